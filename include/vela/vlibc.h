@@ -1,0 +1,74 @@
+// System library of the platform: strings, the string table, name checks,
+// address types, preference directories and the system root.
+#pragma once
+
+#include <stddef.h>
+#include <string>
+
+// ---- System root -----------------------------------------------------------
+
+namespace VELA {
+// The directory under which every absolute path of the system is resolved:
+// "/" by default, or the value of VELA_ROOT read with secure_getenv (so a
+// set-user-id process ignores it). Read once per process; never ends in "/"
+// except when it is "/" itself.
+const std::string& VelaRoot();
+// `absolute` (which starts with "/") resolved under VelaRoot():
+// VelaPath("/etc/velainfo.conf") is "/etc/velainfo.conf" with the default
+// root and "/tmp/r/etc/velainfo.conf" with VELA_ROOT=/tmp/r.
+std::string VelaPath(const std::string& absolute);
+// Forgets the cached root so the next call reads VELA_ROOT again (tests).
+void VelaRootReset();
+}  // namespace VELA
+
+// ---- Strings -----------------------------------------------------------------
+
+// Lower-cases the ASCII letters of `sz` in place and returns `sz`; other
+// bytes stay as they are. A null argument returns null.
+char* VLIBCStrCaseLower(char* sz);
+
+// ---- String table ------------------------------------------------------------
+// A table of string keys to string values that keeps insertion order. Keys
+// are unique: setting an existing key replaces its value in place.
+
+typedef struct _tag_VLIBCSZHASH_ VLIBCSZHASH, *PVLIBCSZHASH;
+
+// A new empty table sized for about `size` entries (any size >= 0 works);
+// null when memory runs out.
+PVLIBCSZHASH VLIBCSzHashAlloc(int size);
+// Frees the table; null is ignored.
+void VLIBCSzHashFree(PVLIBCSZHASH hash);
+// Sets `key` to `value`; 0 on success, -1 for a null table, key or value.
+int VLIBCSzHashSetValue(PVLIBCSZHASH hash, const char* key, const char* value);
+// The value of `key`, or null when absent. Valid until the key is set again
+// or the table is freed.
+const char* VLIBCSzHashGetValue(PVLIBCSZHASH hash, const char* key);
+// Number of entries; 0 for null.
+int VLIBCSzHashCount(PVLIBCSZHASH hash);
+// Key and value of the entry at `index` (insertion order), null when out of
+// range.
+const char* VLIBCSzHashKeyAt(PVLIBCSZHASH hash, int index);
+const char* VLIBCSzHashValueAt(PVLIBCSZHASH hash, int index);
+
+// ---- Names and addresses -------------------------------------------------------
+
+// Non-zero when `name` is one RFC 1123 host label: 1 to 63 characters of
+// letters, digits and "-", neither starting nor ending with "-".
+int BlVLIBIsHostname(const char* name);
+// Non-zero when `name` is a domain name of RFC 1123 labels joined by ".":
+// every label a valid host label, 253 characters at most in all; one
+// trailing "." is accepted.
+int BlVLIBIsDomain(const char* name);
+// inet_pton: 2 (AF_INET) for an IPv4 address, 10 (AF_INET6) for an IPv6
+// address, 0 for anything else, null included.
+int VELANetGetAddrType(const char* text);
+
+// ---- Preference directories ------------------------------------------------------
+
+// Writes into `buf` (of `size` bytes) the preference directory of the user
+// or group, <root>/var/lib/vela/preference/user/<name> or .../group/<name>,
+// creating it (mode 0700) when missing. Returns 0 on success, -1 when the name
+// is empty, longer than 255 bytes, ".", "..", holds "/" or a control byte,
+// the directory cannot be created or the buffer is too small.
+int VELAUserPreferenceDirGet(const char* user, char* buf, size_t size);
+int VELAGroupPreferenceDirGet(const char* group, char* buf, size_t size);

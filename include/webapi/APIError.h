@@ -1,0 +1,52 @@
+// Error codes the framework puts into responses. Handlers may use their own
+// codes beside these; codes not listed here are theirs.
+#pragma once
+
+enum _tag_WEBAPI_ERR {
+    WEBAPI_ERR_NONE = 0,
+    WEBAPI_ERR_BAD_REQUEST = 101,           // malformed request, or it could not be set up
+    WEBAPI_ERR_NO_SUCH_API = 102,           // API not described
+    WEBAPI_ERR_NO_SUCH_METHOD = 103,        // method not in the API's description
+    WEBAPI_ERR_NOT_SUPPORTED_VERSION = 104, // version outside minVersion..maxVersion
+    WEBAPI_ERR_NO_PERMISSION = 105,         // permission denied
+    WEBAPI_ERR_SESSION_TIMEOUT = 106,       // login session timed out
+    WEBAPI_ERR_SESSION_INTERRUPT = 107,     // the platform refused the session
+    WEBAPI_ERR_UPLOAD_FAILED = 108,         // receiving the upload failed
+    WEBAPI_ERR_RELAY_FAILED = 109,          // relaying to another service failed
+    WEBAPI_ERR_COMPOUND_OR_FORK = 110,      // no "compound" parameter, or a task could not fork
+    WEBAPI_ERR_LOAD_LIBRARY = 111,          // the handler library could not be opened
+    WEBAPI_ERR_COMPOUND_STOPPED = 112,      // skipped after an earlier error (stop_when_error)
+    WEBAPI_ERR_COMPOUND_TRANSFER = 113,     // compound entry allows upload or download
+    WEBAPI_ERR_TASK_ACCESS = 114,           // polling task access neither "admin" nor "everyone"
+    WEBAPI_ERR_UPLOAD_NOT_ALLOWED = 115,    // upload to a method without "allowUpload"
+    WEBAPI_ERR_DEMO_MODE = 116,             // demo mode and the method disallows it
+    WEBAPI_ERR_NO_RESPONSE = 117,           // the handler answered nothing, or set-up failed
+    WEBAPI_ERR_PROCESS_NAME = 118,          // naming the process failed
+    WEBAPI_ERR_NOT_AUTHENTICATED = 119,     // not logged in
+    WEBAPI_ERR_METHOD_NOT_IN_TABLE = 121,   // method missing from the library's table
+    WEBAPI_ERR_SHARING_FIRST = 122,         // 122..127: sharing-link refusals
+    WEBAPI_ERR_SHARING_LAST = 127,
+    WEBAPI_ERR_REMOTE_IP = 150,             // client address refused for this session
+    WEBAPI_ERR_POLLING_START = 501,
+    WEBAPI_ERR_POLLING_STATUS = 502,
+    WEBAPI_ERR_POLLING_STOP = 503,
+    WEBAPI_ERR_POLLING_LIST = 505,
+    WEBAPI_ERR_POLLING_GROUP = 506,
+    WEBAPI_ERR_POLLING_OTHER = 508,
+};
+
+// HTTP status codes; the value is the code itself.
+enum _tag_HTTP_STATUS_CODE {
+    HTTP_STATUS_OK = 200,
+    HTTP_STATUS_PARTIAL_CONTENT = 206,
+    HTTP_STATUS_MOVED_PERMANENTLY = 301,
+    HTTP_STATUS_FOUND = 302,
+    HTTP_STATUS_NOT_MODIFIED = 304,
+    HTTP_STATUS_BAD_REQUEST = 400,
+    HTTP_STATUS_UNAUTHORIZED = 401,
+    HTTP_STATUS_FORBIDDEN = 403,
+    HTTP_STATUS_NOT_FOUND = 404,
+    HTTP_STATUS_RANGE_NOT_SATISFIABLE = 416,
+    HTTP_STATUS_INTERNAL_SERVER_ERROR = 500,
+    HTTP_STATUS_SERVICE_UNAVAILABLE = 503,
+};

@@ -1,0 +1,50 @@
+// Helpers shared by the test programs.
+#pragma once
+
+#include <string>
+#include <vector>
+
+namespace VELA {
+namespace Test {
+
+// Captures every log line while it lives (installs the log sink).
+class LogCapture {
+public:
+    LogCapture();
+    ~LogCapture();
+    const std::vector<std::string>& Lines() const { return lines_; }
+    // True when some captured line contains `text`.
+    bool Contains(const std::string& text) const;
+
+private:
+    static void Sink(int priority, const char* line, void* arg);
+    std::vector<std::string> lines_;
+};
+
+// A fresh directory under $TMPDIR, removed with everything in it at the end
+// of the scope.
+class TempDir {
+public:
+    TempDir();
+    ~TempDir();
+    const std::string& Path() const { return path_; }
+
+private:
+    std::string path_;
+};
+
+// Sets (or, with a null value, unsets) an environment variable for the
+// scope, restoring the old state afterwards.
+class ScopedEnv {
+public:
+    ScopedEnv(const char* name, const char* value);
+    ~ScopedEnv();
+
+private:
+    std::string name_;
+    std::string old_;
+    bool had_;
+};
+
+}  // namespace Test
+}  // namespace VELA
