@@ -1,0 +1,100 @@
+// vela-demo: builds a request from a request JSON and prints what a handler
+// would see. Reads the JSON from the file named as the first argument, from
+// standard input with "-", or uses a built-in sample without arguments.
+#include <cstdio>
+#include <iostream>
+#include <iterator>
+#include <string>
+
+#include <json/json.h>
+
+#include "webapi/APIRequest.h"
+#include "webapi/JsonUtil.h"
+
+namespace {
+
+const char kSample[] = R"({
+  "environ": {
+    "REQUEST_METHOD": "POST",
+    "HTTP_HOST": "nas.example.net:5001",
+    "HTTPS": "on",
+    "REQUEST_URI": "/webapi/entry.cgi?api=VELA.Demo.Echo",
+    "HTTP_COOKIE": "id=Zm9vYmFy; lang=en%20US; broken",
+    "HTTP_USER_AGENT": "Mozilla/5.0 (iPhone; CPU iPhone OS 17_0 like Mac OS X) AppleWebKit/605.1.15",
+    "REMOTE_ADDR": "192.0.2.10",
+    "CONTENT_TYPE": "application/x-www-form-urlencoded"
+  },
+  "getParam": {"api": "VELA.Demo.Echo", "version": "1", "method": "get"},
+  "postParam": {"method": "echo", "count": 3, "tags": ["a", "b"], "enabled": true},
+  "session": {"username": "alice", "isAdmin": false, "isTimeout": false, "timeout": 900},
+  "reqLib": {"allowUser": ["admin.local", "normal.local"]}
+})";
+
+bool ReadInput(int argc, char** argv, std::string& text)
+{
+    if (argc < 2) {
+        text = kSample;
+        return true;
+    }
+    std::string arg = argv[1];
+    if (arg == "-") {
+        text.assign(std::istreambuf_iterator<char>(std::cin), std::istreambuf_iterator<char>());
+        return true;
+    }
+    Json::Value parsed;
+    if (!VELA::JsonReadFile(arg, parsed)) {
+        return false;
+    }
+    text = VELA::JsonToString(parsed);
+    return true;
+}
+
+}  // namespace
+
+int main(int argc, char** argv)
+{
+    std::string text;
+    Json::Value input;
+    if (!ReadInput(argc, argv, text) || !VELA::JsonParse(text, input)) {
+        fprintf(stderr, "vela-demo: the input is not a JSON document\n");
+        return 2;
+    }
+    VELA::APIRequest request(input);
+
+    Json::Value seen(Json::objectValue);
+    seen["api"] = request.GetAPIClass();
+    seen["version"] = request.GetAPIVersion();
+    seen["method"] = request.GetAPIMethod();
+    seen["requestMethod"] = request.GetRequestMethod();
+    seen["url"]["proto"] = request.GetURLProto("");
+    seen["url"]["host"] = request.GetURLHost("");
+    seen["url"]["port"] = request.GetURLPort(0);
+    seen["url"]["path"] = request.GetURLPath("");
+    seen["url"]["name"] = request.GetURLName("");
+    seen["cookies"]["id"] = request.GetCookie("id", "");
+    seen["cookies"]["lang"] = request.GetCookie("lang", "");
+    seen["client"]["mobile"] = request.IsMobile();
+    seen["client"]["iPhone"] = request.IsIPhone();
+    seen["client"]["webKit"] = request.IsWebKit();
+    seen["session"]["sessionId"] = request.GetSessionID();
+    seen["session"]["user"] = request.GetLoginUserName();
+    seen["session"]["isAdmin"] = request.IsAdmin();
+    seen["session"]["isTimeout"] = request.IsTimeout();
+    seen["session"]["timeout"] = request.GetTimeoutDuration();
+    seen["session"]["uiLanguage"] = request.GetUILanguage();
+    seen["session"]["allowUser"] = request.GetAllowUser();
+    seen["session"]["authResult"] = static_cast<int>(request.GetAuthResult());
+    Json::Value all(Json::objectValue);
+    for (const char* name : {"count", "tags", "enabled"}) {
+        if (request.HasParam(name)) {
+            all[name] = request.GetParam(name);
+        }
+    }
+    seen["param"] = all;
+    seen["upload"] = request.IsUploadRequest();
+
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "  ";
+    std::cout << Json::writeString(builder, seen) << std::endl;
+    return 0;
+}

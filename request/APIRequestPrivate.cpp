@@ -1,0 +1,460 @@
+#include "request/APIRequestPrivate.h"
+
+#include <climits>
+#include <cstring>
+#include <mutex>
+#include <regex.h>
+#include <strings.h>
+
+#include "request/RequestFacts.h"
+#include "vela/cgi.h"
+#include "vela/log.h"
+#include "vela/vlibc.h"
+#include "vela/webapiutil.h"
+
+namespace VELA {
+
+namespace {
+
+const char* const kCategories[] = {"environ", "cookie", "reqLib", "session", "param", "attr", "url", "userAgent"};
+
+// Name of the sharing-link header as the CGI environment presents it, and of
+// the sharing session cookie.
+const char kSharingHeaderEnv[] = "HTTP_X_VELA_SHARING";
+const char kSharingSidCookie[] = "sharing_sid";
+
+// Encrypted-parameter member names (protocol literals).
+const char kCipherText[] = "__cIpHeRtExT";
+const char kAESToken[] = "__nEkOtReHpIc";
+const char kAESCipher[] = "__tXeTrEhPiC";
+
+// Nesting of "webapi" objects that DecryptParam follows.
+const int kMaxDecryptDepth = 8;
+
+const char kMobilePattern[] =
+    "(SymbianOS|Windows CE|PalmOS|BlackBerry|Vodafone|Opera Mobi|Opera Mini|UP\\.Browser|AvantGo|"
+    "EudoraWeb|PLink|Plucker|NetFront|Xiino|Blazer|WebPro|ProxiNet|Elaine)";
+
+// The mobile-browser expression, compiled once per process.
+const regex_t* MobilePattern()
+{
+    static regex_t compiled;
+    static bool ok = false;
+    static std::once_flag once;
+    std::call_once(once, [] {
+        ok = regcomp(&compiled, kMobilePattern, REG_EXTENDED | REG_ICASE | REG_NOSUB) == 0;
+        if (!ok) {
+            VELA_LOG_ERR("Invalid pattern");
+        }
+    });
+    return ok ? &compiled : nullptr;
+}
+
+bool Contains(const std::string& text, const char* needle)
+{
+    return text.find(needle) != std::string::npos;
+}
+
+// The "forceDesktop" cookie read as a decimal integer: true when it is
+// non-zero. Leading blanks and a sign are allowed; no digits counts as 0.
+bool NonZeroDecimal(const std::string& s)
+{
+    size_t i = 0;
+    while (i < s.size() && (s[i] == ' ' || s[i] == '\t')) {
+        ++i;
+    }
+    if (i < s.size() && (s[i] == '+' || s[i] == '-')) {
+        ++i;
+    }
+    for (; i < s.size() && s[i] >= '0' && s[i] <= '9'; ++i) {
+        if (s[i] != '0') {
+            return true;
+        }
+    }
+    return false;
+}
+
+}  // namespace
+
+APIRequestPrivate::APIRequestPrivate(APIRequest* owner_) : owner(owner_)
+{
+    for (const char* name : kCategories) {
+        data_[name] = Json::Value(Json::objectValue);
+    }
+}
+
+APIRequestPrivate::APIRequestPrivate(const APIRequestPrivate& other, APIRequest* owner_)
+    : APIBase(other),
+      apiClass(other.apiClass),
+      apiVersion(other.apiVersion),
+      apiMethod(other.apiMethod),
+      requestMethod(other.requestMethod),
+      owner(owner_),
+      sharingInfo(other.sharingInfo),
+      sharingID(other.sharingID),
+      sharingSID(other.sharingSID)
+{
+}
+
+APIRequestPrivate::~APIRequestPrivate() = default;
+
+std::string APIRequestPrivate::GetText(const char* section, const char* key)
+{
+    static const Json::Value kNull;
+    return RequestFacts::Text(GetData(section, key, kNull));
+}
+
+bool APIRequestPrivate::GetBool(const char* section, const char* key, bool def)
+{
+    if (!HasData(section, key)) {
+        return def;
+    }
+    static const Json::Value kNull;
+    return RequestFacts::Truthy(GetData(section, key, kNull));
+}
+
+// ---- Set-up ---------------------------------------------------------------
+
+void APIRequestPrivate::InitEnv(const Json::Value& env)
+{
+    SetData("environ", env, true);
+    InitCookie();
+    InitRequestMethod();
+    InitSharing();
+}
+
+void APIRequestPrivate::InitParam(const Json::Value& request, bool reset)
+{
+    if (reset) {
+        ClearData("param", "");
+    }
+    if (!request.isObject()) {
+        return;
+    }
+    for (const char* member : {"getParam", "postParam"}) {
+        const Json::Value* found = request.find(member, member + strlen(member));
+        if (!found) {
+            continue;
+        }
+        Json::Value params = *found;  // the caller's object stays as it is
+        if (!params.isObject()) {
+            continue;
+        }
+        // A failed decryption keeps what is left; the encrypted members are
+        // gone either way, and the dispatcher goes on.
+        DecryptParam(params);
+        SetData("param", params, false);
+        SetAPIDesc(params);
+    }
+}
+
+void APIRequestPrivate::InitAPIInfo(const Json::Value& info)
+{
+    ClearData("reqLib", "");
+    SetData("reqLib", info, false);
+}
+
+void APIRequestPrivate::InitSession(const Json::Value& session)
+{
+    ClearData("session", "");
+    SetData("session", session, false);
+}
+
+void APIRequestPrivate::SetAPIDesc(const Json::Value& params)
+{
+    if (!params.isObject()) {
+        return;
+    }
+    if (const Json::Value* api = params.find("api", "api" + 3)) {
+        apiClass = RequestFacts::Text(*api);
+    }
+    if (const Json::Value* version = params.find("version", "version" + 7)) {
+        long long v = RequestFacts::Integer(*version, 0);
+        apiVersion = (v < INT_MIN || v > INT_MAX) ? 0 : static_cast<int>(v);
+    }
+    if (const Json::Value* method = params.find("method", "method" + 6)) {
+        apiMethod = RequestFacts::Text(*method);
+    }
+}
+
+// Cookie header (RFC 6265 section 5.4): pieces separated by ";", each
+// name=value; a piece without "=" is skipped; the value is URL-decoded; a
+// later cookie of the same name wins.
+void APIRequestPrivate::InitCookie()
+{
+    if (!HasData("environ", "HTTP_COOKIE")) {
+        return;
+    }
+    static const Json::Value kNull;
+    const Json::Value& header = GetData("environ", "HTTP_COOKIE", kNull);
+    if (!header.isString()) {
+        return;
+    }
+    const std::string text = header.asString();
+    const Json::Value pieces = WebAPIUtil::ParseToArray(text.c_str(), ";");
+    for (const Json::Value& piece : pieces) {
+        const std::string s = RequestFacts::Text(piece);
+        const size_t eq = s.find('=');
+        if (eq == std::string::npos) {
+            continue;
+        }
+        SetData("cookie", s.substr(0, eq), WebAPIUtil::URLDecode(s.substr(eq + 1), true), true);
+    }
+}
+
+void APIRequestPrivate::InitRequestMethod()
+{
+    if (!HasData("environ", "REQUEST_METHOD")) {
+        return;
+    }
+    const std::string method = GetText("environ", "REQUEST_METHOD");
+    if (method == "GET") {
+        requestMethod = REQUEST_METHOD_GET;
+    } else if (method == "POST") {
+        requestMethod = REQUEST_METHOD_POST;
+    } else if (method == "HEAD") {
+        requestMethod = REQUEST_METHOD_HEAD;
+    }
+}
+
+// The sharing identifiers are re-read at every environment merge. The
+// records behind them come with the sharing store.
+void APIRequestPrivate::InitSharing()
+{
+    sharingID = GetText("environ", kSharingHeaderEnv);
+    sharingSID = GetText("cookie", kSharingSidCookie);
+}
+
+// ---- URL ------------------------------------------------------------------
+
+void APIRequestPrivate::InitURL()
+{
+    if (HasData("url", "initialized")) {
+        return;
+    }
+    SetData("url", "initialized", true, false);
+    ParseProtocol();
+    ParseHostAndPort();
+    ParsePathAndName();
+}
+
+bool APIRequestPrivate::ParseProtocol()
+{
+    std::string proto = "http";
+    if (strcasecmp(GetText("environ", "HTTPS").c_str(), "on") == 0 ||
+        strcasecmp(GetText("environ", "HTTP_X_FORWARDED_PROTO").c_str(), "https") == 0) {
+        proto = "https";
+    }
+    return SetData("url", "urlProto", proto, true);
+}
+
+// Host header (RFC 7230 section 5.4, RFC 3986 section 3.2.2): host, or
+// host:port, or [IPv6]:port. The port is taken as it comes; an empty one is
+// the scheme's default.
+bool APIRequestPrivate::ParseHostAndPort()
+{
+    const std::string text = GetText("environ", "HTTP_HOST");
+    if (text.empty()) {
+        return false;
+    }
+    std::string host;
+    std::string port;
+    if (text[0] == '[') {
+        const size_t close = text.rfind(']');
+        if (close == std::string::npos) {
+            return false;
+        }
+        host = text.substr(0, close + 1);
+        const size_t colon = text.find(':', close);
+        if (colon != std::string::npos) {
+            port = text.substr(colon + 1);
+        }
+    } else {
+        const size_t colon = text.rfind(':');
+        if (colon == std::string::npos) {
+            host = text;
+        } else {
+            host = text.substr(0, colon);
+            port = text.substr(colon + 1);
+        }
+    }
+    if (port.empty()) {
+        port = GetText("url", "urlProto") == "https" ? "443" : "80";
+    }
+    if (!SetData("url", "urlHost", host, true)) {
+        return false;
+    }
+    return SetData("url", "urlPort", port, true);
+}
+
+bool APIRequestPrivate::ParsePathAndName()
+{
+    std::string uri = GetText("environ", "REQUEST_URI");
+    const size_t query = uri.find('?');
+    if (query != std::string::npos) {
+        uri.erase(query);
+    }
+    const size_t slash = uri.rfind('/');
+    if (slash == std::string::npos) {
+        return true;
+    }
+    if (!SetData("url", "urlPath", uri.substr(0, slash + 1), true)) {
+        return false;
+    }
+    return SetData("url", "urlName", uri.substr(slash + 1), true);
+}
+
+// ---- Client kind -----------------------------------------------------------
+
+void APIRequestPrivate::InitUA()
+{
+    if (HasData("userAgent", "initialized")) {
+        return;
+    }
+    SetData("userAgent", "initialized", true, false);
+    const regex_t* mobilePattern = MobilePattern();
+    if (!HasData("environ", "HTTP_USER_AGENT")) {
+        return;
+    }
+    std::string ua = GetText("environ", "HTTP_USER_AGENT");
+    if (!ua.empty()) {
+        VLIBCStrCaseLower(&ua[0]);
+    }
+
+    const bool webkit = Contains(ua, "webkit");
+    bool mobile = false, mobileDevice = false, iPhone = false, android = false, ieMobile = false;
+    bool iPad = false, playBook = false, blackBerry6 = false, webKit = false, webApp = false;
+    bool mobileOutcome = true;
+    const bool hasIPad = Contains(ua, "ipad");
+    const bool hasIPhone = Contains(ua, "iphone") || Contains(ua, "ipod");
+    const bool hasAndroid = Contains(ua, "android");
+
+    if (webkit && hasIPad) {
+        iPad = iPhone = webKit = webApp = true;
+    } else if (webkit && hasIPhone) {
+        iPhone = webKit = webApp = true;
+    } else if (webkit && hasAndroid) {
+        android = webKit = webApp = true;
+    } else if (!webkit && hasIPad) {
+        iPad = iPhone = true;
+    } else if (!webkit && hasIPhone) {
+        iPhone = true;
+    } else if (!webkit && hasAndroid) {
+        android = true;
+    } else if (Contains(ua, "playbook")) {
+        playBook = true;
+        webKit = webApp = webkit;
+    } else if (webkit && Contains(ua, "blackberry")) {
+        blackBerry6 = webKit = webApp = true;
+    } else {
+        webKit = webkit;
+        const bool patternMatch =
+            mobilePattern && !ua.empty() && regexec(mobilePattern, ua.c_str(), 0, nullptr, 0) == 0;
+        mobileOutcome = patternMatch || HasData("environ", "HTTP_UA_OS") || HasData("environ", "HTTP_X_WAP_PROFILE");
+    }
+
+    if (mobileOutcome) {
+        ieMobile = Contains(ua, "msie") || Contains(ua, "iemobile");
+        mobileDevice = true;
+        static const Json::Value kZero("0");
+        const Json::Value& force = GetData("cookie", "forceDesktop", kZero);
+        mobile = !NonZeroDecimal(force.isString() ? force.asString() : "0");
+    }
+
+    SetData("userAgent", "uaMobile", mobile, false);
+    SetData("userAgent", "uaMobileDevice", mobileDevice, false);
+    SetData("userAgent", "uaIPhone", iPhone, false);
+    SetData("userAgent", "uaAndroid", android, false);
+    SetData("userAgent", "uaIEMobile", ieMobile, false);
+    SetData("userAgent", "uaIPad", iPad, false);
+    SetData("userAgent", "uaPlayBook", playBook, false);
+    SetData("userAgent", "uaBlackBerry6", blackBerry6, false);
+    SetData("userAgent", "uaWebKit", webKit, false);
+    SetData("userAgent", "uaSupportWebAPP", webApp, false);
+}
+
+// ---- Session ---------------------------------------------------------------
+
+uid_t APIRequestPrivate::GetLoginUID()
+{
+    static const Json::Value kNull;
+    if (HasData("session", "uid")) {
+        const Json::Value& uid = GetData("session", "uid", kNull);
+        if (uid.isInt64()) {
+            return static_cast<uid_t>(uid.asInt64());
+        }
+        if (uid.isUInt64()) {
+            return static_cast<uid_t>(uid.asUInt64());
+        }
+        return static_cast<uid_t>(-1);
+    }
+    const std::string sessionId = GetText("cookie", "id");
+    const std::string userName = GetText("session", "username");
+    if (userName.empty()) {
+        return static_cast<uid_t>(-1);
+    }
+    const int uid = VelaCgiUIDGet(sessionId.c_str(), userName.c_str());
+    SetData("session", "uid", Json::Value(uid), false);
+    return static_cast<uid_t>(uid);
+}
+
+// ---- Encrypted parameters --------------------------------------------------
+
+static bool DecryptParamAt(APIRequestPrivate& self, Json::Value& params, int depth)
+{
+    if (!params.isObject()) {
+        return true;
+    }
+    if (params.isMember(kCipherText)) {
+        std::string text = RequestFacts::Text(params[kCipherText]);
+        params.removeMember(kCipherText);
+        if (VelaCgiDecryptParam(text) != 0) {
+            return false;
+        }
+        if (!WebAPIUtil::strPairToJsonObj(text, params, true, true)) {
+            return false;
+        }
+    }
+    if (!params.empty() && !self.DecryptAESParam(params)) {
+        return false;
+    }
+    if (params.isMember("webapi")) {
+        if (depth >= kMaxDecryptDepth) {
+            VELA_LOG_ERR("encrypted parameters nested deeper than %d levels", kMaxDecryptDepth);
+            return false;
+        }
+        return DecryptParamAt(self, params["webapi"], depth + 1);
+    }
+    return true;
+}
+
+bool APIRequestPrivate::DecryptParam(Json::Value& params)
+{
+    return DecryptParamAt(*this, params, 0);
+}
+
+bool APIRequestPrivate::DecryptAESParam(Json::Value& params)
+{
+    if (!params.isObject() || !params.isMember(kAESToken) || !params.isMember(kAESCipher)) {
+        return true;
+    }
+    const std::string token = RequestFacts::Text(params[kAESToken]);
+    const std::string cipher = RequestFacts::Text(params[kAESCipher]);
+    params.removeMember(kAESToken);
+    params.removeMember(kAESCipher);
+    if (token.empty() || cipher.empty()) {
+        return false;
+    }
+    char key[33] = {0};
+    if (VELACloudServiceHubtokenGenerateToken(token.c_str(), key, sizeof(key)) < 0) {
+        return false;
+    }
+    key[sizeof(key) - 1] = '\0';
+    std::string plain;
+    if (!CredRequestUtil::GetDecryptAESString(key, cipher, plain)) {
+        return false;
+    }
+    return WebAPIUtil::strPairToJsonObj(plain, params, true, true);
+}
+
+}  // namespace VELA

@@ -1,0 +1,89 @@
+#include "request/RequestFacts.h"
+
+#include <climits>
+#include <cmath>
+
+namespace VELA {
+namespace RequestFacts {
+
+bool Truthy(const Json::Value& v)
+{
+    switch (v.type()) {
+    case Json::booleanValue:
+        return v.asBool();
+    case Json::intValue:
+        return v.asLargestInt() != 0;
+    case Json::uintValue:
+        return v.asLargestUInt() != 0;
+    case Json::realValue:
+        return v.asDouble() != 0.0;
+    case Json::stringValue: {
+        const char* begin = nullptr;
+        const char* end = nullptr;
+        return v.getString(&begin, &end) && end != begin;
+    }
+    case Json::arrayValue:
+    case Json::objectValue:
+        return !v.empty();
+    default:
+        return false;
+    }
+}
+
+std::string Text(const Json::Value& v)
+{
+    return v.isString() ? v.asString() : std::string();
+}
+
+long long Integer(const Json::Value& v, long long def)
+{
+    if (v.isInt64()) {
+        return v.asInt64();
+    }
+    if (v.isUInt64()) {
+        return def;  // above LLONG_MAX
+    }
+    if (v.isDouble()) {
+        double d = v.asDouble();
+        if (std::isfinite(d) && d > static_cast<double>(LLONG_MIN) && d < static_cast<double>(LLONG_MAX)) {
+            return static_cast<long long>(d);
+        }
+        return def;
+    }
+    if (!v.isString()) {
+        return def;
+    }
+    // Decimal text: optional blanks, optional sign, digits; what follows the
+    // digits is ignored. No digits at all gives `def`.
+    std::string s = v.asString();
+    size_t i = 0;
+    while (i < s.size() && (s[i] == ' ' || s[i] == '\t')) {
+        ++i;
+    }
+    bool negative = false;
+    if (i < s.size() && (s[i] == '+' || s[i] == '-')) {
+        negative = s[i] == '-';
+        ++i;
+    }
+    size_t first = i;
+    unsigned long long magnitude = 0;
+    const unsigned long long limit = negative ? static_cast<unsigned long long>(LLONG_MAX) + 1ULL
+                                              : static_cast<unsigned long long>(LLONG_MAX);
+    for (; i < s.size() && s[i] >= '0' && s[i] <= '9'; ++i) {
+        unsigned digit = static_cast<unsigned>(s[i] - '0');
+        if (magnitude > (limit - digit) / 10) {
+            return def;
+        }
+        magnitude = magnitude * 10 + digit;
+    }
+    if (i == first) {
+        return def;
+    }
+    if (negative) {
+        return magnitude == limit ? LLONG_MIN : -static_cast<long long>(magnitude);
+    }
+    return static_cast<long long>(magnitude);
+}
+
+}  // namespace RequestFacts
+}  // namespace VELA

@@ -1,0 +1,22 @@
+// Small conversions of stored JSON values used by the request accessors.
+#pragma once
+
+#include <json/json.h>
+#include <string>
+
+namespace VELA {
+namespace RequestFacts {
+
+// Truth of a stored value: true, non-zero numbers, non-empty strings and
+// non-empty containers count as true; null and everything else as false.
+bool Truthy(const Json::Value& v);
+// Text of a stored value: the string itself, "" for anything else.
+std::string Text(const Json::Value& v);
+// Integer of a stored value: integral numbers in range as they are, reals
+// truncated when in range, decimal text with optional sign and leading
+// blanks read up to the first non-digit; `def` for everything else and on
+// overflow. Never throws.
+long long Integer(const Json::Value& v, long long def);
+
+}  // namespace RequestFacts
+}  // namespace VELA

@@ -1,0 +1,202 @@
+#include <gtest/gtest.h>
+
+#include "request/APIRequestPrivate.h"
+#include "support/JsonLiteral.h"
+#include "webapi/APIRequest.h"
+
+using VELA::APIRequest;
+
+namespace {
+
+void ExpectEmpty(const APIRequest& r)
+{
+    EXPECT_FALSE(r.HasEnv("REQUEST_METHOD"));
+    EXPECT_FALSE(r.HasParam("api"));
+    EXPECT_FALSE(r.HasAttr("x"));
+    EXPECT_FALSE(r.HasCookie("id"));
+    EXPECT_EQ(0, r.GetAPIVersion());
+    EXPECT_EQ("", r.GetAPIClass());
+    EXPECT_EQ("", r.GetAPIMethod());
+    EXPECT_EQ(VELA::REQUEST_METHOD_UNKNOWN, r.GetRequestMethod());
+    EXPECT_EQ(AUTH_RESULT_NONE, r.GetAuthResult());
+    EXPECT_TRUE(r.GetParam("", Json::Value()).empty());
+}
+
+}  // namespace
+
+TEST(RequestConstruct, AnythingButANonEmptyObjectGivesAnEmptyRequest)
+{
+    for (const char* text : {"null", "{}", "[]", "[1,2]", "\"text\"", "7", "true"}) {
+        SCOPED_TRACE(text);
+        APIRequest r(J(text));
+        ExpectEmpty(r);
+    }
+}
+
+TEST(RequestConstruct, MembersOfTheWrongTypeAreIgnored)
+{
+    APIRequest r(J(R"({"environ": [1], "getParam": "api=x", "postParam": 5, "reqLib": 3, "session": []})"));
+    ExpectEmpty(r);
+    EXPECT_EQ(Json::Value(Json::objectValue), r.GetAPIInfo("", Json::Value("d")));
+}
+
+TEST(RequestConstruct, EnvironKeepsOnlyStrings)
+{
+    APIRequest r(J(R"({"environ": {"REQUEST_METHOD": "GET", "CONTENT_LENGTH": 12, "X": null, "Y": {"a": 1}}})"));
+    EXPECT_EQ("GET", r.GetEnv("REQUEST_METHOD").asString());
+    EXPECT_FALSE(r.HasEnv("CONTENT_LENGTH"));
+    EXPECT_FALSE(r.HasEnv("X"));
+    EXPECT_FALSE(r.HasEnv("Y"));
+    EXPECT_EQ(Json::Value("dflt"), r.GetEnv("CONTENT_LENGTH", "dflt"));
+}
+
+TEST(RequestConstruct, DeepAndHugeValuesAreKeptWithoutHarm)
+{
+    Json::Value deep;
+    Json::Value* at = &deep;
+    for (int i = 0; i < 2000; ++i) {
+        at = &((*at)["n"]);
+    }
+    *at = 1;
+    Json::Value request(Json::objectValue);
+    request["getParam"]["deep"] = deep;
+    request["getParam"]["big"] = std::string(1 << 20, 'x');
+    request["getParam"]["webapi"] = deep;
+    request["environ"]["HTTP_USER_AGENT"] = std::string(1 << 20, 'A');
+    APIRequest r(request);
+    EXPECT_TRUE(r.HasParam("deep"));
+    EXPECT_EQ(size_t(1) << 20, r.GetParam("big").asString().size());
+    EXPECT_FALSE(r.IsMobile());
+}
+
+TEST(RequestParam, BodyOverridesQuery)
+{
+    APIRequest r(J(R"({"getParam": {"api": "VELA.A", "version": 1, "method": "get", "q": 1},
+                      "postParam": {"method": "set", "version": "3", "p": [1]}})"));
+    EXPECT_EQ("set", r.GetParam("method").asString());
+    EXPECT_EQ("set", r.GetAPIMethod());
+    EXPECT_EQ("VELA.A", r.GetAPIClass());
+    EXPECT_EQ(3, r.GetAPIVersion());  // decimal text from a form
+    EXPECT_EQ(1, r.GetParam("q").asInt());
+    EXPECT_EQ(J("[1]"), r.GetParam("p"));
+}
+
+TEST(RequestParam, VersionThatIsNotANumberReadsAsZero)
+{
+    for (const char* v : {R"("abc")", "[]", "{}", "99999999999", "-99999999999", R"("")"}) {
+        SCOPED_TRACE(v);
+        APIRequest r(J(std::string(R"({"getParam": {"version": )") + v + "}}"));
+        EXPECT_EQ(0, r.GetAPIVersion());
+    }
+}
+
+TEST(RequestParam, ResetWithoutParametersKeepsTheApiIdentity)
+{
+    APIRequest r(J(R"({"getParam": {"api": "VELA.A", "version": 2, "method": "get", "x": 1}})"));
+    r.InitParam(J("{}"), true);
+    EXPECT_FALSE(r.HasParam("x"));
+    EXPECT_FALSE(r.HasParam("api"));
+    EXPECT_EQ("VELA.A", r.GetAPIClass());
+    EXPECT_EQ(2, r.GetAPIVersion());
+    EXPECT_EQ("get", r.GetAPIMethod());
+}
+
+TEST(RequestParam, WithoutResetEarlierParametersStay)
+{
+    APIRequest r(J(R"({"getParam": {"a": 1, "b": 2}})"));
+    r.InitParam(J(R"({"postParam": {"b": 3}})"), false);
+    EXPECT_EQ(1, r.GetParam("a").asInt());
+    EXPECT_EQ(3, r.GetParam("b").asInt());
+}
+
+TEST(RequestParam, CallerObjectIsNotChanged)
+{
+    Json::Value request = J(R"({"getParam": {"__nEkOtReHpIc": "t", "__tXeTrEhPiC": "", "a": 1}})");
+    const Json::Value before = request;
+    APIRequest r(J("{}"));
+    r.InitParam(request, false);
+    EXPECT_EQ(before, request);
+}
+
+TEST(RequestParam, ParamRefIsTheStoredValueOrTheDefaultItself)
+{
+    APIRequest r(J(R"({"getParam": {"a": {"k": 1}}})"));
+    const Json::Value def("d");
+    EXPECT_EQ(&def, &r.GetParamRef("missing", def));
+    const Json::Value& a1 = r.GetParamRef("a", def);
+    const Json::Value& a2 = r.GetParamRef("a", def);
+    EXPECT_EQ(&a1, &a2);
+    EXPECT_EQ(1, a1["k"].asInt());
+}
+
+TEST(RequestSession, SecondSessionReplacesTheFirstAndItsVerdict)
+{
+    APIRequest r(J(R"({"session": {"username": "a", "isAdmin": true}})"));
+    r.SetAuthResult(AUTH_RESULT_AUTHORIZED);
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, r.GetAuthResult());
+    r.InitSession(J(R"({"timeout": 5})"));
+    EXPECT_EQ("", r.GetLoginUserName());
+    EXPECT_FALSE(r.IsAdmin());
+    EXPECT_EQ(5, r.GetTimeoutDuration());
+    EXPECT_EQ(AUTH_RESULT_NONE, r.GetAuthResult());
+}
+
+TEST(RequestSession, InfoReplacesTheDescription)
+{
+    APIRequest r(J(R"({"reqLib": {"lib": "a.so", "methods": {"1": ["get"]}}})"));
+    EXPECT_EQ("a.so", r.GetAPIInfo("lib").asString());
+    r.InitAPIInfo(J(R"({"other": 1})"));
+    EXPECT_FALSE(r.GetAPIInfo("lib", Json::Value(false)).asBool());
+    EXPECT_EQ(J(R"({"other": 1})"), r.GetAPIInfo(""));
+}
+
+TEST(RequestAttr, AnyTypeButNoEmptyName)
+{
+    APIRequest r;
+    EXPECT_TRUE(r.SetAttr("n", 5));
+    EXPECT_TRUE(r.SetAttr("o", J(R"({"a": [1]})")));
+    EXPECT_TRUE(r.SetAttr("z", Json::Value()));
+    EXPECT_FALSE(r.SetAttr("", 1));
+    EXPECT_TRUE(r.HasAttr("z"));
+    EXPECT_EQ(J(R"({"a": [1]})"), r.GetAttr("o"));
+}
+
+TEST(RequestCookie, NonStringCookieGivesTheDefault)
+{
+    APIRequest r;
+    // Only strings can be stored through SetCookie; a non-string reaches the
+    // store only through the private side.
+    r.GetPrivate()->SetData("cookie", "n", Json::Value(5), false);
+    EXPECT_TRUE(r.HasCookie("n"));
+    EXPECT_EQ("dflt", r.GetCookie("n", "dflt"));
+    EXPECT_TRUE(r.SetCookie("s", "v"));
+    EXPECT_EQ("v", r.GetCookie("s", "dflt"));
+    EXPECT_FALSE(r.SetCookie("", "v"));
+}
+
+TEST(RequestCopy, CopiesShareNothing)
+{
+    APIRequest a(J(R"({"environ": {"HTTP_HOST": "h:1", "HTTP_X_VELA_SHARING": "link"},
+                      "getParam": {"api": "VELA.A", "version": 4, "method": "m"}})"));
+    EXPECT_EQ("h", a.GetURLHost(""));  // derive and freeze before copying
+    APIRequest b(a);
+    EXPECT_TRUE(b.SetAttr("k", 1));
+    b.InitParam(J(R"({"getParam": {"api": "VELA.B"}})"), true);
+    b.SetCookie("id", "x");
+    EXPECT_FALSE(a.HasAttr("k"));
+    EXPECT_EQ("VELA.A", a.GetAPIClass());
+    EXPECT_EQ("VELA.B", b.GetAPIClass());
+    EXPECT_EQ(4, b.GetAPIVersion());
+    EXPECT_TRUE(a.HasParam("method"));
+    EXPECT_FALSE(a.HasCookie("id"));
+    EXPECT_EQ("h", b.GetURLHost(""));
+    EXPECT_EQ("link", b.GetSharingID());
+    EXPECT_TRUE(b.IsSharing());
+    EXPECT_EQ(&b, b.GetPrivate()->owner);
+}
+
+TEST(RequestMisc, DemoModeIsNeverActive)
+{
+    APIRequest r(J(R"({"environ": {"DEMO": "1"}})"));
+    EXPECT_FALSE(r.IsDemoMode());
+}
