@@ -76,7 +76,7 @@ TEST(RequestSessionFacts, StoredFactsAndTheirConversions)
 {
     APIRequest r(J(R"({"session": {"username": "alice", "isAdmin": "yes", "isTimeout": 0,
         "isSkipCheckIP": [], "isAuthorized": 2, "timeout": "900", "uiLang": "ger", "app": "a",
-        "webapi": "w", "sessFile": "/f", "appPriv": "SYNO.App"}})"));
+        "webapi": "w", "sessFile": "/f", "appPriv": "VELA.App"}})"));
     EXPECT_EQ("alice", r.GetLoginUserName());
     EXPECT_TRUE(r.IsAdmin());        // non-empty text counts as true
     EXPECT_FALSE(r.IsTimeout());     // 0
@@ -87,7 +87,7 @@ TEST(RequestSessionFacts, StoredFactsAndTheirConversions)
     EXPECT_EQ("a", r.GetApplication());
     EXPECT_EQ("w", r.GetWebAPIPriv());
     EXPECT_EQ("/f", r.GetSessionFilePath());
-    EXPECT_TRUE(r.HasAppPriv("SYNO.App"));
+    EXPECT_TRUE(r.HasAppPriv("VELA.App"));
     EXPECT_FALSE(r.HasAppPriv(""));
 }
 
