@@ -93,9 +93,9 @@ TEST(RequestClient, ForceDesktopCookieKeepsTheDevice)
 
 TEST(RequestClient, ClassifiedOnceAndFrozen)
 {
-    APIRequest r(J(R"({"environ": {"HTTP_USER_AGENT": "Mozilla/5.0 (X11)"}})"));
+    APIRequest r(J(R"j({"environ": {"HTTP_USER_AGENT": "Mozilla/5.0 (X11)"}})j"));
     EXPECT_FALSE(r.IsMobile());
-    r.InitEnv(J(R"({"HTTP_USER_AGENT": "Mozilla/5.0 (iPhone) AppleWebKit"})"));
+    r.InitEnv(J(R"j({"HTTP_USER_AGENT": "Mozilla/5.0 (iPhone) AppleWebKit"})j"));
     EXPECT_FALSE(r.IsMobile());
     EXPECT_FALSE(r.IsIPhone());
     APIRequest copy(r);
