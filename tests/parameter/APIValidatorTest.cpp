@@ -1,0 +1,161 @@
+#include <cfloat>
+#include <thread>
+#include <vector>
+
+#include "ParamTestUtil.h"
+#include "support/TestSupport.h"
+#include "webapi/APIValidator.h"
+
+namespace VELA {
+namespace {
+
+using Test::Parse;
+typedef APIValidator V;
+
+// A valid parameter holding `v`, or an invalid one.
+template <typename T> APIParameter<T> Param(T const& v, bool invalid = false)
+{
+    APIParameter<T> p;
+    EXPECT_TRUE(p.SetDefault(v));
+    if (invalid) {
+        p.MarkInvalid();
+    }
+    return p;
+}
+
+void ExpectAll(bool (*check)(std::string const&), std::vector<std::string> const& texts, bool expected)
+{
+    for (auto const& text : texts) {
+        EXPECT_EQ(check(text), expected) << '"' << text << '"';
+    }
+}
+
+TEST(TextFormat, Patterns)
+{
+    // In the e-mail pattern "+-\" is a range: ":" and "[" lie inside it.
+    ExpectAll(V::IsEMail, {"john.doe@example.com", "a\"b,(c)<d>@host", "a:b[@host"}, true);
+    ExpectAll(V::IsEMail, {"a b@host", "@host", "user@", "user@ho st", ""}, false);
+    ExpectAll(V::IsNetbios, {"a_b-C9", std::string(255, 'a')}, true);
+    ExpectAll(V::IsNetbios, {std::string(256, 'a'), "9abc", "ab.c", ""}, false);
+    // Unanchored: one character outside the forbidden set is enough.
+    ExpectAll(V::IsWorkGroup, {"WORKGROUP", "a;"}, true);
+    ExpectAll(V::IsWorkGroup, {";", "]", "[", "\\", "/", "|?,*+<>:\"", ""}, false);
+    ExpectAll(V::IsDigit, {"007"}, true);
+    ExpectAll(V::IsDigit, {"", "12a", "-1", std::string("12\0x", 4)}, false);
+    ExpectAll(V::IsFarlinkId, {"Ab-12"}, true);
+    ExpectAll(V::IsFarlinkId, {"a_b", ""}, false);
+}
+
+TEST(TextFormat, HostAndAddress)
+{
+    ExpectAll(V::IsHostname, {"nas-01"}, true);
+    ExpectAll(V::IsHostname, {"-nas", std::string("nas\0-", 5), ""}, false);
+    ExpectAll(V::IsDomain, {"corp.example.com"}, true);
+    ExpectAll(V::IsDomain, {"corp..com", ""}, false);
+    ExpectAll(V::IsIP, {"192.168.0.1", "fe80::1"}, true);
+    ExpectAll(V::IsIP, {"192.168.0.256", std::string("10.0.0.1\0junk", 13), ""}, false);
+    ExpectAll(V::IsIPv4, {"192.168.0.1"}, true);
+    ExpectAll(V::IsIPv4, {"fe80::1", ""}, false);
+    ExpectAll(V::IsIPv6, {"fe80::1"}, true);
+    ExpectAll(V::IsIPv6, {"192.168.0.1", ""}, false);
+}
+
+TEST(CheckRegex, BadPatternLogs)
+{
+    static const char bad[] = "a(b";
+    VELA::Test::LogCapture capture;
+    EXPECT_FALSE(V::CheckRegex("a(b", bad));
+    EXPECT_TRUE(capture.Contains("APIValidator:57 Invalid pattern"));
+    EXPECT_FALSE(V::CheckRegex("x", nullptr));
+}
+
+TEST(CheckRegex, SharedAcrossThreads)
+{
+    static const char pattern[] = "^x+$";
+    std::vector<APIValidator*> seen(8, nullptr);
+    std::vector<int> matched(8, 0);
+    std::vector<std::thread> threads;
+    for (size_t i = 0; i < seen.size(); ++i) {
+        threads.emplace_back([&, i] {
+            seen[i] = V::GetInstance();
+            matched[i] = V::CheckRegex(std::string(i + 1, 'x'), pattern) && !V::CheckRegex("xy", pattern);
+        });
+    }
+    for (auto& t : threads) {
+        t.join();
+    }
+    for (size_t i = 0; i < seen.size(); ++i) {
+        EXPECT_NE(seen[i], nullptr);
+        EXPECT_EQ(seen[i], V::GetInstance());
+        EXPECT_TRUE(matched[i]) << i;
+    }
+}
+
+TEST(Numeric, PortAndEqual)
+{
+    EXPECT_FALSE(V::IsPort(-1));
+    EXPECT_TRUE(V::IsPort(0));
+    EXPECT_TRUE(V::IsPort(65535));
+    EXPECT_FALSE(V::IsPort(65536));
+
+    EXPECT_TRUE(V::IsEqual(Param(3), 3));
+    EXPECT_FALSE(V::IsEqual(Param(3, true), 3));
+    EXPECT_TRUE(V::IsEqual(Param(true), true));
+    EXPECT_FALSE(V::IsEqual(Param(std::string("a")), std::string("b")));
+    EXPECT_TRUE(V::IsEqual(Param(std::string("a")), "a"));
+    EXPECT_FALSE(V::IsEqual(Param(std::string("a")), static_cast<const char*>(nullptr)));
+    EXPECT_TRUE(V::IsEqual(Param(Parse("[1,{\"k\":2}]")), Parse("[1,{\"k\":2}]")));
+    EXPECT_TRUE(V::IsEqual(Param(0.3), 0.1 + 0.2));
+    EXPECT_FALSE(V::IsEqual(Param(0.3), 0.3001));
+    EXPECT_FALSE(V::IsEqual(Param(0.3, true), 0.3));
+}
+
+TEST(Numeric, Ranges)
+{
+    EXPECT_TRUE(V::IsBetween(Param(5), 5, 10));
+    EXPECT_TRUE(V::IsBetween(Param(10), 5, 10));
+    EXPECT_FALSE(V::IsBetween(Param(11), 5, 10));
+    EXPECT_FALSE(V::IsBetween(Param(7, true), 5, 10));
+    EXPECT_TRUE(V::IsBetween(Param(4000000000u), 1u, 4000000000u));
+    EXPECT_FALSE(V::IsBetween(Param(0ULL), 1ULL, 2ULL));
+    // Doubles: both ends excluded.
+    EXPECT_FALSE(V::IsBetween(Param(5.0), 5.0, 10.0));
+    EXPECT_TRUE(V::IsBetween(Param(5.0000001), 5.0, 10.0));
+    EXPECT_FALSE(V::IsBetween(Param(10.0), 5.0, 10.0));
+    EXPECT_FALSE(V::IsBetween(Param(7.0, true), 5.0, 10.0));
+
+    EXPECT_TRUE(V::IsGreater(Param(2), 1));
+    EXPECT_FALSE(V::IsGreater(Param(1), 1));
+    EXPECT_FALSE(V::IsGreater(Param(2, true), 1));
+    EXPECT_TRUE(V::IsGreater(Param(5000000000ULL), 4999999999ULL));
+    EXPECT_TRUE(V::IsLess(Param(0u), 1u));
+    EXPECT_FALSE(V::IsLess(Param(0, true), 1));
+    EXPECT_FALSE(V::IsGreater(Param(DBL_EPSILON / 2), 0.0));
+    EXPECT_TRUE(V::IsGreater(Param(1.5), 1.0));
+    EXPECT_FALSE(V::IsLess(Param(1.0), 1.0));
+    EXPECT_TRUE(V::IsLess(Param(0.5), 1.0));
+    EXPECT_FALSE(V::IsLess(Param(0.5, true), 1.0));
+}
+
+TEST(Membership, StringAndJson)
+{
+    Json::Value strings = Parse("[\"a\",\"b\",1]");
+    EXPECT_TRUE(V::IsBelong(Param(std::string("b")), strings));
+    EXPECT_FALSE(V::IsBelong(Param(std::string("1")), strings));
+    EXPECT_FALSE(V::IsBelong(Param(std::string("a"), true), strings));
+    EXPECT_FALSE(V::IsBelong(Param(std::string("a")), Parse("{\"a\":\"a\"}")));
+
+    Json::Value list = Parse("[1,2,3,\"x\"]");
+    for (const char* in : {"[1,2]", "{\"p\":3,\"q\":\"x\"}", "[]", "null", "2"}) {
+        EXPECT_TRUE(V::IsBelong(Param(Parse(in)), list)) << in;
+    }
+    for (const char* out : {"[1,4]", "{\"p\":4}", "4"}) {
+        EXPECT_FALSE(V::IsBelong(Param(Parse(out)), list)) << out;
+    }
+    EXPECT_FALSE(V::IsBelong(Param(Parse("[1]")), Parse("{\"a\":1}")));
+    EXPECT_FALSE(V::IsBelong(Param(Parse("[]")), Json::Value(1)));
+    EXPECT_FALSE(V::IsBelong(Param(Parse("[1]"), true), list));
+}
+
+}  // namespace
+}  // namespace VELA
