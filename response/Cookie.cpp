@@ -1,0 +1,149 @@
+#include "response/Cookie.h"
+
+#include <cctype>
+#include <climits>
+#include <cstdint>
+#include <limits>
+#include <locale.h>
+#include <type_traits>
+
+#include "vela/webapiutil.h"
+
+namespace VELA {
+namespace Cookie {
+
+const char* const kExpiredDate = "Thu, 01-Jan-1970 00:00:01 GMT";
+
+static_assert(std::is_integral<time_t>::value && std::is_signed<time_t>::value,
+              "the expiry arithmetic assumes a signed integral time_t");
+
+bool IsValidName(const std::string& name)
+{
+    if (name.empty()) {
+        return false;
+    }
+    for (char c : name) {
+        if (!isalnum(static_cast<unsigned char>(c)) && c != '_' && c != '-') {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool HasLineBreak(const std::string& text)
+{
+    return text.find_first_of("\r\n") != std::string::npos;
+}
+
+// Decimal text with an optional sign and at least one digit, nothing else.
+// False on any other character or when the number leaves time_t.
+static bool ParseDecimal(const std::string& text, time_t& out)
+{
+    size_t i = 0;
+    bool negative = false;
+    if (i < text.size() && (text[i] == '+' || text[i] == '-')) {
+        negative = text[i] == '-';
+        ++i;
+    }
+    if (i == text.size()) {
+        return false;
+    }
+    time_t result = 0;
+    for (; i < text.size(); ++i) {
+        char c = text[i];
+        if (c < '0' || c > '9') {
+            return false;
+        }
+        // Accumulate towards the sign so that the most negative value fits.
+        time_t digit = c - '0';
+        if (__builtin_mul_overflow(result, static_cast<time_t>(10), &result) ||
+            (negative ? __builtin_sub_overflow(result, digit, &result)
+                      : __builtin_add_overflow(result, digit, &result))) {
+            return false;
+        }
+    }
+    out = result;
+    return true;
+}
+
+time_t ParseClientTime(const Json::Value& value)
+{
+    if (value.isString()) {
+        time_t parsed = 0;
+        return ParseDecimal(value.asString(), parsed) ? parsed : 0;
+    }
+    // isInt64() holds for integers and for doubles with an integral value in
+    // range, and never for booleans, so asInt64() can not throw here.
+    if (value.isInt64()) {
+        Json::Int64 n = value.asInt64();
+        if (n < std::numeric_limits<time_t>::min() || n > std::numeric_limits<time_t>::max()) {
+            return 0;
+        }
+        return static_cast<time_t>(n);
+    }
+    return 0;
+}
+
+// The "C" locale for strftime_l, so a locale the process may have set can not
+// change the day and month names. Created once; null if that failed.
+static locale_t CLocale()
+{
+    static const locale_t loc = newlocale(LC_ALL_MASK, "C", static_cast<locale_t>(0));
+    return loc;
+}
+
+bool FormatExpiry(time_t reference, long minutes, std::string& out)
+{
+    time_t seconds = 0;
+    time_t when = 0;
+    if (__builtin_mul_overflow(minutes, 60, &seconds) ||
+        __builtin_add_overflow(reference, seconds, &when)) {
+        return false;
+    }
+    struct tm tm {};
+    if (!gmtime_r(&when, &tm)) {
+        return false;  // the year does not fit struct tm
+    }
+    locale_t loc = CLocale();
+    if (loc == static_cast<locale_t>(0)) {
+        return false;
+    }
+    char buf[1024];
+    size_t len = strftime_l(buf, sizeof(buf), "%a, %d-%b-%Y %H:%M:%S GMT", &tm, loc);
+    if (len == 0) {
+        return false;
+    }
+    out.assign(buf, len);
+    return true;
+}
+
+bool BuildLine(const std::string& name, const std::string& value, const std::string& path,
+               long expireMinutes, time_t reference, const std::string& domain, bool secure,
+               bool httpOnly, std::string& line)
+{
+    std::string text = name + "=" + WebAPIUtil::URLEncode(value) + "; path=" + path;
+    if (expireMinutes < 0) {
+        text += "; expires=";
+        text += kExpiredDate;
+    } else if (expireMinutes > 0) {
+        std::string date;
+        if (!FormatExpiry(reference, expireMinutes, date)) {
+            return false;
+        }
+        text += "; expires=" + date;
+    }
+    if (!domain.empty()) {
+        text += "; domain=" + domain;
+    }
+    if (secure) {
+        text += "; secure";
+    }
+    if (httpOnly) {
+        text += "; httponly";
+    }
+    line.swap(text);
+    return true;
+}
+
+}  // namespace Cookie
+}  // namespace VELA

@@ -1,0 +1,132 @@
+// Set-Cookie lines of APIResponse::AddCookie.
+#include <climits>
+#include <gtest/gtest.h>
+
+#include "support/TestSupport.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+
+namespace VELA {
+namespace {
+
+APIRequest RequestWithClientTime(const Json::Value& clientTime)
+{
+    Json::Value json;
+    json["getParam"]["client_time"] = clientTime;
+    return APIRequest(json);
+}
+
+// The single line a cookie with a 10-minute expiry gets under `clientTime`,
+// or "" when it was refused.
+std::string TenMinuteLine(const Json::Value& clientTime)
+{
+    APIRequest req = RequestWithClientTime(clientTime);
+    APIResponse resp(&req);
+    if (!resp.AddCookie("id", "v", "/", 10, "", false, false)) {
+        return "";
+    }
+    return resp.GetCookies()[0].asString();
+}
+
+TEST(APIResponseCookie, ExpiryForms)
+{
+    APIResponse resp(nullptr);
+    EXPECT_TRUE(resp.AddCookie("sid", "x", "/", -1, "", false, true));
+    EXPECT_TRUE(resp.AddCookie("sid", "x", "/", 0, "", false, false));
+    EXPECT_TRUE(resp.AddCookie("sid", "x", "/webman", LONG_MIN, "nas.lan", true, false));
+    Json::Value expected(Json::arrayValue);
+    expected.append("sid=x; path=/; expires=Thu, 01-Jan-1970 00:00:01 GMT; httponly");
+    expected.append("sid=x; path=/");
+    expected.append("sid=x; path=/webman; expires=Thu, 01-Jan-1970 00:00:01 GMT; domain=nas.lan; secure");
+    EXPECT_EQ(expected, resp.GetCookies());
+}
+
+TEST(APIResponseCookie, ExpiryFromClientTime)
+{
+    APIRequest req = RequestWithClientTime(0);
+    APIResponse resp(&req);
+    ASSERT_TRUE(resp.AddCookie("id", "a b", "/", 10, "", true, true));
+    EXPECT_EQ("id=a%20b; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT; secure; httponly",
+              resp.GetCookies()[0].asString());
+
+    const std::string suffix = "; path=/; expires=";
+    EXPECT_EQ("id=v" + suffix + "Tue, 14-Nov-2023 22:23:20 GMT", TenMinuteLine(1700000000));
+    EXPECT_EQ("id=v" + suffix + "Sat, 01-Jan-2000 00:10:00 GMT", TenMinuteLine("946684800"));
+    EXPECT_EQ("id=v" + suffix + "Thu, 01-Jan-1970 00:11:00 GMT", TenMinuteLine("+60"));
+    EXPECT_EQ("id=v" + suffix + "Thu, 01-Jan-1970 00:09:00 GMT", TenMinuteLine("-60"));
+    EXPECT_EQ("id=v" + suffix + "Thu, 01-Jan-1970 00:11:00 GMT", TenMinuteLine(60.0));
+}
+
+TEST(APIResponseCookie, UnreadableClientTimeCountsAsZero)
+{
+    const std::string epoch = "id=v; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT";
+    for (const Json::Value& v :
+         {Json::Value("abc"), Json::Value("12abc"), Json::Value(" 5"), Json::Value(""),
+          Json::Value("-"), Json::Value("99999999999999999999"), Json::Value(60.5),
+          Json::Value(true), Json::Value(), Json::Value(Json::arrayValue)}) {
+        EXPECT_EQ(epoch, TenMinuteLine(v)) << v.toStyledString();
+    }
+}
+
+TEST(APIResponseCookie, ExpiryWithoutClientTimeUsesNow)
+{
+    APIResponse resp(nullptr);
+    ASSERT_TRUE(resp.AddCookie("id", "v", "/", 1, "", false, false));
+    const std::string line = resp.GetCookies()[0].asString();
+    EXPECT_EQ(0u, line.find("id=v; path=/; expires=")) << line;
+    EXPECT_EQ(std::string::npos, line.find("1970")) << line;
+}
+
+TEST(APIResponseCookie, ExpiryOutOfRangeIsRefused)
+{
+    APIRequest req = RequestWithClientTime(0);
+    APIResponse resp(&req);
+    EXPECT_FALSE(resp.AddCookie("id", "v", "/", LONG_MAX, "", false, false));
+    // Fits time_t, but the year does not fit struct tm.
+    EXPECT_FALSE(resp.AddCookie("id", "v", "/", 2000000000000000L, "", false, false));
+    EXPECT_EQ("", TenMinuteLine("9223372036854775807"));
+    EXPECT_EQ(0u, resp.GetCookies().size());
+}
+
+TEST(APIResponseCookie, InvalidNameIsRefusedAndLogged)
+{
+    APIResponse resp(nullptr);
+    VELA::Test::LogCapture log;
+    EXPECT_FALSE(resp.AddCookie("a.b", "v", "/", 0, "", false, false));
+    EXPECT_TRUE(log.Contains("APIResponse(84)AddCookie: key[a.b] contains invalid character"));
+    EXPECT_FALSE(resp.AddCookie("a b", "v", "/", 0, "", false, false));
+    EXPECT_TRUE(log.Contains("key[a b] contains invalid character"));
+    EXPECT_FALSE(resp.AddCookie("caf\xc3\xa9", "v", "/", 0, "", false, false));
+    EXPECT_FALSE(resp.AddCookie("a;b", "v", "/", 0, "", false, false));
+    EXPECT_TRUE(resp.AddCookie("Az_09-x", "v", "/", 0, "", false, false));
+    EXPECT_EQ(1u, resp.GetCookies().size());
+}
+
+TEST(APIResponseCookie, MissingPartsAndLineBreaksAreRefused)
+{
+    APIResponse resp(nullptr);
+    {
+        VELA::Test::LogCapture log;
+        EXPECT_FALSE(resp.AddCookie("", "v", "/", 0, "", false, false));
+        EXPECT_FALSE(resp.AddCookie("id", "v", "", 0, "", false, false));
+        EXPECT_TRUE(log.Lines().empty());
+    }
+    EXPECT_FALSE(resp.AddCookie("id", "v\r\n", "/", 0, "", false, false));
+    EXPECT_FALSE(resp.AddCookie("id", "v", "/\r\nX-A: 1", 0, "", false, false));
+    EXPECT_FALSE(resp.AddCookie("id", "v", "/", 0, "h\n", false, false));
+    EXPECT_EQ(0u, resp.GetCookies().size());
+}
+
+TEST(APIResponseCookie, SameNameTwiceKeepsBothInOrder)
+{
+    APIResponse resp(nullptr);
+    ASSERT_TRUE(resp.AddCookie("id", "1", "/", 0, "", false, false));
+    ASSERT_TRUE(resp.AddCookie("id", "x;y=z", "/", 0, "", false, false));
+    Json::Value expected(Json::arrayValue);
+    expected.append("id=1; path=/");
+    expected.append("id=x%3By%3Dz; path=/");
+    EXPECT_EQ(expected, resp.GetCookies());
+}
+
+}  // namespace
+}  // namespace VELA
