@@ -1,7 +1,5 @@
 // CGI library: the handle with the request's cookies (RFC 6265), the client
-// address (REMOTE_ADDR, X-Forwarded-For behind a trusted proxy) and the
-// session and decryption calls, which fail closed until the identity and
-// session module exists.
+// address (REMOTE_ADDR, X-Forwarded-For behind a trusted proxy).
 #include <arpa/inet.h>
 #include <cerrno>
 #include <cstdlib>
@@ -12,16 +10,13 @@
 #include <sys/socket.h>
 #include <vector>
 
+#include "CgiContext.h"
 #include "FileUtil.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 
-struct _tag_VELACGI_CTX_ {
-    std::string app;
-    PVLIBCSZHASH cookies = nullptr;
-};
 
 namespace {
 
@@ -30,7 +25,6 @@ constexpr int kMaxCookies = 256;
 constexpr size_t kMaxForwardedHeader = 64 * 1024;
 constexpr size_t kMaxConfFile = 64 * 1024;
 const char kConfPath[] = "/etc/vela/webapi.conf";
-const char kNotBuilt[] = "the identity/session module is not built yet";
 
 bool IsBlank(char c) { return c == ' ' || c == '\t'; }
 
@@ -425,45 +419,3 @@ int VelaCgiGetRemoteIP(char* buf, size_t size)
     memcpy(buf, text, len + 1);
     return 0;
 }
-
-// ---- Identity and session module: not built yet, every call fails closed.
-
-int VelaCgiIsTokenEnable(VELACGI_CTX* ctx)
-{
-    VELA_LOG_ERR("VelaCgiIsTokenEnable: %s", kNotBuilt);
-    return 0;
-}
-
-int VelaCgiUIDGet(const char* sid, const char* user)
-{
-    VELA_LOG_ERR("VelaCgiUIDGet: %s", kNotBuilt);
-    return -1;
-}
-
-int VelaCgiDecryptParam(std::string& text)
-{
-    VELA_LOG_ERR("VelaCgiDecryptParam: %s", kNotBuilt);
-    return -1;
-}
-
-int VELACloudServiceHubtokenGenerateToken(const char* token, char* key, size_t size)
-{
-    if (key != nullptr && size > 0) {
-        key[0] = '\0';
-    }
-    VELA_LOG_ERR("VELACloudServiceHubtokenGenerateToken: %s", kNotBuilt);
-    return -1;
-}
-
-namespace VELA {
-namespace CredRequestUtil {
-
-bool GetDecryptAESString(const std::string& key, const std::string& cipher, std::string& plain)
-{
-    plain.clear();
-    VELA_LOG_ERR("GetDecryptAESString: %s", kNotBuilt);
-    return false;
-}
-
-}  // namespace CredRequestUtil
-}  // namespace VELA

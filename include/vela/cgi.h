@@ -53,6 +53,10 @@ int VelaCgiDecryptParam(std::string& text);
 // bytes, at most 32 characters and the terminator). 0 / -1.
 int VELACloudServiceHubtokenGenerateToken(const char* token, char* key, size_t size);
 
+// The server's public key for encrypted parameters, as PEM text (created
+// with the key pair on first use). 0 / -1.
+int VelaCgiPublicKeyPEM(std::string& pem);
+
 namespace VELA {
 namespace CredRequestUtil {
 // Decrypts a "__tXeTrEhPiC" payload with `key`. False on any failure.
