@@ -9,6 +9,8 @@
 #include <json/json.h>
 
 #include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webapi/APIValidator.h"
 #include "webapi/JsonUtil.h"
 
 namespace {
@@ -84,14 +86,28 @@ int main(int argc, char** argv)
     seen["session"]["uiLanguage"] = request.GetUILanguage();
     seen["session"]["allowUser"] = request.GetAllowUser();
     seen["session"]["authResult"] = static_cast<int>(request.GetAuthResult());
-    Json::Value all(Json::objectValue);
-    for (const char* name : {"count", "tags", "enabled"}) {
-        if (request.HasParam(name)) {
-            all[name] = request.GetParam(name);
-        }
-    }
-    seen["param"] = all;
+    // Typed parameters, with the flags a handler would test.
+    auto count = request.GetAndCheckInt("count", VELA::APIRequest::OPTIONAL);
+    auto tags = request.GetAndCheckUnitArray("tags", VELA::APIRequest::OPTIONAL);
+    auto enabled = request.GetAndCheckBool("enabled", VELA::APIRequest::REQUIRED);
+    auto port = request.GetAndCheckInt("port", VELA::APIRequest::OPTIONAL, VELA::APIValidator::IsPort);
+    port.SetDefault(5000);
+    seen["param"]["count"] = count.IsInvalid() ? Json::Value("invalid") : Json::Value(count.Get(0));
+    seen["param"]["tags"] = tags.Get(Json::Value(Json::arrayValue));
+    seen["param"]["enabled"] = enabled.IsInvalid() ? Json::Value("invalid") : Json::Value(enabled.Get());
+    seen["param"]["port"] = port.Get();
+    seen["param"]["portIsDefault"] = port.IsDefault();
     seen["upload"] = request.IsUploadRequest();
+
+    // What an echo handler would answer.
+    VELA::APIResponse response(&request);
+    Json::Value echo(Json::objectValue);
+    echo["method"] = request.GetAPIMethod();
+    echo["count"] = count.Get(0);
+    response.SetSuccess(echo);
+    response.AddCookie("lang", request.GetCookie("lang", "en"), "/", 0, "", request.GetURLProto("") == "https", true);
+    seen["response"]["body"] = response.GetBody();
+    seen["response"]["cookies"] = response.GetCookies();
 
     Json::StreamWriterBuilder builder;
     builder["indentation"] = "  ";
