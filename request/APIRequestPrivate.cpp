@@ -447,14 +447,18 @@ bool APIRequestPrivate::DecryptAESParam(Json::Value& params)
     }
     char key[33] = {0};
     if (VELACloudServiceHubtokenGenerateToken(token.c_str(), key, sizeof(key)) < 0) {
+        explicit_bzero(key, sizeof(key));
         return false;
     }
     key[sizeof(key) - 1] = '\0';
     std::string plain;
-    if (!CredRequestUtil::GetDecryptAESString(key, cipher, plain)) {
-        return false;
+    const bool decrypted = CredRequestUtil::GetDecryptAESString(key, cipher, plain);
+    explicit_bzero(key, sizeof(key));
+    bool parsed = decrypted && WebAPIUtil::strPairToJsonObj(plain, params, true, true);
+    if (!plain.empty()) {
+        explicit_bzero(&plain[0], plain.size());
     }
-    return WebAPIUtil::strPairToJsonObj(plain, params, true, true);
+    return parsed;
 }
 
 }  // namespace VELA

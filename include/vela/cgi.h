@@ -1,9 +1,9 @@
 // CGI library of the platform: cookies, client address, login sessions and
 // encrypted parameters.
 //
-// Sessions, tokens and decryption belong to the identity and session module;
-// until it is built those calls fail closed (they log why and return their
-// failure value), they never report success.
+// A call that is not built yet fails closed (it logs why and returns its
+// failure value); it never reports success. Creating and removing login
+// sessions is in vela/session.h.
 #pragma once
 
 #include <stddef.h>
@@ -43,18 +43,118 @@ void VelaCgiFree(VELACGI_CTX* ctx);
 // <root>/etc/vela/webapi.conf names others (trusted_proxies="a b c").
 int VelaCgiGetRemoteIP(char* buf, size_t size);
 
-// Non-zero when token protection is on for the session of the handle.
+// ---- Login sessions ------------------------------------------------------------
+
+// Flags of VelaCgiIsAuthorizedEx.
+// Check only: the session's last use is not moved forward, so a method that
+// a page polls by itself (marked "allowTimeout") does not keep an idle
+// session alive. A last use found in the future is still pulled back to now.
+#define VELACGI_AUTH_NO_REFRESH 0x1
+
+// What VelaCgiIsAuthorizedEx reports about the session it read, whatever the
+// verdict (all zero when no valid session file was found).
+typedef struct _tag_VELACGI_SESSION_INFO_ {
+    long long created;  // seconds since the epoch
+    long long lastUse;  // as stored before this check
+    int idleTimeout;    // seconds
+    int lifetime;       // seconds after `created`
+    int skipCheckIP;    // 1 when the client address was not compared
+    int tokenProtect;   // 1 when requests must carry the anti-forgery token
+    char clientIP[46];  // the address the session is bound to, "" for none
+    char lang[4];       // three letters, "" for none
+} VELACGI_SESSION_INFO;
+
+// Checks login session `sid` for the current request (process environment).
+// Verdicts, in the order they are tested:
+//   -2 AUTH_RESULT_NO_SESSION  malformed id, no such session, a corrupt or
+//                              foreign session file, or its user no longer
+//                              exists;
+//   -1 AUTH_RESULT_TIMEOUT     the idle timeout or the lifetime has passed;
+//   -8 AUTH_RESULT_IP_MISMATCH the client address (VelaCgiGetRemoteIP)
+//                              differs from the session's and neither the
+//                              session nor the handle skips that check;
+//   -7 AUTH_RESULT_TOKEN_MISSING token protection is on and the request has
+//                              neither header X-Vela-Token (HTTP_X_VELA_TOKEN)
+//                              nor query parameter VelaToken equal to the
+//                              session's anti-forgery token;
+//   -3 AUTH_RESULT_REJECTED    `user` too small, a failed user look-up, out
+//                              of memory;
+//    1 AUTH_RESULT_AUTHORIZED  valid: `user` (of `userSize` bytes, 493 is
+//                              enough for any user name) receives the user
+//                              name, the handle the session-file path, the
+//                              idle timeout, the skip-IP flag and the options
+//                              read by VelaCgiGetOption and VelaCgiGetLang;
+//                              the last use becomes now unless `flags` holds
+//                              VELACGI_AUTH_NO_REFRESH.
+// A last use or creation time in the future (the clock went back) counts as
+// now and is written back as now. `ctx`, `user` and `info` may be null.
+// `user` is "" unless the verdict is 1.
+int VelaCgiIsAuthorizedEx(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
+                          VELACGI_SESSION_INFO* info, int flags);
+
+// Options of VelaCgiGetOption.
+#define VELACGI_OPT_SKIP_IP 1   // the session's skip-IP flag, "1" or "0"
+#define VELACGI_OPT_WEBAPI 6    // the session's web-API privilege
+#define VELACGI_OPT_APP 7       // the session's application
+#define VELACGI_OPT_TIMEOUT 10  // the session's idle timeout in seconds, decimal
+
+// An option of the session that the handle was last authorised for
+// (VelaCgiIsAuthorizedEx returned 1), as text owned by the handle and valid
+// until the next check or VelaCgiFree. `defaultValue` (which may be null) when
+// the handle holds no authorised session or the option is unknown.
+const char* VelaCgiGetOption(VELACGI_CTX* ctx, int option, const char* defaultValue);
+
+// The three-letter UI language: the language of the handle's authorised
+// session when it has one; otherwise the best entry of Accept-Language
+// (HTTP_ACCEPT_LANGUAGE, quality values honoured, tags matched by dropping
+// subtags from the end):
+//   en enu, de ger, fr fra, ja jpn, zh-tw/zh-hk/zh-mo/zh-hant cht,
+//   zh/zh-cn/zh-sg/zh-hans chs, it ita, es spn, nl nld, sv sve, da dan,
+//   nb/nn/no nor, fi fin, pl plk, pt-br ptb, pt ptg, ru rus, ko krn, cs csy,
+//   hu hun, tr trk, th tha;
+// otherwise "enu". Writes it into `buf` (`size` >= 4). 0, or -1 for a null or
+// too small buffer.
+int VelaCgiGetLang(VELACGI_CTX* ctx, char* buf, size_t size);
+
+// The skip-IP flag of the handle: set it before VelaCgiIsAuthorizedEx for a
+// method that must not compare the client address; after a valid check it
+// is also on when the session skips the check. Set: 0 / -1 for a null handle.
+// Get: 1 or 0.
+int VelaCgiSetSkipCheckIP(VELACGI_CTX* ctx, int skip);
+int VelaCgiGetSkipCheckIP(VELACGI_CTX* ctx);
+// The session-file path and the idle timeout (seconds) of the handle's
+// authorised session; "" and 0 when it has none.
+const char* VelaCgiGetSessionFile(VELACGI_CTX* ctx);
+int VelaCgiGetTimeout(VELACGI_CTX* ctx);
+
+// 1 when token protection is on for the session named by the handle's "id"
+// cookie, 0 otherwise (no cookie, malformed id, no such session).
 int VelaCgiIsTokenEnable(VELACGI_CTX* ctx);
-// The uid of the user logged in with session `sid`, or -1.
+// The uid of `user` when session `sid` exists and belongs to `user`, else -1.
 int VelaCgiUIDGet(const char* sid, const char* user);
+
+// ---- Encrypted parameters ---------------------------------------------------------
+//
+// One server RSA key pair (3072 bits) under /var/lib/vela/keys, created by
+// the first VelaCgiPublicKeyPEM call; decryption never creates it. libcrypto
+// is loaded on the first decryption, never before. Formats (all base64 is the
+// standard alphabet, padded, without whitespace):
+//   "__cIpHeRtExT"   base64(RSA-OAEP with SHA-256 (digest and MGF1) of the
+//                    query string), at most 318 bytes of plain text;
+//   "__nEkOtReHpIc"  base64(RSA-OAEP of a 32-character AES key text);
+//   "__tXeTrEhPiC"   base64(IV[12] | ciphertext | tag[16]), AES-256-GCM under
+//                    the 32 bytes of the key text, no additional data.
+// These are what a browser's WebCrypto produces for RSA-OAEP/SHA-256 with the
+// SPKI public key and AES-GCM with a 12-byte IV.
+
 // Decrypts a "__cIpHeRtExT" payload in place into a query string. 0 / -1.
 int VelaCgiDecryptParam(std::string& text);
 // Recovers the AES key from a "__nEkOtReHpIc" token into `key` (`size`
 // bytes, at most 32 characters and the terminator). 0 / -1.
 int VELACloudServiceHubtokenGenerateToken(const char* token, char* key, size_t size);
 
-// The server's public key for encrypted parameters, as PEM text (created
-// with the key pair on first use). 0 / -1.
+// The server's public key for encrypted parameters, as SPKI PEM text; the
+// key pair is created on the first call. 0 / -1.
 int VelaCgiPublicKeyPEM(std::string& pem);
 
 namespace VELA {

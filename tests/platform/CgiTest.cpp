@@ -137,22 +137,4 @@ TEST_F(RemoteIP, BufferSize)
     EXPECT_EQ(-1, VelaCgiGetRemoteIP(nullptr, 12));
 }
 
-TEST(Cgi, SessionCallsFailClosed)
-{
-    VELA::Test::LogCapture log;
-    Handle h;
-    EXPECT_EQ(0, VelaCgiIsTokenEnable(h.ctx));
-    EXPECT_EQ(-1, VelaCgiUIDGet("sid", "admin"));
-    std::string text = "__cIpHeRtExT=abc";
-    EXPECT_EQ(-1, VelaCgiDecryptParam(text));
-    char key[33] = "stale";
-    EXPECT_EQ(-1, VELACloudServiceHubtokenGenerateToken("tok", key, sizeof(key)));
-    EXPECT_STREQ("", key);
-    std::string plain = "stale";
-    EXPECT_FALSE(VELA::CredRequestUtil::GetDecryptAESString("k", "c", plain));
-    EXPECT_TRUE(plain.empty());
-    EXPECT_EQ(5u, log.Lines().size());
-    EXPECT_TRUE(log.Contains("not built yet"));
-}
-
 }  // namespace

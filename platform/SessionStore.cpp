@@ -1,0 +1,436 @@
+// Helpers of the session and access-token stores: clock, random identifiers,
+// state directories and files, the store lock, NSS look-ups.
+#include "SessionStore.h"
+
+#include <arpa/inet.h>
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <pwd.h>
+#include <sys/file.h>
+#include <sys/random.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <time.h>
+#include <unistd.h>
+#include <vector>
+
+#include "vela/log.h"
+#include "vela/session.h"
+#include "vela/webapiutil.h"
+
+namespace {
+
+std::atomic<long long (*)(void)> g_clock{nullptr};
+
+constexpr size_t kMaxUserName = 492;
+constexpr size_t kMaxNssBuffer = 1024 * 1024;
+constexpr int kLockWaitMs = 3000;
+
+const char kBase64Url[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-_";
+
+bool IsBase64UrlChar(unsigned char c)
+{
+    return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' ||
+           c == '_';
+}
+
+class Fd {
+public:
+    explicit Fd(int fd) : fd_(fd) {}
+    ~Fd()
+    {
+        if (fd_ >= 0) {
+            close(fd_);
+        }
+    }
+    Fd(const Fd&) = delete;
+    Fd& operator=(const Fd&) = delete;
+    int get() const { return fd_; }
+
+private:
+    int fd_;
+};
+
+long long MonotonicMs()
+{
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+}
+
+}  // namespace
+
+void VelaSetClockForTest(long long (*now)(void)) { g_clock.store(now); }
+
+namespace VELA {
+namespace Platform {
+
+long long Now()
+{
+    long long (*clock)(void) = g_clock.load();
+    if (clock != nullptr) {
+        return clock();
+    }
+    return static_cast<long long>(time(nullptr));
+}
+
+bool RandomId(size_t bytes, std::string& out)
+{
+    unsigned char raw[64];
+    if (bytes == 0 || bytes > sizeof(raw)) {
+        return false;
+    }
+    size_t got = 0;
+    while (got < bytes) {
+        const ssize_t n = getrandom(raw + got, bytes - got, 0);
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            VELA_LOG_ERR("getrandom: %m");
+            return false;
+        }
+        got += static_cast<size_t>(n);
+    }
+    std::string text;
+    try {
+        text.reserve(IdLength(bytes));
+        for (size_t i = 0; i < bytes; i += 3) {
+            const unsigned v = (raw[i] << 16) | ((i + 1 < bytes ? raw[i + 1] : 0) << 8) |
+                               (i + 2 < bytes ? raw[i + 2] : 0);
+            text.push_back(kBase64Url[(v >> 18) & 63]);
+            text.push_back(kBase64Url[(v >> 12) & 63]);
+            if (i + 1 < bytes) {
+                text.push_back(kBase64Url[(v >> 6) & 63]);
+            }
+            if (i + 2 < bytes) {
+                text.push_back(kBase64Url[v & 63]);
+            }
+        }
+    } catch (const std::exception&) {
+        explicit_bzero(raw, sizeof(raw));
+        return false;
+    }
+    explicit_bzero(raw, sizeof(raw));
+    out.swap(text);
+    return true;
+}
+
+bool IsId(const char* text, size_t len)
+{
+    if (text == nullptr || strnlen(text, len + 1) != len) {
+        return false;
+    }
+    for (size_t i = 0; i < len; ++i) {
+        if (!IsBase64UrlChar(static_cast<unsigned char>(text[i]))) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool ConstantTimeEquals(const std::string& a, const std::string& b)
+{
+    if (a.size() != b.size()) {
+        return false;
+    }
+    volatile unsigned char diff = 0;
+    for (size_t i = 0; i < a.size(); ++i) {
+        diff = diff | static_cast<unsigned char>(a[i] ^ b[i]);
+    }
+    return diff == 0;
+}
+
+bool IsUserName(const char* name)
+{
+    if (name == nullptr) {
+        return false;
+    }
+    const size_t len = strnlen(name, kMaxUserName + 1);
+    if (len == 0 || len > kMaxUserName) {
+        return false;
+    }
+    for (size_t i = 0; i < len; ++i) {
+        const unsigned char c = static_cast<unsigned char>(name[i]);
+        if (c < 0x20 || c == 0x7f || c == '/' || c == ':') {
+            return false;
+        }
+    }
+    return true;
+}
+
+int LookupUser(const char* name, uid_t& uid)
+{
+    const long hint = sysconf(_SC_GETPW_R_SIZE_MAX);
+    size_t len = hint > 0 ? static_cast<size_t>(hint) : 16384;
+    for (;;) {
+        std::vector<char> buffer;
+        try {
+            buffer.resize(len);
+        } catch (const std::exception&) {
+            return -1;
+        }
+        struct passwd pw;
+        struct passwd* result = nullptr;
+        const int rc = getpwnam_r(name, &pw, buffer.data(), buffer.size(), &result);
+        if (rc == ERANGE && len < kMaxNssBuffer) {
+            len *= 2;
+            continue;
+        }
+        if (rc == 0 && result != nullptr) {
+            uid = pw.pw_uid;
+            return 1;
+        }
+        // getpwnam_r reports an unknown name as 0 and a null result; some NSS
+        // modules use ENOENT or ESRCH for it instead.
+        if (rc == 0 || rc == ENOENT || rc == ESRCH) {
+            return 0;
+        }
+        VELA_LOG_ERR("getpwnam_r(%.64s): %s", name, strerror(rc));
+        return -1;
+    }
+}
+
+bool CanonicalAddress(const std::string& text, std::string& out)
+{
+    if (text.size() >= INET6_ADDRSTRLEN) {
+        return false;
+    }
+    unsigned char bytes[sizeof(struct in6_addr)];
+    int family = AF_INET;
+    if (inet_pton(AF_INET, text.c_str(), bytes) != 1) {
+        family = AF_INET6;
+        if (inet_pton(AF_INET6, text.c_str(), bytes) != 1) {
+            return false;
+        }
+        struct in6_addr v6;
+        memcpy(&v6, bytes, sizeof(v6));
+        if (IN6_IS_ADDR_V4MAPPED(&v6)) {
+            family = AF_INET;
+            memmove(bytes, bytes + 12, 4);
+        }
+    }
+    char buf[INET6_ADDRSTRLEN];
+    if (inet_ntop(family, bytes, buf, sizeof(buf)) == nullptr) {
+        return false;
+    }
+    try {
+        out = buf;
+    } catch (const std::exception&) {
+        return false;
+    }
+    return true;
+}
+
+bool EnsureStateDir(const std::string& path)
+{
+    if (path.empty() || path[0] != '/') {
+        return false;
+    }
+    for (size_t pos = 1; pos <= path.size(); ++pos) {
+        if (pos != path.size() && path[pos] != '/') {
+            continue;
+        }
+        const std::string prefix = path.substr(0, pos);
+        const bool leaf = pos == path.size();
+        struct stat st;
+        if (stat(prefix.c_str(), &st) == 0) {
+            continue;
+        }
+        if (errno != ENOENT) {
+            VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
+            return false;
+        }
+        if (mkdir(prefix.c_str(), leaf ? 0700 : 0755) != 0 && errno != EEXIST) {
+            VELA_LOG_ERR("mkdir(%s): %m", prefix.c_str());
+            return false;
+        }
+    }
+    struct stat st;
+    if (lstat(path.c_str(), &st) != 0) {
+        VELA_LOG_ERR("lstat(%s): %m", path.c_str());
+        return false;
+    }
+    if (!S_ISDIR(st.st_mode)) {
+        VELA_LOG_ERR("%s is not a directory", path.c_str());
+        return false;
+    }
+    if (st.st_uid != geteuid()) {
+        VELA_LOG_ERR("%s is owned by uid %u, not by uid %u", path.c_str(), static_cast<unsigned>(st.st_uid),
+                     static_cast<unsigned>(geteuid()));
+        return false;
+    }
+    if ((st.st_mode & 077) != 0) {
+        VELA_LOG(LOG_WARNING, "%s had mode %03o, setting 0700", path.c_str(), static_cast<unsigned>(st.st_mode & 0777));
+        if (chmod(path.c_str(), 0700) != 0) {
+            VELA_LOG_ERR("chmod(%s): %m", path.c_str());
+            return false;
+        }
+    }
+    return true;
+}
+
+ReadResult ReadStateFile(const std::string& path, size_t limit, Json::Value& out)
+{
+    Fd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK | O_NOFOLLOW));
+    if (fd.get() < 0) {
+        if (errno == ENOENT) {
+            return ReadResult::Missing;
+        }
+        if (errno == ELOOP) {
+            VELA_LOG_ERR("%s is a symbolic link, refused", path.c_str());
+            return ReadResult::Corrupt;
+        }
+        VELA_LOG_ERR("open(%s): %m", path.c_str());
+        return ReadResult::Error;
+    }
+    struct stat st;
+    if (fstat(fd.get(), &st) != 0) {
+        VELA_LOG_ERR("fstat(%s): %m", path.c_str());
+        return ReadResult::Error;
+    }
+    if (!S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
+        VELA_LOG_ERR("%s is not a regular file owned by uid %u, refused", path.c_str(),
+                     static_cast<unsigned>(geteuid()));
+        return ReadResult::Corrupt;
+    }
+    if (st.st_size < 0 || static_cast<unsigned long long>(st.st_size) > limit) {
+        VELA_LOG_ERR("%s is larger than %zu bytes, refused", path.c_str(), limit);
+        return ReadResult::Corrupt;
+    }
+    std::string text;
+    try {
+        text.resize(limit + 1);
+    } catch (const std::exception&) {
+        return ReadResult::Error;
+    }
+    size_t used = 0;
+    while (used < text.size()) {
+        const ssize_t got = read(fd.get(), &text[used], text.size() - used);
+        if (got < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            VELA_LOG_ERR("read(%s): %m", path.c_str());
+            return ReadResult::Error;
+        }
+        if (got == 0) {
+            break;
+        }
+        used += static_cast<size_t>(got);
+    }
+    if (used > limit) {
+        VELA_LOG_ERR("%s grew beyond %zu bytes, refused", path.c_str(), limit);
+        return ReadResult::Corrupt;
+    }
+    text.resize(used);
+    Json::Value doc;
+    if (!VELA::WebAPIUtil::ParseJson(text, doc) || !doc.isObject()) {
+        VELA_LOG_ERR("%s is not a valid state file", path.c_str());
+        return ReadResult::Corrupt;
+    }
+    out.swap(doc);
+    return ReadResult::Ok;
+}
+
+bool WriteStateFile(const std::string& path, const Json::Value& value)
+{
+    return VELA::WebAPIUtil::WriteJsonFileAtomic(path, value, 0600);
+}
+
+StoreLock::StoreLock(const std::string& dir)
+{
+    const std::string path = dir + "/.lock";
+    const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NOCTTY, 0600);
+    if (fd < 0) {
+        VELA_LOG_ERR("open(%s): %m", path.c_str());
+        return;
+    }
+    const long long deadline = MonotonicMs() + kLockWaitMs;
+    for (;;) {
+        if (flock(fd, LOCK_EX | LOCK_NB) == 0) {
+            fd_ = fd;
+            return;
+        }
+        if (errno != EWOULDBLOCK && errno != EINTR) {
+            VELA_LOG_ERR("flock(%s): %m", path.c_str());
+            break;
+        }
+        if (MonotonicMs() >= deadline) {
+            VELA_LOG_ERR("flock(%s): still held by another process after %d ms", path.c_str(), kLockWaitMs);
+            break;
+        }
+        struct timespec pause = {0, 2 * 1000 * 1000};
+        nanosleep(&pause, nullptr);
+    }
+    close(fd);
+}
+
+StoreLock::~StoreLock()
+{
+    if (fd_ >= 0) {
+        close(fd_);  // releases the flock
+    }
+}
+
+bool GetInt(const Json::Value& obj, const char* key, long long min, long long max, long long& out)
+{
+    const Json::Value* v = obj.find(key, key + strlen(key));
+    if (v == nullptr || !(v->isInt64() && (v->isIntegral()))) {
+        return false;
+    }
+    const long long n = v->asInt64();
+    if (n < min || n > max) {
+        return false;
+    }
+    out = n;
+    return true;
+}
+
+bool GetBool(const Json::Value& obj, const char* key, bool& out)
+{
+    const Json::Value* v = obj.find(key, key + strlen(key));
+    if (v == nullptr || !v->isBool()) {
+        return false;
+    }
+    out = v->asBool();
+    return true;
+}
+
+bool GetString(const Json::Value& obj, const char* key, size_t maxLen, std::string& out)
+{
+    const Json::Value* v = obj.find(key, key + strlen(key));
+    if (v == nullptr || !v->isString()) {
+        return false;
+    }
+    const char* begin = nullptr;
+    const char* end = nullptr;
+    if (!v->getString(&begin, &end) || static_cast<size_t>(end - begin) > maxLen) {
+        return false;
+    }
+    try {
+        out.assign(begin, end);
+    } catch (const std::exception&) {
+        return false;
+    }
+    return out.find('\0') == std::string::npos;
+}
+
+bool CopyOut(const std::string& text, char* buf, size_t size)
+{
+    if (buf == nullptr || size == 0) {
+        return false;
+    }
+    if (text.size() + 1 > size) {
+        buf[0] = '\0';
+        return false;
+    }
+    memcpy(buf, text.c_str(), text.size() + 1);
+    return true;
+}
+
+}  // namespace Platform
+}  // namespace VELA

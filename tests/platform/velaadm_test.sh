@@ -1,0 +1,148 @@
+#!/bin/sh
+# Drives the velaadm binary against a fresh VELA_ROOT: every subcommand, its
+# output, exit status and error messages, and the files it leaves.
+# usage: velaadm_test.sh /path/to/velaadm
+set -u
+
+ADM=${1:?usage: velaadm_test.sh /path/to/velaadm}
+VELA_ROOT=$(mktemp -d "${TMPDIR:-/tmp}/velaadm-test-XXXXXX") || exit 1
+export VELA_ROOT
+unset VELA_LOG_STDERR
+trap 'rm -rf "$VELA_ROOT"' EXIT
+
+failures=0
+OUT="$VELA_ROOT/.out"
+ERR="$VELA_ROOT/.err"
+
+fail() {
+    echo "FAIL: $*" >&2
+    echo "  stdout: $(cat "$OUT" 2>/dev/null)" >&2
+    echo "  stderr: $(cat "$ERR" 2>/dev/null)" >&2
+    failures=$((failures + 1))
+}
+
+# expect STATUS ARGS...: runs velaadm, checks its exit status.
+expect() {
+    want=$1
+    shift
+    "$ADM" "$@" >"$OUT" 2>"$ERR"
+    got=$?
+    [ "$got" -eq "$want" ] || fail "velaadm $* exited $got, expected $want"
+}
+
+stdout_has() { grep -q -- "$1" "$OUT" || fail "stdout lacks \"$1\""; }
+stderr_has() { grep -q -- "$1" "$ERR" || fail "stderr lacks \"$1\""; }
+stdout_lacks() { ! grep -q -- "$1" "$OUT" || fail "stdout shows \"$1\""; }
+mode_is() {
+    m=$(stat -c %a "$1" 2>/dev/null)
+    [ "$m" = "$2" ] || fail "$1 has mode ${m:-none}, expected $2"
+}
+
+# ---- usage errors
+expect 2
+stderr_has "usage: velaadm"
+expect 2 frobnicate
+stderr_has "unknown command"
+expect 2 session
+expect 2 session frobnicate
+expect 2 session create
+expect 2 session create root --timeout abc
+stderr_has "\-\-timeout must be"
+expect 2 session create root --timeout -5
+expect 2 session create root --ip
+stderr_has "needs a value"
+expect 2 session create root --bogus
+stderr_has "unknown option --bogus"
+expect 2 session list extra
+expect 0 --help
+stdout_has "session create"
+
+# ---- sessions
+expect 1 session create vela-no-such-user
+stderr_has "no user \"vela-no-such-user\""
+expect 1 session create root --ip 999.1.1.1
+stderr_has "not an IP address"
+
+expect 0 session create root --ip 192.0.2.7 --timeout 600 --token
+sid=$(sed -n 's/^sid=//p' "$OUT")
+token=$(sed -n 's/^token=//p' "$OUT")
+echo "$sid" | grep -Eq '^[A-Za-z0-9_-]{32}$' || fail "session id \"$sid\" has the wrong form"
+echo "$token" | grep -Eq '^[A-Za-z0-9_-]{32}$' || fail "anti-forgery token \"$token\" has the wrong form"
+mode_is "$VELA_ROOT/run/vela/sessions" 700
+mode_is "$VELA_ROOT/run/vela/sessions/$sid" 600
+grep -q '"idleTimeout":600' "$VELA_ROOT/run/vela/sessions/$sid" || fail "idle timeout not stored"
+grep -q '"tokenProtect":true' "$VELA_ROOT/run/vela/sessions/$sid" || fail "token protection not stored"
+
+expect 0 session create nobody
+sid2=$(sed -n 's/^sid=//p' "$OUT")
+grep -q '"skipIP":true' "$VELA_ROOT/run/vela/sessions/$sid2" || fail "a session without --ip must skip the address check"
+
+expect 0 session list
+stdout_has "$sid"
+stdout_has "192.0.2.7"
+stdout_has "$sid2"
+stdout_has "nobody"
+stdout_lacks "$token"
+
+expect 0 session revoke "$sid"
+[ ! -e "$VELA_ROOT/run/vela/sessions/$sid" ] || fail "revoked session file still exists"
+expect 1 session revoke "$sid"
+stderr_has "no session"
+expect 1 session revoke ../x
+expect 2 session revoke
+expect 0 session list
+stdout_lacks "$sid"
+
+# ---- access tokens
+expect 2 token create root --method get
+stderr_has "at least one --api"
+expect 2 token create root --api 'a*b' --method get
+stderr_has "invalid pattern"
+expect 2 token create root --api x --method y --expires 0
+expect 1 token create vela-no-such-user --api x --method y
+stderr_has "no user \"vela-no-such-user\""
+
+expect 0 token create root --api 'VELA.Demo.*' --api VELA.Other --method 'get*' --expires 3600
+tid=$(sed -n 's/^id=//p' "$OUT")
+tok=$(sed -n 's/^token=//p' "$OUT")
+echo "$tid" | grep -Eq '^[A-Za-z0-9_-]{22}$' || fail "token id \"$tid\" has the wrong form"
+case "$tok" in
+"$tid".*) ;;
+*) fail "token \"$tok\" does not start with its id" ;;
+esac
+mode_is "$VELA_ROOT/var/lib/vela/tokens" 700
+mode_is "$VELA_ROOT/var/lib/vela/tokens/$tid" 600
+
+expect 0 token list
+stdout_has "$tid"
+stdout_has "VELA.Demo.\*,VELA.Other / get\*"
+stdout_lacks "${tok#*.}"
+
+expect 0 token revoke "$tid"
+[ ! -e "$VELA_ROOT/var/lib/vela/tokens/$tid" ] || fail "revoked token file still exists"
+expect 1 token revoke "$tid"
+stderr_has "no access token"
+expect 1 token revoke ../../x
+
+# ---- public key: printed as PEM, or a clear refusal while none is available
+"$ADM" pubkey >"$OUT" 2>"$ERR"
+case $? in
+0) stdout_has "BEGIN PUBLIC KEY" ;;
+1) stderr_has "public key is not available" ;;
+*) fail "pubkey exited with an unexpected status" ;;
+esac
+expect 2 pubkey extra
+
+# Nothing was written outside the state directories.
+extra=$(find "$VELA_ROOT" -mindepth 1 \( -path "$VELA_ROOT/run" -o -path "$VELA_ROOT/run/vela" \
+    -o -path "$VELA_ROOT/run/vela/sessions*" -o -path "$VELA_ROOT/var" -o -path "$VELA_ROOT/var/lib" \
+    -o -path "$VELA_ROOT/var/lib/vela" -o -path "$VELA_ROOT/var/lib/vela/tokens*" \
+    -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$VELA_ROOT/etc*" -o -path "$OUT" -o -path "$ERR" \) \
+    -prune -o -print)
+[ -z "$extra" ] || fail "unexpected files: $extra"
+
+if [ "$failures" -ne 0 ]; then
+    echo "$failures check(s) failed" >&2
+    exit 1
+fi
+echo "velaadm: all checks passed"

@@ -1,0 +1,406 @@
+// velaadm: administration of login sessions and access tokens, and the
+// server's public key. Works on the state under VELA_ROOT ("/" by default).
+//
+// Exit status: 0 success, 1 the operation failed, 2 a usage error.
+#include <cerrno>
+#include <climits>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <string>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+#include <vector>
+
+#include "vela/cgi.h"
+#include "vela/log.h"
+#include "vela/session.h"
+#include "vela/token.h"
+
+namespace {
+
+const char kUsage[] =
+    "usage: velaadm <command> [arguments]\n"
+    "\n"
+    "  session create <user> [--ip ADDRESS] [--timeout SECONDS] [--lifetime SECONDS]\n"
+    "                 [--token] [--skip-ip] [--lang CODE]\n"
+    "        Creates a login session and prints its id and anti-forgery token.\n"
+    "        --ip binds it to a client address (without it no address is checked);\n"
+    "        --timeout is the idle timeout (default 900), --lifetime the absolute\n"
+    "        lifetime (default 86400); --token requires the anti-forgery token on\n"
+    "        every request; --lang is a three-letter UI language (\"enu\").\n"
+    "  session list\n"
+    "  session revoke <sid>\n"
+    "  token create <user> --api PATTERN [--api PATTERN...] --method PATTERN\n"
+    "               [--method PATTERN...] [--expires SECONDS]\n"
+    "        Creates an access token and prints it once, with its id. A pattern\n"
+    "        is a name or a prefix ending in \"*\". --expires: lifetime in seconds\n"
+    "        (default 2592000, 30 days).\n"
+    "  token list\n"
+    "  token revoke <id>\n"
+    "  pubkey\n"
+    "        Prints the server's public key for encrypted parameters (PEM).\n"
+    "\n"
+    "The state lives under VELA_ROOT when it is set.\n";
+
+constexpr int kExitFailure = 1;
+constexpr int kExitUsage = 2;
+
+// Platform log lines go to syslog as usual and, so that the administrator
+// sees why a command failed, warnings and errors to standard error as well.
+void LogSink(int priority, const char* line, void*)
+{
+    syslog(priority, "%s", line);
+    if (LOG_PRI(priority) > LOG_WARNING) {
+        return;
+    }
+    // The terminal gets the message without the "Source:line " prefix.
+    const char* text = line;
+    const char* colon = strchr(line, ':');
+    const char* space = strchr(line, ' ');
+    if (colon != nullptr && space != nullptr && colon < space && colon[1] >= '0' && colon[1] <= '9') {
+        text = space + 1;
+    }
+    fprintf(stderr, "velaadm: %s\n", text);
+}
+
+int Usage(const char* problem)
+{
+    fprintf(stderr, "velaadm: %s\n\n%s", problem, kUsage);
+    return kExitUsage;
+}
+
+int Fail(const std::string& message)
+{
+    fprintf(stderr, "velaadm: %s\n", message.c_str());
+    return kExitFailure;
+}
+
+// A decimal number of seconds from 1 to `max`. False for anything else
+// (signs, blanks, trailing text, overflow).
+bool ParseSeconds(const char* text, long long max, long long& out)
+{
+    if (text == nullptr || text[0] < '0' || text[0] > '9') {
+        return false;
+    }
+    errno = 0;
+    char* end = nullptr;
+    const long long value = strtoll(text, &end, 10);
+    if (errno != 0 || end == text || *end != '\0' || value < 1 || value > max) {
+        return false;
+    }
+    out = value;
+    return true;
+}
+
+std::string FormatTime(long long t)
+{
+    const time_t tt = static_cast<time_t>(t);
+    struct tm tm;
+    char buf[32];
+    if (gmtime_r(&tt, &tm) == nullptr || strftime(buf, sizeof(buf), "%Y-%m-%dT%H:%M:%SZ", &tm) == 0) {
+        return std::to_string(t);
+    }
+    return buf;
+}
+
+std::string Join(const std::vector<std::string>& items)
+{
+    std::string out;
+    for (const std::string& item : items) {
+        if (!out.empty()) {
+            out += ",";
+        }
+        out += item;
+    }
+    return out;
+}
+
+// Arguments after the subcommand: positionals and "--name [value]" options.
+struct Args {
+    std::vector<std::string> positional;
+    std::vector<std::pair<std::string, std::string>> options;
+};
+
+// `withValue` lists the options that take a value, `flags` those that do not.
+// False (with `problem` set) for an unknown option or a missing value.
+bool SplitArgs(int argc, char** argv, int first, const std::vector<std::string>& withValue,
+               const std::vector<std::string>& flags, Args& out, std::string& problem)
+{
+    for (int i = first; i < argc; ++i) {
+        const std::string arg = argv[i];
+        if (arg.size() < 3 || arg.compare(0, 2, "--") != 0) {
+            out.positional.push_back(arg);
+            continue;
+        }
+        bool known = false;
+        for (const std::string& name : withValue) {
+            if (arg == name) {
+                if (i + 1 >= argc) {
+                    problem = arg + " needs a value";
+                    return false;
+                }
+                out.options.emplace_back(arg, argv[++i]);
+                known = true;
+                break;
+            }
+        }
+        for (const std::string& name : flags) {
+            if (!known && arg == name) {
+                out.options.emplace_back(arg, "");
+                known = true;
+            }
+        }
+        if (!known) {
+            problem = "unknown option " + arg;
+            return false;
+        }
+    }
+    return true;
+}
+
+int SessionCreate(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {"--ip", "--timeout", "--lifetime", "--lang"}, {"--token", "--skip-ip"}, args,
+                   problem)) {
+        return Usage(problem.c_str());
+    }
+    if (args.positional.size() != 1) {
+        return Usage("session create needs exactly one user name");
+    }
+    const std::string& user = args.positional[0];
+    std::string ip;
+    VelaSessionOptions options;
+    for (const auto& opt : args.options) {
+        long long seconds = 0;
+        if (opt.first == "--ip") {
+            ip = opt.second;
+        } else if (opt.first == "--timeout") {
+            if (!ParseSeconds(opt.second.c_str(), VELA_SESSION_IDLE_MAX, seconds)) {
+                return Usage(("--timeout must be 1 to " + std::to_string(VELA_SESSION_IDLE_MAX) + " seconds").c_str());
+            }
+            options.idleTimeout = static_cast<int>(seconds);
+        } else if (opt.first == "--lifetime") {
+            if (!ParseSeconds(opt.second.c_str(), VELA_SESSION_LIFETIME_MAX, seconds)) {
+                return Usage(
+                    ("--lifetime must be 1 to " + std::to_string(VELA_SESSION_LIFETIME_MAX) + " seconds").c_str());
+            }
+            options.lifetime = static_cast<int>(seconds);
+        } else if (opt.first == "--lang") {
+            options.lang = opt.second;
+        } else if (opt.first == "--token") {
+            options.tokenProtect = true;
+        } else if (opt.first == "--skip-ip") {
+            options.skipIP = true;
+        }
+    }
+    std::string sid;
+    std::string token;
+    if (VelaSessionCreate(user.c_str(), ip.c_str(), &options, sid, token) != 0) {
+        return Fail("cannot create a session for \"" + user + "\"");
+    }
+    printf("sid=%s\ntoken=%s\n", sid.c_str(), token.c_str());
+    return 0;
+}
+
+int SessionList(int argc, char** argv)
+{
+    if (argc != 3) {
+        return Usage("session list takes no arguments");
+    }
+    std::vector<VelaSessionRecord> sessions;
+    if (VelaSessionList(sessions) != 0) {
+        return Fail("cannot list the sessions");
+    }
+    printf("%-32s  %-16s  %-15s  %-20s  %-20s  %7s  %8s  %s\n", "SID", "USER", "ADDRESS", "CREATED", "LAST USE",
+           "IDLE", "LIFETIME", "FLAGS");
+    for (const VelaSessionRecord& s : sessions) {
+        std::string flags;
+        flags += s.skipIP ? "skip-ip " : "";
+        flags += s.tokenProtect ? "token " : "";
+        flags += s.expired ? "expired" : "active";
+        printf("%-32s  %-16s  %-15s  %-20s  %-20s  %7d  %8d  %s\n", s.sid.c_str(), s.user.c_str(),
+               s.clientIP.empty() ? "-" : s.clientIP.c_str(), FormatTime(s.created).c_str(),
+               FormatTime(s.lastUse).c_str(), s.idleTimeout, s.lifetime, flags.c_str());
+    }
+    return 0;
+}
+
+int SessionRevoke(int argc, char** argv)
+{
+    if (argc != 4) {
+        return Usage("session revoke needs exactly one session id");
+    }
+    const int rc = VelaSessionRemove(argv[3]);
+    if (rc == -2) {
+        return Fail("no session with that id");
+    }
+    if (rc != 0) {
+        return Fail("cannot remove the session");
+    }
+    printf("session revoked\n");
+    return 0;
+}
+
+int TokenCreate(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {"--api", "--method", "--expires"}, {}, args, problem)) {
+        return Usage(problem.c_str());
+    }
+    if (args.positional.size() != 1) {
+        return Usage("token create needs exactly one user name");
+    }
+    const std::string& user = args.positional[0];
+    std::vector<std::string> apis;
+    std::vector<std::string> methods;
+    long long lifetime = 0;
+    for (const auto& opt : args.options) {
+        std::vector<std::string>& list = opt.first == "--api" ? apis : methods;
+        if (opt.first == "--expires") {
+            if (!ParseSeconds(opt.second.c_str(), VELA_TOKEN_LIFETIME_MAX, lifetime)) {
+                return Usage(
+                    ("--expires must be 1 to " + std::to_string(VELA_TOKEN_LIFETIME_MAX) + " seconds").c_str());
+            }
+            continue;
+        }
+        if (!VelaAccessTokenIsPattern(opt.second)) {
+            return Usage(("invalid pattern \"" + opt.second + "\" for " + opt.first +
+                          ": a name of letters, digits, '.', '_', '-', optionally ending in '*'")
+                             .c_str());
+        }
+        list.push_back(opt.second);
+    }
+    if (apis.empty() || methods.empty()) {
+        return Usage("token create needs at least one --api and one --method");
+    }
+    if (apis.size() > VELA_TOKEN_MAX_PATTERNS || methods.size() > VELA_TOKEN_MAX_PATTERNS) {
+        return Usage(("at most " + std::to_string(VELA_TOKEN_MAX_PATTERNS) + " patterns of each kind").c_str());
+    }
+    std::string token;
+    std::string id;
+    if (VelaAccessTokenCreate(user.c_str(), apis, methods, lifetime, token, id) != 0) {
+        return Fail("cannot create an access token for \"" + user + "\"");
+    }
+    printf("id=%s\ntoken=%s\n", id.c_str(), token.c_str());
+    return 0;
+}
+
+int TokenList(int argc, char** argv)
+{
+    if (argc != 3) {
+        return Usage("token list takes no arguments");
+    }
+    std::vector<VelaAccessTokenRecord> tokens;
+    if (VelaAccessTokenList(tokens) != 0) {
+        return Fail("cannot list the access tokens");
+    }
+    printf("%-22s  %-16s  %-20s  %-20s  %-7s  %s\n", "ID", "USER", "CREATED", "EXPIRES", "STATE", "APIS / METHODS");
+    for (const VelaAccessTokenRecord& t : tokens) {
+        printf("%-22s  %-16s  %-20s  %-20s  %-7s  %s / %s\n", t.id.c_str(), t.user.c_str(),
+               FormatTime(t.created).c_str(), FormatTime(t.expires).c_str(), t.expired ? "expired" : "active",
+               Join(t.apis).c_str(), Join(t.methods).c_str());
+    }
+    return 0;
+}
+
+int TokenRevoke(int argc, char** argv)
+{
+    if (argc != 4) {
+        return Usage("token revoke needs exactly one token id");
+    }
+    const int rc = VelaAccessTokenRevoke(argv[3]);
+    if (rc == -2) {
+        return Fail("no access token with that id");
+    }
+    if (rc != 0) {
+        return Fail("cannot revoke the access token");
+    }
+    printf("access token revoked\n");
+    return 0;
+}
+
+int PublicKey(int argc, char** argv)
+{
+    if (argc != 2) {
+        return Usage("pubkey takes no arguments");
+    }
+    std::string pem;
+    if (VelaCgiPublicKeyPEM(pem) != 0 || pem.empty()) {
+        return Fail("the server's public key is not available");
+    }
+    fputs(pem.c_str(), stdout);
+    if (pem.back() != '\n') {
+        fputc('\n', stdout);
+    }
+    return 0;
+}
+
+int Run(int argc, char** argv)
+{
+    if (argc < 2) {
+        return Usage("no command given");
+    }
+    const std::string command = argv[1];
+    if (command == "--help" || command == "-h" || command == "help") {
+        fputs(kUsage, stdout);
+        return 0;
+    }
+    if (command == "pubkey") {
+        return PublicKey(argc, argv);
+    }
+    if (command != "session" && command != "token") {
+        return Usage(("unknown command \"" + command + "\"").c_str());
+    }
+    if (argc < 3) {
+        return Usage((command + " needs an action: create, list or revoke").c_str());
+    }
+    const std::string action = argv[2];
+    if (command == "session") {
+        if (action == "create") {
+            return SessionCreate(argc, argv);
+        }
+        if (action == "list") {
+            return SessionList(argc, argv);
+        }
+        if (action == "revoke") {
+            return SessionRevoke(argc, argv);
+        }
+    } else {
+        if (action == "create") {
+            return TokenCreate(argc, argv);
+        }
+        if (action == "list") {
+            return TokenList(argc, argv);
+        }
+        if (action == "revoke") {
+            return TokenRevoke(argc, argv);
+        }
+    }
+    return Usage(("unknown action \"" + action + "\" for " + command).c_str());
+}
+
+}  // namespace
+
+int main(int argc, char** argv)
+{
+    openlog("velaadm", LOG_PID, LOG_AUTHPRIV);
+    VelaLogSetSink(LogSink, nullptr);
+    umask(077);
+    int rc = kExitFailure;
+    try {
+        rc = Run(argc, argv);
+    } catch (const std::exception& e) {
+        rc = Fail(std::string("internal error: ") + e.what());
+    }
+    if (fflush(stdout) != 0) {
+        fprintf(stderr, "velaadm: cannot write the output: %s\n", strerror(errno));
+        rc = kExitFailure;
+    }
+    return rc;
+}
