@@ -6,6 +6,7 @@ set -euo pipefail
 packages=(
   build-essential cmake pkg-config
   libjsoncpp-dev
+  libssl-dev openssl passwd
   libgtest-dev libgmock-dev googletest
   libbenchmark-dev
   clang libclang-rt-dev
