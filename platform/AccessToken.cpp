@@ -4,7 +4,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-#include <dirent.h>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -26,7 +25,6 @@ static_assert(VELA::Platform::IdLength(kIdBytes) == VELA_TOKEN_ID_LEN, "token id
 static_assert(VELA::Platform::IdLength(kSecretBytes) == VELA_TOKEN_SECRET_LEN, "token secret length");
 constexpr size_t kMaxTokenFile = 16 * 1024;
 constexpr size_t kMaxPattern = 128;
-constexpr size_t kMaxDirEntries = 100000;
 constexpr long long kMaxTime = 1LL << 40;
 const int kAuthLog = LOG_AUTHPRIV | LOG_NOTICE;
 
@@ -212,37 +210,10 @@ int Grant(const char* token, const char* api, const char* method, char* user, si
     return 0;
 }
 
-// The names in the token directory that are token ids. False when the
-// directory cannot be read (a missing directory is an empty list).
-bool TokenIds(std::vector<std::string>& ids)
-{
-    const std::string dir = TokenDir();
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        if (errno == ENOENT) {
-            return true;
-        }
-        VELA_LOG_ERR("opendir(%s): %m", dir.c_str());
-        return false;
-    }
-    size_t seen = 0;
-    while (struct dirent* ent = readdir(d)) {
-        if (++seen > kMaxDirEntries) {
-            VELA_LOG_ERR("%s holds more than %zu entries, the rest are ignored", dir.c_str(), kMaxDirEntries);
-            break;
-        }
-        if (VELA::Platform::IsId(ent->d_name, VELA_TOKEN_ID_LEN)) {
-            ids.emplace_back(ent->d_name);
-        }
-    }
-    closedir(d);
-    return true;
-}
-
 void PurgeExpired()
 {
     std::vector<std::string> ids;
-    if (!TokenIds(ids)) {
+    if (!VELA::Platform::ListIds(TokenDir(), VELA_TOKEN_ID_LEN, ids)) {
         return;
     }
     const long long now = VELA::Platform::Now();
@@ -378,7 +349,7 @@ int VelaAccessTokenList(std::vector<VelaAccessTokenRecord>& out)
     out.clear();
     try {
         std::vector<std::string> ids;
-        if (!TokenIds(ids)) {
+        if (!VELA::Platform::ListIds(TokenDir(), VELA_TOKEN_ID_LEN, ids)) {
             return -1;
         }
         const long long now = VELA::Platform::Now();

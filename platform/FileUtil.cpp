@@ -1,59 +1,55 @@
 #include "FileUtil.h"
 
 #include <cerrno>
+#include <cstdlib>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "vela/log.h"
+
 namespace VELA {
 namespace Platform {
 
-namespace {
-
-class Fd {
-public:
-    explicit Fd(int fd) : fd_(fd) {}
-    ~Fd()
-    {
-        if (fd_ >= 0) {
-            close(fd_);
-        }
+void ScopedFd::Reset(int fd)
+{
+    if (fd_ >= 0) {
+        close(fd_);
     }
-    Fd(const Fd&) = delete;
-    Fd& operator=(const Fd&) = delete;
-    int get() const { return fd_; }
+    fd_ = fd;
+}
 
-private:
-    int fd_;
-};
-
-}  // namespace
-
-bool ReadFileBounded(const std::string& path, size_t limit, std::string& out, int& err)
+bool ReadFileBounded(const std::string& path, size_t limit, std::string& out, int& err, unsigned flags,
+                     struct stat* st)
 {
     // O_NONBLOCK: opening a FIFO must not wait for a writer; the S_ISREG
     // check below then refuses it.
-    Fd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
-    if (fd.get() < 0) {
+    int openFlags = O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK;
+    if ((flags & kReadNoFollow) != 0) {
+        openFlags |= O_NOFOLLOW;
+    }
+    ScopedFd fd(open(path.c_str(), openFlags));
+    if (fd.Get() < 0) {
         err = errno;
         return false;
     }
-    struct stat st;
-    if (fstat(fd.get(), &st) != 0) {
+    struct stat own;
+    struct stat& info = st != nullptr ? *st : own;
+    if (fstat(fd.Get(), &info) != 0) {
         err = errno;
         return false;
     }
-    if (!S_ISREG(st.st_mode)) {
+    if (!S_ISREG(info.st_mode)) {
         err = EINVAL;
         return false;
     }
-    if (st.st_size < 0 || static_cast<unsigned long long>(st.st_size) > limit) {
+    if (info.st_size < 0 || static_cast<unsigned long long>(info.st_size) > limit) {
         err = EFBIG;
         return false;
     }
     std::string data;
     try {
-        data.resize(static_cast<size_t>(st.st_size) + 1);
+        data.resize(static_cast<size_t>(info.st_size) + 1);
         size_t used = 0;
         for (;;) {
             if (used == data.size()) {
@@ -64,7 +60,7 @@ bool ReadFileBounded(const std::string& path, size_t limit, std::string& out, in
                 }
                 data.resize(data.size() + 4096 > limit + 1 ? limit + 1 : data.size() + 4096);
             }
-            ssize_t got = read(fd.get(), &data[used], data.size() - used);
+            ssize_t got = read(fd.Get(), &data[used], data.size() - used);
             if (got < 0) {
                 if (errno == EINTR) {
                     continue;
@@ -104,6 +100,127 @@ bool WriteAll(int fd, const char* data, size_t len)
         len -= static_cast<size_t>(done);
     }
     return true;
+}
+
+bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid, const char*& step)
+{
+    if (fchmod(fd, mode & 07777) != 0) {
+        step = "chmod";
+    } else if ((uid != static_cast<uid_t>(-1) || gid != static_cast<gid_t>(-1)) && fchown(fd, uid, gid) != 0) {
+        step = "chown";
+    } else if (!WriteAll(fd, data, len)) {
+        step = "write";
+    } else if (fsync(fd) != 0) {
+        step = "fsync";
+    } else {
+        return true;
+    }
+    return false;
+}
+
+bool WriteFileAtomic(const std::string& path, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid,
+                     const char*& step)
+{
+    std::string dir;
+    std::string tmpl;
+    try {
+        dir = DirName(path);
+        // Cut the name so the temporary one stays within NAME_MAX.
+        tmpl = dir + "/." + BaseName(path).substr(0, 200) + ".XXXXXX";
+    } catch (const std::exception&) {
+        step = "mkstemp";
+        errno = ENOMEM;
+        return false;
+    }
+    ScopedFd fd(mkostemp(&tmpl[0], O_CLOEXEC));
+    if (fd.Get() < 0) {
+        step = "mkstemp";
+        return false;
+    }
+    bool ok = FillTempFile(fd.Get(), data, len, mode, uid, gid, step);
+    // close() can report a deferred write error (NFS): it counts.
+    if (ok && close(fd.Release()) != 0) {
+        step = "close";
+        ok = false;
+    }
+    if (ok && rename(tmpl.c_str(), path.c_str()) != 0) {
+        step = "rename";
+        ok = false;
+    }
+    if (!ok) {
+        const int saved = errno;
+        fd.Reset();
+        unlink(tmpl.c_str());
+        errno = saved;
+        return false;
+    }
+    SyncDir(dir);
+    return true;
+}
+
+void SyncDir(const std::string& dir)
+{
+    ScopedFd fd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (fd.Get() < 0) {
+        VELA_LOG_ERR("open(%s) for fsync: %m", dir.c_str());
+        return;
+    }
+    if (fsync(fd.Get()) != 0) {
+        VELA_LOG_ERR("fsync(%s): %m", dir.c_str());
+    }
+}
+
+bool MakeDirs(const std::string& path, mode_t mode)
+{
+    try {
+        for (size_t pos = 1; pos <= path.size(); ++pos) {
+            if (pos != path.size() && path[pos] != '/') {
+                continue;
+            }
+            const std::string prefix = path.substr(0, pos);
+            struct stat st;
+            if (stat(prefix.c_str(), &st) != 0) {
+                if (errno != ENOENT) {
+                    VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
+                    return false;
+                }
+                if (mkdir(prefix.c_str(), mode) != 0 && errno != EEXIST) {
+                    VELA_LOG_ERR("mkdir(%s): %m", prefix.c_str());
+                    return false;
+                }
+                if (stat(prefix.c_str(), &st) != 0) {  // EEXIST: made by someone else meanwhile
+                    VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
+                    return false;
+                }
+            }
+            if (!S_ISDIR(st.st_mode)) {
+                VELA_LOG_ERR("%s exists and is not a directory", prefix.c_str());
+                return false;
+            }
+        }
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("out of memory creating %s", path.c_str());
+        return false;
+    }
+    return true;
+}
+
+std::string DirName(const std::string& path)
+{
+    const size_t slash = path.rfind('/');
+    if (slash == std::string::npos) {
+        return ".";
+    }
+    if (slash == 0) {
+        return "/";
+    }
+    return path.substr(0, slash);
+}
+
+std::string BaseName(const std::string& path)
+{
+    const size_t slash = path.rfind('/');
+    return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
 }  // namespace Platform

@@ -4,21 +4,19 @@
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
-#include <grp.h>
-#include <pwd.h>
 #include <string>
 #include <sys/stat.h>
 #include <sys/types.h>
 #include <unistd.h>
-#include <vector>
 
+#include "FileUtil.h"
+#include "SysInternal.h"
 #include "vela/log.h"
 #include "vela/vlibc.h"
 
 namespace {
 
 constexpr size_t kMaxName = 255;  // NAME_MAX: one path component
-constexpr size_t kMaxNssBuffer = 1024 * 1024;
 const char kPreferenceBase[] = "/var/lib/vela/preference/";
 
 enum class Kind { User, Group };
@@ -46,89 +44,27 @@ bool ValidName(const char* name)
     return true;
 }
 
-// mkdir -p of `path` (absolute) with `mode` for the directories it creates.
-// Existing components may be symbolic links to directories (a data volume
-// mounted elsewhere); anything that is not a directory fails.
-bool MakeParents(const std::string& path, mode_t mode)
-{
-    for (size_t pos = 1; pos <= path.size(); ++pos) {
-        if (pos != path.size() && path[pos] != '/') {
-            continue;
-        }
-        const std::string prefix = path.substr(0, pos);
-        struct stat st;
-        if (stat(prefix.c_str(), &st) != 0) {
-            if (errno != ENOENT) {
-                VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
-                return false;
-            }
-            if (mkdir(prefix.c_str(), mode) != 0 && errno != EEXIST) {
-                VELA_LOG_ERR("mkdir(%s): %m", prefix.c_str());
-                return false;
-            }
-            if (stat(prefix.c_str(), &st) != 0) {  // EEXIST: made by someone else meanwhile
-                VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
-                return false;
-            }
-        }
-        if (!S_ISDIR(st.st_mode)) {
-            VELA_LOG_ERR("%s exists and is not a directory", prefix.c_str());
-            return false;
-        }
-    }
-    return true;
-}
-
 // Owner for the directory from NSS. 1 when found, 0 when the name is not
 // known, -1 on a lookup error.
 int LookupOwner(Kind kind, const char* name, uid_t& uid, gid_t& gid)
 {
-    long hint = sysconf(kind == Kind::User ? _SC_GETPW_R_SIZE_MAX : _SC_GETGR_R_SIZE_MAX);
-    size_t len = hint > 0 ? static_cast<size_t>(hint) : 16384;
-    for (;;) {
-        std::vector<char> buffer;
-        try {
-            buffer.resize(len);
-        } catch (const std::exception&) {
-            return -1;
-        }
-        int rc;
-        bool found;
+    int found = -1;
+    try {
         if (kind == Kind::User) {
-            struct passwd pw;
-            struct passwd* result = nullptr;
-            rc = getpwnam_r(name, &pw, buffer.data(), buffer.size(), &result);
-            found = rc == 0 && result != nullptr;
-            if (found) {
-                uid = pw.pw_uid;
-                gid = pw.pw_gid;
-            }
+            found = VELA::Platform::FindUserByName(name, uid, gid, nullptr);
         } else {
-            struct group gr;
-            struct group* result = nullptr;
-            rc = getgrnam_r(name, &gr, buffer.data(), buffer.size(), &result);
-            found = rc == 0 && result != nullptr;
-            if (found) {
+            found = VELA::Platform::FindGroupByName(name, gid);
+            if (found == 1) {
                 uid = static_cast<uid_t>(-1);  // the owner stays root
-                gid = gr.gr_gid;
             }
         }
-        if (rc == ERANGE && len < kMaxNssBuffer) {
-            len *= 2;
-            continue;
-        }
-        if (found) {
-            return 1;
-        }
-        // getpwnam_r reports "no such name" as 0 with a null result, but
-        // some NSS modules return ENOENT or ESRCH for it instead.
-        if (rc == 0 || rc == ENOENT || rc == ESRCH) {
-            return 0;
-        }
-        errno = rc;
-        VELA_LOG_ERR("looking up %s \"%s\": %m", kind == Kind::User ? "user" : "group", name);
+    } catch (const std::exception&) {
         return -1;
     }
+    if (found < 0) {
+        VELA_LOG_ERR("looking up %s \"%s\": %m", kind == Kind::User ? "user" : "group", name);
+    }
+    return found;
 }
 
 int PreferenceDirGet(Kind kind, const char* name, char* buf, size_t size)
@@ -148,7 +84,7 @@ int PreferenceDirGet(Kind kind, const char* name, char* buf, size_t size)
         VELA_LOG_ERR("buffer of %zu bytes too small for %s", size, path.c_str());
         return -1;
     }
-    if (!MakeParents(parent, 0755)) {
+    if (!VELA::Platform::MakeDirs(parent, 0755)) {
         return -1;
     }
     int parentFd = open(parent.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);

@@ -42,29 +42,6 @@ std::string g_cacheDir;
 EVP_PKEY* g_cacheKey = nullptr;
 const CryptoApi* g_cacheApi = nullptr;
 
-class Fd {
-public:
-    explicit Fd(int fd) : fd_(fd) {}
-    ~Fd()
-    {
-        if (fd_ >= 0) {
-            close(fd_);
-        }
-    }
-    Fd(const Fd&) = delete;
-    Fd& operator=(const Fd&) = delete;
-    int get() const { return fd_; }
-    int release()
-    {
-        const int fd = fd_;
-        fd_ = -1;
-        return fd;
-    }
-
-private:
-    int fd_;
-};
-
 // A passphrase is never asked for: without this callback OpenSSL would
 // prompt on the terminal for an encrypted key.
 int NoPassphrase(char*, int, int, void*)
@@ -79,38 +56,6 @@ long ElapsedMs(const struct timespec& start)
     return (now.tv_sec - start.tv_sec) * 1000L + (now.tv_nsec - start.tv_nsec) / 1000000L;
 }
 
-// mkdir -p of `path` (absolute), mode 0755 for what it creates. Existing
-// components may be symbolic links to directories.
-bool MakeParents(const std::string& path)
-{
-    for (size_t pos = 1; pos <= path.size(); ++pos) {
-        if (pos != path.size() && path[pos] != '/') {
-            continue;
-        }
-        const std::string prefix = path.substr(0, pos);
-        struct stat st;
-        if (stat(prefix.c_str(), &st) != 0) {
-            if (errno != ENOENT) {
-                VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
-                return false;
-            }
-            if (mkdir(prefix.c_str(), 0755) != 0 && errno != EEXIST) {
-                VELA_LOG_ERR("mkdir(%s): %m", prefix.c_str());
-                return false;
-            }
-            if (stat(prefix.c_str(), &st) != 0) {
-                VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
-                return false;
-            }
-        }
-        if (!S_ISDIR(st.st_mode)) {
-            VELA_LOG_ERR("%s exists and is not a directory", prefix.c_str());
-            return false;
-        }
-    }
-    return true;
-}
-
 // Opens the key directory; with `create`, creates it (and its parents)
 // when missing. It must be a real directory owned by the process's user;
 // group and other permissions found on it are removed. -1 with errno ENOENT
@@ -118,7 +63,7 @@ bool MakeParents(const std::string& path)
 int OpenKeyDir(const std::string& dir, bool create)
 {
     if (create) {
-        if (!MakeParents(VELA::VelaPath(kStateParent))) {
+        if (!MakeDirs(VELA::VelaPath(kStateParent), 0755)) {
             return -1;
         }
         if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
@@ -126,8 +71,8 @@ int OpenKeyDir(const std::string& dir, bool create)
             return -1;
         }
     }
-    Fd fd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-    if (fd.get() < 0) {
+    ScopedFd fd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (fd.Get() < 0) {
         if (errno == ENOENT && !create) {
             return -1;
         }
@@ -135,7 +80,7 @@ int OpenKeyDir(const std::string& dir, bool create)
         return -1;
     }
     struct stat st;
-    if (fstat(fd.get(), &st) != 0) {
+    if (fstat(fd.Get(), &st) != 0) {
         VELA_LOG_ERR("stat(%s): %m", dir.c_str());
         return -1;
     }
@@ -144,11 +89,11 @@ int OpenKeyDir(const std::string& dir, bool create)
                      static_cast<unsigned>(st.st_uid));
         return -1;
     }
-    if ((st.st_mode & 07777) != 0700 && fchmod(fd.get(), 0700) != 0) {
+    if ((st.st_mode & 07777) != 0700 && fchmod(fd.Get(), 0700) != 0) {
         VELA_LOG_ERR("chmod(%s): %m", dir.c_str());
         return -1;
     }
-    return fd.release();
+    return fd.Release();
 }
 
 enum class KeyFile { Loaded, Missing, Unusable };
@@ -157,8 +102,8 @@ KeyFile ReadPrivateKey(const CryptoApi& api, int dirFd, const std::string& dir, 
 {
     out = nullptr;
     const std::string path = dir + "/" + kPrivateName;
-    Fd fd(openat(dirFd, kPrivateName, O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
-    if (fd.get() < 0) {
+    ScopedFd fd(openat(dirFd, kPrivateName, O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    if (fd.Get() < 0) {
         if (errno == ENOENT) {
             return KeyFile::Missing;
         }
@@ -166,7 +111,7 @@ KeyFile ReadPrivateKey(const CryptoApi& api, int dirFd, const std::string& dir, 
         return KeyFile::Unusable;
     }
     struct stat st;
-    if (fstat(fd.get(), &st) != 0) {
+    if (fstat(fd.Get(), &st) != 0) {
         VELA_LOG_ERR("stat(%s): %m", path.c_str());
         return KeyFile::Unusable;
     }
@@ -182,7 +127,7 @@ KeyFile ReadPrivateKey(const CryptoApi& api, int dirFd, const std::string& dir, 
     SecretBytes pem(static_cast<size_t>(st.st_size));
     size_t used = 0;
     while (used < pem.size()) {
-        ssize_t got = read(fd.get(), pem.data() + used, pem.size() - used);
+        ssize_t got = read(fd.Get(), pem.data() + used, pem.size() - used);
         if (got < 0 && errno == EINTR) {
             continue;
         }
@@ -241,18 +186,13 @@ bool PublishFile(int dirFd, const std::string& dir, const char* temp, const char
         VELA_LOG_ERR("unlink(%s/%s): %m", dir.c_str(), temp);
         return false;
     }
-    Fd fd(openat(dirFd, temp, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
-    if (fd.get() < 0) {
+    ScopedFd fd(openat(dirFd, temp, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
+    if (fd.Get() < 0) {
         VELA_LOG_ERR("open(%s/%s): %m", dir.c_str(), temp);
         return false;
     }
-    bool ok = fchmod(fd.get(), mode) == 0;  // whatever the umask was
-    if (ok && !WriteAll(fd.get(), data, len)) {
-        ok = false;
-    }
-    if (ok && fsync(fd.get()) != 0) {
-        ok = false;
-    }
+    const char* step = nullptr;
+    bool ok = FillTempFile(fd.Get(), data, len, mode, static_cast<uid_t>(-1), static_cast<gid_t>(-1), step);
     if (ok && renameat(dirFd, temp, dirFd, name) != 0) {
         ok = false;
     }
@@ -292,32 +232,32 @@ bool LockBounded(int fd, const std::string& what)
 int TakeLock(int dirFd, const std::string& dir)
 {
     const std::string lockPath = dir + "/" + kLockName;
-    Fd lock(openat(dirFd, kLockName, O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
-    if (lock.get() < 0) {
+    ScopedFd lock(openat(dirFd, kLockName, O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
+    if (lock.Get() < 0) {
         VELA_LOG_ERR("open(%s): %m", lockPath.c_str());
         return -1;
     }
     struct stat st;
-    if (fstat(lock.get(), &st) != 0 || !S_ISREG(st.st_mode)) {
+    if (fstat(lock.Get(), &st) != 0 || !S_ISREG(st.st_mode)) {
         VELA_LOG_ERR("%s is not a regular file", lockPath.c_str());
         return -1;
     }
-    if ((st.st_mode & 07777) != 0600 && fchmod(lock.get(), 0600) != 0) {  // whatever the umask was
+    if ((st.st_mode & 07777) != 0600 && fchmod(lock.Get(), 0600) != 0) {  // whatever the umask was
         VELA_LOG_ERR("chmod(%s): %m", lockPath.c_str());
         return -1;
     }
-    if (!LockBounded(lock.get(), lockPath)) {
+    if (!LockBounded(lock.Get(), lockPath)) {
         return -1;
     }
-    return lock.release();
+    return lock.Release();
 }
 
 // Creates the pair, or loads the one that another process created while
 // this one waited for the lock.
 EVP_PKEY* CreateUnderLock(const CryptoApi& api, int dirFd, const std::string& dir)
 {
-    Fd lock(TakeLock(dirFd, dir));
-    if (lock.get() < 0) {
+    ScopedFd lock(TakeLock(dirFd, dir));
+    if (lock.Get() < 0) {
         return nullptr;
     }
     EVP_PKEY* loaded = nullptr;
@@ -372,9 +312,9 @@ EVP_PKEY* LoadOrCreate(const CryptoApi& api, const std::string& dir, bool create
         }
         return nullptr;
     }
-    Fd dirFd(rawFd);
+    ScopedFd dirFd(rawFd);
     EVP_PKEY* key = nullptr;
-    switch (ReadPrivateKey(api, dirFd.get(), dir, key)) {
+    switch (ReadPrivateKey(api, dirFd.Get(), dir, key)) {
     case KeyFile::Loaded:
         return key;
     case KeyFile::Unusable:
@@ -386,7 +326,7 @@ EVP_PKEY* LoadOrCreate(const CryptoApi& api, const std::string& dir, bool create
         VELA_LOG_ERR("no key pair for encrypted parameters in %s yet", dir.c_str());
         return nullptr;
     }
-    return CreateUnderLock(api, dirFd.get(), dir);
+    return CreateUnderLock(api, dirFd.Get(), dir);
 }
 
 }  // namespace
@@ -425,12 +365,12 @@ void RefreshPublicKeyFile(const std::string& pem)
     if (rawFd < 0) {
         return;
     }
-    Fd dirFd(rawFd);
-    Fd lock(TakeLock(dirFd.get(), dir));
-    if (lock.get() < 0) {
+    ScopedFd dirFd(rawFd);
+    ScopedFd lock(TakeLock(dirFd.Get(), dir));
+    if (lock.Get() < 0) {
         return;
     }
-    if (PublishFile(dirFd.get(), dir, kPublicTemp, kPublicName, pem.data(), pem.size(), 0644)) {
+    if (PublishFile(dirFd.Get(), dir, kPublicTemp, kPublicName, pem.data(), pem.size(), 0644)) {
         VELA_LOG(LOG_NOTICE, "rewrote %s/%s from the private key", dir.c_str(), kPublicName);
     }
 }

@@ -6,7 +6,6 @@
 #include <climits>
 #include <cstdlib>
 #include <cstring>
-#include <dirent.h>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -34,7 +33,6 @@ constexpr size_t kMaxTokenHeader = 256;      // a longer X-Vela-Token is not our
 constexpr size_t kMaxQueryString = 64 * 1024;
 constexpr size_t kMaxAcceptLanguage = 4096;
 constexpr int kMaxAcceptEntries = 64;
-constexpr size_t kMaxDirEntries = 100000;    // bound of one directory scan
 constexpr long long kMaxTime = 1LL << 40;    // far beyond any real clock
 constexpr long long kPurgeGrace = 3600;      // expired sessions kept this long
 const int kAuthLog = LOG_AUTHPRIV | LOG_NOTICE;
@@ -693,33 +691,6 @@ int CreateSession(const char* user, const char* clientIP, const VelaSessionOptio
     return 0;
 }
 
-// The names in the session directory that are session ids. False when the
-// directory cannot be read (a missing directory is an empty list).
-bool SessionIds(std::vector<std::string>& ids)
-{
-    const std::string dir = SessionDir();
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        if (errno == ENOENT) {
-            return true;
-        }
-        VELA_LOG_ERR("opendir(%s): %m", dir.c_str());
-        return false;
-    }
-    size_t seen = 0;
-    while (struct dirent* ent = readdir(d)) {
-        if (++seen > kMaxDirEntries) {
-            VELA_LOG_ERR("%s holds more than %zu entries, the rest are ignored", dir.c_str(), kMaxDirEntries);
-            break;
-        }
-        if (VELA::Platform::IsId(ent->d_name, VELA_SESSION_ID_LEN)) {
-            ids.emplace_back(ent->d_name);
-        }
-    }
-    closedir(d);
-    return true;
-}
-
 }  // namespace
 
 int VelaSessionCreate(const char* user, const char* clientIP, const VelaSessionOptions* options,
@@ -772,7 +743,7 @@ int VelaSessionList(std::vector<VelaSessionRecord>& out)
     out.clear();
     try {
         std::vector<std::string> ids;
-        if (!SessionIds(ids)) {
+        if (!VELA::Platform::ListIds(SessionDir(), VELA_SESSION_ID_LEN, ids)) {
             return -1;
         }
         const long long now = VELA::Platform::Now();
@@ -814,7 +785,7 @@ int VelaSessionPurge(long long graceSeconds)
     }
     try {
         std::vector<std::string> ids;
-        if (!SessionIds(ids)) {
+        if (!VELA::Platform::ListIds(SessionDir(), VELA_SESSION_ID_LEN, ids)) {
             return -1;
         }
         const std::string dir = SessionDir();

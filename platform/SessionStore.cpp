@@ -6,9 +6,9 @@
 #include <atomic>
 #include <cerrno>
 #include <cstring>
+#include <dirent.h>
 #include <fcntl.h>
 #include <netinet/in.h>
-#include <pwd.h>
 #include <sys/file.h>
 #include <sys/random.h>
 #include <sys/socket.h>
@@ -17,6 +17,8 @@
 #include <unistd.h>
 #include <vector>
 
+#include "FileUtil.h"
+#include "SysInternal.h"
 #include "vela/log.h"
 #include "vela/session.h"
 #include "vela/webapiutil.h"
@@ -26,8 +28,8 @@ namespace {
 std::atomic<long long (*)(void)> g_clock{nullptr};
 
 constexpr size_t kMaxUserName = 492;
-constexpr size_t kMaxNssBuffer = 1024 * 1024;
 constexpr int kLockWaitMs = 3000;
+constexpr size_t kMaxDirEntries = 100000;  // bound of one directory scan
 
 const char kBase64Url[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-_";
 
@@ -36,23 +38,6 @@ bool IsBase64UrlChar(unsigned char c)
     return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' ||
            c == '_';
 }
-
-class Fd {
-public:
-    explicit Fd(int fd) : fd_(fd) {}
-    ~Fd()
-    {
-        if (fd_ >= 0) {
-            close(fd_);
-        }
-    }
-    Fd(const Fd&) = delete;
-    Fd& operator=(const Fd&) = delete;
-    int get() const { return fd_; }
-
-private:
-    int fd_;
-};
 
 long long MonotonicMs()
 {
@@ -132,6 +117,35 @@ bool IsId(const char* text, size_t len)
     return true;
 }
 
+bool ListIds(const std::string& dir, size_t len, std::vector<std::string>& ids)
+{
+    DIR* d = opendir(dir.c_str());
+    if (d == nullptr) {
+        if (errno == ENOENT) {
+            return true;
+        }
+        VELA_LOG_ERR("opendir(%s): %m", dir.c_str());
+        return false;
+    }
+    try {
+        size_t seen = 0;
+        while (struct dirent* ent = readdir(d)) {
+            if (++seen > kMaxDirEntries) {
+                VELA_LOG_ERR("%s holds more than %zu entries, the rest are ignored", dir.c_str(), kMaxDirEntries);
+                break;
+            }
+            if (IsId(ent->d_name, len)) {
+                ids.emplace_back(ent->d_name);
+            }
+        }
+    } catch (...) {
+        closedir(d);
+        throw;
+    }
+    closedir(d);
+    return true;
+}
+
 bool ConstantTimeEquals(const std::string& a, const std::string& b)
 {
     if (a.size() != b.size()) {
@@ -164,34 +178,17 @@ bool IsUserName(const char* name)
 
 int LookupUser(const char* name, uid_t& uid)
 {
-    const long hint = sysconf(_SC_GETPW_R_SIZE_MAX);
-    size_t len = hint > 0 ? static_cast<size_t>(hint) : 16384;
-    for (;;) {
-        std::vector<char> buffer;
-        try {
-            buffer.resize(len);
-        } catch (const std::exception&) {
-            return -1;
-        }
-        struct passwd pw;
-        struct passwd* result = nullptr;
-        const int rc = getpwnam_r(name, &pw, buffer.data(), buffer.size(), &result);
-        if (rc == ERANGE && len < kMaxNssBuffer) {
-            len *= 2;
-            continue;
-        }
-        if (rc == 0 && result != nullptr) {
-            uid = pw.pw_uid;
-            return 1;
-        }
-        // getpwnam_r reports an unknown name as 0 and a null result; some NSS
-        // modules use ENOENT or ESRCH for it instead.
-        if (rc == 0 || rc == ENOENT || rc == ESRCH) {
-            return 0;
-        }
-        VELA_LOG_ERR("getpwnam_r(%.64s): %s", name, strerror(rc));
+    gid_t gid = 0;
+    int found = -1;
+    try {
+        found = FindUserByName(name, uid, gid, nullptr);
+    } catch (const std::exception&) {
         return -1;
     }
+    if (found < 0) {
+        VELA_LOG_ERR("getpwnam_r(%.64s): %m", name);
+    }
+    return found;
 }
 
 bool CanonicalAddress(const std::string& text, std::string& out)
@@ -230,24 +227,12 @@ bool EnsureStateDir(const std::string& path)
     if (path.empty() || path[0] != '/') {
         return false;
     }
-    for (size_t pos = 1; pos <= path.size(); ++pos) {
-        if (pos != path.size() && path[pos] != '/') {
-            continue;
-        }
-        const std::string prefix = path.substr(0, pos);
-        const bool leaf = pos == path.size();
-        struct stat st;
-        if (stat(prefix.c_str(), &st) == 0) {
-            continue;
-        }
-        if (errno != ENOENT) {
-            VELA_LOG_ERR("stat(%s): %m", prefix.c_str());
-            return false;
-        }
-        if (mkdir(prefix.c_str(), leaf ? 0700 : 0755) != 0 && errno != EEXIST) {
-            VELA_LOG_ERR("mkdir(%s): %m", prefix.c_str());
-            return false;
-        }
+    if (!MakeDirs(DirName(path), 0755)) {
+        return false;
+    }
+    if (mkdir(path.c_str(), 0700) != 0 && errno != EEXIST) {
+        VELA_LOG_ERR("mkdir(%s): %m", path.c_str());
+        return false;
     }
     struct stat st;
     if (lstat(path.c_str(), &st) != 0) {
@@ -275,58 +260,32 @@ bool EnsureStateDir(const std::string& path)
 
 ReadResult ReadStateFile(const std::string& path, size_t limit, Json::Value& out)
 {
-    Fd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK | O_NOFOLLOW));
-    if (fd.get() < 0) {
-        if (errno == ENOENT) {
+    std::string text;
+    struct stat st;
+    int err = 0;
+    if (!ReadFileBounded(path, limit, text, err, kReadNoFollow, &st)) {
+        switch (err) {
+        case ENOENT:
             return ReadResult::Missing;
-        }
-        if (errno == ELOOP) {
+        case ELOOP:
             VELA_LOG_ERR("%s is a symbolic link, refused", path.c_str());
             return ReadResult::Corrupt;
+        case EINVAL:
+            VELA_LOG_ERR("%s is not a regular file, refused", path.c_str());
+            return ReadResult::Corrupt;
+        case EFBIG:
+            VELA_LOG_ERR("%s is larger than %zu bytes, refused", path.c_str(), limit);
+            return ReadResult::Corrupt;
+        default:
+            VELA_LOG_ERR("cannot read %s: %s", path.c_str(), strerror(err));
+            return ReadResult::Error;
         }
-        VELA_LOG_ERR("open(%s): %m", path.c_str());
-        return ReadResult::Error;
     }
-    struct stat st;
-    if (fstat(fd.get(), &st) != 0) {
-        VELA_LOG_ERR("fstat(%s): %m", path.c_str());
-        return ReadResult::Error;
-    }
-    if (!S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
+    if (st.st_uid != geteuid()) {
         VELA_LOG_ERR("%s is not a regular file owned by uid %u, refused", path.c_str(),
                      static_cast<unsigned>(geteuid()));
         return ReadResult::Corrupt;
     }
-    if (st.st_size < 0 || static_cast<unsigned long long>(st.st_size) > limit) {
-        VELA_LOG_ERR("%s is larger than %zu bytes, refused", path.c_str(), limit);
-        return ReadResult::Corrupt;
-    }
-    std::string text;
-    try {
-        text.resize(limit + 1);
-    } catch (const std::exception&) {
-        return ReadResult::Error;
-    }
-    size_t used = 0;
-    while (used < text.size()) {
-        const ssize_t got = read(fd.get(), &text[used], text.size() - used);
-        if (got < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            VELA_LOG_ERR("read(%s): %m", path.c_str());
-            return ReadResult::Error;
-        }
-        if (got == 0) {
-            break;
-        }
-        used += static_cast<size_t>(got);
-    }
-    if (used > limit) {
-        VELA_LOG_ERR("%s grew beyond %zu bytes, refused", path.c_str(), limit);
-        return ReadResult::Corrupt;
-    }
-    text.resize(used);
     Json::Value doc;
     if (!VELA::WebAPIUtil::ParseJson(text, doc) || !doc.isObject()) {
         VELA_LOG_ERR("%s is not a valid state file", path.c_str());

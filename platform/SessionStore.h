@@ -9,6 +9,7 @@
 #include <json/json.h>
 #include <string>
 #include <sys/types.h>
+#include <vector>
 
 namespace VELA {
 namespace Platform {
@@ -29,6 +30,12 @@ constexpr size_t IdLength(size_t bytes) { return (bytes * 4 + 2) / 3; }
 // NUL (the text then ends early) and overlong texts give false without
 // reading more than `len + 1` bytes.
 bool IsId(const char* text, size_t len);
+
+// Appends to `ids` the names in the directory `dir` that are identifiers of
+// `len` characters (IsId). At most 100000 entries are looked at; the rest
+// are ignored (logged). True for a missing directory (nothing added), false
+// (logged) when it cannot be read. Can throw std::bad_alloc.
+bool ListIds(const std::string& dir, size_t len, std::vector<std::string>& ids);
 
 // Compares two byte strings in time that depends only on their lengths.
 bool ConstantTimeEquals(const std::string& a, const std::string& b);

@@ -97,110 +97,22 @@ bool ParseLine(const std::string& raw, KeyValueLine& out)
     return true;
 }
 
-// Reads the regular file `path` (never through a symbolic link) into `out`,
-// at most `limit` bytes; `st` receives its status. False with `err` set.
-bool ReadRegularNoFollow(const std::string& path, size_t limit, std::string& out, struct stat& st, int& err)
-{
-    ScopedFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK | O_NOFOLLOW));
-    if (fd.Get() < 0) {
-        err = errno == ELOOP ? EINVAL : errno;
-        return false;
-    }
-    if (fstat(fd.Get(), &st) != 0) {
-        err = errno;
-        return false;
-    }
-    if (!S_ISREG(st.st_mode)) {
-        err = EINVAL;
-        return false;
-    }
-    if (st.st_size < 0 || static_cast<unsigned long long>(st.st_size) > limit) {
-        err = EFBIG;
-        return false;
-    }
-    std::string data;
-    char chunk[16384];
-    for (;;) {
-        const ssize_t got = read(fd.Get(), chunk, sizeof(chunk));
-        if (got < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            err = errno;
-            return false;
-        }
-        if (got == 0) {
-            break;
-        }
-        if (data.size() + static_cast<size_t>(got) > limit) {
-            err = EFBIG;  // grew after fstat
-            return false;
-        }
-        data.append(chunk, static_cast<size_t>(got));
-    }
-    out.swap(data);
-    return true;
-}
-
-std::string DirName(const std::string& path)
-{
-    const size_t slash = path.rfind('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    if (slash == 0) {
-        return "/";
-    }
-    return path.substr(0, slash);
-}
-
-std::string BaseName(const std::string& path)
-{
-    const size_t slash = path.rfind('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
-}
-
 // Writes `text` to `path` through a temporary file in the same directory.
 // `mode`, and `uid`/`gid` unless they are -1, are given to the new file.
 bool ReplaceFileAtomic(const std::string& path, const std::string& text, mode_t mode, uid_t uid, gid_t gid)
 {
-    const std::string dir = DirName(path);
-    std::string tmpl = dir + "/." + BaseName(path).substr(0, 200) + ".XXXXXX";
-    ScopedFd fd(mkostemp(&tmpl[0], O_CLOEXEC));
-    if (fd.Get() < 0) {
-        VELA_RECORD_ERROR(VLIBC_ERR_IO, "mkstemp in %.200s: %m", dir.c_str());
-        VELA_LOG_ERR("cannot create a temporary file in %s: %m", dir.c_str());
-        return false;
-    }
     const char* step = nullptr;
-    if (!WriteAll(fd.Get(), text.data(), text.size())) {
-        step = "write";
-    } else if (fchmod(fd.Get(), mode) != 0) {
-        step = "chmod";
-    } else if ((uid != static_cast<uid_t>(-1) || gid != static_cast<gid_t>(-1)) && fchown(fd.Get(), uid, gid) != 0) {
-        step = "chown";
-    } else if (fsync(fd.Get()) != 0) {
-        step = "fsync";
-    } else if (close(fd.Release()) != 0) {
-        step = "close";
-    } else if (rename(tmpl.c_str(), path.c_str()) != 0) {
-        step = "rename";
+    if (WriteFileAtomic(path, text.data(), text.size(), mode, uid, gid, step)) {
+        return true;
     }
-    if (step != nullptr) {
-        const int saved = errno;
-        unlink(tmpl.c_str());
-        errno = saved;
+    if (strcmp(step, "mkstemp") == 0) {
+        VELA_RECORD_ERROR(VLIBC_ERR_IO, "mkstemp in %.200s: %m", DirName(path).c_str());
+        VELA_LOG_ERR("cannot create a temporary file for %s: %m", path.c_str());
+    } else {
         VELA_RECORD_ERROR(VLIBC_ERR_IO, "%s %.200s: %m", step, path.c_str());
         VELA_LOG_ERR("cannot write %s (%s): %m", path.c_str(), step);
-        return false;
     }
-    // The rename is durable once the directory is synced; a failure here
-    // does not undo it, so it is only logged.
-    ScopedFd dirFd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (dirFd.Get() < 0 || fsync(dirFd.Get()) != 0) {
-        VELA_LOG_ERR("fsync of %s: %m", dir.c_str());
-    }
-    return true;
+    return false;
 }
 
 int SetKeyValue(const char* rawPath, const char* key, const char* value)
@@ -221,14 +133,14 @@ int SetKeyValue(const char* rawPath, const char* key, const char* value)
     std::string text;
     struct stat st;
     int err = 0;
-    if (ReadRegularNoFollow(path, kMaxKeyValueFile, text, st, err)) {
+    if (ReadFileBounded(path, kMaxKeyValueFile, text, err, kReadNoFollow, &st)) {
         mode = st.st_mode & 07777;
         if (geteuid() == 0) {
             uid = st.st_uid;
             gid = st.st_gid;
         }
     } else if (err != ENOENT) {
-        errno = err;
+        errno = err == ELOOP ? EINVAL : err;
         VELA_RECORD_ERROR(VLIBC_ERR_IO, "read %.200s: %m", path.c_str());
         VELA_LOG_ERR("cannot read %s: %m", path.c_str());
         return -1;
@@ -458,14 +370,6 @@ int LockTime(const char* rawPath, int exclusive, int timeoutSec, int* handle)
 }
 
 }  // namespace
-
-void ScopedFd::Reset(int fd)
-{
-    if (fd_ >= 0) {
-        close(fd_);
-    }
-    fd_ = fd;
-}
 
 std::string ResolvePath(const char* path)
 {

@@ -7,29 +7,10 @@
 #include <sys/types.h>
 #include <vector>
 
+#include "FileUtil.h"
+
 namespace VELA {
 namespace Platform {
-
-// A file descriptor closed at the end of the scope.
-class ScopedFd {
-public:
-    explicit ScopedFd(int fd = -1) : fd_(fd) {}
-    ~ScopedFd() { Reset(); }
-    ScopedFd(const ScopedFd&) = delete;
-    ScopedFd& operator=(const ScopedFd&) = delete;
-    int Get() const { return fd_; }
-    // Gives the descriptor up without closing it.
-    int Release()
-    {
-        const int fd = fd_;
-        fd_ = -1;
-        return fd;
-    }
-    void Reset(int fd = -1);
-
-private:
-    int fd_;
-};
 
 // `path` resolved as the public headers describe: an absolute path under
 // the system root unless it already lies inside it; a relative path as it
@@ -71,7 +52,14 @@ int ReadKeyValue(const std::string& path, const std::string& key, std::string& v
 // or "..".
 bool ValidAccountName(const char* name);
 
-// NSS lookups. 1 found, 0 no such name, -1 lookup error.
+// NSS look-ups without logging or recording anything: 1 found, 0 no such
+// name (also the ENOENT, ESRCH, EBADF and EPERM some NSS modules give for
+// it), -1 lookup error with errno set. Can throw std::bad_alloc.
+int FindUserByName(const char* name, uid_t& uid, gid_t& gid, std::string* canonical);
+int FindGroupByName(const char* name, gid_t& gid);
+
+// The same look-ups, plus the uid one, with an error logged and recorded in
+// the last-error record. 1 found, 0 no such name, -1 lookup error.
 int LookupUserByName(const char* name, uid_t& uid, gid_t& gid, std::string* canonical);
 int LookupUserByUID(uid_t uid, std::string& name, gid_t& gid);
 int LookupGroupByName(const char* name, gid_t& gid);

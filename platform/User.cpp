@@ -413,9 +413,9 @@ bool ValidAccountName(const char* name)
     return true;
 }
 
-int LookupUserByName(const char* name, uid_t& uid, gid_t& gid, std::string* canonical)
+int FindUserByName(const char* name, uid_t& uid, gid_t& gid, std::string* canonical)
 {
-    const int found = WithPasswd(
+    return WithPasswd(
         [name](struct passwd* pw, char* buf, size_t len, struct passwd** result) {
             return getpwnam_r(name, pw, buf, len, result);
         },
@@ -426,6 +426,11 @@ int LookupUserByName(const char* name, uid_t& uid, gid_t& gid, std::string* cano
                 *canonical = pw.pw_name;
             }
         });
+}
+
+int LookupUserByName(const char* name, uid_t& uid, gid_t& gid, std::string* canonical)
+{
+    const int found = FindUserByName(name, uid, gid, canonical);
     if (found < 0) {
         VELA_RECORD_ERROR(VLIBC_ERR_IO, "user lookup: %m");
         VELA_LOG_ERR("looking up user \"%.255s\": %m", name);
@@ -450,7 +455,7 @@ int LookupUserByUID(uid_t uid, std::string& name, gid_t& gid)
     return found;
 }
 
-int LookupGroupByName(const char* name, gid_t& gid)
+int FindGroupByName(const char* name, gid_t& gid)
 {
     size_t len = NssBufferHint(_SC_GETGR_R_SIZE_MAX);
     for (;;) {
@@ -465,12 +470,19 @@ int LookupGroupByName(const char* name, gid_t& gid)
         const int found = NssResult(rc, rc == 0 && result != nullptr);
         if (found == 1) {
             gid = gr.gr_gid;
-        } else if (found < 0) {
-            VELA_RECORD_ERROR(VLIBC_ERR_IO, "group lookup: %m");
-            VELA_LOG_ERR("looking up group \"%.255s\": %m", name);
         }
         return found;
     }
+}
+
+int LookupGroupByName(const char* name, gid_t& gid)
+{
+    const int found = FindGroupByName(name, gid);
+    if (found < 0) {
+        VELA_RECORD_ERROR(VLIBC_ERR_IO, "group lookup: %m");
+        VELA_LOG_ERR("looking up group \"%.255s\": %m", name);
+    }
+    return found;
 }
 
 bool GroupListOf(const std::string& user, gid_t base, std::vector<gid_t>& groups)

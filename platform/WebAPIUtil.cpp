@@ -74,38 +74,6 @@ bool IsUnreserved(unsigned char c)
            c == '.' || c == '_' || c == '~';
 }
 
-std::string DirName(const std::string& path)
-{
-    const size_t slash = path.rfind('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    if (slash == 0) {
-        return "/";
-    }
-    return path.substr(0, slash);
-}
-
-std::string BaseName(const std::string& path)
-{
-    const size_t slash = path.rfind('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
-}
-
-// fsync of the directory makes the rename itself durable.
-void SyncDir(const std::string& dir)
-{
-    int fd = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd < 0) {
-        VELA_LOG_ERR("open(%s) for fsync: %m", dir.c_str());
-        return;
-    }
-    if (fsync(fd) != 0) {
-        VELA_LOG_ERR("fsync(%s): %m", dir.c_str());
-    }
-    close(fd);
-}
-
 }  // namespace
 
 bool ParseJson(const std::string& text, Json::Value& out)
@@ -169,52 +137,22 @@ bool WriteJsonFileAtomic(const std::string& path, const Json::Value& value, unsi
         return false;
     }
     std::string text;
-    std::string tmp;
     try {
         Json::StreamWriterBuilder builder;
         builder["indentation"] = "";
         builder["emitUTF8"] = true;
         text = Json::writeString(builder, value);
         text.push_back('\n');
-        // Cut the name so the temporary one stays within NAME_MAX.
-        tmp = DirName(path) + "/." + BaseName(path).substr(0, 200) + ".XXXXXX";
     } catch (...) {
         VELA_LOG_ERR("cannot serialize JSON for %s", path.c_str());
         return false;
     }
-
-    int fd = mkostemp(&tmp[0], O_CLOEXEC);
-    if (fd < 0) {
-        VELA_LOG_ERR("mkostemp(%s): %m", tmp.c_str());
+    const char* step = nullptr;
+    if (!Platform::WriteFileAtomic(path, text.data(), text.size(), static_cast<mode_t>(mode & 07777),
+                                   static_cast<uid_t>(-1), static_cast<gid_t>(-1), step)) {
+        VELA_LOG_ERR("cannot write %s (%s): %m", path.c_str(), step);
         return false;
     }
-    bool ok = true;
-    if (fchmod(fd, static_cast<mode_t>(mode & 07777)) != 0) {
-        VELA_LOG_ERR("fchmod(%s, %o): %m", tmp.c_str(), mode);
-        ok = false;
-    } else if (!Platform::WriteAll(fd, text.data(), text.size())) {
-        VELA_LOG_ERR("write(%s): %m", tmp.c_str());
-        ok = false;
-    } else if (fsync(fd) != 0) {
-        VELA_LOG_ERR("fsync(%s): %m", tmp.c_str());
-        ok = false;
-    }
-    // close() can report a deferred write error (NFS): it counts.
-    if (close(fd) != 0 && ok) {
-        VELA_LOG_ERR("close(%s): %m", tmp.c_str());
-        ok = false;
-    }
-    if (ok && rename(tmp.c_str(), path.c_str()) != 0) {
-        VELA_LOG_ERR("rename(%s, %s): %m", tmp.c_str(), path.c_str());
-        ok = false;
-    }
-    if (!ok) {
-        if (unlink(tmp.c_str()) != 0 && errno != ENOENT) {
-            VELA_LOG_ERR("unlink(%s): %m", tmp.c_str());
-        }
-        return false;
-    }
-    SyncDir(DirName(path));
     return true;
 }
 

@@ -22,20 +22,13 @@
 namespace {
 
 using VELA::Test::LogCapture;
+using VELA::Test::ReadText;
 using VELA::Test::ScopedEnv;
 using VELA::Test::TempDir;
 
 const long long kStart = 1700000000;
 long long g_now = kStart;
 long long FakeNow() { return g_now; }
-
-std::string ReadText(const std::string& path)
-{
-    std::ifstream in(path, std::ios::binary);
-    std::ostringstream text;
-    text << in.rdbuf();
-    return text.str();
-}
 
 std::set<std::string> Names(const std::string& dir)
 {

@@ -25,6 +25,7 @@
 namespace {
 
 using VELA::Test::LogCapture;
+using VELA::Test::ReadText;
 using VELA::Test::ScopedEnv;
 using VELA::Test::TempDir;
 
@@ -61,14 +62,6 @@ void Snapshot(const std::string& dir, std::map<std::string, std::string>& out)
         }
     }
     closedir(d);
-}
-
-std::string ReadText(const std::string& path)
-{
-    std::ifstream in(path, std::ios::binary);
-    std::ostringstream text;
-    text << in.rdbuf();
-    return text.str();
 }
 
 struct Handle {

@@ -49,21 +49,7 @@ mode_t ModeOf(const std::string& path)
     return stat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
 }
 
-std::vector<std::string> List(const std::string& dir)
-{
-    std::vector<std::string> names;
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        return names;
-    }
-    while (struct dirent* e = readdir(d)) {
-        if (std::string(e->d_name) != "." && std::string(e->d_name) != "..") {
-            names.push_back(e->d_name);
-        }
-    }
-    closedir(d);
-    return names;
-}
+using VELA::Test::DirEntries;
 
 // A system root with etc/; a second directory stands for the rest of the
 // machine, which nothing may touch.
@@ -128,7 +114,7 @@ TEST_F(SysFile, InvalidKeysAndValuesAreRefused)
     EXPECT_EQ(-1, VLIBCINFOSetKeyValue(nullptr, "x"));
     EXPECT_EQ(-1, VLIBCINFOSetKeyValue("a", nullptr));
     EXPECT_EQ("a=\"1\"\n", ReadAll(file));
-    EXPECT_EQ(std::vector<std::string>{"velainfo.conf"}, List(In("/etc")));  // no temporary file left
+    EXPECT_EQ(std::vector<std::string>{"velainfo.conf"}, DirEntries(In("/etc")));  // no temporary file left
 }
 
 TEST_F(SysFile, CorruptOrTruncatedFilesAreNotUsedNorRewritten)
@@ -155,7 +141,7 @@ TEST_F(SysFile, CorruptOrTruncatedFilesAreNotUsedNorRewritten)
     WriteFile(file, std::string(1024 * 1024 + 1, '#'));
     EXPECT_EQ(0, VLIBCFileCheckKeyValue("/etc/velainfo.conf", "a", "1", 0));
     EXPECT_EQ(-1, VLIBCINFOSetKeyValue("a", "2"));
-    EXPECT_EQ(std::vector<std::string>{"velainfo.conf"}, List(In("/etc")));
+    EXPECT_EQ(std::vector<std::string>{"velainfo.conf"}, DirEntries(In("/etc")));
 }
 
 // Symbolic links pointing outside the root are never written through.
@@ -179,7 +165,7 @@ TEST_F(SysFile, LinksOutOfTheRootAreNotFollowed)
     EXPECT_EQ(-1, VELAFSMkdirP("/etc/../../escape", 0, 0, (uid_t)-1, (gid_t)-1, 0755));
 
     EXPECT_EQ("a=\"1\"\n", ReadAll(victim));
-    EXPECT_EQ(std::vector<std::string>{"victim"}, List(outside_.Path()));
+    EXPECT_EQ(std::vector<std::string>{"victim"}, DirEntries(outside_.Path()));
     EXPECT_EQ(0700u, ModeOf(outside_.Path()));
 }
 

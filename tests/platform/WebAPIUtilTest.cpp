@@ -20,21 +20,7 @@ std::string Nested(int depth, const std::string& inner)
     return std::string(depth, '[') + inner + std::string(depth, ']');
 }
 
-std::vector<std::string> List(const std::string& dir)
-{
-    std::vector<std::string> names;
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        return names;
-    }
-    while (struct dirent* e = readdir(d)) {
-        if (std::string(e->d_name) != "." && std::string(e->d_name) != "..") {
-            names.push_back(e->d_name);
-        }
-    }
-    closedir(d);
-    return names;
-}
+using VELA::Test::DirEntries;
 
 void WriteText(const std::string& path, const std::string& text)
 {
@@ -110,12 +96,12 @@ TEST(WebAPIUtil, WriteJsonFileAtomicReplacesWithMode)
     struct stat st;
     ASSERT_EQ(0, stat(path.c_str(), &st));
     EXPECT_EQ(0640u, st.st_mode & 07777);
-    EXPECT_EQ(std::vector<std::string>{"conf.json"}, List(dir.Path()));
+    EXPECT_EQ(std::vector<std::string>{"conf.json"}, DirEntries(dir.Path()));
 
     // The temporary name must stay within NAME_MAX for a 255-byte name.
     const std::string longName(255, 'n');
     EXPECT_TRUE(WriteJsonFileAtomic(dir.Path() + "/" + longName, value, 0600));
-    EXPECT_EQ(2u, List(dir.Path()).size());
+    EXPECT_EQ(2u, DirEntries(dir.Path()).size());
 }
 
 TEST(WebAPIUtil, WriteJsonFileAtomicLeavesNoTemporaryOnFailure)
@@ -128,8 +114,8 @@ TEST(WebAPIUtil, WriteJsonFileAtomicLeavesNoTemporaryOnFailure)
     VELA::Test::LogCapture log;
     EXPECT_FALSE(WriteJsonFileAtomic(target, Json::Value(1), 0600));
     EXPECT_TRUE(log.Contains("rename"));
-    EXPECT_EQ(std::vector<std::string>{"busy"}, List(dir.Path()));
-    EXPECT_EQ(std::vector<std::string>{"inside"}, List(target));
+    EXPECT_EQ(std::vector<std::string>{"busy"}, DirEntries(dir.Path()));
+    EXPECT_EQ(std::vector<std::string>{"inside"}, DirEntries(target));
 
     EXPECT_FALSE(WriteJsonFileAtomic(dir.Path() + "/missing/x.json", Json::Value(1), 0600));
     EXPECT_FALSE(WriteJsonFileAtomic("", Json::Value(1), 0600));
@@ -145,7 +131,7 @@ TEST(WebAPIUtil, WriteJsonFileAtomicUnwritableDirectory)
     const std::string sub = dir.Path() + "/ro";
     ASSERT_EQ(0, mkdir(sub.c_str(), 0500));
     EXPECT_FALSE(WriteJsonFileAtomic(sub + "/x.json", Json::Value(1), 0600));
-    EXPECT_TRUE(List(sub).empty());
+    EXPECT_TRUE(DirEntries(sub).empty());
     chmod(sub.c_str(), 0700);
 }
 

@@ -1,6 +1,9 @@
 #include "support/TestSupport.h"
 
 #include <cstdlib>
+#include <dirent.h>
+#include <fstream>
+#include <sstream>
 #include <ftw.h>
 #include <stdexcept>
 #include <unistd.h>
@@ -67,6 +70,30 @@ ScopedEnv::~ScopedEnv()
     } else {
         unsetenv(name_.c_str());
     }
+}
+
+std::string ReadText(const std::string& path)
+{
+    std::ifstream in(path, std::ios::binary);
+    std::ostringstream text;
+    text << in.rdbuf();
+    return text.str();
+}
+
+std::vector<std::string> DirEntries(const std::string& dir)
+{
+    std::vector<std::string> names;
+    DIR* d = opendir(dir.c_str());
+    if (d == nullptr) {
+        return names;
+    }
+    while (struct dirent* e = readdir(d)) {
+        if (std::string(e->d_name) != "." && std::string(e->d_name) != "..") {
+            names.push_back(e->d_name);
+        }
+    }
+    closedir(d);
+    return names;
 }
 
 }  // namespace Test

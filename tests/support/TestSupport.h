@@ -46,5 +46,12 @@ private:
     bool had_;
 };
 
+// The whole content of the file `path`; empty when it cannot be read.
+std::string ReadText(const std::string& path);
+
+// The names in the directory `dir` other than "." and "..", in readdir
+// order; empty when it cannot be opened.
+std::vector<std::string> DirEntries(const std::string& dir);
+
 }  // namespace Test
 }  // namespace VELA
