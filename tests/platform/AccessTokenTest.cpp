@@ -3,6 +3,8 @@
 // listing and revocation.
 #include <gtest/gtest.h>
 
+#include "platform/StateRootTest.h"
+
 #include <cstring>
 #include <dirent.h>
 #include <fstream>
@@ -26,9 +28,6 @@ using VELA::Test::ReadText;
 using VELA::Test::ScopedEnv;
 using VELA::Test::TempDir;
 
-const long long kStart = 1700000000;
-long long g_now = kStart;
-long long FakeNow() { return g_now; }
 
 std::set<std::string> Names(const std::string& dir)
 {
@@ -44,20 +43,8 @@ std::set<std::string> Names(const std::string& dir)
     return names;
 }
 
-class AccessTokenTest : public ::testing::Test {
+class AccessTokenTest : public StateRootTest {
 protected:
-    void SetUp() override
-    {
-        VELA::VelaRootReset();
-        g_now = kStart;
-        VelaSetClockForTest(&FakeNow);
-    }
-    void TearDown() override
-    {
-        VelaSetClockForTest(nullptr);
-        VELA::VelaRootReset();
-    }
-
     std::string Dir() const { return root_.Path() + "/var/lib/vela/tokens"; }
     std::string File(const std::string& id) const { return Dir() + "/" + id; }
 
@@ -90,8 +77,6 @@ protected:
         ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(File(id), doc, 0600));
     }
 
-    TempDir root_;
-    ScopedEnv rootEnv_{"VELA_ROOT", root_.Path().c_str()};
     LogCapture log_;
     char user_[493];
 };
@@ -148,9 +133,9 @@ TEST_F(AccessTokenTest, PatternsSelectApiAndMethod)
 TEST_F(AccessTokenTest, Expiry)
 {
     const std::string token = Create({"*"}, {"*"}, 100);
-    g_now += 99;
+    Now() += 99;
     EXPECT_EQ(0, Grant(token, "VELA.Demo", "get"));
-    g_now += 1;
+    Now() += 1;
     EXPECT_EQ(-2, Grant(token, "VELA.Demo", "get"));
     EXPECT_STREQ("", user_);
     EXPECT_TRUE(log_.Contains("expired"));
@@ -291,7 +276,7 @@ TEST_F(AccessTokenTest, ListAndRevoke)
 {
     std::string first;
     const std::string a = Create({"VELA.Demo.*"}, {"get*"}, 0, "root", &first);
-    g_now += 1;
+    Now() += 1;
     std::string second;
     const std::string b = Create({"*"}, {"list"}, 0, "nobody", &second);
     std::ofstream(Dir() + "/not-a-token") << "x";

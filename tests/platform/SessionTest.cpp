@@ -3,6 +3,8 @@
 // concurrent processes, and the calls that read the same session.
 #include <gtest/gtest.h>
 
+#include "platform/StateRootTest.h"
+
 #include <cerrno>
 #include <cstring>
 #include <dirent.h>
@@ -29,9 +31,6 @@ using VELA::Test::ReadText;
 using VELA::Test::ScopedEnv;
 using VELA::Test::TempDir;
 
-const long long kStart = 1700000000;
-long long g_now = kStart;
-long long FakeNow() { return g_now; }
 
 const char kClient[] = "192.0.2.7";
 
@@ -70,20 +69,8 @@ struct Handle {
     VELACGI_CTX* ctx = nullptr;
 };
 
-class SessionTest : public ::testing::Test {
+class SessionTest : public StateRootTest {
 protected:
-    void SetUp() override
-    {
-        VELA::VelaRootReset();
-        g_now = kStart;
-        VelaSetClockForTest(&FakeNow);
-    }
-    void TearDown() override
-    {
-        VelaSetClockForTest(nullptr);
-        VELA::VelaRootReset();
-    }
-
     std::string Dir() const { return root_.Path() + "/run/vela/sessions"; }
     std::string File(const std::string& sid) const { return Dir() + "/" + sid; }
 
@@ -126,8 +113,6 @@ protected:
         Write(sid, doc);
     }
 
-    TempDir root_;
-    ScopedEnv rootEnv_{"VELA_ROOT", root_.Path().c_str()};
     ScopedEnv remote_{"REMOTE_ADDR", kClient};
     ScopedEnv forwarded_{"HTTP_X_FORWARDED_FOR", nullptr};
     ScopedEnv header_{"HTTP_X_VELA_TOKEN", nullptr};
@@ -245,18 +230,18 @@ TEST_F(SessionTest, IdleTimeoutAndLifetime)
     options.lifetime = 250;
     const std::string sid = Create(options);
 
-    g_now += 100;  // exactly the idle timeout: still valid, and refreshed
+    Now() += 100;  // exactly the idle timeout: still valid, and refreshed
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-    EXPECT_EQ(g_now, Read(sid)["lastUse"].asInt64());
-    g_now += 100;
+    EXPECT_EQ(Now(), Read(sid)["lastUse"].asInt64());
+    Now() += 100;
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-    g_now += 51;  // 251 seconds after the login: the lifetime has passed
+    Now() += 51;  // 251 seconds after the login: the lifetime has passed
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
 
     const std::string idle = Create(options);
-    g_now += 101;
+    Now() += 101;
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(idle));
-    EXPECT_EQ(g_now - 101, Read(idle)["lastUse"].asInt64());  // a timed-out check refreshes nothing
+    EXPECT_EQ(Now() - 101, Read(idle)["lastUse"].asInt64());  // a timed-out check refreshes nothing
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(idle));
 
     // Times far in the past.
@@ -276,7 +261,7 @@ TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
     const std::string used = Create(options);
 
     for (int i = 0; i < 3; ++i) {
-        g_now += 60;
+        Now() += 60;
         EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(used));
         if (i == 0) {
             EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(polled, VELACGI_AUTH_NO_REFRESH));
@@ -285,7 +270,7 @@ TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
             EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(polled, VELACGI_AUTH_NO_REFRESH));
         }
     }
-    EXPECT_EQ(g_now, Read(used)["lastUse"].asInt64());
+    EXPECT_EQ(Now(), Read(used)["lastUse"].asInt64());
 }
 
 TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
@@ -297,15 +282,15 @@ TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
 
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
     EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
-    g_now += 101;
+    Now() += 101;
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
 
     // A check without refresh still pulls the future back to now.
     const std::string polled = Create(options);
-    Edit(polled, "lastUse", Json::Int64(g_now + 1000000));
+    Edit(polled, "lastUse", Json::Int64(Now() + 1000000));
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(polled, VELACGI_AUTH_NO_REFRESH));
-    EXPECT_EQ(g_now, Read(polled)["lastUse"].asInt64());
-    g_now += 101;
+    EXPECT_EQ(Now(), Read(polled)["lastUse"].asInt64());
+    Now() += 101;
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(polled, VELACGI_AUTH_NO_REFRESH));
 }
 
@@ -319,10 +304,10 @@ TEST_F(SessionTest, CreationInTheFutureStartsTheLifetimeNow)
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
     EXPECT_EQ(kStart, Read(sid)["created"].asInt64());
     for (int i = 0; i < 2; ++i) {
-        g_now += 90;
+        Now() += 90;
         EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
     }
-    g_now += 90;
+    Now() += 90;
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
 }
 
@@ -457,7 +442,7 @@ TEST_F(SessionTest, ClientAddressMustMatch)
         EXPECT_EQ(AUTH_RESULT_IP_MISMATCH, Check(sid));
         EXPECT_TRUE(log_.Contains("request from 198.51.100.1"));
         EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
-        g_now += 10;
+        Now() += 10;
         EXPECT_EQ(AUTH_RESULT_IP_MISMATCH, Check(sid));
         EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());  // a refused check keeps nothing alive
 
@@ -503,7 +488,7 @@ TEST_F(SessionTest, AntiForgeryToken)
     EXPECT_TRUE(log_.Contains("anti-forgery token missing or wrong"));
     {
         ScopedEnv wrong("HTTP_X_VELA_TOKEN", otherToken.c_str());
-        g_now += 5;
+        Now() += 5;
         EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
         EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
     }
@@ -585,9 +570,9 @@ TEST_F(SessionTest, ListRemovePurge)
     VelaSessionOptions shortIdle;
     shortIdle.idleTimeout = 60;
     const std::string a = Create(shortIdle);
-    g_now += 1;
+    Now() += 1;
     const std::string b = Create(VelaSessionOptions(), "nobody", "2001:db8::1");
-    g_now += 1;
+    Now() += 1;
     VelaSessionOptions longIdle;
     longIdle.idleTimeout = 7200;
     const std::string c = Create(longIdle);
@@ -607,14 +592,14 @@ TEST_F(SessionTest, ListRemovePurge)
     EXPECT_EQ(-2, VelaSessionRemove(b.c_str()));
     EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(b));
 
-    g_now += 61;
+    Now() += 61;
     ASSERT_EQ(0, VelaSessionList(list));
     ASSERT_EQ(2u, list.size());
     EXPECT_TRUE(list[0].expired);
     EXPECT_FALSE(list[1].expired);
     EXPECT_EQ(0, VelaSessionPurge(3600));  // within the grace period
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(a));
-    g_now += 3600;
+    Now() += 3600;
     EXPECT_EQ(1, VelaSessionPurge(3600));
     EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(a));
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(c));
@@ -677,7 +662,7 @@ TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
         if (pid == 0) {
             int failures = 0;
             for (int i = 0; i < kChecks; ++i) {
-                g_now = kStart + i;  // every check has a new time to write
+                Now() = kStart + i;  // every check has a new time to write
                 char user[493];
                 if (VelaCgiIsAuthorizedEx(nullptr, sid.c_str(), user, sizeof(user), nullptr, 0) !=
                         AUTH_RESULT_AUTHORIZED ||
@@ -699,7 +684,7 @@ TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
     EXPECT_EQ(sid, doc["id"].asString());
     EXPECT_GE(doc["lastUse"].asInt64(), kStart);
     EXPECT_LT(doc["lastUse"].asInt64(), kStart + kChecks);
-    g_now = kStart + kChecks;
+    Now() = kStart + kChecks;
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
 
     // No temporary file is left behind.
@@ -724,7 +709,7 @@ TEST_F(SessionTest, RemovalWinsOverConcurrentRefresh)
             if (pid == 0) {
                 bool removed = false;
                 for (int i = 1; i <= 200; ++i) {
-                    g_now = kStart + i;
+                    Now() = kStart + i;
                     const int verdict = Check(sid);
                     if (verdict == AUTH_RESULT_NO_SESSION) {
                         removed = true;
