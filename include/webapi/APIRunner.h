@@ -1,0 +1,129 @@
+// The dispatcher: runs one request from its request form to its response.
+//
+// APIRunner checks the request against the API descriptions of the web-API
+// directory, asks the permission hooks, loads the handler library, sets up
+// the identity, priority, standard streams and working directory of the
+// call, calls the handler and restores everything. The outcome is left in
+// the runner's response. The base class serves requests given as JSON; the
+// CGI front end (WebEntry) derives from it and overrides the hooks.
+//
+// Relative paths ("*.lib" description files, the candidates of one API, the
+// "lib" paths) are resolved against the working directory, which the caller
+// sets to the web-API directory (<root>/usr/vela/velaman/webapi).
+#pragma once
+
+#include <json/json.h>
+#include <map>
+#include <string>
+
+#include "webapi/APITable.h"
+
+namespace VELA {
+
+class APIRequest;
+class APIResponse;
+class APIRunnerPrivate;
+
+class APIRunner {
+public:
+    // Creates an empty request and its response, makes the process lead a
+    // new session and reads the defaults file lib.def.
+    APIRunner();
+    APIRunner(const APIRunner&) = delete;
+    APIRunner& operator=(const APIRunner&) = delete;
+    // Closes the handler libraries, deletes the request and the response and
+    // puts the process name back.
+    virtual ~APIRunner();
+
+    // ---- Hooks ----
+    // Initialize, SetProcessName, then Process. The outcome is in GetResponse().
+    virtual bool Run(const Json::Value& request);
+    // Fills the request from the process environment and the request JSON.
+    virtual bool Initialize(const Json::Value& request);
+    virtual bool CheckSharingPermission(APIRequest* req, APIResponse* resp);  // true
+    virtual bool NeedPermission(APIRequest* req);                             // false
+    virtual bool CheckPermission(APIRequest* req, APIResponse* resp);         // true
+    virtual bool HandleUpload(APIRequest* req, APIResponse* resp);            // true
+    virtual bool SkipPermission(APIRequest* req);                             // true
+
+    // Lets the runner show the API being served in argument 0 (ps).
+    void SetArgs(int argc, char** argv);
+
+    // ---- Pipeline stages (public for the compound handler) ----
+    bool Process(APIRequest* req, APIResponse* resp);
+    bool ProcessEntry(APIRequest* req, APIResponse* resp);
+    bool ProcessLib(APIRequest* req, APIResponse* resp);
+    bool HandleCompound(APIRequest* req, APIResponse* resp);
+    // Names the process, the log identity and the thread after the call:
+    // "<prefix>_<api>_<version>_<method>". Errors 101 and 118.
+    bool SetProcessName(APIRequest* req, APIResponse* resp);
+
+    // The response body plus "httpd_restart"; null without a response.
+    Json::Value GetResponse();
+    // Runs the response's after-reply callbacks in a detached child, one
+    // second later, so that the reply is not held up.
+    void HandleCallback(APIResponse* resp);
+
+    // Runs one API on behalf of `user`. Until the exec handler exists these
+    // answer {"success": false, "error": {"code": 117}}.
+    void Exec(Json::Value& out, int fd, const char* api, int version, const char* method,
+              const Json::Value& params, const Json::Value& extra, const char* user);
+    void Exec(Json::Value& out, const char* api, int version, const char* method,
+              const Json::Value& params, const Json::Value& extra, const char* user);
+    void Exec(Json::Value& out, const char* api, int version, const char* method,
+              const Json::Value& params, const char* user);
+
+    // ---- Description registry ----
+    // Copies the defaults' "authLevel", "allowUser" and "priority" into
+    // `desc` where absent; "requestFormat" defaults to "JSON".
+    Json::Value& ApplyLibDef(Json::Value& desc);
+    bool CheckLibDescription(Json::Value& desc);
+    // Loads every *.lib file of the working directory into `table`.
+    bool InitLibDesc(Json::Value& table);
+    // Makes sure `api` is in `table`, loading the one file that declares it.
+    // A name holding anything but letters, digits, ".", "_" and "-" is
+    // refused before any file is touched.
+    bool InitLibDesc(Json::Value& table, const std::string& api);
+    bool InitLibDesc(Json::Value& table, APIRequest* req);
+    // The attribute object of one method; the defaults' "methods" when the
+    // method has none of its own.
+    const Json::Value& GetMethod(const std::string& api, int version, const std::string& method);
+    bool GetMethodAttr(const std::string& api, int version, const std::string& method,
+                       const std::string& attr);
+    bool GetMethodAttr(APIRequest* req, const std::string& attr);
+    // Hands the request its API's description (already loaded).
+    bool AddAPIInfo(APIRequest* req);
+    // Errors 101, 102, 103, 104, 115, 116.
+    bool CheckRequestParam(APIRequest* req, APIResponse* resp);
+
+    // ---- Handler libraries ----
+    bool CacheLib(APIRequest* req, void** handle);
+    bool OpenLib(APIRequest* req, _tag_API_TABLE** table, _tag_API_CHECK_TABLE** check);
+    bool GetTableFunc(void* handle, _tag_API_TABLE** table);
+    bool GetCheckTableFunc(void* handle, _tag_API_CHECK_TABLE** check);
+    void CloseLib();
+
+    // ---- Usage counter ----
+    // Counts one call of the request's API, version and method when usage
+    // data collection is on; never fails the call.
+    void IncreaseCounter(APIRequest* req);
+
+    APIRequest* GetRequest() const { return request_; }
+    APIResponse* GetResponseObject() const { return response_; }
+    int GetCompoundDepth() const { return compoundDepth_; }
+
+protected:
+    // Collects the process environment ("NAME=value" entries) into the
+    // object `env`. False when `env` is not an object (or null).
+    bool InitEnv(Json::Value& env);
+
+    Json::Value libDef_;   // lib.def, an empty object when missing
+    Json::Value libDesc_;  // API name -> merged description
+    APIRequest* request_;
+    APIResponse* response_;
+    std::map<std::string, void*> libCache_;  // "lib" path -> dlopen handle
+    int compoundDepth_;
+    APIRunnerPrivate* d_;
+};
+
+}  // namespace VELA

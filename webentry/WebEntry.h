@@ -1,0 +1,66 @@
+// The CGI front end: the runner that serves one web-API call arriving from
+// the web server. velascgi constructs one WebEntry per process and calls Run.
+//
+// Initialize builds the request from the CGI environment, the query string,
+// the body (decrypting encrypted parameters) and the cookies; the pipeline of
+// APIRunner then runs it; OutputHeader and OutputBody write the CGI reply to
+// standard output. The permission hooks live in access/.
+#pragma once
+
+#include <json/json.h>
+#include <string>
+
+#include "vela/cgi.h"
+#include "webapi/APIRunner.h"
+
+namespace VELA {
+
+class WebEntry : public APIRunner {
+public:
+    WebEntry();
+    ~WebEntry() override;
+
+    // The argument is not used: the request comes from the CGI environment.
+    bool Run(const Json::Value& unused) override;
+    bool Initialize(const Json::Value& unused) override;
+
+    // ---- Permission (access/) ----
+    bool CheckSharingPermission(APIRequest* req, APIResponse* resp) override;
+    bool NeedPermission(APIRequest* req) override;
+    bool CheckPermission(APIRequest* req, APIResponse* resp) override;
+    bool SkipPermission(APIRequest* req) override;
+    // The session check itself: the error code for the platform's verdict
+    // (0 allowed), computed at most once per value of `allowTimeout`.
+    int CheckPermission(bool allowTimeout);
+
+    // ---- Uploads ----
+    bool HandleUpload(APIRequest* req, APIResponse* resp) override;
+    // For an upload whose query string lacks api, version or method: reads
+    // them from the leading form fields of the body into `postParam`.
+    bool LoadUploadAPIDesc(Json::Value& postParam);
+
+    // ---- Building the request ----
+    bool InitParam(Json::Value& param);
+    bool InitGetParam(Json::Value& getParam);
+    bool InitPostParam(Json::Value& postParam);
+    bool DetectAndDecryptParamLine(const std::string& line, Json::Value& out);
+    bool DecryptParam(const std::string& cipher, Json::Value& out);
+    bool DecryptAESParam(Json::Value& param);
+
+    // ---- Relay to another service: not served yet (error 109) ----
+    bool ProcessRelay(APIRequest* req, APIResponse* resp);
+
+    // ---- HTTP output (standard output) ----
+    void OutputHeader();
+    void OutputBody();
+
+protected:
+    VELACGI_CTX* cgi_;
+    Json::Value uploadedFiles_;  // stored files of the upload, in body order
+    Json::Value permission_;     // {"permResult": [verdict with timeout allowed, without]}
+};
+
+// After-reply callback: asks the platform to restart the web server.
+void RestartHttpd(void*);
+
+}  // namespace VELA
