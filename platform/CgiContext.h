@@ -5,6 +5,20 @@
 
 #include "vela/vlibc.h"
 
+// The handle's upload tables (vela/upload.h), freed with the handle.
+struct VelaCgiUploadTables {
+    PVLIBCSZHASH params = nullptr;  // every form field read so far
+    PVLIBCSZHASH files = nullptr;   // the file stored by the last load
+    VelaCgiUploadTables() = default;
+    VelaCgiUploadTables(const VelaCgiUploadTables&) = delete;
+    VelaCgiUploadTables& operator=(const VelaCgiUploadTables&) = delete;
+    ~VelaCgiUploadTables()
+    {
+        VLIBCSzHashFree(params);
+        VLIBCSzHashFree(files);
+    }
+};
+
 struct _tag_VELACGI_CTX_ {
     std::string app;
     PVLIBCSZHASH cookies = nullptr;
@@ -23,4 +37,6 @@ struct _tag_VELACGI_CTX_ {
     std::string sessionApp;        // option 7
     std::string sessionWebAPI;     // option 6
     std::string sessionLang;       // three letters or ""
+
+    VelaCgiUploadTables upload;
 };

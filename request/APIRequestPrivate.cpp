@@ -14,14 +14,12 @@
 
 namespace VELA {
 
+const char kSharingHeaderEnv[] = "HTTP_X_VELA_SHARING";
+const char kSharingSidCookie[] = "sharing_sid";
+
 namespace {
 
 const char* const kCategories[] = {"environ", "cookie", "reqLib", "session", "param", "attr", "url", "userAgent"};
-
-// Name of the sharing-link header as the CGI environment presents it, and of
-// the sharing session cookie.
-const char kSharingHeaderEnv[] = "HTTP_X_VELA_SHARING";
-const char kSharingSidCookie[] = "sharing_sid";
 
 // Encrypted-parameter member names (protocol literals).
 const char kCipherText[] = "__cIpHeRtExT";

@@ -13,6 +13,11 @@
 
 namespace VELA {
 
+// Name of the sharing-link header as the CGI environment presents it, and of
+// the sharing session cookie.
+extern const char kSharingHeaderEnv[];
+extern const char kSharingSidCookie[];
+
 class APIRequestPrivate : public APIBase {
 public:
     explicit APIRequestPrivate(APIRequest* owner);

@@ -10,6 +10,8 @@ packages=(
   libgtest-dev libgmock-dev googletest
   libbenchmark-dev
   clang libclang-rt-dev
+  wrk curl time
+  lighttpd media-types
 )
 
 missing=()

@@ -149,6 +149,22 @@ int VelaCgiUIDGet(const char* sid, const char* user);
 
 // Decrypts a "__cIpHeRtExT" payload in place into a query string. 0 / -1.
 int VelaCgiDecryptParam(std::string& text);
+
+// Longest parameter line (query string or form-encoded body) accepted.
+#define VELACGI_MAX_PARAM_LINE (16u * 1024u * 1024u)
+// Checks a raw parameter line (a query string or an
+// application/x-www-form-urlencoded body, RFC 3986 percent-encoding) and
+// decrypts it in place when it is encrypted as a whole:
+//  - a plain "name=value&..." line is accepted unchanged;
+//  - a line of exactly one pair "__cIpHeRtExT=<base64>" is replaced by its
+//    decrypted query string (VelaCgiDecryptParam; the value may be
+//    percent-encoded), which must pass the same checks;
+//  - refused (false, one log line) are: a line longer than
+//    VELACGI_MAX_PARAM_LINE, a control byte (0x00-0x1f, 0x7f) anywhere, a
+//    "%" not followed by two hex digits, and a cipher that does not decrypt.
+// Encrypted members among other pairs are left for the request to decrypt.
+// On false `line` is unchanged.
+bool VelaCgiDetectAndDecryptParamLine(std::string& line);
 // Recovers the AES key from a "__nEkOtReHpIc" token into `key` (`size`
 // bytes, at most 32 characters and the terminator). 0 / -1.
 int VELACloudServiceHubtokenGenerateToken(const char* token, char* key, size_t size);

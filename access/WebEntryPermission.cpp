@@ -1,0 +1,290 @@
+// Permission hooks of the CGI front end: whether a method needs a login,
+// the login-session / access-token check with its verdict cache, the user
+// classes and application privilege of the API, and the sharing-link hook.
+//
+// The platform's verdict (VelaCgiIsAuthorizedEx, VelaAccessTokenGrant) is
+// computed at most once per process for each value of "allowTimeout" and kept
+// in permission_["permResult"]: slot 0 with timeout allowed, slot 1 without.
+#include <errno.h>
+#include <json/json.h>
+#include <limits.h>
+#include <stdlib.h>
+#include <string.h>
+#include <string>
+
+#include "vela/cgi.h"
+#include "vela/log.h"
+#include "vela/token.h"
+#include "vela/user.h"
+#include "webapi/APIError.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webentry/WebEntry.h"
+
+namespace VELA {
+
+namespace {
+
+// Room for any user name the platform hands back, terminator included.
+constexpr size_t kUserNameSize = 493;
+
+// The API's "authLevel": 0 no login, 1 login required, 2 checked but not
+// enforced. Absent or not a number counts as 1, the safe side.
+int AuthLevel(const APIRequest* req)
+{
+    const Json::Value level = req->GetAPIInfo("authLevel", Json::Value(1));
+    if (level.isInt()) {
+        return level.asInt();
+    }
+    return 1;
+}
+
+// The error code of a platform verdict; 105 outside -8 .. 2.
+int VerdictToError(int verdict)
+{
+    static const int kTable[] = {
+        WEBAPI_ERR_REMOTE_IP,         // -8 client address refused
+        WEBAPI_ERR_NO_PERMISSION,     // -7 anti-forgery token missing
+        WEBAPI_ERR_NO_PERMISSION,     // -6
+        WEBAPI_ERR_NOT_AUTHENTICATED, // -5 no credentials, token refused
+        WEBAPI_ERR_NO_PERMISSION,     // -4
+        WEBAPI_ERR_NO_PERMISSION,     // -3
+        WEBAPI_ERR_NO_PERMISSION,     // -2 no such session
+        WEBAPI_ERR_SESSION_TIMEOUT,   // -1 idle timeout passed
+        WEBAPI_ERR_NO_PERMISSION,     //  0
+        WEBAPI_ERR_NONE,              //  1 authorised
+        WEBAPI_ERR_NONE,              //  2 authorised
+    };
+    if (verdict < -8 || verdict > 2) {
+        return WEBAPI_ERR_NO_PERMISSION;
+    }
+    return kTable[verdict + 8];
+}
+
+// "admin." or "normal." followed by the user's origin: "domain" for
+// DOMAIN\user, "ldap" for user@realm, else "local".
+std::string UserClass(bool isAdmin, const std::string& user)
+{
+    std::string cls = isAdmin ? "admin." : "normal.";
+    if (user.find('\\') != std::string::npos) {
+        cls += "domain";
+    } else if (user.find('@') != std::string::npos) {
+        cls += "ldap";
+    } else {
+        cls += "local";
+    }
+    return cls;
+}
+
+// Whole decimal number of an option text; 0 for anything else.
+int DecimalOption(const char* text)
+{
+    if (text == nullptr || *text == '\0') {
+        return 0;
+    }
+    char* end = nullptr;
+    errno = 0;
+    const long value = strtol(text, &end, 10);
+    if (errno != 0 || *end != '\0' || value < 0 || value > INT_MAX) {
+        return 0;
+    }
+    return static_cast<int>(value);
+}
+
+}  // namespace
+
+bool WebEntry::NeedPermission(APIRequest* req)
+{
+    if (req == nullptr) {
+        return true;
+    }
+    return AuthLevel(req) != 0;
+}
+
+bool WebEntry::SkipPermission(APIRequest* req)
+{
+    if (req == nullptr) {
+        return false;
+    }
+    return AuthLevel(req) == 2;
+}
+
+int WebEntry::CheckPermission(bool allowTimeout)
+{
+    APIRequest* req = request_;
+    if (req == nullptr) {
+        return WEBAPI_ERR_NO_PERMISSION;
+    }
+    Json::Value& slots = permission_["permResult"];
+    if (!slots.isArray() || slots.size() != 2) {
+        slots = Json::Value(Json::arrayValue);
+        slots.append(Json::Value());
+        slots.append(Json::Value());
+    }
+    const Json::ArrayIndex slot = allowTimeout ? 0 : 1;
+    if (slots[slot].isInt()) {
+        return VerdictToError(slots[slot].asInt());
+    }
+    // A check before Initialize (a runner built by hand) still needs a
+    // handle for the skip-IP flag and the session facts.
+    if (cgi_ == nullptr && (VelaCgiInit("", &cgi_) != 0 || VelaCgiLoadInCookies(cgi_) != 0)) {
+        VELA_LOG_ERR("cannot set up the CGI handle for the session check");
+    }
+
+    const std::string sid = req->GetSessionID();
+    const char* tokenEnv = req->GetVelaAccessTokenID();
+    const std::string token = tokenEnv != nullptr ? tokenEnv : "";
+    int verdict = AUTH_RESULT_UNAUTHENTICATED;
+
+    if (!sid.empty() || !token.empty()) {
+        const std::string api = req->GetAPIClass();
+        const std::string method = req->GetAPIMethod();
+        if (GetMethodAttr(req, "skipCheckIP")) {
+            VelaCgiSetSkipCheckIP(cgi_, 1);
+        }
+        char user[kUserNameSize];
+        memset(user, 0, sizeof(user));
+        verdict = AUTH_RESULT_NO_SESSION;
+        bool facts = false;
+        if (!sid.empty()) {
+            VELACGI_SESSION_INFO info;
+            // A page that polls by itself must not keep an idle session alive.
+            const int flags = allowTimeout ? VELACGI_AUTH_NO_REFRESH : 0;
+            verdict = VelaCgiIsAuthorizedEx(cgi_, sid.c_str(), user, sizeof(user), &info, flags);
+            facts = verdict >= 0;
+        }
+        if (!facts && !token.empty()) {
+            const int granted = VelaAccessTokenGrant(token.c_str(), api.c_str(), method.c_str(), user, sizeof(user));
+            verdict = granted < 0 ? AUTH_RESULT_UNAUTHENTICATED : AUTH_RESULT_AUTHORIZED;
+            facts = true;
+        }
+        if (facts) {
+            user[sizeof(user) - 1] = '\0';
+            setenv("VELA_WEBAPI_USERNAME", user, 1);
+            int timeout = DecimalOption(VelaCgiGetOption(cgi_, VELACGI_OPT_TIMEOUT, "0"));
+            if (timeout == 0) {
+                timeout = VelaCgiGetTimeout(cgi_);
+            }
+            const char* skipOption = VelaCgiGetOption(cgi_, VELACGI_OPT_SKIP_IP, nullptr);
+            const bool skipIP = skipOption == nullptr ? VelaCgiGetSkipCheckIP(cgi_) == 1 : strcmp(skipOption, "1") == 0;
+            char lang[8] = "";
+            VelaCgiGetLang(cgi_, lang, sizeof(lang));
+            const char* app = VelaCgiGetOption(cgi_, VELACGI_OPT_APP, "");
+            const char* webapi = VelaCgiGetOption(cgi_, VELACGI_OPT_WEBAPI, "");
+            const char* sessFile = VelaCgiGetSessionFile(cgi_);
+
+            Json::Value session(Json::objectValue);
+            session["username"] = user;
+            session["isAdmin"] = user[0] != '\0' && VLIBGroupIsAdminGroupMem(user, 0) == 1;
+            session["sessFile"] = sessFile != nullptr ? sessFile : "";
+            session["isTimeout"] = verdict == AUTH_RESULT_TIMEOUT;
+            session["timeout"] = timeout;
+            session["isSkipCheckIP"] = skipIP;
+            session["uiLang"] = lang;
+            session["app"] = app != nullptr ? app : "";
+            session["webapi"] = webapi != nullptr ? webapi : "";
+            session["isAuthorized"] = true;
+            req->InitSession(session);
+        }
+    }
+
+    req->SetAuthResult(static_cast<_tag_authorized_result_>(verdict));
+    slots[slot] = verdict;
+    return VerdictToError(verdict);
+}
+
+bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
+{
+    if (req == nullptr || resp == nullptr) {
+        return false;
+    }
+    const bool allowTimeout = GetMethodAttr(req, "allowTimeout");
+    const int code = CheckPermission(allowTimeout);
+    const Json::Value& cached = permission_["permResult"][allowTimeout ? 0 : 1];
+    if (cached.isInt() && cached.asInt() == AUTH_RESULT_TOKEN_MISSING && AuthLevel(req) == 1) {
+        VELA_LOG_ERR("Token Authentication Fail.");
+    }
+
+    resp->SetError(code, Json::Value());
+    switch (code) {
+    case WEBAPI_ERR_NONE:
+        break;
+    case WEBAPI_ERR_SESSION_TIMEOUT:
+        resp->SetServerError("timeout");
+        return false;
+    case WEBAPI_ERR_NOT_AUTHENTICATED:
+        resp->SetServerError("unauth");
+        return false;
+    case WEBAPI_ERR_REMOTE_IP:
+        resp->SetServerError("errorip");
+        return false;
+    case WEBAPI_ERR_NO_PERMISSION:
+        resp->SetServerError("noprivilege");
+        return false;
+    default:
+        return false;
+    }
+
+    // User classes: the method's own "allowUser" list replaces the API's. A
+    // missing, non-array or empty list admits every logged-in user.
+    const std::string user = req->GetLoginUserName();
+    Json::Value allowUser = req->GetAPIInfo("allowUser", Json::Value());
+    const Json::Value& method = GetMethod(req->GetAPIClass(), req->GetAPIVersion(), req->GetAPIMethod());
+    if (method.isObject() && method.isMember("allowUser")) {
+        allowUser = method["allowUser"];
+    }
+    if (allowUser.isArray() && !allowUser.empty()) {
+        const std::string cls = UserClass(req->IsAdmin(), user);
+        bool allowed = false;
+        for (const Json::Value& entry : allowUser) {
+            if (entry.isString() && entry.asString() == cls) {
+                allowed = true;
+                break;
+            }
+        }
+        if (!allowed) {
+            VELA_LOG_ERR("user \"%s\" (%s) may not call %s", user.c_str(), cls.c_str(), req->GetAPIClass().c_str());
+            resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
+            return false;
+        }
+    }
+
+    const Json::Value privValue = req->GetAPIInfo("appPriv", Json::Value(""));
+    const std::string appPriv = privValue.isString() ? privValue.asString() : "";
+    if (!appPriv.empty() && VLIBAppPrivUserHas(user.c_str(), appPriv.c_str(), req->GetRemoteIP().c_str()) != 1) {
+        VELA_LOG_ERR("user \"%s\" lacks the application privilege %s for %s", user.c_str(), appPriv.c_str(),
+                     req->GetAPIClass().c_str());
+        resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
+        return false;
+    }
+
+    Json::Value session(Json::objectValue);
+    session["appPriv"] = appPriv;
+    session["username"] = user;
+    session["isAdmin"] = req->IsAdmin();
+    session["sessFile"] = req->GetSessionFilePath();
+    session["isTimeout"] = req->IsTimeout();
+    session["timeout"] = req->GetTimeoutDuration();
+    session["isSkipCheckIP"] = req->IsSkipCheckIP();
+    session["uiLang"] = req->GetUILanguage();
+    session["app"] = req->GetApplication();
+    session["webapi"] = req->GetWebAPIPriv();
+    session["isAuthorized"] = req->IsAuthorized();
+    // The verdict is kept with the facts it produced.
+    session["authResult"] = static_cast<int>(req->GetAuthResult());
+    req->InitSession(session);
+    return true;
+}
+
+bool WebEntry::CheckSharingPermission(APIRequest* req, APIResponse* resp)
+{
+    // Sharing links are not served yet: refuse, whatever the link says.
+    VELA_LOG_ERR("sharing links are not available; %s refused",
+                 req != nullptr ? req->GetAPIClass().c_str() : "request");
+    if (resp != nullptr) {
+        resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
+    }
+    return false;
+}
+
+}  // namespace VELA

@@ -1,0 +1,32 @@
+#!/usr/bin/env bash
+# Builds the project and runs the dispatcher benchmarks, printing the
+# figures of each beside its baseline:
+#   1. whole process: velarun answering the sample's echo against
+#      vela-bench-minimal-echo (JsonCpp only, same answer), fork/exec,
+#      interleaved, several rounds;
+#   2. in process: one APIRunner::Process of the echo against the same
+#      answer built with JsonCpp alone (Google Benchmark).
+#
+# usage: bench/run.sh [build-dir]          (default: build)
+# Environment: BENCH_RUNS=300 BENCH_ROUNDS=3 (part 1).
+set -euo pipefail
+cd "$(dirname "$0")/.."
+build=${1:-build}
+runs=${BENCH_RUNS:-300}
+rounds=${BENCH_ROUNDS:-3}
+
+scripts/build.sh "$build" >/dev/null
+export VELA_ROOT=$PWD/$build/root
+unset VELA_LOG_STDERR
+
+echo "== whole process: velarun echo vs minimal JsonCpp program ($runs runs each, $rounds rounds) =="
+"$build/bench/vela-bench-process" --runs "$runs" --rounds "$rounds" \
+    "$build/velarun" "$build/bench/vela-bench-minimal-echo" "$PWD/bench/echo.json"
+
+if [ -x "$build/bench/vela-bench-dispatch" ]; then
+    echo
+    echo "== in process: APIRunner::Process of the echo vs JsonCpp alone =="
+    "$build/bench/vela-bench-dispatch" --benchmark_repetitions=3 --benchmark_report_aggregates_only=true
+else
+    echo "vela-bench-dispatch was not built (Google Benchmark missing)" >&2
+fi

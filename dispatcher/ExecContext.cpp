@@ -1,0 +1,217 @@
+// The identity of a handler call, and the scoped guard that runs a few
+// statements with full rights. The call's switches log as the dispatcher
+// (source name APIRunner); the guard logs under the file its user names.
+#include "dispatcher/ExecContext.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <grp.h>
+#include <unistd.h>
+
+#include "vela/log.h"
+#include "vela/user.h"
+#include "webapi/APIUtils.h"
+
+// Lines of the identity switch belong to the dispatcher's log source.
+#define RUNNER_LOG(priority, fmt, ...) VelaLogAt((priority), "APIRunner", __LINE__, fmt, ##__VA_ARGS__)
+
+namespace VELA {
+
+namespace {
+
+const uid_t kKeepUid = static_cast<uid_t>(-1);
+const gid_t kKeepGid = static_cast<gid_t>(-1);
+constexpr int kMaxGroups = 65536;
+
+// "WARNING: set<what>(r, e, s)" to the authorisation facility after a
+// successful set, "ERROR: set<what>(r, e, s) [reason]" after a failed one.
+// errno is kept.
+void LogSet(int line, bool ok, const char* what, int r, int e, int s, int err)
+{
+    const int saved = errno;
+    if (ok) {
+        VelaLogAt(LOG_AUTHPRIV | LOG_INFO, "APIRunner", line, "WARNING: set%s(%d, %d, %d)", what, r, e, s);
+    } else {
+        char buf[256];
+        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, "APIRunner", line, "ERROR: set%s(%d, %d, %d) [%s]", what, r, e, s,
+                  strerror_r(err, buf, sizeof(buf)));
+    }
+    errno = saved;
+}
+
+// setresuid/setresgid with the log line above. `logSuccess` false leaves a
+// success unlogged (failures are always logged).
+bool SetResUid(int line, uid_t r, uid_t e, uid_t s, bool logSuccess = true)
+{
+    const bool ok = setresuid(r, e, s) == 0;
+    const int err = errno;
+    if (!ok || logSuccess) {
+        LogSet(line, ok, "resuid", static_cast<int>(r), static_cast<int>(e), static_cast<int>(s), err);
+    }
+    errno = err;
+    return ok;
+}
+
+bool SetResGid(int line, gid_t r, gid_t e, gid_t s, bool logSuccess = true)
+{
+    const bool ok = setresgid(r, e, s) == 0;
+    const int err = errno;
+    if (!ok || logSuccess) {
+        LogSet(line, ok, "resgid", static_cast<int>(r), static_cast<int>(e), static_cast<int>(s), err);
+    }
+    errno = err;
+    return ok;
+}
+
+bool ReadGroups(std::vector<gid_t>& out)
+{
+    const int n = getgroups(0, nullptr);
+    if (n < 0 || n > kMaxGroups) {
+        return false;
+    }
+    std::vector<gid_t> groups(static_cast<size_t>(n));
+    const int got = n > 0 ? getgroups(n, groups.data()) : 0;
+    if (got < 0) {
+        return false;
+    }
+    groups.resize(static_cast<size_t>(got));
+    std::sort(groups.begin(), groups.end());
+    out.swap(groups);
+    return true;
+}
+
+// Runs the process as user `name`. Takes back root first; when that is
+// refused, a process that already is the user goes on as it is.
+bool SwitchToUser(const std::string& name, bool grantable)
+{
+    if (SetResUid(__LINE__, kKeepUid, 0, kKeepUid)) {
+        return ResetCredentialsByName(name.c_str(), grantable);
+    }
+    uid_t uid = 0;
+    gid_t gid = 0;
+    if (VELAUserGetUGID(name.c_str(), &uid, &gid) == 0 && geteuid() == uid && getegid() == gid) {
+        return true;
+    }
+    return ResetCredentialsByName(name.c_str(), grantable);
+}
+
+}  // namespace
+
+// ---- ExecContext ------------------------------------------------------------------
+
+ExecContext::~ExecContext() { Restore(); }
+
+bool ExecContext::SaveIds()
+{
+    saved_ = getresuid(&ruid_, &euid_, &suid_) == 0 && getresgid(&rgid_, &egid_, &sgid_) == 0 &&
+             ReadGroups(groups_);
+    return saved_;
+}
+
+bool ExecContext::Prepare(const ExecIdentity& want)
+{
+    if (!saved_) {
+        return false;
+    }
+    // Whatever a failed switch changed is put back: a refused call leaves
+    // the identity as it found it.
+    restore_ = true;
+    if (!want.grantByDefault && !want.grantByUser) {
+        if (!SwitchToUser(want.runAs, want.grantable)) {
+            RUNNER_LOG(LOG_ERR, "grantable failed. [%m]");
+            return false;
+        }
+        restore_ = want.grantable;
+        return true;
+    }
+    if (!want.grantByDefault) {
+        if (want.loginName.empty()) {
+            RUNNER_LOG(LOG_ERR, "grantByUser: failed to get login username.");
+            return false;
+        }
+        if (!SwitchToUser(want.loginName, want.grantable)) {
+            RUNNER_LOG(LOG_ERR, "grantByUser failed. [%m]");
+            return false;
+        }
+        restore_ = want.grantable;
+        return true;
+    }
+    // grantByDefault: the handler runs with full rights.
+    if (egid_ != 0 && !SetResGid(__LINE__, kKeepGid, 0, kKeepGid)) {
+        RUNNER_LOG(LOG_ERR, "grantByDefault failed. [%m]");
+        return false;
+    }
+    if (euid_ != 0 && !SetResUid(__LINE__, kKeepUid, 0, kKeepUid)) {
+        RUNNER_LOG(LOG_ERR, "grantByDefault failed. [%m]");
+        return false;
+    }
+    return true;
+}
+
+void ExecContext::Restore()
+{
+    if (!restore_ || !saved_) {
+        return;
+    }
+    restore_ = false;
+    uid_t r = 0, e = 0, s = 0;
+    gid_t rg = 0, eg = 0, sg = 0;
+    std::vector<gid_t> groups;
+    const bool known = getresuid(&r, &e, &s) == 0 && getresgid(&rg, &eg, &sg) == 0 && ReadGroups(groups);
+    const bool groupsDiffer = !known || groups != groups_;
+    const bool idsDiffer = !known || r != ruid_ || e != euid_ || s != suid_ || rg != rgid_ || eg != egid_ ||
+                           sg != sgid_;
+    // Group ids and groups can only be put back with root's rights: a user
+    // switch that kept the saved uid 0 takes root back first.
+    if ((groupsDiffer || idsDiffer) && geteuid() != 0) {
+        SetResUid(__LINE__, kKeepUid, 0, kKeepUid);
+    }
+    if (groupsDiffer && setgroups(groups_.size(), groups_.data()) != 0) {
+        char buf[256];
+        RUNNER_LOG(LOG_AUTHPRIV | LOG_ERR, "ERROR: setgroups(%zu) [%s]", groups_.size(),
+                   strerror_r(errno, buf, sizeof(buf)));
+    }
+    SetResGid(__LINE__, rgid_, egid_, sgid_, egid_ == 0);
+    SetResUid(__LINE__, ruid_, euid_, suid_, euid_ == 0);
+}
+
+// ---- RunAsRootGuard -----------------------------------------------------------------
+
+RunAsRootGuard::RunAsRootGuard(const char* file, int line, const char* label)
+    : uid_(geteuid()), gid_(getegid()), file_(file), line_(line), label_(label ? label : ""), ok_(true)
+{
+    if (geteuid() != 0 && setresuid(kKeepUid, 0, kKeepUid) != 0) {
+        ok_ = false;
+    } else if (getegid() != 0) {
+        ok_ = setresgid(kKeepGid, 0, kKeepGid) == 0 && setresuid(kKeepUid, 0, kKeepUid) == 0;
+    }
+    if (!ok_) {
+        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, file_, line_, "ERROR: %s(%d, %d)", label_, 0, 0);
+    }
+}
+
+RunAsRootGuard::~RunAsRootGuard()
+{
+    const bool uidSame = uid_ == kKeepUid || geteuid() == uid_;
+    const bool gidSame = gid_ == kKeepGid || getegid() == gid_;
+    if (uidSame && gidSame) {
+        return;
+    }
+    bool ok = true;
+    if (geteuid() != 0) {
+        ok = setresuid(kKeepUid, 0, kKeepUid) == 0;
+    }
+    if (ok && !gidSame) {
+        ok = setresgid(kKeepGid, gid_, kKeepGid) == 0;
+    }
+    if (ok && uid_ != kKeepUid) {
+        ok = setresuid(kKeepUid, uid_, kKeepUid) == 0;
+    }
+    if (!ok) {
+        VelaLogAt(LOG_AUTHPRIV | LOG_CRIT, file_, line_, "ERROR: ~%s(%d, %d)", label_, static_cast<int>(uid_),
+                  static_cast<int>(gid_));
+    }
+}
+
+}  // namespace VELA

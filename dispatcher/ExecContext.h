@@ -1,0 +1,48 @@
+// The identity under which one handler runs: chosen from the API's and the
+// method's "runAs", "grantable", "grantByDefault" and "grantByUser", and put
+// back after the handler.
+#pragma once
+
+#include <string>
+#include <sys/types.h>
+#include <vector>
+
+namespace VELA {
+
+// What a call asks for, as read from its description and its request.
+struct ExecIdentity {
+    std::string runAs = "system";  // the API's "runAs", replaced by the method's
+    std::string loginName;         // the session's user, may be empty
+    bool grantable = false;
+    bool grantByDefault = false;
+    bool grantByUser = false;
+};
+
+// One handler call's identity switch. SaveIds() before Prepare(); Restore()
+// after the handler (the destructor restores too if nobody did).
+class ExecContext {
+public:
+    ExecContext() = default;
+    ~ExecContext();
+    ExecContext(const ExecContext&) = delete;
+    ExecContext& operator=(const ExecContext&) = delete;
+
+    // Records the real, effective and saved user and group ids and the
+    // supplementary groups. False when they cannot be read.
+    bool SaveIds();
+    // Switches to the identity `want` asks for. False (logged) ends the call
+    // before the handler runs; the response keeps its preset error.
+    bool Prepare(const ExecIdentity& want);
+    // Puts the recorded identity back when the switch asked for it
+    // (grantable, or grantByDefault). Failures are only logged.
+    void Restore();
+
+private:
+    uid_t ruid_ = 0, euid_ = 0, suid_ = 0;
+    gid_t rgid_ = 0, egid_ = 0, sgid_ = 0;
+    std::vector<gid_t> groups_;
+    bool saved_ = false;
+    bool restore_ = false;
+};
+
+}  // namespace VELA

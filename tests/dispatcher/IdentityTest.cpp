@@ -1,0 +1,287 @@
+// The identity a handler runs with ("runAs", "grantable", "grantByUser",
+// "grantByDefault") and its restoration, the root guard and SetVelaInfo, on
+// a real unprivileged account. Every case runs in a forked child so the
+// test process keeps root. Needs root: skipped otherwise.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <functional>
+#include <regex>
+#include <string>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <vector>
+
+#include "dispatcher/PipeFixture.h"
+#include "platform/IdentityTestUtil.h"
+#include "vela/log.h"
+#include "vela/sysfile.h"
+#include "vela/user.h"
+#include "webapi/APIError.h"
+#include "webapi/APIRunner.h"
+#include "webapi/APIUtils.h"
+#include "webapi/JsonUtil.h"
+
+namespace {
+
+using VELA::APIRunner;
+using VELA::Test::InChild;
+
+// {"uid": [r, e, s], "gid": [r, e, s], "groups": [...]}, as the test
+// handler reports them.
+Json::Value Ids()
+{
+    uid_t r, e, s;
+    gid_t rg, eg, sg;
+    getresuid(&r, &e, &s);
+    getresgid(&rg, &eg, &sg);
+    Json::Value ids(Json::objectValue);
+    for (uid_t id : {r, e, s}) {
+        ids["uid"].append(static_cast<Json::Int>(id));
+    }
+    for (gid_t id : {rg, eg, sg}) {
+        ids["gid"].append(static_cast<Json::Int>(id));
+    }
+    std::vector<gid_t> groups(static_cast<size_t>(getgroups(0, nullptr)));
+    groups.resize(static_cast<size_t>(getgroups(static_cast<int>(groups.size()), groups.data())));
+    std::sort(groups.begin(), groups.end());
+    ids["groups"] = Json::Value(Json::arrayValue);
+    for (gid_t g : groups) {
+        ids["groups"].append(static_cast<Json::Int>(g));
+    }
+    return ids;
+}
+
+// Ids as parsed from a report: JSON integers.
+Json::Value Triple(unsigned r, unsigned e, unsigned s)
+{
+    Json::Value v(Json::arrayValue);
+    for (unsigned id : {r, e, s}) {
+        v.append(static_cast<Json::Int>(id));
+    }
+    return v;
+}
+
+bool HasGroup(const Json::Value& ids, unsigned gid)
+{
+    return VELA::JsonSearchArrayIndex(ids["groups"], Json::Value(static_cast<Json::Int>(gid))) >= 0;
+}
+
+// True when `log` ("<priority>|<line>" per line) holds a line of `priority`
+// matching `pattern`.
+bool Logged(const std::string& log, int priority, const std::string& pattern)
+{
+    return std::regex_search(log, std::regex(std::to_string(priority) + "\\|" + pattern));
+}
+
+void Collect(int priority, const char* line, void* arg)
+{
+    *static_cast<std::string*>(arg) += std::to_string(priority) + "|" + line + "\n";
+}
+
+const int kAuthInfo = LOG_AUTHPRIV | LOG_INFO;
+const int kAuthErr = LOG_AUTHPRIV | LOG_ERR;
+
+class Identity : public PipeFixture {
+protected:
+    void SetUp() override
+    {
+        if (geteuid() != 0) {
+            GTEST_SKIP() << "identity switches need root";
+        }
+        PipeFixture::SetUp();
+        ASSERT_TRUE(account_.Create()) << "useradd/groupadd failed";
+        created_ = true;
+        // The account reads the descriptions in some cases.
+        ASSERT_EQ(0, chmod(root_.Path().c_str(), 0755));
+        Json::Value desc = Descriptions();
+        desc["VELA.Pipe.Ids"] = J(R"({"lib": ")" + Lib("pipe_handlers") + R"(", "minVersion": 1,
+            "maxVersion": 1, "runAs": "system", "methods": {"1": [
+                {"grantable": {"runAs": ")" + account_.user + R"(", "grantable": true}},
+                {"dropped": {"runAs": ")" + account_.user + R"("}},
+                {"byUser": {"grantByUser": true, "grantable": true}},
+                {"byDefault": {"grantByDefault": true}},
+                {"unknownUser": {"runAs": "vela-no-such-user-x", "grantable": true}}]}})");
+        WriteJson("VELA.Pipe.lib", desc);
+        rootIds_ = Ids();
+    }
+    void TearDown() override
+    {
+        if (created_) {
+            account_.Remove();
+        }
+        if (geteuid() == 0) {
+            PipeFixture::TearDown();
+        }
+    }
+
+    // Runs `request` in a forked child after `before`; reports Run's
+    // result, the answer, the ids afterwards and the log lines.
+    Json::Value RunInChild(const Json::Value& request, const std::function<void()>& before = nullptr)
+    {
+        const std::string text = InChild([&] {
+            std::string log;
+            VelaLogSetSink(Collect, &log);
+            if (before) {
+                before();
+            }
+            Json::Value report(Json::objectValue);
+            {
+                APIRunner runner;
+                report["result"] = runner.Run(request);
+                report["answer"] = runner.GetResponse();
+            }
+            report["after"] = Ids();
+            VelaLogSetSink(nullptr, nullptr);
+            report["log"] = log;
+            return VELA::JsonToString(report);
+        });
+        Json::Value report;
+        EXPECT_TRUE(VELA::JsonParse(text, report)) << text;
+        return report;
+    }
+
+    Json::Value IdsCall(const std::string& method, const Json::Value& session = Json::Value())
+    {
+        Json::Value request = Call("VELA.Pipe.Ids", 1, method);
+        if (!session.isNull()) {
+            request["session"] = session;
+        }
+        return request;
+    }
+
+    VELA::Test::TestAccount account_;
+    bool created_ = false;
+    Json::Value rootIds_;
+};
+
+TEST_F(Identity, GrantableSwitchComesBackToRoot)
+{
+    const unsigned u = account_.uid, g = account_.gid;
+    for (const char* method : {"grantable", "byUser"}) {
+        const Json::Value report = RunInChild(IdsCall(method, J(R"({"username": ")" + account_.user + R"("})")));
+        const Json::Value& seen = report["answer"]["data"];
+        EXPECT_EQ(Triple(u, u, 0), seen["uid"]) << method;
+        EXPECT_EQ(Triple(g, g, g), seen["gid"]) << method;
+        EXPECT_TRUE(HasGroup(seen, account_.suppGid)) << method;
+        EXPECT_EQ(rootIds_, report["after"]) << method;
+        EXPECT_TRUE(Logged(report["log"].asString(), kAuthInfo, "APIRunner:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n"))
+            << report["log"].asString();
+    }
+}
+
+TEST_F(Identity, NotGrantableStaysTheUser)
+{
+    const unsigned u = account_.uid, g = account_.gid;
+    const Json::Value report = RunInChild(IdsCall("dropped"));
+    EXPECT_EQ(Triple(u, u, u), report["answer"]["data"]["uid"]);
+    EXPECT_EQ(Triple(u, u, u), report["after"]["uid"]);
+    EXPECT_EQ(Triple(g, g, g), report["after"]["gid"]);
+
+    // A process that already is the user and cannot regain root still runs
+    // the handler.
+    const Json::Value again = RunInChild(IdsCall("dropped"), [this] {
+        ResetCredentialsByName(account_.user.c_str(), false);
+    });
+    EXPECT_EQ(Json::Value(true), again["result"]);
+    EXPECT_EQ(Triple(u, u, u), again["answer"]["data"]["uid"]);
+    EXPECT_TRUE(Logged(again["log"].asString(), kAuthErr, "APIRunner:\\d+ ERROR: setresuid\\(-1, 0, -1\\) \\[.+\\]\n"))
+        << again["log"].asString();
+}
+
+// Refused switches end the call before the handler, with the preset 117.
+TEST_F(Identity, RefusedSwitchSkipsTheHandler)
+{
+    const struct {
+        const char* method;
+        const char* line;
+    } cases[] = {
+        {"byUser", "APIRunner:\\d+ grantByUser: failed to get login username\\.\n"},
+        {"unknownUser", "APIRunner:\\d+ grantable failed\\. \\[.*\\]\n"},
+    };
+    for (const auto& c : cases) {
+        const Json::Value report = RunInChild(IdsCall(c.method));
+        EXPECT_EQ(Json::Value(false), report["result"]) << c.method;
+        EXPECT_EQ(Json::Value(WEBAPI_ERR_NO_RESPONSE), report["answer"]["error"]["code"]) << c.method;
+        EXPECT_FALSE(report["answer"].isMember("data")) << c.method;
+        EXPECT_TRUE(Logged(report["log"].asString(), LOG_ERR, c.line)) << report["log"].asString();
+        EXPECT_EQ(rootIds_, report["after"]) << c.method;
+    }
+}
+
+// grantByDefault gives the handler full rights and puts the caller's ids
+// back afterwards.
+TEST_F(Identity, GrantByDefaultRunsAsRoot)
+{
+    const unsigned u = account_.uid, g = account_.gid;
+    const Json::Value report = RunInChild(IdsCall("byDefault"), [&] {
+        EXPECT_EQ(0, setresgid(0, g, 0));
+        EXPECT_EQ(0, setresuid(0, u, 0));
+    });
+    EXPECT_EQ(Triple(0, 0, 0), report["answer"]["data"]["uid"]);
+    EXPECT_EQ(Triple(0, 0, 0), report["answer"]["data"]["gid"]);
+    EXPECT_EQ(Triple(0, u, 0), report["after"]["uid"]);
+    EXPECT_EQ(Triple(0, g, 0), report["after"]["gid"]);
+    const std::string log = report["log"].asString();
+    EXPECT_TRUE(Logged(log, kAuthInfo, "APIRunner:\\d+ WARNING: setresgid\\(-1, 0, -1\\)\n")) << log;
+    EXPECT_TRUE(Logged(log, kAuthInfo, "APIRunner:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n")) << log;
+}
+
+TEST_F(Identity, RootGuardAndSetVelaInfo)
+{
+    ASSERT_EQ(0, system(("mkdir -p '" + root_.Path() + "/etc'").c_str()));
+    const unsigned u = account_.uid, g = account_.gid;
+    const std::string checks = InChild([&] {
+        std::string errors;
+        std::string log;
+        VelaLogSetSink(Collect, &log);
+        // As root the guard changes nothing and logs nothing.
+        {
+            const Json::Value before = Ids();
+            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
+            if (!guard.Ok() || Ids() != before) {
+                errors += "guard as root changed the ids; ";
+            }
+        }
+        if (!log.empty()) {
+            errors += "guard as root logged: " + log;
+        }
+        // From the user's effective ids with a saved uid 0: root inside,
+        // the user again afterwards.
+        setresgid(g, g, g);
+        setresuid(u, u, 0);
+        {
+            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
+            if (!guard.Ok() || geteuid() != 0 || getegid() != 0) {
+                errors += "guard did not gain root; ";
+            }
+        }
+        if (geteuid() != u || getegid() != g) {
+            errors += "guard did not restore the user; ";
+        }
+        if (!VELA::APIUtils::SetVelaInfo("pipe_test_key", "written") || geteuid() != u) {
+            errors += "SetVelaInfo as the user failed; ";
+        }
+        // No way back to root: the guarded statements must be skipped.
+        setresuid(u, u, u);
+        log.clear();
+        {
+            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
+            if (guard.Ok()) {
+                errors += "guard claims root without a way back; ";
+            }
+        }
+        if (!Logged(log, kAuthErr, "IdentityTest:\\d+ ERROR: IF_RUN_AS\\(0, 0\\)\n")) {
+            errors += "no guard error line: " + log;
+        }
+        if (VELA::APIUtils::SetVelaInfo("pipe_test_key", "refused")) {
+            errors += "SetVelaInfo succeeded without rights; ";
+        }
+        VelaLogSetSink(nullptr, nullptr);
+        return errors;
+    });
+    EXPECT_EQ("", checks);
+    EXPECT_EQ(1, VLIBCFileCheckKeyValue((root_.Path() + "/etc/velainfo.conf").c_str(), "pipe_test_key", "written", 0));
+}
+
+}  // namespace

@@ -1,0 +1,109 @@
+// Fixture of the pipeline, counter and identity tests: a fresh system root
+// whose web-API directory holds lib.def and the descriptions of the test
+// handler libraries (tests/dispatcher/libs/pipe_*.cpp), with the working
+// directory there for the test's duration.
+#pragma once
+
+#include <climits>
+#include <cstdlib>
+#include <fstream>
+#include <gtest/gtest.h>
+#include <json/json.h>
+#include <pwd.h>
+#include <string>
+#include <unistd.h>
+
+#include "platform/StateRootTest.h"
+#include "support/JsonLiteral.h"
+#include "vela/webapiutil.h"
+
+class PipeFixture : public StateRootTest {
+protected:
+    void SetUp() override
+    {
+        StateRootTest::SetUp();
+        char buf[PATH_MAX];
+        ASSERT_NE(nullptr, getcwd(buf, sizeof(buf)));
+        oldCwd_ = buf;
+        webapiDir_ = root_.Path() + "/usr/vela/velaman/webapi";
+        ASSERT_EQ(0, system(("mkdir -p '" + webapiDir_ + "'").c_str()));
+        ASSERT_EQ(0, chdir(webapiDir_.c_str()));
+        WriteJson("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0,
+                                   "methods": {"allowDemo": false}})"));
+        WriteJson("VELA.Pipe.lib", Descriptions());
+        WriteJson("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": ")" + Lib("pipe_handlers") + R"(",
+            "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(",
+            "methods": {"1": ["request", "other"]}}})"));
+    }
+    void TearDown() override
+    {
+        if (!oldCwd_.empty()) {
+            EXPECT_EQ(0, chdir(oldCwd_.c_str()));
+        }
+        StateRootTest::TearDown();
+    }
+
+    // Path of a test handler library lib<name>.so.
+    static std::string Lib(const std::string& name)
+    {
+        const char* dir = getenv("VELA_TEST_BINARY_DIR");
+        return std::string(dir ? dir : ".") + "/tests/dispatcher/libs/lib" + name + ".so";
+    }
+
+    // The user the handlers run as: the test's own, so the switch needs no
+    // rights the test lacks.
+    static std::string RunAs()
+    {
+        const struct passwd* pw = getpwuid(geteuid());
+        return pw ? pw->pw_name : "system";
+    }
+
+    void WriteJson(const std::string& name, const Json::Value& value)
+    {
+        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + name, value, 0644)) << name;
+    }
+
+    // A request JSON for one call.
+    static Json::Value Call(const std::string& api, int version, const std::string& method,
+                            const Json::Value& params = Json::Value(Json::objectValue))
+    {
+        Json::Value request(Json::objectValue);
+        request["getParam"] = params;
+        request["getParam"]["api"] = api;
+        request["getParam"]["version"] = version;
+        request["getParam"]["method"] = method;
+        return request;
+    }
+
+    // The descriptions of VELA.Pipe.lib; tests add to them and write again.
+    Json::Value Descriptions() const
+    {
+        const std::string handlers = Lib("pipe_handlers");
+        const std::string runAs = RunAs();
+        return J(R"({
+            "VELA.Pipe.Test": {"lib": ")" + handlers + R"(", "minVersion": 1, "maxVersion": 2,
+                "runAs": ")" + runAs + R"(",
+                "methods": {
+                    "1": ["silent", "echo", "print", "chdir", "throws", "callback", "v1only",
+                          {"printKept": {"allowDownload": true, "allowUpload": true}},
+                          {"upload": {"allowUpload": true}},
+                          {"timeout": {"allowTimeout": true}}],
+                    "2": ["v1only"]}},
+            "VELA.Pipe.Uncounted": {"lib": ")" + handlers + R"(", "minVersion": 1, "maxVersion": 1,
+                "runAs": ")" + runAs + R"(", "count": false, "methods": {"1": ["get"]}},
+            "VELA.Pipe.Nice": {"lib": ")" + handlers + R"(", "minVersion": 1, "maxVersion": 1,
+                "runAs": ")" + runAs + R"(", "priority": 5, "methods": {"1": ["fail"]}},
+            "VELA.Pipe.Checked": {"lib": ")" + Lib("pipe_checked") + R"(", "minVersion": 1, "maxVersion": 1,
+                "runAs": ")" + runAs + R"(", "methods": {"1": ["open", "guarded", "unlisted"]}},
+            "VELA.Pipe.NoLib": {"lib": ")" + Lib("pipe_missing") + R"(", "minVersion": 1, "maxVersion": 1,
+                "methods": {"1": ["get"]}},
+            "VELA.Pipe.NoTable": {"lib": ")" + Lib("pipe_notable") + R"(", "minVersion": 1, "maxVersion": 1,
+                "methods": {"1": ["get"]}},
+            "VELA.Pipe.NullTable": {"lib": ")" + Lib("pipe_nulltable") + R"(", "minVersion": 1,
+                "maxVersion": 1, "methods": {"1": ["get"]}}
+        })");
+    }
+
+    std::string oldCwd_;
+    std::string webapiDir_;
+};

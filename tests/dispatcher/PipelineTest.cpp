@@ -1,0 +1,289 @@
+// The runner pipeline end to end: request JSON in, response out, through the
+// real description files and handler libraries of PipeFixture.
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <climits>
+#include <cstring>
+#include <iostream>
+#include <memory>
+#include <sstream>
+#include <string>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "dispatcher/PipeFixture.h"
+#include "support/TestSupport.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webapi/APIRunner.h"
+
+namespace {
+
+using VELA::APIRequest;
+using VELA::APIResponse;
+using VELA::APIRunner;
+
+class Pipeline : public PipeFixture {
+protected:
+    // Runs `request` in a fresh runner; the answer and Run's result.
+    Json::Value RunOnce(const Json::Value& request, bool* result = nullptr, int* code = nullptr)
+    {
+        APIRunner runner;
+        const bool ok = runner.Run(request);
+        if (result) {
+            *result = ok;
+        }
+        if (code) {
+            *code = runner.GetResponseObject()->GetError();
+        }
+        return runner.GetResponse();
+    }
+};
+
+// A runner whose permission and upload hooks the test sets.
+class HookRunner : public APIRunner {
+public:
+    bool skip = false;
+    bool uploadOk = true;
+    int permissionChecks = 0;
+    int uploads = 0;
+
+    bool NeedPermission(APIRequest*) override { return true; }
+    bool CheckPermission(APIRequest*, APIResponse* resp) override
+    {
+        ++permissionChecks;
+        resp->SetError(WEBAPI_ERR_NO_PERMISSION);
+        return false;
+    }
+    bool SkipPermission(APIRequest*) override { return skip; }
+    bool HandleUpload(APIRequest*, APIResponse* resp) override
+    {
+        ++uploads;
+        if (!uploadOk) {
+            resp->SetError(WEBAPI_ERR_UPLOAD_FAILED);
+        }
+        return uploadOk;
+    }
+};
+
+std::string Cwd()
+{
+    char buf[PATH_MAX];
+    return getcwd(buf, sizeof(buf)) ? buf : "";
+}
+
+TEST_F(Pipeline, EachRefusalSetsItsCode)
+{
+    Json::Value relay = Call("VELA.Pipe.Test", 1, "echo");
+    relay["getParam"]["relay_ds"] = "other";
+    Json::Value noName(Json::objectValue);
+    noName["getParam"]["version"] = 1;
+    noName["getParam"]["method"] = "get";
+
+    const struct {
+        const char* what;
+        Json::Value request;
+        int code;
+    } cases[] = {
+        {"null request", Json::Value(), WEBAPI_ERR_BAD_REQUEST},
+        {"empty request", Json::Value(Json::objectValue), WEBAPI_ERR_BAD_REQUEST},
+        {"no API name", noName, WEBAPI_ERR_BAD_REQUEST},
+        {"relay_ds given to Run", relay, WEBAPI_ERR_BAD_REQUEST},
+        {"entry API without compound", Call("VELA.Entry.Request", 1, "request"), WEBAPI_ERR_COMPOUND_OR_FORK},
+        {"library missing", Call("VELA.Pipe.NoLib", 1, "get"), WEBAPI_ERR_LOAD_LIBRARY},
+        {"no GetAPITable", Call("VELA.Pipe.NoTable", 1, "get"), WEBAPI_ERR_LOAD_LIBRARY},
+        {"GetAPITable gives null", Call("VELA.Pipe.NullTable", 1, "get"), WEBAPI_ERR_LOAD_LIBRARY},
+        {"entry only for another version", Call("VELA.Pipe.Test", 2, "v1only"), WEBAPI_ERR_METHOD_NOT_IN_TABLE},
+    };
+    for (const auto& c : cases) {
+        bool ok = true;
+        int code = 0;
+        const Json::Value answer = RunOnce(c.request, &ok, &code);
+        EXPECT_FALSE(ok) << c.what;
+        EXPECT_EQ(c.code, code) << c.what;
+        EXPECT_EQ(Json::Value(false), answer["success"]) << c.what;
+        EXPECT_EQ(Json::Value(false), answer["httpd_restart"]) << c.what;
+    }
+
+    // "relay_ds" that reaches Process (as a compound sub-request would).
+    APIRunner runner;
+    APIRequest req(relay);
+    APIResponse resp(&req);
+    EXPECT_FALSE(runner.Process(&req, &resp));
+    EXPECT_EQ(WEBAPI_ERR_RELAY_FAILED, resp.GetError());
+
+    // The entry API with another method: refused without an error code.
+    bool ok = true;
+    int code = -1;
+    const Json::Value answer = RunOnce(Call("VELA.Entry.Request", 1, "other"), &ok, &code);
+    EXPECT_FALSE(ok);
+    EXPECT_EQ(0, code);
+    EXPECT_FALSE(answer.isMember("success")) << answer;
+}
+
+// A handler that answers nothing, or throws, leaves the preset 117; one that
+// answers is heard.
+TEST_F(Pipeline, HandlerAnswerOrPreset)
+{
+    bool ok = false;
+    int code = 0;
+    RunOnce(Call("VELA.Pipe.Test", 1, "silent"), &ok, &code);
+    EXPECT_TRUE(ok);
+    EXPECT_EQ(WEBAPI_ERR_NO_RESPONSE, code);
+
+    VELA::Test::LogCapture log;
+    RunOnce(Call("VELA.Pipe.Test", 1, "throws"), &ok, &code);
+    EXPECT_EQ(WEBAPI_ERR_NO_RESPONSE, code);
+    EXPECT_TRUE(log.Contains("handler gave up"));
+
+    const Json::Value answer = RunOnce(Call("VELA.Pipe.Test", 1, "echo"), &ok, &code);
+    EXPECT_TRUE(ok);
+    EXPECT_EQ(0, code);
+    EXPECT_EQ(J(R"({"success": true, "httpd_restart": false,
+                    "data": {"api": "VELA.Pipe.Test", "method": "echo", "cwd": ")" + webapiDir_ + R"(",
+                             "user": ""}})"),
+              answer);
+}
+
+// The named check refuses; the terminating entry's check vets the calls
+// that no entry names, and may let them through.
+TEST_F(Pipeline, CheckTableSelection)
+{
+    int code = 0;
+    Json::Value answer = RunOnce(Call("VELA.Pipe.Checked", 1, "guarded"), nullptr, &code);
+    EXPECT_EQ(WEBAPI_ERR_NO_PERMISSION, code);
+    EXPECT_EQ(Json::Value("guarded"), answer["error"]["errors"]);
+
+    answer = RunOnce(Call("VELA.Pipe.Checked", 1, "open", J(R"({"deny": true})")), nullptr, &code);
+    EXPECT_EQ(499, code);
+
+    APIRunner runner;
+    EXPECT_TRUE(runner.Run(Call("VELA.Pipe.Checked", 1, "open")));
+    EXPECT_EQ(Json::Value("handled"), runner.GetResponse()["data"]);
+    EXPECT_EQ("catch-all", runner.GetResponseObject()->GetHeader("X-Checked"));
+
+    // Listed in the description, missing from the library's table.
+    RunOnce(Call("VELA.Pipe.Checked", 1, "unlisted"), nullptr, &code);
+    EXPECT_EQ(WEBAPI_ERR_METHOD_NOT_IN_TABLE, code);
+}
+
+TEST_F(Pipeline, PermissionAndUploadHooks)
+{
+    {
+        HookRunner runner;
+        EXPECT_FALSE(runner.Run(Call("VELA.Pipe.Test", 1, "echo")));
+        EXPECT_EQ(1, runner.permissionChecks);
+        EXPECT_EQ(WEBAPI_ERR_NO_PERMISSION, runner.GetResponseObject()->GetError());
+    }
+    {
+        HookRunner runner;
+        runner.skip = true;
+        EXPECT_TRUE(runner.Run(Call("VELA.Pipe.Test", 1, "echo")));
+        EXPECT_EQ(1, runner.permissionChecks);
+        EXPECT_EQ(Json::Value(true), runner.GetResponse()["success"]);
+    }
+    Json::Value upload = Call("VELA.Pipe.Test", 1, "upload");
+    upload["environ"]["CONTENT_TYPE"] = "multipart/form-data; boundary=x";
+    for (bool uploadOk : {false, true}) {
+        HookRunner runner;
+        runner.skip = true;
+        runner.uploadOk = uploadOk;
+        EXPECT_EQ(uploadOk, runner.Run(upload));
+        EXPECT_EQ(1, runner.uploads);
+        EXPECT_EQ(uploadOk ? 0 : WEBAPI_ERR_UPLOAD_FAILED, runner.GetResponseObject()->GetError());
+    }
+}
+
+// Priority, standard streams and working directory come back after the
+// call, whatever the handler did.
+TEST_F(Pipeline, CallLeavesNoTrace)
+{
+    errno = 0;
+    const int nice = getpriority(PRIO_PROCESS, 0);
+    ASSERT_EQ(0, errno);
+    if (nice == 5) {
+        GTEST_SKIP() << "the test already runs at the description's priority";
+    }
+    int code = 0;
+    Json::Value answer = RunOnce(Call("VELA.Pipe.Nice", 1, "fail"), nullptr, &code);
+    EXPECT_EQ(555, code);
+    EXPECT_EQ(Json::Value(5), answer["error"]["errors"]["nice"]);
+    EXPECT_EQ(nice, getpriority(PRIO_PROCESS, 0));
+
+    std::stringstream out;
+    std::stringstream in;
+    std::streambuf* oldOut = std::cout.rdbuf(out.rdbuf());
+    std::streambuf* oldIn = std::cin.rdbuf(in.rdbuf());
+    in.str("typed\ntyped again\n");
+    const Json::Value discarded = RunOnce(Call("VELA.Pipe.Test", 1, "print"));
+    const std::string afterDiscarded = out.str();
+    const Json::Value kept = RunOnce(Call("VELA.Pipe.Test", 1, "printKept"));
+    const bool cinRestored = std::cin.rdbuf() == in.rdbuf() && std::cout.rdbuf() == out.rdbuf();
+    std::cout.rdbuf(oldOut);
+    std::cin.rdbuf(oldIn);
+    EXPECT_TRUE(cinRestored);
+    EXPECT_EQ("", afterDiscarded);
+    EXPECT_EQ(Json::Value(""), discarded["data"]["stdin"]);
+    EXPECT_EQ("handler output\n", out.str());
+    EXPECT_EQ(Json::Value("typed"), kept["data"]["stdin"]);
+
+    answer = RunOnce(Call("VELA.Pipe.Test", 1, "chdir"));
+    EXPECT_EQ(Json::Value("/"), answer["data"]["cwd"]);
+    EXPECT_EQ(webapiDir_, Cwd());
+}
+
+TEST_F(Pipeline, CallbacksRunInAChildAfterTheReply)
+{
+    const std::string file = root_.Path() + "/callback.pid";
+    APIRunner runner;
+    ASSERT_TRUE(runner.Run(Call("VELA.Pipe.Test", 1, "callback", J(R"({"file": ")" + file + R"("})"))));
+    ASSERT_EQ(1u, runner.GetResponseObject()->GetCallbackFuncs().size());
+    runner.HandleCallback(runner.GetResponseObject());
+    std::string pid;
+    for (int i = 0; i < 600 && pid.empty(); ++i) {  // up to a minute on a slow machine
+        usleep(100 * 1000);
+        pid = VELA::Test::ReadText(file);
+    }
+    ASSERT_FALSE(pid.empty()) << "callback did not run";
+    const pid_t child = static_cast<pid_t>(std::stol(pid));
+    EXPECT_NE(getpid(), child);
+    int status = 0;
+    EXPECT_EQ(child, waitpid(child, &status, 0));
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+
+    // No callbacks: no child.
+    APIResponse empty(nullptr);
+    runner.HandleCallback(&empty);
+    EXPECT_EQ(-1, waitpid(-1, &status, WNOHANG));
+    EXPECT_EQ(ECHILD, errno);
+}
+
+TEST_F(Pipeline, ProcessNameFollowsTheCall)
+{
+    const std::string comm = VELA::Test::ReadText("/proc/self/comm");
+    char area[96];
+    memset(area, 'x', sizeof(area) - 1);
+    area[sizeof(area) - 1] = '\0';
+    char* argv[] = {area, nullptr};
+    const std::string prefix = program_invocation_short_name;
+    {
+        APIRunner runner;
+        runner.SetArgs(1, argv);
+        EXPECT_STREQ("velascgi", area);
+        EXPECT_EQ(std::string(sizeof(area) - 1 - 8, '\0'), std::string(area + 8, sizeof(area) - 1 - 8));
+
+        ASSERT_TRUE(runner.Run(Call("VELA.Pipe.Test", 1, "echo")));
+        EXPECT_EQ(prefix + "_VELA.Pipe.Test_1_echo", std::string(area));
+        EXPECT_EQ("VELA.Pipe.Test_\n", VELA::Test::ReadText("/proc/self/comm"));
+
+        // Control bytes of a client's API name never reach ps or syslog.
+        runner.Run(Call("VELA.Pipe\nX", 1, "echo"));
+        EXPECT_EQ(prefix + "_VELA.Pipe?X_1_echo", std::string(area));
+    }
+    EXPECT_EQ(prefix.substr(0, sizeof(area) - 1), std::string(area));
+    EXPECT_EQ(comm, VELA::Test::ReadText("/proc/self/comm"));
+}
+
+}  // namespace

@@ -1,0 +1,224 @@
+#!/usr/bin/env bash
+# End-to-end through the real web server: a private lighttpd, configured from
+# deploy/lighttpd.conf.in, runs velascgi on a free port of 127.0.0.1 under a
+# temporary system root that serves the staged web-API directory; curl then
+# calls the sample API the way a browser or a client program would.
+#
+# usage: e2e.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR
+# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without lighttpd
+# or curl, or when not run as root (velascgi switches identity per API, which
+# only root can do).
+set -u
+
+[ $# -eq 4 ] || { echo "usage: e2e.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR" >&2; exit 2; }
+VELASCGI=$(realpath -e "$1") || exit 1
+VELAADM=$(realpath -e "$2") || exit 1
+WEBAPI=$(realpath -e "$3") || exit 1
+SRC=$(realpath -e "$4") || exit 1
+
+for tool in lighttpd curl cksum cmp; do
+  if ! command -v "$tool" >/dev/null 2>&1; then
+    echo "SKIP: $tool is not installed"
+    exit 77
+  fi
+done
+if [ "$(id -u)" -ne 0 ]; then
+  echo "SKIP: needs root (velascgi switches to the identity each API asks for)"
+  exit 77
+fi
+
+TMP=$(mktemp -d "${TMPDIR:-/tmp}/vela-e2e-XXXXXX") || exit 1
+ROOT=$TMP/root
+RUN=$TMP/run
+PIDFILE=$RUN/lighttpd.pid
+failures=0
+
+# lighttpd runs in the foreground as a child of this script (-D), so that
+# whoever ends the script's process tree ends the server as well.
+LPID=""
+stop_server() {
+  if [ -n "$LPID" ]; then
+    kill -TERM "$LPID" 2>/dev/null
+    wait "$LPID" 2>/dev/null
+    LPID=""
+  fi
+}
+cleanup() {
+  stop_server
+  if [ "$failures" -ne 0 ]; then
+    for log in error.log cgi.log; do
+      if [ -f "$RUN/$log" ]; then
+        echo "---- $log"
+        tail -n 100 "$RUN/$log"
+      fi
+    done
+  fi
+  rm -rf "$TMP"
+}
+trap cleanup EXIT
+trap 'exit 1' HUP INT TERM
+
+fail() {
+  echo "FAIL: $*"
+  failures=$((failures + 1))
+}
+
+# ---- The system root: the staged web-API directory, one data volume.
+mkdir -p "$ROOT/usr/vela/velaman" "$ROOT/etc/vela" "$ROOT/vol1/sample" "$RUN/www"
+ln -s "$WEBAPI" "$ROOT/usr/vela/velaman/webapi"
+echo /vol1 >"$ROOT/etc/vela/volumes.conf"
+
+# ---- A private lighttpd on a free port (another program may take a port
+# between the look and the bind: then try another one).
+conf_args=(--out "$RUN/lighttpd.conf" --run "$RUN" --pidfile "$PIDFILE" --docroot "$RUN/www"
+           --velascgi "$VELASCGI" --env "VELA_ROOT=$ROOT" --env "VELA_LOG_STDERR=1"
+           --env "PATH=/usr/sbin:/usr/bin:/sbin:/bin" --xsendfile-dir "$ROOT/vol1")
+# Sanitizer builds: the options reach velascgi too.
+for var in ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS; do
+  if [ -n "${!var:-}" ]; then
+    conf_args+=(--env "$var=${!var}")
+  fi
+done
+URL=""
+for _ in $(seq 1 20); do
+  port=$((20000 + RANDOM % 40000))
+  if (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null; then
+    continue
+  fi
+  "$SRC/scripts/lighttpd-conf.sh" "${conf_args[@]}" --port "$port" || exit 1
+  lighttpd -D -f "$RUN/lighttpd.conf" 2>>"$RUN/start.log" &
+  LPID=$!
+  # Up when it answers; gone (the port was taken meanwhile) when it exits.
+  for _ in $(seq 1 200); do
+    if ! kill -0 "$LPID" 2>/dev/null; then
+      wait "$LPID" 2>/dev/null
+      LPID=""
+      break
+    fi
+    if curl -s -o /dev/null --max-time 5 "http://127.0.0.1:$port/webapi/entry.cgi"; then
+      URL="http://127.0.0.1:$port/webapi/entry.cgi"
+      break
+    fi
+    sleep 0.1
+  done
+  [ -n "$URL" ] && break
+  stop_server
+done
+if [ -z "$URL" ]; then
+  cat "$RUN/start.log" "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null
+  echo "FAIL: lighttpd did not start"
+  exit 1
+fi
+
+# ---- Helpers. Every call leaves the answer in $TMP/body, the header block in
+# $TMP/headers and the HTTP status in $status.
+status=""
+call() {
+  status=$(curl -s --max-time 60 -D "$TMP/headers" -o "$TMP/body" -w '%{http_code}' "$@") || status="curl failed"
+}
+# expect NAME TEXT...: the JSON answer holds every TEXT (compact JSON).
+expect() {
+  local name=$1 text
+  shift
+  for text in "$@"; do
+    grep -qF -- "$text" "$TMP/body" || fail "$name: answer lacks $text: $(head -c 600 "$TMP/body")"
+  done
+}
+expect_header() {
+  grep -qi -- "^$2" "$TMP/headers" || fail "$1: no header \"$2\" in: $(tr -d '\r' <"$TMP/headers")"
+}
+expect_status() {
+  [ "$status" = "$2" ] || fail "$1: HTTP status $status, expected $2"
+}
+
+sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
+[ -n "$sid" ] || fail "velaadm created no session"
+COOKIE="id=$sid"
+
+# ---- The sample's echo, by GET and by POST.
+call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=echo&text=hi%20there&n=5"
+expect_status "GET echo" 200
+expect "GET echo" '"success":true' '"text":"hi there"' '"n":"5"' '"method":"echo"'
+expect_header "GET echo" 'Content-type: application/json'
+expect_header "GET echo" 'X-Content-Type-Options: nosniff'
+expect_header "GET echo" 'Cache-Control: max-age=0, no-cache, no-store, must-revalidate'
+
+call --cookie "$COOKIE" --data 'api=VELA.Sample&version=1&method=echo&word=caf%C3%A9&a=1&a=2' "$URL"
+expect_status "POST echo" 200
+expect "POST echo" '"success":true' '"word":"café"' '"a":"2"'
+
+# ---- A method that needs a login: without the session, with it as cookie,
+# and with it as the parameter "_sid".
+nobody_uid=$(id -u nobody)
+call "$URL?api=VELA.Sample&version=1&method=whoami"
+expect "whoami without session" '"success":false' '"code":119'
+expect_header "whoami without session" 'x-request-error: unauth'
+call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=whoami"
+expect "whoami with session" '"success":true' "\"uid\":[$nobody_uid,$nobody_uid,$nobody_uid]"
+call --cookie "id=not-a-session" "$URL?api=VELA.Sample&version=1&method=whoami&_sid=$sid"
+expect "whoami with _sid" '"success":true' "\"uid\":[$nobody_uid,"
+
+# ---- Upload: two fields and two files to a method with "allowUpload".
+head -c 1048576 /dev/urandom >"$TMP/one.bin"
+printf 'second file\r\nwith two lines\n' >"$TMP/two.txt"
+call --cookie "$COOKIE" -F "title=Holiday 2024" -F "note=x&y=z" \
+  -F "file1=@$TMP/one.bin" -F "file2=@$TMP/two.txt;filename=notes.txt" \
+  "$URL?api=VELA.Sample&version=1&method=upload"
+expect_status "upload" 200
+expect "upload" '"success":true' '"fields":{"note":"x&y=z","title":"Holiday 2024"}'
+# expect_file FIELD NAME PATH: the answer describes that stored file.
+expect_file() {
+  local sum size
+  read -r sum size _ < <(cksum <"$3")
+  expect "upload $1" "{\"cksum\":$sum,\"field\":\"$1\",\"name\":\"$2\",\"size\":$size}"
+}
+expect_file file1 one.bin "$TMP/one.bin"
+expect_file file2 notes.txt "$TMP/two.txt"
+leftover=$(find "$ROOT/vol1" -path "$ROOT/vol1/sample" -prune -o -type f -print)
+[ -z "$leftover" ] || fail "upload left files behind: $leftover"
+
+call --cookie "$COOKIE" -F "file1=@$TMP/two.txt" "$URL?api=VELA.Sample&version=1&method=echo"
+expect "upload to a method without allowUpload" '"success":false' '"code":115'
+
+# ---- Download, whole and one range, first streamed by velascgi, then
+# through lighttpd's X-Sendfile.
+head -c 2097152 /dev/urandom >"$ROOT/vol1/sample/data.bin"
+tail -c +1001 "$ROOT/vol1/sample/data.bin" | head -c 1000 >"$TMP/range.bin"
+download_checks() {
+  local mode=$1
+  call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=download&name=data.bin"
+  expect_status "download ($mode)" 200
+  cmp -s "$TMP/body" "$ROOT/vol1/sample/data.bin" || fail "download ($mode): bytes differ"
+  expect_header "download ($mode)" 'Content-Length: 2097152'
+  call --cookie "$COOKIE" -r 1000-1999 "$URL?api=VELA.Sample&version=1&method=download&name=data.bin"
+  expect_status "range ($mode)" 206
+  cmp -s "$TMP/body" "$TMP/range.bin" || fail "range ($mode): bytes differ"
+  expect_header "range ($mode)" 'Content-Range: bytes 1000-1999/2097152'
+}
+download_checks "streamed"
+grep -qi '^ETag:' "$TMP/headers" && fail "streamed download came from X-Sendfile"
+echo 'xsendfile="yes"' >"$ROOT/etc/vela/webapi.conf"
+download_checks "X-Sendfile"
+# lighttpd's own file answer carries an ETag; velascgi never writes one.
+expect_header "download (X-Sendfile)" 'ETag:'
+rm -f "$ROOT/etc/vela/webapi.conf"
+call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=download&name=../../etc/passwd"
+expect "download outside the folder" '"success":false' '"code":101'
+
+# ---- Refusals of the front end and the registry.
+call --cookie "$COOKIE" "$URL?api=VELA.NoSuch&version=1&method=get"
+expect "unknown API" '"success":false' '"code":102'
+call --cookie "$COOKIE" -X POST -H 'Content-Type: application/x-www-form-urlencoded' --data-binary '' "$URL"
+expect "POST with an empty body" '"success":false' '"code":101'
+
+# ---- Nothing went wrong inside velascgi.
+if grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null; then
+  fail "sanitizer reports in the error log"
+fi
+
+if [ "$failures" -ne 0 ]; then
+  echo "$failures check(s) failed"
+  exit 1
+fi
+echo "all end-to-end checks passed ($URL)"
+exit 0

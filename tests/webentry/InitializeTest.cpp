@@ -1,0 +1,293 @@
+// WebEntry::Initialize against a controlled process environment; the cases
+// with a body run in a forked child whose standard input is a pipe.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <memory>
+#include <string>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <vector>
+
+#include "support/JsonLiteral.h"
+#include "support/TestSupport.h"
+#include "vela/upload.h"
+#include "vela/vlibc.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webapi/JsonUtil.h"
+#include "webentry/WebEntry.h"
+
+using VELA::Test::LogCapture;
+using VELA::Test::ScopedEnv;
+
+namespace {
+
+std::string EnvOr(const char* name, const char* def)
+{
+    const char* v = getenv(name);
+    return v != nullptr ? v : def;
+}
+
+class WebEntryInit : public ::testing::Test {
+protected:
+    void SetUp() override
+    {
+        for (const char* name : {"REQUEST_METHOD", "QUERY_STRING", "CONTENT_LENGTH", "CONTENT_TYPE", "HTTP_COOKIE",
+                                 "HTTP_X_VELA_SHARING", "velaAccessToken", "HTTP_X_TYPE_NAME",
+                                 "HTTP_ACCEPT_LANGUAGE"}) {
+            Set(name, nullptr);
+        }
+    }
+    void TearDown() override
+    {
+        while (!env_.empty()) {
+            env_.pop_back();  // newest first, so every variable gets its first state back
+        }
+    }
+    void Set(const char* name, const char* value) { env_.emplace_back(new ScopedEnv(name, value)); }
+
+    // Initialize in a child whose standard input holds `body`; reports
+    // {"ok", "error", "params", "api", "contentType", "stdinLeft"}. With
+    // `upload`, HandleUpload runs after it.
+    Json::Value InitializeWithBody(const std::string& body, bool upload = false)
+    {
+        int in[2];
+        int out[2];
+        if (pipe(in) != 0 || pipe(out) != 0) {
+            ADD_FAILURE() << "pipe";
+            return Json::Value();
+        }
+        const pid_t pid = fork();
+        if (pid == 0) {
+            dup2(in[0], STDIN_FILENO);
+            close(in[0]);
+            close(in[1]);
+            close(out[0]);
+            VELA::VelaRootReset();
+            Json::Value r;
+            {
+                VELA::WebEntry entry;
+                VELA::APIRequest* req = entry.GetRequest();
+                r["ok"] = entry.Initialize(Json::Value());
+                if (upload && r["ok"].asBool()) {
+                    r["ok"] = entry.HandleUpload(req, entry.GetResponseObject());
+                }
+                r["error"] = entry.GetResponseObject()->GetError();
+                r["params"] = req->GetParam("");
+                r["api"] = req->GetAPIClass();
+                r["contentType"] = entry.GetResponseObject()->GetHeader("Content-type");
+                char c[64];
+                const ssize_t n = read(STDIN_FILENO, c, sizeof(c));
+                r["stdinLeft"] = static_cast<int>(n);
+            }
+            const std::string text = VELA::JsonToString(r);
+            (void)!write(out[1], text.data(), text.size());
+            _exit(0);
+        }
+        close(in[0]);
+        close(out[1]);
+        (void)!write(in[1], body.data(), body.size());
+        close(in[1]);
+        std::string text;
+        char buf[4096];
+        for (ssize_t n; (n = read(out[0], buf, sizeof(buf))) > 0;) {
+            text.append(buf, static_cast<size_t>(n));
+        }
+        close(out[0]);
+        int status = 0;
+        waitpid(pid, &status, 0);
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+        return J(text);
+    }
+
+    std::vector<std::unique_ptr<ScopedEnv>> env_;
+};
+
+}  // namespace
+
+TEST_F(WebEntryInit, GetWithoutQueryString)
+{
+    Set("REQUEST_METHOD", "GET");
+    Set("HTTP_ACCEPT_LANGUAGE", "de-DE,de;q=0.9");
+    VELA::WebEntry entry;
+    VELA::APIRequest* req = entry.GetRequest();
+    ASSERT_TRUE(entry.Initialize(Json::Value()));
+    EXPECT_EQ(0, entry.GetResponseObject()->GetError());
+    EXPECT_EQ(Json::Value(Json::objectValue), req->GetParam(""));
+    EXPECT_EQ(VELA::REQUEST_METHOD_GET, req->GetRequestMethod());
+    EXPECT_EQ(Json::Value(true), req->GetAttr("_collector_count_webapi"));
+    EXPECT_EQ("ger", req->GetUILanguage());
+    EXPECT_EQ("GET", req->GetEnv("REQUEST_METHOD").asString());
+}
+
+TEST_F(WebEntryInit, QueryParametersAndBrokenPercentEncoding)
+{
+    Set("REQUEST_METHOD", "GET");
+    Set("QUERY_STRING", "api=VELA.Sample&version=1&method=echo&n=a%20b+c");
+    {
+        VELA::WebEntry entry;
+        ASSERT_TRUE(entry.Initialize(Json::Value()));
+        EXPECT_EQ(J(R"({"api": "VELA.Sample", "version": "1", "method": "echo", "n": "a b c"})"),
+                  entry.GetRequest()->GetParam(""));
+        EXPECT_EQ(1, entry.GetRequest()->GetAPIVersion());
+    }
+    for (const char* bad : {"api=VELA.Sample&n=%zz", "n=%4", "n=100%"}) {
+        Set("QUERY_STRING", bad);
+        LogCapture log;
+        VELA::WebEntry entry;
+        EXPECT_FALSE(entry.Initialize(Json::Value())) << bad;
+        EXPECT_EQ(101, entry.GetResponseObject()->GetError()) << bad;
+        EXPECT_TRUE(log.Contains("broken percent-encoding")) << bad;
+    }
+}
+
+TEST_F(WebEntryInit, SessionIdReplacesTheCookieId)
+{
+    Set("REQUEST_METHOD", "GET");
+    Set("QUERY_STRING", "_sid=abc");
+    Set("HTTP_COOKIE", "id=old; x=1");
+    VELA::WebEntry entry;
+    ASSERT_TRUE(entry.Initialize(Json::Value()));
+    EXPECT_EQ("abandoned=old; x=1; id=abc", EnvOr("HTTP_COOKIE", "-"));
+    EXPECT_EQ("abandoned=old; x=1; id=abc", entry.GetRequest()->GetEnv("HTTP_COOKIE").asString());
+    EXPECT_EQ("abc", entry.GetRequest()->GetSessionID());
+    EXPECT_EQ("-", EnvOr("velaAccessToken", "-"));
+
+    // The search is a plain substring search: it also hits a longer name.
+    Set("HTTP_COOKIE", "xsid=old");
+    VELA::WebEntry second;
+    ASSERT_TRUE(second.Initialize(Json::Value()));
+    EXPECT_EQ("xsabandoned=old; id=abc", EnvOr("HTTP_COOKIE", "-"));
+
+    Set("HTTP_COOKIE", nullptr);
+    VELA::WebEntry third;
+    ASSERT_TRUE(third.Initialize(Json::Value()));
+    EXPECT_EQ("id=abc", EnvOr("HTTP_COOKIE", "-"));
+}
+
+TEST_F(WebEntryInit, SessionIdThatWouldAddACookieIsRefused)
+{
+    Set("REQUEST_METHOD", "GET");
+    Set("QUERY_STRING", "_sid=abc%3B%20sharing_sid%3Devil");
+    Set("HTTP_COOKIE", "x=1");
+    VELA::WebEntry entry;
+    EXPECT_FALSE(entry.Initialize(Json::Value()));
+    EXPECT_EQ(101, entry.GetResponseObject()->GetError());
+    EXPECT_EQ("x=1", EnvOr("HTTP_COOKIE", "-"));
+}
+
+TEST_F(WebEntryInit, AccessTokenOnlyWithoutSessionId)
+{
+    Set("REQUEST_METHOD", "GET");
+    Set("QUERY_STRING", "tid=tok1");
+    Set("HTTP_COOKIE", "id=old");
+    {
+        VELA::WebEntry entry;
+        ASSERT_TRUE(entry.Initialize(Json::Value()));
+        EXPECT_EQ("tok1", EnvOr("velaAccessToken", "-"));
+        EXPECT_EQ("id=old", EnvOr("HTTP_COOKIE", "-"));
+        EXPECT_STREQ("tok1", entry.GetRequest()->GetVelaAccessTokenID());
+    }
+    unsetenv("velaAccessToken");
+    Set("QUERY_STRING", "tid=tok1&_sid=abc");
+    VELA::WebEntry entry;
+    ASSERT_TRUE(entry.Initialize(Json::Value()));
+    EXPECT_EQ("-", EnvOr("velaAccessToken", "-"));
+    EXPECT_EQ("abandoned=old; id=abc", EnvOr("HTTP_COOKIE", "-"));
+}
+
+TEST_F(WebEntryInit, SharingParameters)
+{
+    Set("REQUEST_METHOD", "GET");
+    Set("HTTP_COOKIE", "a=1");
+    Set("QUERY_STRING", "_sharing_sid=q");
+    {
+        VELA::WebEntry entry;
+        ASSERT_TRUE(entry.Initialize(Json::Value()));
+        EXPECT_EQ("a=1", EnvOr("HTTP_COOKIE", "-"));
+        EXPECT_EQ("-", EnvOr("HTTP_X_VELA_SHARING", "-"));
+        EXPECT_FALSE(entry.GetRequest()->HasEnv("HTTP_X_VELA_SHARING"));
+        EXPECT_FALSE(entry.GetRequest()->HasCookie("sharing_sid"));
+    }
+    Set("QUERY_STRING", "_sharing_id=Link1&_sharing_sid=q");
+    VELA::WebEntry entry;
+    ASSERT_TRUE(entry.Initialize(Json::Value()));
+    EXPECT_EQ("a=1; sharing_sid=q", EnvOr("HTTP_COOKIE", "-"));
+    EXPECT_EQ("Link1", EnvOr("HTTP_X_VELA_SHARING", "-"));
+    EXPECT_EQ("Link1", entry.GetRequest()->GetSharingID());
+    EXPECT_EQ("q", entry.GetRequest()->GetSharingSID());
+}
+
+TEST_F(WebEntryInit, PostBodyOverridesQueryAndStdinIsClosedAfterIt)
+{
+    Set("REQUEST_METHOD", "POST");
+    Set("QUERY_STRING", "method=get&q=1");
+    const std::string body = "method=set&b=x%2By";
+    Set("CONTENT_LENGTH", std::to_string(body.size()).c_str());
+    const Json::Value r = InitializeWithBody(body + "TRAILING");
+    EXPECT_TRUE(r["ok"].asBool()) << r;
+    EXPECT_EQ(J(R"({"method": "set", "q": "1", "b": "x+y"})"), r["params"]);
+    EXPECT_EQ(0, r["stdinLeft"].asInt());  // /dev/null, not the rest of the pipe
+}
+
+TEST_F(WebEntryInit, PostBodiesRefused)
+{
+    Set("REQUEST_METHOD", "POST");
+    const struct {
+        const char* length;
+        std::string body;
+    } cases[] = {
+        {"0", ""},                                 // empty
+        {nullptr, "a=1"},                          // no length
+        {"10", "a=1"},                             // shorter than CONTENT_LENGTH
+        {"16777217", "a=1"},                       // above the bound
+        {"3x", "a=1"},                             // not a number
+        {"7", std::string("a=1\0b=2", 7)},         // NUL byte
+        {"6", "a=%zz1"},                           // broken percent-encoding
+    };
+    for (const auto& c : cases) {
+        Set("CONTENT_LENGTH", c.length);
+        const Json::Value r = InitializeWithBody(c.body);
+        EXPECT_FALSE(r["ok"].asBool()) << (c.length ? c.length : "null");
+        EXPECT_EQ(101, r["error"].asInt()) << (c.length ? c.length : "null");
+    }
+}
+
+// An upload whose identity comes from the form fields before the first file
+// part: nothing of the body is lost for the full load that follows.
+TEST_F(WebEntryInit, UploadIdentityFromLeadingFields)
+{
+    VELA::Test::TempDir root;
+    ASSERT_EQ(0, mkdir((root.Path() + "/tmp").c_str(), 0700));
+    Set("VELA_ROOT", root.Path().c_str());
+    const std::string body =
+        "--XyZ\r\nContent-Disposition: form-data; name=\"api\"\r\n\r\nVELA.Sample\r\n"
+        "--XyZ\r\nContent-Disposition: form-data; name=\"version\"\r\n\r\n1\r\n"
+        "--XyZ\r\nContent-Disposition: form-data; name=\"method\"\r\n\r\nput\r\n"
+        "--XyZ\r\nContent-Disposition: form-data; name=\"file\"; filename=\"a.txt\"\r\n\r\nhello\r\n"
+        "--XyZ\r\nContent-Disposition: form-data; name=\"after\"\r\n\r\nyes\r\n"
+        "--XyZ--\r\n";
+    Set("REQUEST_METHOD", "POST");
+    Set("CONTENT_TYPE", "multipart/form-data; boundary=XyZ");
+    Set("CONTENT_LENGTH", std::to_string(body.size()).c_str());
+    const Json::Value r = InitializeWithBody(body, true);
+    ASSERT_TRUE(r["ok"].asBool()) << r;
+    EXPECT_EQ("VELA.Sample", r["api"].asString());
+    EXPECT_EQ("text/plain; charset=\"UTF-8\"", r["contentType"].asString());
+    const Json::Value& p = r["params"];
+    EXPECT_EQ("put", p["method"].asString());
+    EXPECT_EQ("yes", p["after"].asString());
+    EXPECT_EQ("a.txt", p["file_name"].asString());
+    EXPECT_EQ("hello", VELA::Test::ReadText(p["file"].asString()));
+
+    // Without the identity before the first file part the upload is refused.
+    const std::string late =
+        "--XyZ\r\nContent-Disposition: form-data; name=\"file\"; filename=\"a.txt\"\r\n\r\nhello\r\n"
+        "--XyZ\r\nContent-Disposition: form-data; name=\"api\"\r\n\r\nVELA.Sample\r\n--XyZ--\r\n";
+    Set("CONTENT_LENGTH", std::to_string(late.size()).c_str());
+    const Json::Value refused = InitializeWithBody(late, true);
+    EXPECT_FALSE(refused["ok"].asBool());
+    EXPECT_EQ(101, refused["error"].asInt());
+}

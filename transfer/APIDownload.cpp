@@ -1,0 +1,160 @@
+// Downloads: the response's headers, then the file through the platform's
+// HTTP file outputer.
+#include "webapi/APIDownload.h"
+
+#include <fcntl.h>
+#include <iostream>
+#include <strings.h>
+#include <sys/stat.h>
+
+#include "transfer/APIDownloadPrivate.h"
+#include "vela/httpoutput.h"
+#include "vela/log.h"
+#include "webapi/APIResponse.h"
+
+namespace VELA {
+
+namespace {
+
+const char kDefaultType[] = "application/octet-stream";
+
+bool SameName(const std::string& a, const char* b) { return strcasecmp(a.c_str(), b) == 0; }
+
+bool HasLineBreak(const std::string& text) { return text.find_first_of("\r\n") != std::string::npos; }
+
+}  // namespace
+
+APIDownload::APIDownload() : d_(nullptr)
+{
+    APIResponse* own = new APIResponse(nullptr);
+    d_ = new APIDownloadPrivate(this, own, true);
+}
+
+APIDownload::APIDownload(APIResponse* response) : d_(new APIDownloadPrivate(this, response, false)) {}
+
+APIDownload::~APIDownload()
+{
+    if (d_->ownsResponse) {
+        delete d_->response;
+    }
+    delete d_;
+}
+
+bool APIDownload::SetHeader(std::string const& name, std::string const& value)
+{
+    if (d_->response == nullptr) {
+        return false;
+    }
+    return d_->response->SetHeader(name, value);
+}
+
+bool APIDownload::SetHeader(Json::Value const& headers)
+{
+    try {
+        if (!headers.isObject()) {
+            return headers.isNull();
+        }
+        for (auto it = headers.begin(); it != headers.end(); ++it) {
+            if (!it->isString()) {
+                continue;
+            }
+            if (!SetHeader(it.name(), it->asString())) {
+                return false;
+            }
+        }
+        return true;
+    } catch (const std::exception&) {
+        return false;
+    }
+}
+
+void APIDownload::SetMimeType(std::string const& mimeType)
+{
+    try {
+        d_->mimeType = mimeType;
+    } catch (const std::exception&) {
+        d_->mimeType.clear();
+    }
+}
+
+void APIDownload::SetMimeTypeFromFileName(std::string const& name)
+{
+    SetMimeType(HTTPFileOutputer::GetMimeType(name));
+}
+
+void APIDownload::PrintHeader()
+{
+    d_->outputer.SetWriteDisposition(true);
+    if (d_->response == nullptr) {
+        return;
+    }
+    try {
+        const Json::Value headers = d_->response->GetHeaders();
+        for (auto it = headers.begin(); it != headers.end(); ++it) {
+            if (!it->isString()) {
+                continue;
+            }
+            const std::string name = it.name();
+            const std::string value = it->asString();
+            if (SameName(name, "Content-Type") || SameName(name, "Content-Length") || HasLineBreak(name) ||
+                HasLineBreak(value)) {
+                continue;
+            }
+            if (SameName(name, "Content-Disposition")) {
+                d_->outputer.SetWriteDisposition(false);
+            }
+            std::cout << name << ": " << value << "\r\n";
+        }
+        std::cout.flush();
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("out of memory printing the headers of a download");
+    }
+}
+
+bool APIDownload::Output(std::string const& path)
+{
+    struct stat st;
+    if (stat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) {
+        VELA_LOG_ERR("download refused: %s is not a regular file", path.c_str());
+        return false;
+    }
+    PrintHeader();
+    if (d_->response != nullptr) {
+        d_->response->SetEnableOutput(false);
+    }
+    try {
+        const std::string type = d_->mimeType.empty() ? HTTPFileOutputer::GetMimeType(path) : d_->mimeType;
+        return d_->outputer.Output(path, type);
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("out of memory sending %s", path.c_str());
+        return false;
+    }
+}
+
+bool APIDownload::Output(FILE* file)
+{
+    struct stat st;
+    const int fd = file == nullptr ? -1 : fileno(file);
+    const int mode = fd < 0 ? -1 : fcntl(fd, F_GETFL);
+    if (mode < 0 || (mode & O_ACCMODE) == O_WRONLY || fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+        VELA_LOG_ERR("download refused: the stream is not a readable regular file");
+        return false;
+    }
+    PrintHeader();
+    if (d_->response != nullptr) {
+        d_->response->SetEnableOutput(false);
+    }
+    try {
+        const std::string type = d_->mimeType.empty() ? std::string(kDefaultType) : d_->mimeType;
+        return d_->outputer.Output(file, "", type);
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("out of memory sending a file");
+        return false;
+    }
+}
+
+void APIDownload::SetXSendFileDisabled() { HTTP::FileOutputerHelper::SetFastOutputEnabled(false); }
+
+bool APIDownload::GetXSendFileEnabled() { return HTTP::FileOutputerHelper::IsFastOutputEnabled(); }
+
+}  // namespace VELA

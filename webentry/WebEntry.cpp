@@ -1,0 +1,448 @@
+// WebEntry: one web-API call from the web server's CGI interface. Run is the
+// road of the call: Initialize builds the request from the environment, the
+// query string, the body and the cookies; the dispatcher runs it; the reply
+// goes to standard output (Output.cpp); callbacks run after it.
+#include "webentry/WebEntry.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <string>
+#include <unistd.h>
+
+#include "request/APIRequestPrivate.h"
+#include "request/RequestFacts.h"
+#include "vela/cgi.h"
+#include "vela/log.h"
+#include "vela/upload.h"
+#include "vela/webapiutil.h"
+#include "vela/webserver.h"
+#include "webapi/APIError.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webapi/APIUpload.h"
+
+namespace VELA {
+
+namespace {
+
+const char kCipherText[] = "__cIpHeRtExT";
+const char kCipherToken[] = "__cIpHeRtOkEn";
+
+// A form-encoded body larger than this is refused before anything is
+// allocated for it; uploads are streamed and not bound by it.
+constexpr long long kMaxPostBody = VELACGI_MAX_PARAM_LINE;
+
+// CONTENT_LENGTH (RFC 9110 section 8.6, 1*DIGIT). The length, or -1 when the
+// value is not a string of digits or exceeds `limit`.
+long long ContentLength(const Json::Value& value, long long limit)
+{
+    if (!value.isString()) {
+        return value.isNull() ? 0 : -1;
+    }
+    const std::string text = value.asString();
+    if (text.empty()) {
+        return 0;
+    }
+    long long n = 0;
+    for (char c : text) {
+        if (c < '0' || c > '9') {
+            return -1;
+        }
+        n = n * 10 + (c - '0');
+        if (n > limit) {
+            return -1;
+        }
+    }
+    return n;
+}
+
+// RFC 6265 section 4.1.1 cookie-octet: what may stand in a cookie value
+// without ending it or starting another cookie.
+bool IsCookieValue(const std::string& value)
+{
+    for (char ch : value) {
+        const unsigned char c = static_cast<unsigned char>(ch);
+        if (c < 0x21 || c == 0x7f || c == '"' || c == ',' || c == ';' || c == '\\') {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool Present(const APIParameter<std::string>& p)
+{
+    return p.IsSet() && !p.IsInvalid() && !p.IsReset();
+}
+
+// Reads exactly `want` bytes of standard input into `body`; false when the
+// input ends (or fails) first.
+bool ReadBody(std::string& body, size_t want)
+{
+    body.assign(want, '\0');
+    size_t got = 0;
+    while (got < want) {
+        const ssize_t n = read(STDIN_FILENO, &body[got], want - got);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            VELA_LOG_ERR("body truncated: %zu of %zu bytes (CONTENT_LENGTH) arrived", got, want);
+            return false;
+        }
+        got += static_cast<size_t>(n);
+    }
+    return true;
+}
+
+// Standard input on /dev/null, so that nothing later reads a consumed body.
+void StdinToDevNull()
+{
+    const int fd = open("/dev/null", O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+        return;
+    }
+    if (fd != STDIN_FILENO) {
+        dup2(fd, STDIN_FILENO);
+        close(fd);
+    }
+}
+
+// Steps 7 to 11 of Initialize: the session id ("_sid"), access token
+// ("tid") and sharing-link parameters ("_sharing_id", "_sharing_sid") of the
+// query move into the process environment and the request's cookie header,
+// where the session checks look for them.
+bool MoveIdentityParams(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)
+{
+    const APIParameter<std::string> sid = req->GetAndCheckString("_sid", APIRequest::OPTIONAL);
+    const APIParameter<std::string> tid = req->GetAndCheckString("tid", APIRequest::OPTIONAL);
+    const APIParameter<std::string> sharingId = req->GetAndCheckString("_sharing_id", APIRequest::OPTIONAL);
+    const APIParameter<std::string> sharingSid = req->GetAndCheckString("_sharing_sid", APIRequest::OPTIONAL);
+    const bool hasSid = Present(sid);
+    const bool hasSharing = Present(sharingId);
+    const bool hasSharingSid = hasSharing && Present(sharingSid);
+    if (!hasSid && !Present(tid) && !hasSharing && !Present(sharingSid)) {
+        return true;
+    }
+    // The values become part of a Cookie header: one that would end its
+    // cookie and start another is refused.
+    if ((hasSid && !IsCookieValue(sid.Get())) || (hasSharingSid && !IsCookieValue(sharingSid.Get()))) {
+        VELA_LOG_ERR("refused a session id parameter that is not a cookie value (%zu bytes)",
+                     hasSid ? sid.Get().size() : sharingSid.Get().size());
+        resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+        return false;
+    }
+
+    std::string cookie = RequestFacts::Text(req->GetEnv("HTTP_COOKIE"));
+    std::string sharingHeader = RequestFacts::Text(req->GetEnv(kSharingHeaderEnv));
+
+    if (hasSharing) {
+        sharingHeader = sharingId.Get();
+        if (setenv(kSharingHeaderEnv, sharingHeader.c_str(), 1) != 0) {
+            VELA_LOG_ERR("setenv %s failed[%m]", kSharingHeaderEnv);
+            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+            return false;
+        }
+    }
+    if (hasSharingSid) {
+        if (!cookie.empty()) {
+            cookie += "; ";
+        }
+        cookie += std::string(kSharingSidCookie) + "=" + sharingSid.Get();
+        if (setenv("HTTP_COOKIE", cookie.c_str(), 1) != 0) {
+            VELA_LOG_ERR("setenv HTTP_COOKIE failed[%m]");
+            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+            return false;
+        }
+    }
+    if (!hasSid) {
+        if (Present(tid) && setenv("velaAccessToken", tid.Get().c_str(), 1) != 0) {
+            VELA_LOG_ERR("setenv velaAccessToken failed[%m]");
+            return false;
+        }
+    } else {
+        // The session id of the query replaces the one of the cookie header:
+        // the first "id=" in the header (a plain substring search, which can
+        // also hit the end of a longer name) becomes "abandoned=", and the
+        // new id is appended.
+        if (!cookie.empty()) {
+            cookie += "; ";
+            const size_t at = cookie.find("id=");
+            if (at != std::string::npos) {
+                cookie.replace(at, 2, "abandoned");
+            }
+        }
+        cookie += "id=" + sid.Get();
+        if (setenv("HTTP_COOKIE", cookie.c_str(), 1) != 0) {
+            VELA_LOG_ERR("setenv HTTP_COOKIE failed[%m]");
+            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+            return false;
+        }
+    }
+
+    VelaCgiLoadInCookies(cgi);
+    Json::Value env(Json::objectValue);
+    if (!cookie.empty()) {
+        env["HTTP_COOKIE"] = cookie;
+    }
+    if (!sharingHeader.empty()) {
+        env[kSharingHeaderEnv] = sharingHeader;
+    }
+    req->InitEnv(env);
+    return true;
+}
+
+}  // namespace
+
+WebEntry::WebEntry() : cgi_(nullptr), uploadedFiles_(Json::arrayValue), permission_(Json::objectValue)
+{
+    Json::Value slots(Json::arrayValue);
+    slots.append(Json::Value());
+    slots.append(Json::Value());
+    permission_["permResult"] = slots;
+}
+
+WebEntry::~WebEntry()
+{
+    permission_ = Json::Value();
+    uploadedFiles_ = Json::Value();
+    VelaCgiFree(cgi_);
+    cgi_ = nullptr;
+}
+
+bool WebEntry::Run(const Json::Value& /*unused*/)
+{
+    bool served = false;
+    try {
+        if (Initialize(Json::Value()) && SetProcessName(request_, response_)) {
+            served = request_->HasParam("relay_ds") ? ProcessRelay(request_, response_)
+                                                    : Process(request_, response_);
+        }
+    } catch (const std::exception& e) {
+        VELA_LOG_ERR("request aborted: %s", e.what());
+        response_->SetError(WEBAPI_ERR_NO_RESPONSE);
+        served = false;
+    } catch (...) {
+        VELA_LOG_ERR("request aborted");
+        response_->SetError(WEBAPI_ERR_NO_RESPONSE);
+        served = false;
+    }
+    if (response_->IsEnableOutput()) {
+        OutputHeader();
+        OutputBody();
+    }
+    if (response_->GetHttpdRestart()) {
+        response_->SetCallbackFunc(RestartHttpd, nullptr);
+    }
+    HandleCallback(response_);
+    return served;
+}
+
+bool WebEntry::Initialize(const Json::Value& /*unused*/)
+{
+    Json::Value env(Json::objectValue);
+    Json::Value session(Json::objectValue);
+
+    VelaCgiFree(cgi_);
+    cgi_ = nullptr;
+    if (VelaCgiInit("", &cgi_) != 0 || VelaCgiLoadInCookies(cgi_) != 0) {
+        VELA_LOG_ERR("CGI library could not load the cookies");
+    }
+    request_->SetAttr("_collector_count_webapi", true);
+
+    char lang[8] = "";
+    if (VelaCgiGetLang(cgi_, lang, sizeof(lang)) != 0) {
+        strcpy(lang, "enu");
+    }
+    session["uiLang"] = lang;
+    request_->InitSession(session);
+
+    if (!InitEnv(env)) {
+        response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+        return false;
+    }
+    request_->InitEnv(env);
+    env = Json::Value(Json::objectValue);  // now the parameters
+    if (!InitParam(env)) {
+        return false;
+    }
+    request_->InitParam(env, false);
+
+    return MoveIdentityParams(request_, response_, cgi_);
+}
+
+bool WebEntry::InitParam(Json::Value& param)
+{
+    if (request_->HasEnv("QUERY_STRING")) {
+        param["getParam"] = Json::Value(Json::objectValue);
+        if (!InitGetParam(param["getParam"])) {
+            return false;
+        }
+    }
+    if (request_->GetRequestMethod() != REQUEST_METHOD_POST) {
+        return true;
+    }
+    const Json::Value* get = param.find("getParam", "getParam" + 8);
+    const bool hasIdentity = get != nullptr && get->isObject() && get->isMember("api") &&
+                             get->isMember("version") && get->isMember("method");
+    param["postParam"] = Json::Value(Json::objectValue);
+    if (request_->IsUploadRequest()) {
+        // The result of an upload is read by a browser frame as plain text.
+        response_->SetHeader("Content-type", "text/plain; charset=\"UTF-8\"");
+        if (hasIdentity || LoadUploadAPIDesc(param["postParam"])) {
+            return true;
+        }
+        response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+        return false;
+    }
+    if (InitPostParam(param["postParam"])) {
+        return true;
+    }
+    response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+    return false;
+}
+
+bool WebEntry::InitGetParam(Json::Value& getParam)
+{
+    const Json::Value query = request_->GetEnv("QUERY_STRING");
+    if (!query.isString() || !DetectAndDecryptParamLine(query.asString(), getParam)) {
+        response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+        return false;
+    }
+    return true;
+}
+
+bool WebEntry::InitPostParam(Json::Value& postParam)
+{
+    if (!postParam.isObject() || request_->IsUploadRequest()) {
+        return false;
+    }
+    const Json::Value lengthText = request_->GetEnv("CONTENT_LENGTH");
+    const long long length = ContentLength(lengthText, kMaxPostBody);
+    if (length < 0) {
+        VELA_LOG_ERR("body refused: CONTENT_LENGTH \"%.32s\" is not a length of at most %lld bytes",
+                     RequestFacts::Text(lengthText).c_str(), kMaxPostBody);
+        return false;
+    }
+    if (length == 0) {
+        VELA_LOG_ERR("body refused: empty POST body");
+        return false;
+    }
+    std::string body;
+    const bool complete = ReadBody(body, static_cast<size_t>(length));
+    StdinToDevNull();
+    // A NUL byte inside the body is refused with the rest of the line.
+    return complete && DetectAndDecryptParamLine(body, postParam);
+}
+
+bool WebEntry::DetectAndDecryptParamLine(const std::string& line, Json::Value& out)
+{
+    std::string plain = line;
+    if (!VelaCgiDetectAndDecryptParamLine(plain)) {
+        return false;
+    }
+    if (!WebAPIUtil::strPairToJsonObj(plain, out, true, true)) {
+        return false;
+    }
+    if (!out.empty() && !DecryptAESParam(out)) {
+        VELA_LOG_ERR("parameters refused: __tXeTrEhPiC does not decrypt");
+        return false;
+    }
+    Json::Value* webapi = out.isObject() && out.isMember("webapi") ? &out["webapi"] : nullptr;
+    if (webapi != nullptr && webapi->isObject() && webapi->isMember(kCipherText)) {
+        const std::string cipher = RequestFacts::Text((*webapi)[kCipherText]);
+        webapi->removeMember(kCipherText);
+        DecryptParam(cipher, *webapi);
+        webapi->removeMember(kCipherToken);
+    }
+    return true;
+}
+
+bool WebEntry::DecryptParam(const std::string& cipher, Json::Value& out)
+{
+    std::string plain = cipher;
+    if (VelaCgiDecryptParam(plain) != 0) {
+        return false;
+    }
+    if (!WebAPIUtil::strPairToJsonObj(plain, out, true, true)) {
+        return false;
+    }
+    return out.empty() || DecryptAESParam(out);
+}
+
+bool WebEntry::DecryptAESParam(Json::Value& param)
+{
+    return request_->GetPrivate()->DecryptAESParam(param);
+}
+
+// The identity of an upload whose query string lacks it comes from the form
+// fields before the first file part. The platform keeps one multipart reader
+// per process over standard input, so the fields read here stay with it and
+// the rest of the body waits for HandleUpload (or a deferring handler).
+bool WebEntry::LoadUploadAPIDesc(Json::Value& postParam)
+{
+    if (!postParam.isObject() && !postParam.isNull()) {
+        return false;
+    }
+    unsigned long long length = 0;
+    char fileName[512] = "";
+    char fieldName[512] = "";
+    char fieldValue[512] = "";
+    const int rc = VelaCgiLoadUploadParams(cgi_, nullptr, &length, fileName, sizeof(fileName), fieldName,
+                                           sizeof(fieldName), fieldValue, sizeof(fieldValue));
+    if (rc != VELA_UPLOAD_OK) {
+        VELA_LOG_ERR("upload refused: its leading form fields could not be read[%d]", rc);
+        return false;
+    }
+    const Json::Value fields = WebAPIUtil::SzHashToJsonObj(VelaCgiGetUploadParams(cgi_));
+    for (const char* key : {"api", "version", "method"}) {
+        if (!fields.isMember(key)) {
+            VELA_LOG_ERR("upload refused: no \"%s\" in the query or before the first file part", key);
+            return false;
+        }
+    }
+    for (const char* key : {"api", "version", "method"}) {
+        postParam[key] = fields[key];
+    }
+    return true;
+}
+
+bool WebEntry::HandleUpload(APIRequest* req, APIResponse* resp)
+{
+    if (req == nullptr || resp == nullptr) {
+        return false;
+    }
+    if (GetMethodAttr(req, "deferUpload")) {
+        return true;  // the handler reads the body itself
+    }
+    Json::Value param(Json::objectValue);
+    param["postParam"] = Json::Value(Json::objectValue);
+    APIUpload upload(req);
+    const int rc = upload.GetUploadAll(param["postParam"], &uploadedFiles_);
+    if (rc != UPLOAD_RESULT_SUCCESS) {
+        Json::Value detail(Json::objectValue);
+        detail["upload_err"] = rc;
+        resp->SetError(WEBAPI_ERR_UPLOAD_FAILED, detail);
+        return false;
+    }
+    req->InitParam(param, false);
+    return true;
+}
+
+bool WebEntry::ProcessRelay(APIRequest* req, APIResponse* resp)
+{
+    const std::string target = RequestFacts::Text(req->GetParam("relay_ds"));
+    VELA_LOG_ERR("relay request fail[%d]: relaying to another service (relay_ds \"%.64s\") is not served",
+                 ENOSYS, target.c_str());
+    resp->SetError(WEBAPI_ERR_RELAY_FAILED);
+    return false;
+}
+
+void RestartHttpd(void* /*unused*/)
+{
+    velaw3::Engine engine;
+    velaw3::TARN(engine).RestartService();  // logs its own refusals
+}
+
+}  // namespace VELA

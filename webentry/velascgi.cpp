@@ -1,0 +1,62 @@
+// velascgi: the CGI program the web server runs for every web-API call.
+// It works in the web-API directory, where the API descriptions and handler
+// libraries are named relative to, and hands the call to one WebEntry.
+#include <cstring>
+#include <exception>
+#include <string>
+#include <unistd.h>
+
+#include "vela/log.h"
+#include "vela/vlibc.h"
+#include "webentry/WebEntry.h"
+
+namespace {
+
+// The reply when the program cannot even start serving: a CGI status line,
+// the usual headers and a JSON error (117: set-up failed).
+const char kSetupFailedReply[] =
+    "Status: 500 Internal Server Error\r\n"
+    "Content-type: application/json; charset=\"UTF-8\"\r\n"
+    "X-Content-Type-Options: nosniff\r\n"
+    "X-XSS-Protection: 1; mode=block\r\n"
+    "Cache-Control: max-age=0, no-cache, no-store, must-revalidate\r\n"
+    "Pragma: no-cache\r\n"
+    "Expires: 0\r\n"
+    "\r\n"
+    "{\"error\":{\"code\":117},\"success\":false}";
+
+void ReplySetupFailed()
+{
+    const char* p = kSetupFailedReply;
+    size_t left = sizeof(kSetupFailedReply) - 1;
+    while (left > 0) {
+        const ssize_t n = write(STDOUT_FILENO, p, left);
+        if (n <= 0) {
+            return;
+        }
+        p += n;
+        left -= static_cast<size_t>(n);
+    }
+}
+
+}  // namespace
+
+int main(int argc, char** argv)
+{
+    try {
+        const std::string dir = VELA::VelaPath("/usr/vela/velaman/webapi");
+        if (chdir(dir.c_str()) != 0) {
+            VELA_LOG_ERR("cannot enter the web-API directory %s[%m]", dir.c_str());
+            ReplySetupFailed();
+            return 0;
+        }
+        VELA::WebEntry entry;
+        entry.SetArgs(argc, argv);
+        entry.Run(Json::Value());
+    } catch (const std::exception& e) {
+        VELA_LOG_ERR("request aborted: %s", e.what());
+    } catch (...) {
+        VELA_LOG_ERR("request aborted");
+    }
+    return 0;
+}
