@@ -428,7 +428,7 @@ bool ParseDigits(const std::string& text, size_t& pos, uint64_t& value)
 }
 
 // Reads the Range header `header` against a file of `size` bytes. One
-// byte-range-spec ("a-b", "a-") or suffix-range ("-n") gives kPartial with
+// byte range ("a-b", "a-") or suffix range ("-n") gives kPartial with
 // the inclusive [first, last], or kUnsatisfiable when it selects no byte of
 // the file; no header, several ranges or bad syntax give kWhole (the header
 // is ignored, RFC 9110 section 14.2).

@@ -407,8 +407,9 @@ const char* MultipartReader::FindDelimiter(const char* data, size_t len) const
 }
 
 // Hands the bytes before the next delimiter to `sink` and consumes the
-// delimiter. The last (delimiter length - 1) bytes stay buffered while no
-// delimiter is found, as they may begin one.
+// delimiter. While no delimiter is found the last (delimiter length - 1)
+// bytes stay buffered, as they may begin one, and a few more so that what is
+// handed on ends on a page boundary of the part's content.
 int MultipartReader::ScanToDelimiter(MultipartSink* sink)
 {
     const size_t dlen = delimiter_.size();

@@ -232,6 +232,7 @@ bool WebEntry::Run(const Json::Value& /*unused*/)
         OutputHeader();
         OutputBody();
     }
+    RemoveUploadedFiles();
     if (response_->GetHttpdRestart()) {
         response_->SetCallbackFunc(RestartHttpd, nullptr);
     }
@@ -283,7 +284,7 @@ bool WebEntry::InitParam(Json::Value& param)
     if (request_->GetRequestMethod() != REQUEST_METHOD_POST) {
         return true;
     }
-    const Json::Value* get = param.find("getParam", "getParam" + 8);
+    const Json::Value* get = param.isMember("getParam") ? &param["getParam"] : nullptr;
     const bool hasIdentity = get != nullptr && get->isObject() && get->isMember("api") &&
                              get->isMember("version") && get->isMember("method");
     param["postParam"] = Json::Value(Json::objectValue);
@@ -428,6 +429,23 @@ bool WebEntry::HandleUpload(APIRequest* req, APIResponse* resp)
     }
     req->InitParam(param, false);
     return true;
+}
+
+// The files an upload stored are the handler's during the call; a handler
+// that keeps one moves it away. Whatever is still in place afterwards is
+// removed, so that no upload outlives its request. The paths are the ones
+// the upload reader created, never client text.
+void WebEntry::RemoveUploadedFiles()
+{
+    if (!uploadedFiles_.isArray()) {
+        return;
+    }
+    for (const Json::Value& path : uploadedFiles_) {
+        if (path.isString() && unlink(path.asCString()) != 0 && errno != ENOENT) {
+            VELA_LOG_ERR("cannot remove uploaded file %s [%m]", path.asCString());
+        }
+    }
+    uploadedFiles_ = Json::Value(Json::arrayValue);
 }
 
 bool WebEntry::ProcessRelay(APIRequest* req, APIResponse* resp)

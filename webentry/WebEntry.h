@@ -55,6 +55,9 @@ public:
     void OutputBody();
 
 protected:
+    // Removes the stored files of the upload that the handler left in place.
+    void RemoveUploadedFiles();
+
     VELACGI_CTX* cgi_;
     Json::Value uploadedFiles_;  // stored files of the upload, in body order
     Json::Value permission_;     // {"permResult": [verdict with timeout allowed, without]}

@@ -6,17 +6,16 @@
 #include <memory>
 #include <string>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 #include <vector>
 
 #include "support/JsonLiteral.h"
 #include "support/TestSupport.h"
-#include "vela/upload.h"
 #include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/JsonUtil.h"
+#include "webentry/ChildRun.h"
 #include "webentry/WebEntry.h"
 
 using VELA::Test::LogCapture;
@@ -53,18 +52,7 @@ protected:
     // `upload`, HandleUpload runs after it.
     Json::Value InitializeWithBody(const std::string& body, bool upload = false)
     {
-        int in[2];
-        int out[2];
-        if (pipe(in) != 0 || pipe(out) != 0) {
-            ADD_FAILURE() << "pipe";
-            return Json::Value();
-        }
-        const pid_t pid = fork();
-        if (pid == 0) {
-            dup2(in[0], STDIN_FILENO);
-            close(in[0]);
-            close(in[1]);
-            close(out[0]);
+        return J(RunChild(body, [upload] {
             VELA::VelaRootReset();
             Json::Value r;
             {
@@ -79,27 +67,11 @@ protected:
                 r["api"] = req->GetAPIClass();
                 r["contentType"] = entry.GetResponseObject()->GetHeader("Content-type");
                 char c[64];
-                const ssize_t n = read(STDIN_FILENO, c, sizeof(c));
-                r["stdinLeft"] = static_cast<int>(n);
+                r["stdinLeft"] = static_cast<int>(read(STDIN_FILENO, c, sizeof(c)));
             }
             const std::string text = VELA::JsonToString(r);
-            (void)!write(out[1], text.data(), text.size());
-            _exit(0);
-        }
-        close(in[0]);
-        close(out[1]);
-        (void)!write(in[1], body.data(), body.size());
-        close(in[1]);
-        std::string text;
-        char buf[4096];
-        for (ssize_t n; (n = read(out[0], buf, sizeof(buf))) > 0;) {
-            text.append(buf, static_cast<size_t>(n));
-        }
-        close(out[0]);
-        int status = 0;
-        waitpid(pid, &status, 0);
-        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-        return J(text);
+            (void)!write(STDOUT_FILENO, text.data(), text.size());
+        }));
     }
 
     std::vector<std::unique_ptr<ScopedEnv>> env_;

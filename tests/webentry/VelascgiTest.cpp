@@ -5,11 +5,10 @@
 #include <cstdlib>
 #include <string>
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 #include <vector>
 
 #include "support/TestSupport.h"
+#include "webentry/ChildRun.h"
 
 namespace {
 
@@ -33,20 +32,7 @@ std::string BinaryDir()
 std::string RunCgi(const std::vector<std::string>& env, const std::string& body)
 {
     const std::string program = BinaryDir() + "/velascgi";
-    int in[2];
-    int out[2];
-    if (pipe(in) != 0 || pipe(out) != 0) {
-        ADD_FAILURE() << "pipe";
-        return "";
-    }
-    const pid_t pid = fork();
-    if (pid == 0) {
-        dup2(in[0], STDIN_FILENO);
-        dup2(out[1], STDOUT_FILENO);
-        close(in[0]);
-        close(in[1]);
-        close(out[0]);
-        close(out[1]);
+    return RunChild(body, [&] {
         std::vector<char*> envp;
         for (const std::string& e : env) {
             envp.push_back(const_cast<char*>(e.c_str()));
@@ -55,21 +41,7 @@ std::string RunCgi(const std::vector<std::string>& env, const std::string& body)
         char* argv[] = {const_cast<char*>(program.c_str()), nullptr};
         execve(program.c_str(), argv, envp.data());
         _exit(127);
-    }
-    close(in[0]);
-    close(out[1]);
-    (void)!write(in[1], body.data(), body.size());
-    close(in[1]);
-    std::string text;
-    char buf[4096];
-    for (ssize_t n; (n = read(out[0], buf, sizeof(buf))) > 0;) {
-        text.append(buf, static_cast<size_t>(n));
-    }
-    close(out[0]);
-    int status = 0;
-    waitpid(pid, &status, 0);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-    return text;
+    });
 }
 
 class Velascgi : public ::testing::Test {
