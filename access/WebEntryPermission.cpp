@@ -14,6 +14,9 @@
 
 #include "vela/cgi.h"
 #include "vela/log.h"
+
+// The checks are members of WebEntry; their lines carry its name.
+#define VELA_WEBENTRY_LOG(fmt, ...) VelaLogAt(LOG_ERR, "WebEntry", __LINE__, fmt, ##__VA_ARGS__)
 #include "vela/token.h"
 #include "vela/user.h"
 #include "webapi/APIError.h"
@@ -128,7 +131,7 @@ int WebEntry::CheckPermission(bool allowTimeout)
     // A check before Initialize (a runner built by hand) still needs a
     // handle for the skip-IP flag and the session facts.
     if (cgi_ == nullptr && (VelaCgiInit("", &cgi_) != 0 || VelaCgiLoadInCookies(cgi_) != 0)) {
-        VELA_LOG_ERR("cannot set up the CGI handle for the session check");
+        VELA_WEBENTRY_LOG("cannot set up the CGI handle for the session check");
     }
 
     const std::string sid = req->GetSessionID();
@@ -202,7 +205,7 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
     const int code = CheckPermission(allowTimeout);
     const Json::Value& cached = permission_["permResult"][allowTimeout ? 0 : 1];
     if (cached.isInt() && cached.asInt() == AUTH_RESULT_TOKEN_MISSING && AuthLevel(req) == 1) {
-        VELA_LOG_ERR("Token Authentication Fail.");
+        VELA_WEBENTRY_LOG("Token Authentication Fail.");
     }
 
     resp->SetError(code, Json::Value());
@@ -243,7 +246,7 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
             }
         }
         if (!allowed) {
-            VELA_LOG_ERR("user \"%s\" (%s) may not call %s", user.c_str(), cls.c_str(), req->GetAPIClass().c_str());
+            VELA_WEBENTRY_LOG("user \"%s\" (%s) may not call %s", user.c_str(), cls.c_str(), req->GetAPIClass().c_str());
             resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
             return false;
         }
@@ -252,7 +255,7 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
     const Json::Value privValue = req->GetAPIInfo("appPriv", Json::Value(""));
     const std::string appPriv = privValue.isString() ? privValue.asString() : "";
     if (!appPriv.empty() && VLIBAppPrivUserHas(user.c_str(), appPriv.c_str(), req->GetRemoteIP().c_str()) != 1) {
-        VELA_LOG_ERR("user \"%s\" lacks the application privilege %s for %s", user.c_str(), appPriv.c_str(),
+        VELA_WEBENTRY_LOG("user \"%s\" lacks the application privilege %s for %s", user.c_str(), appPriv.c_str(),
                      req->GetAPIClass().c_str());
         resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
         return false;
@@ -279,7 +282,7 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
 bool WebEntry::CheckSharingPermission(APIRequest* req, APIResponse* resp)
 {
     // Sharing links are not served yet: refuse, whatever the link says.
-    VELA_LOG_ERR("sharing links are not available; %s refused",
+    VELA_WEBENTRY_LOG("sharing links are not available; %s refused",
                  req != nullptr ? req->GetAPIClass().c_str() : "request");
     if (resp != nullptr) {
         resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());

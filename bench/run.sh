@@ -19,6 +19,9 @@ scripts/build.sh "$build" >/dev/null
 export VELA_ROOT=$PWD/$build/root
 unset VELA_LOG_STDERR
 
+if [ ! -S /dev/log ]; then
+    echo "note: no syslog daemon (/dev/log missing): every log line of the call goes to /dev/console"
+fi
 echo "== whole process: velarun echo vs minimal JsonCpp program ($runs runs each, $rounds rounds) =="
 "$build/bench/vela-bench-process" --runs "$runs" --rounds "$rounds" \
     "$build/velarun" "$build/bench/vela-bench-minimal-echo" "$PWD/bench/echo.json"

@@ -97,7 +97,10 @@ int VLIBAppPrivUserHas(const char* user, const char* priv, const char* remoteIP)
 // put back when possible and false is returned.
 
 // Switches to user `name` ("system": the superuser) with the user's groups
-// (initgroups). True when the ids read back as requested.
+// (initgroups). True when the ids read back as requested. A process whose
+// user and group ids are all 0 and whose only supplementary group is 0 (or
+// none) already is "system": nothing is changed or logged and no account is
+// looked up.
 bool ResetCredentialsByName(const char* name, bool grantable);
 
 // Switches to the owner and group of the regular file `path` (symbolic

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <grp.h>
 #include <regex>
 #include <string>
 #include <sys/stat.h>
@@ -143,6 +144,29 @@ TEST_F(Credentials, LogsEverySwitch)
     EXPECT_TRUE(std::regex_search(lines, std::regex(info + "setresuid" + uids))) << lines;
     EXPECT_TRUE(std::regex_search(lines, std::regex(err + "setresuid\\(-1, 0, -1\\) \\[.+\\]\n"))) << lines;
     EXPECT_EQ(std::string::npos, lines.find("regained root")) << lines;
+}
+
+// "system" from a process that is plain root already changes and logs
+// nothing; root carrying another group still has its groups reset.
+TEST_F(Credentials, SystemFromPlainRootIsAlreadyDone)
+{
+    const VELA::Test::TestAccount& a = account_;
+    EXPECT_EQ("", InChild([&] {
+        std::string errors;
+        const gid_t zero = 0;
+        Check(errors, setgroups(1, &zero) == 0 && setresgid(0, 0, 0) == 0, "cannot become plain root");
+        std::string lines;
+        VelaLogSetSink([](int, const char* line, void* arg) { *static_cast<std::string*>(arg) += line; }, &lines);
+        Check(errors, ResetCredentialsByName("system", false), "plain root refused");
+        Check(errors, lines.empty(), "logged: " + lines);
+        const gid_t extra[] = {0, a.suppGid};
+        Check(errors, setgroups(2, extra) == 0, "cannot add a group");
+        Check(errors, ResetCredentialsByName("system", false), "root with a group refused");
+        Check(errors, !Has(Groups(), a.suppGid), "extra group kept");
+        Check(errors, lines.find("WARNING: setresgid(0, 0, 0)") != std::string::npos, "no switch logged: " + lines);
+        VelaLogSetSink(nullptr, nullptr);
+        return errors;
+    }));
 }
 
 TEST_F(Credentials, UnknownAndHostileNamesChangeNothing)
