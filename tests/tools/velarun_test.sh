@@ -86,7 +86,7 @@ sample)
 
     if nobody=$(id -u nobody 2>/dev/null) && group=$(id -g nobody 2>/dev/null); then
         call 0 "$(req VELA.Sample 1 whoami)"
-        answer_is "{\"data\":{\"gid\":[$group,$group,$group],\"uid\":[$nobody,$nobody,$nobody]},\"httpd_restart\":false,\"success\":true}"
+        answer_is "{\"data\":{\"gid\":[$group,$group,$group],\"uid\":[$nobody,$nobody,$nobody],\"user\":\"\"},\"httpd_restart\":false,\"success\":true}"
     fi
     ;;
 *)

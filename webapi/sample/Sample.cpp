@@ -7,7 +7,9 @@
 //   typed   reads typed parameters with validators; a bad one gets 101 and
 //           the list of what was wrong
 //   whoami  runs as the user its description names ("runAs"), answers the
-//           real, effective and saved user and group ids
+//           real, effective and saved user and group ids and the login user
+//   adminonly  open to local administrators only ("allowUser"); answers the
+//           login user
 //   upload, download  (Transfer.cpp) a multipart form in, a file out
 #include <json/json.h>
 #include <string>
@@ -109,7 +111,7 @@ void Typed(APIRequest* req, APIResponse* resp)
     resp->SetSuccess(data);
 }
 
-void WhoAmI(APIRequest*, APIResponse* resp)
+void WhoAmI(APIRequest* req, APIResponse* resp)
 {
     uid_t ruid, euid, suid;
     gid_t rgid, egid, sgid;
@@ -118,12 +120,21 @@ void WhoAmI(APIRequest*, APIResponse* resp)
         return;
     }
     Json::Value data(Json::objectValue);
+    data["user"] = req->GetLoginUserName();
     for (uid_t id : {ruid, euid, suid}) {
         data["uid"].append(static_cast<Json::UInt>(id));
     }
     for (gid_t id : {rgid, egid, sgid}) {
         data["gid"].append(static_cast<Json::UInt>(id));
     }
+    resp->SetSuccess(data);
+}
+
+void AdminOnly(APIRequest* req, APIResponse* resp)
+{
+    Json::Value data(Json::objectValue);
+    data["user"] = req->GetLoginUserName();
+    data["isAdmin"] = req->IsAdmin();
     resp->SetSuccess(data);
 }
 
@@ -143,6 +154,7 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Sample", 1, "fail", Guarded<Fail>},
     {"VELA.Sample", 1, "typed", Guarded<Typed>},
     {"VELA.Sample", 1, "whoami", Guarded<WhoAmI>},
+    {"VELA.Sample", 1, "adminonly", Guarded<AdminOnly>},
     {"VELA.Sample", 1, "upload", Guarded<Sample::Upload>},
     {"VELA.Sample", 1, "download", Guarded<Sample::Download>},
     {"VELA.Sample.Echo", 1, "echo", Guarded<Echo>},
