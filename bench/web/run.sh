@@ -23,6 +23,7 @@
 #   BENCH_LIGHTTPD_EXTRA      lines added to the lighttpd configuration
 #   BENCH_ECHO_QUERY, BENCH_UPLOAD_QUERY, BENCH_DOWNLOAD_QUERY
 #                             query strings of the sample's methods
+#   BENCH_PLAIN=1             no private mount namespace (see below)
 #
 # The server is the project's own lighttpd configuration, written by
 # scripts/lighttpd-conf.sh, plus one block for the baselines under /bench/;
@@ -54,6 +55,7 @@ VELAADM=$build/velaadm
 MINIMAL=$build/bench/web/vela-bench-minimal-cgi
 BENCH_LIB=$build/bench/web/libvela-bench-transfer.so
 LOG_SINK=$build/bench/web/vela-bench-log-sink
+PEAK_RSS=$build/bench/web/vela-bench-peak-rss
 STAGE=$build/root
 
 die() {
@@ -63,8 +65,7 @@ die() {
 for tool in lighttpd curl wrk awk ss shuf; do
     command -v "$tool" >/dev/null || die "$tool is not installed (scripts/install-deps.sh)"
 done
-[ -x /usr/bin/time ] || die "GNU time (/usr/bin/time) is not installed"
-[ -x "$MINIMAL" ] && [ -x "$LOG_SINK" ] || die "the benchmark programs are not built in $build"
+[ -x "$MINIMAL" ] && [ -x "$LOG_SINK" ] && [ -x "$PEAK_RSS" ] || die "the benchmark programs are not built in $build"
 for n in "$SIZE_MB" "$DURATION" "$ROUNDS" "$CONNS" "$THREADS" "$XROUNDS"; do
     case $n in '' | *[!0-9]* | 0) die "sizes, durations and counts must be positive numbers" ;; esac
 done
@@ -113,12 +114,10 @@ trap 'exit 130' INT
 trap 'exit 143' TERM HUP
 
 mkdir -p "$ROOT/run" "$ROOT/etc/vela" "$VOLUME/sample" "$DOCROOT/bench" "$work/bin" || die "cannot populate $work"
-RUN_NOTE="state root /run on $(df -P "$ROOT/run" | awk 'NR == 2 { print $1 }')"
 SYSLOG=$work/syslog.txt
 SYSLOG_NOTE="syslog: the machine's log daemon"
 if [ -n "${VELA_BENCH_NS:-}" ]; then
     mount -t tmpfs -o mode=755,size=64m vela-bench-run "$ROOT/run" || die "cannot mount a tmpfs on $ROOT/run"
-    RUN_NOTE="state root /run on tmpfs"
     if [ ! -S /dev/log ]; then
         # A /dev of this namespace only: the machine's nodes bound again, and
         # a log sink on /dev/log.
@@ -147,6 +146,7 @@ if [ -n "${VELA_BENCH_NS:-}" ]; then
 elif [ ! -S /dev/log ]; then
     SYSLOG_NOTE="syslog: no log daemon, so every line goes to /dev/console (slow)"
 fi
+RUN_NOTE="state root /run on $(stat -f -c %T "$ROOT/run")"
 
 if [ "$have_velascgi" = 1 ]; then
     cp -a "$STAGE/." "$ROOT/" || die "cannot copy the staged root $STAGE"
@@ -198,11 +198,11 @@ peak_kib() {
     done
     awk '/^[0-9]+$/ { v = $1 } END { print v + 0 }' "$1" 2>/dev/null
 }
-# A wrapper that runs PROGRAM and records its peak RSS (GNU time, the
-# ru_maxrss of wait4) into LOG.
+# A wrapper that runs PROGRAM and records its peak RSS (the ru_maxrss of
+# wait4) into LOG.
 make_mem_wrapper() {
     local program=$1 out=$2 log=$3
-    printf '#!/bin/sh\nexec /usr/bin/time -a -o %s -f %%M %s\n' "'$log'" "'$program'" >"$out"
+    printf '#!/bin/sh\nexec %s %s %s\n' "'$PEAK_RSS'" "'$log'" "'$program'" >"$out"
     chmod 755 "$out"
 }
 # fast_output yes|no: the platform's X-Sendfile switch in webapi.conf.
@@ -329,18 +329,19 @@ prepare_login() {
 
 # ---- requests per second ----------------------------------------------------------
 
-# wrk_rps URL [SECONDS]: requests per second of one wrk run; any non-2xx
-# answer or socket error fails it.
+# wrk_rps URL [SECONDS]: requests per second of one wrk run; a non-2xx
+# answer fails it, socket errors (time-outs of a loaded machine) are shown.
 wrk_rps() {
     local out
     out=$(wrk -t"$THREADS" -c"$CONNS" -d"${2:-$DURATION}s" "${COOKIE_ARGS[@]}" "$1") || {
         echo "$out" >&2
         return 1
     }
-    if printf '%s\n' "$out" | grep -q -e 'Non-2xx' -e 'Socket errors'; then
+    if printf '%s\n' "$out" | grep -q 'Non-2xx'; then
         echo "$out" >&2
         return 1
     fi
+    printf '%s\n' "$out" | grep 'Socket errors' | sed "s|^ *|wrk on ${1%%\?*}: |" >&2
     printf '%s\n' "$out" | awk '/^Requests\/sec:/ { print $2 }'
 }
 
@@ -378,6 +379,7 @@ bench_rps() {
     curl -s -o /dev/null "$BASE/bench/minimal_mem.cgi?$ECHO_QUERY"
     echo "peak RSS of one call: velascgi echo $(peak_kib "$MEMLOG") KiB, baseline $(peak_kib "$work/mem-minimal.log") KiB"
     if [ -f "$SYSLOG" ]; then
+        sleep 0.5 # the sink may still be writing the last datagrams
         echo "syslog lines of one echo call: $(($(wc -l <"$SYSLOG") - lines))"
     fi
 }
