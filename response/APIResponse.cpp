@@ -86,7 +86,14 @@ bool APIResponse::AddCookie(std::string const& name, std::string const& value,
                             std::string const& path, long expireMinutes, std::string const& domain,
                             bool secure, bool httpOnly)
 {
-    return d_->AddCookie(name, value, path, expireMinutes, domain, secure, httpOnly);
+    return d_->AddCookie(name, value, path, expireMinutes, domain, secure, httpOnly, "");
+}
+
+bool APIResponse::AddCookie(std::string const& name, std::string const& value,
+                            std::string const& path, long expireMinutes, std::string const& domain,
+                            bool secure, bool httpOnly, std::string const& sameSite)
+{
+    return d_->AddCookie(name, value, path, expireMinutes, domain, secure, httpOnly, sameSite);
 }
 
 Json::Value APIResponse::GetCookies() const { return d_->GetCookies(); }

@@ -170,7 +170,8 @@ time_t APIResponsePrivate::CookieReferenceTime() const
 
 bool APIResponsePrivate::AddCookie(const std::string& name, const std::string& value,
                                    const std::string& path, long expireMinutes,
-                                   const std::string& domain, bool secure, bool httpOnly)
+                                   const std::string& domain, bool secure, bool httpOnly,
+                                   const std::string& sameSite)
 {
     if (name.empty() || path.empty()) {
         return false;
@@ -186,6 +187,10 @@ bool APIResponsePrivate::AddCookie(const std::string& name, const std::string& v
         VELA_LOG_ERR("cookie [%s] refused: line break in value, path or domain", name.c_str());
         return false;
     }
+    if (!sameSite.empty() && sameSite != "Strict" && sameSite != "Lax" && sameSite != "None") {
+        VELA_LOG_ERR("cookie [%s] refused: SameSite must be Strict, Lax or None", name.c_str());
+        return false;
+    }
     // An expiry past what time_t or struct tm can hold is refused rather than
     // clamped: a silently different date would be worse than no cookie.
     time_t reference = expireMinutes > 0 ? CookieReferenceTime() : 0;
@@ -195,6 +200,9 @@ bool APIResponsePrivate::AddCookie(const std::string& name, const std::string& v
         VELA_LOG_ERR("cookie [%s] refused: expiry of %ld minutes from %lld is out of range",
                      name.c_str(), expireMinutes, static_cast<long long>(reference));
         return false;
+    }
+    if (!sameSite.empty()) {
+        line += "; SameSite=" + sameSite;
     }
     // APIBase::SetData writes object sections only; this one is an array.
     Json::Value& cookies = data_["setCookie"];

@@ -47,8 +47,10 @@ public:
     void AddCallback(APICallbackFn fn, void* arg);
     const APICallbackList& Callbacks() const { return callbacks_; }
 
+    // `sameSite`: "", "Strict", "Lax" or "None" (see APIResponse::AddCookie).
     bool AddCookie(const std::string& name, const std::string& value, const std::string& path,
-                   long expireMinutes, const std::string& domain, bool secure, bool httpOnly);
+                   long expireMinutes, const std::string& domain, bool secure, bool httpOnly,
+                   const std::string& sameSite);
     Json::Value GetCookies() const;
 
     // A copy of a whole section (null when missing).

@@ -85,6 +85,12 @@ public:
     // URL-encoded; `domain` is written when non-empty.
     bool AddCookie(std::string const& name, std::string const& value, std::string const& path,
                    long expireMinutes, std::string const& domain, bool secure, bool httpOnly);
+    // The same, with "; SameSite=<sameSite>" at the end of the line:
+    // `sameSite` is "Strict", "Lax" or "None" (browsers take "None" only
+    // with `secure`); "" adds nothing; anything else refuses the cookie.
+    bool AddCookie(std::string const& name, std::string const& value, std::string const& path,
+                   long expireMinutes, std::string const& domain, bool secure, bool httpOnly,
+                   std::string const& sameSite);
     // The Set-Cookie lines, in call order.
     Json::Value GetCookies() const;
 

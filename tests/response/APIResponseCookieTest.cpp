@@ -128,5 +128,22 @@ TEST(APIResponseCookie, SameNameTwiceKeepsBothInOrder)
     EXPECT_EQ(expected, resp.GetCookies());
 }
 
+TEST(APIResponseCookie, SameSiteEndsTheLine)
+{
+    APIRequest req = RequestWithClientTime(0);
+    APIResponse resp(&req);
+    ASSERT_TRUE(resp.AddCookie("id", "s", "/", 0, "", true, true, "Strict"));
+    ASSERT_TRUE(resp.AddCookie("id", "s", "/", 10, "", false, false, "Lax"));
+    ASSERT_TRUE(resp.AddCookie("id", "", "/", -1, "", true, true, ""));
+    for (const char* bad : {"strict", "Strict; secure", "Strict\r\nX-A: 1", " None"}) {
+        EXPECT_FALSE(resp.AddCookie("id", "s", "/", 0, "", true, true, bad)) << bad;
+    }
+    Json::Value expected(Json::arrayValue);
+    expected.append("id=s; path=/; secure; httponly; SameSite=Strict");
+    expected.append("id=s; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT; SameSite=Lax");
+    expected.append("id=; path=/; expires=Thu, 01-Jan-1970 00:00:01 GMT; secure; httponly");
+    EXPECT_EQ(expected, resp.GetCookies());
+}
+
 }  // namespace
 }  // namespace VELA
