@@ -34,6 +34,7 @@ namespace Platform {
     X(BIO_ctrl)                           \
     X(BIO_free)                           \
     X(EVP_sha256)                         \
+    X(EVP_Digest)                         \
     X(EVP_aes_256_gcm)                    \
     X(EVP_PKEY_CTX_new_from_name)         \
     X(EVP_PKEY_CTX_new_from_pkey)         \
