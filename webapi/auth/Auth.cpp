@@ -1,0 +1,229 @@
+// The login API "VELA.Auth" (description VELA.Auth.lib): open to callers
+// without a session, run as "system".
+//
+//   login   POST account, passwd: checks the password through PAM (Pam.cpp)
+//           behind the brute-force guard (vela/loginguard.h), replaces the
+//           caller's session ("id" cookie) with a new one and sets the cookie
+//           "id"; answers {"sid", "token", "account", "isAdmin"}
+//   logout  removes the caller's session and deletes the cookie
+//   key     the public key of encrypted parameters: {"publicKey": <PEM>}
+//
+// Error codes of this API (besides the framework's 101 for a malformed
+// call):
+//   400  wrong account or password (also: unknown or locked account)
+//   401  right password, but it has expired and must be changed first
+//   402  the login could not be completed on the server (logged)
+//   407  too many failed logins: blocked, {"waitSeconds": <seconds>}
+#include <cstring>
+#include <json/json.h>
+#include <string>
+
+#include "Pam.h"
+#include "vela/cgi.h"
+#include "vela/log.h"
+#include "vela/loginguard.h"
+#include "vela/session.h"
+#include "vela/user.h"
+#include "webapi/APIError.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webapi/APITable.h"
+
+#define HANDLER_EXPORT extern "C" __attribute__((visibility("default")))
+
+namespace {
+
+using VELA::APIRequest;
+using VELA::APIResponse;
+
+constexpr int kErrWrongPassword = 400;
+constexpr int kErrPasswordExpired = 401;
+constexpr int kErrServer = 402;
+constexpr int kErrBlocked = 407;
+
+constexpr size_t kMaxAccount = VELA_LOGIN_ACCOUNT_MAX;
+constexpr size_t kMaxPassword = 512;  // PAM's own bound of an answer
+
+const char kCookie[] = "id";
+
+// Printable bytes only: no NUL, no other control byte, no DEL.
+bool IsPrintable(const char* text, size_t len)
+{
+    for (size_t i = 0; i < len; ++i) {
+        const unsigned char c = static_cast<unsigned char>(text[i]);
+        if (c < 0x20 || c == 0x7f) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// The string parameter `name` of 1 to `maxLen` printable bytes, without
+// copying it. False when it is missing, not a string or not like that.
+bool TextParam(const APIRequest* req, const char* name, size_t maxLen, const char*& text, size_t& len)
+{
+    static const Json::Value kNone;
+    const Json::Value& v = req->GetParamRef(name, kNone);
+    const char* begin = nullptr;
+    const char* end = nullptr;
+    if (!v.isString() || !v.getString(&begin, &end)) {
+        return false;
+    }
+    len = static_cast<size_t>(end - begin);
+    text = begin;
+    return len >= 1 && len <= maxLen && IsPrintable(begin, len);
+}
+
+// A user name PAM and NSS can be asked about: the platform's rule (no "/",
+// ":", control byte, not "." or "..") and no leading "-", which helpers
+// would read as an option.
+bool IsAccount(const std::string& account)
+{
+    return VELAUserNameIsValid(account.c_str()) == 1 && account[0] != '-';
+}
+
+bool OverHttps(const APIRequest* req) { return req->GetURLProto("") == "https"; }
+
+void Login(APIRequest* req, APIResponse* resp)
+{
+    if (req->GetRequestMethod() != VELA::REQUEST_METHOD_POST) {
+        VELA_LOG_ERR("login refused: the credentials must come in a POST body");
+        resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+        return;
+    }
+    const std::string clientIP = req->GetRemoteIP();
+    const char* accountText = nullptr;
+    const char* password = nullptr;
+    size_t accountLen = 0;
+    size_t passwordLen = 0;
+    const bool accountOk = TextParam(req, "account", kMaxAccount, accountText, accountLen);
+    const std::string account = accountOk ? std::string(accountText, accountLen) : "";
+    const char* bad = nullptr;
+    if (!accountOk || !IsAccount(account)) {
+        bad = "account";
+    } else if (!TextParam(req, "passwd", kMaxPassword, password, passwordLen)) {
+        bad = "passwd";
+    }
+    if (bad != nullptr) {
+        VELA_LOG_ERR("login from %s refused: \"%s\" missing, empty, too long or not a valid text",
+                     clientIP.empty() ? "an unknown address" : clientIP.c_str(), bad);
+        resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+        return;
+    }
+    VelaLoginSettings settings;
+    VelaLoginSettingsLoad(&settings);
+
+    int wait = 0;
+    const int verdict = VelaLoginGuardBegin(&settings, account.c_str(), clientIP.c_str(), &wait);
+    if (verdict == VELA_LOGIN_GUARD_BLOCKED) {
+        Json::Value details(Json::objectValue);
+        details["waitSeconds"] = wait;
+        resp->SetError(kErrBlocked, details);
+        return;
+    }
+    if (verdict != VELA_LOGIN_GUARD_ALLOW) {
+        resp->SetError(kErrServer);
+        return;
+    }
+
+    std::string user;
+    std::string reason;
+    const VelaAuth::PamResult checked =
+        VelaAuth::CheckPassword(account, password, passwordLen, clientIP, user, reason);
+    if (checked == VelaAuth::PamResult::Denied) {
+        VelaLoginGuardFailed(&settings, account.c_str(), clientIP.c_str(), reason.c_str());
+        resp->SetError(kErrWrongPassword);
+        return;
+    }
+    if (checked == VelaAuth::PamResult::Error) {
+        resp->SetError(kErrServer);
+        return;
+    }
+    VelaLoginGuardSucceeded(account.c_str(), clientIP.c_str());
+    if (checked == VelaAuth::PamResult::Expired) {
+        VELA_LOG(LOG_AUTHPRIV | LOG_NOTICE, "login of \"%s\" refused: the password has expired", user.c_str());
+        resp->SetError(kErrPasswordExpired);
+        return;
+    }
+
+    // A new login ends the session the caller came with.
+    const std::string oldSid = req->GetSessionID();
+    if (!oldSid.empty()) {
+        VelaSessionRemove(oldSid.c_str());
+    }
+    VelaSessionOptions options;
+    options.idleTimeout = settings.idleTimeout;
+    options.lifetime = settings.lifetime;
+    options.tokenProtect = true;
+    char lang[4] = "";
+    if (VelaCgiGetLang(nullptr, lang, sizeof(lang)) == 0) {
+        options.lang = lang;
+    }
+    std::string sid;
+    std::string token;
+    if (VelaSessionCreate(user.c_str(), clientIP.empty() ? nullptr : clientIP.c_str(), &options, sid, token) != 0) {
+        resp->SetError(kErrServer);
+        return;
+    }
+    // A browser-session cookie: gone when the browser closes, never sent
+    // along with requests of other sites, out of reach of scripts, and
+    // marked Secure when the login came over HTTPS.
+    if (!resp->AddCookie(kCookie, sid, "/", 0, "", OverHttps(req), true, "Strict")) {
+        VelaSessionRemove(sid.c_str());
+        resp->SetError(kErrServer);
+        return;
+    }
+    Json::Value data(Json::objectValue);
+    data["sid"] = sid;
+    data["token"] = token;
+    data["account"] = user;
+    data["isAdmin"] = VLIBGroupIsAdminGroupMem(user.c_str(), 0) == 1;
+    resp->SetSuccess(data);
+}
+
+void Logout(APIRequest* req, APIResponse* resp)
+{
+    const std::string sid = req->GetSessionID();
+    if (!sid.empty() && VelaSessionRemove(sid.c_str()) == -1) {
+        VELA_LOG_ERR("logout: the session could not be removed");
+        resp->SetError(kErrServer);
+        return;
+    }
+    resp->AddCookie(kCookie, "", "/", -1, "", OverHttps(req), true, "Strict");
+    resp->SetSuccess();
+}
+
+void Key(APIRequest*, APIResponse* resp)
+{
+    std::string pem;
+    if (VelaCgiPublicKeyPEM(pem) != 0) {
+        resp->SetError(kErrServer);
+        return;
+    }
+    Json::Value data(Json::objectValue);
+    data["publicKey"] = pem;
+    resp->SetSuccess(data);
+}
+
+// Handlers must not let an exception reach the framework.
+template <void (*Handler)(APIRequest*, APIResponse*)>
+void Guarded(APIRequest* req, APIResponse* resp)
+{
+    try {
+        Handler(req, resp);
+    } catch (const std::exception& e) {
+        VELA_LOG_ERR("VELA.Auth: %s", e.what());
+        resp->SetError(kErrServer);
+    }
+}
+
+_tag_API_TABLE g_table[] = {
+    {"VELA.Auth", 1, "login", Guarded<Login>},
+    {"VELA.Auth", 1, "logout", Guarded<Logout>},
+    {"VELA.Auth", 1, "key", Guarded<Key>},
+    {nullptr, 0, nullptr, nullptr},
+};
+
+}  // namespace
+
+HANDLER_EXPORT _tag_API_TABLE* GetAPITable(void) { return g_table; }
