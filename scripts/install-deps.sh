@@ -7,12 +7,19 @@ packages=(
   build-essential cmake pkg-config
   libjsoncpp-dev
   libssl-dev openssl passwd
+  libpam0g-dev
   libgtest-dev libgmock-dev googletest
   libbenchmark-dev
   clang libclang-rt-dev
-  wrk curl time
+  wrk curl
   lighttpd media-types
+  chromium
 )
+# Node.js and npm drive the browser test. A node that came from elsewhere
+# (its own package that bundles npm) is kept: Debian's npm would replace it.
+if ! command -v node >/dev/null 2>&1 || ! command -v npm >/dev/null 2>&1; then
+  packages+=(nodejs npm)
+fi
 
 missing=()
 for p in "${packages[@]}"; do

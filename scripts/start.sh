@@ -26,6 +26,17 @@ esac
 velascgi="$build/velascgi"
 [ -x "$velascgi" ] || die "$velascgi was not built"
 [ -d "$root/usr/vela/velaman/webapi" ] || die "no web-API directory under $root"
+# The PAM service of the login API, read from <root>/etc/pam.d (the build
+# stages it under build/root). Installed when missing; an existing file is
+# the administrator's and stays as it is.
+pamfile="${root%/}/etc/pam.d/vela-webapi"
+if [ ! -e "$pamfile" ]; then
+  if [ "$root" != / ] || [ "$(id -u)" -eq 0 ]; then
+    install -D -m 0644 "$repo/deploy/pam/vela-webapi" "$pamfile"
+  else
+    echo "start.sh: $pamfile is missing; logins fail until root installs deploy/pam/vela-webapi there" >&2
+  fi
+fi
 
 if pid="$(running_pid)"; then
   die "lighttpd already runs (pid $pid, $pidfile); stop it with scripts/stop.sh"
@@ -98,6 +109,10 @@ Create a login session for $user, then send its id as the cookie "id":
   sid=\$(VELA_ROOT=$root $build/velaadm session create $user --ip 127.0.0.1 | sed -n 's/^sid=//p')
   curl --cookie "id=\$sid" '$url?api=VELA.Sample&version=1&method=echo&text=hello'
   curl --cookie "id=\$sid" '$url?api=VELA.Sample&version=1&method=whoami'
+
+Or log in with an account of this machine (PAM); later calls send the
+cookie and the answer's "token" as the header X-Vela-Token:
+  curl -c jar --data-urlencode account=$user --data-urlencode 'passwd=<password>' '$url?api=VELA.Auth&version=1&method=login'
 
 Stop it with: $stop
 EOF

@@ -1,0 +1,125 @@
+// Drives deploy/www/login.html in headless Chromium: a wrong password shows
+// the sign-in error; the right one signs in (encrypted credentials, HttpOnly
+// session cookie, token header) and the page shows the sample's whoami
+// answer for the user.
+//
+// usage: node login.test.js BASE_URL ACCOUNT PASSWORD
+// Exit 0 when every check passed, 1 otherwise. CHROMIUM names the browser
+// (default /usr/bin/chromium).
+"use strict";
+
+const { chromium } = require("playwright-core");
+
+const [base, account, password] = process.argv.slice(2);
+if (!base || !account || !password) {
+  console.error("usage: node login.test.js BASE_URL ACCOUNT PASSWORD");
+  process.exit(2);
+}
+// Bounded waits: a slow machine gets time, a broken page an answer.
+const STEP_MS = 60000;
+
+let failures = 0;
+// What the page loaded and logged, printed when a check failed.
+const pageLog = [];
+
+function check(ok, message) {
+  if (!ok) {
+    console.log(`FAIL: ${message}`);
+    failures++;
+  }
+}
+
+// Waits until the sign-in is over: the whoami answer or the error shown.
+// Their texts ("" for the one not shown).
+async function outcome(page) {
+  await page.waitForFunction(() => ["user", "error"].some((id) => {
+    const e = document.getElementById(id);
+    return !e.closest("[hidden]") && e.textContent.trim() !== "";
+  }), null, { timeout: STEP_MS });
+  return page.evaluate(() => {
+    const text = (id) => (document.getElementById(id).closest("[hidden]") ? "" : document.getElementById(id).textContent.trim());
+    return { user: text("user"), error: text("error") };
+  });
+}
+
+async function signIn(page, passwd) {
+  await page.fill("#account", account);
+  await page.fill("#passwd", passwd);
+  await page.click("#submit");
+}
+
+async function main() {
+  await run();
+  if (failures !== 0) {
+    console.log("---- what the page did");
+    console.log(pageLog.join("\n"));
+    console.log(`${failures} check(s) failed`);
+    return 1;
+  }
+  console.log("browser login checks passed");
+  return 0;
+}
+
+async function run() {
+  const browser = await chromium.launch({
+    executablePath: process.env.CHROMIUM || "/usr/bin/chromium",
+    args: ["--no-sandbox"],
+    timeout: STEP_MS,
+  });
+  try {
+    const context = await browser.newContext();
+    const page = await context.newPage();
+    page.setDefaultTimeout(STEP_MS);
+    page.on("console", (m) => pageLog.push(`console.${m.type()}: ${m.text()}`));
+    page.on("pageerror", (e) => pageLog.push(`page error: ${e.message}`));
+    page.on("response", (r) => pageLog.push(`${r.status()} ${r.request().method()} ${r.url()}`));
+
+    const reply = await page.goto(`${base}/login.html`);
+    check(reply && reply.status() === 200, `login.html: HTTP ${reply && reply.status()}`);
+
+    // A wrong password: the error, no session.
+    await signIn(page, `x${password}`);
+    const wrong = await outcome(page);
+    check(/wrong account or password/i.test(wrong.error), `wrong password shows ${JSON.stringify(wrong)}`);
+    check(wrong.user === "", "wrong password: the whoami answer is shown");
+    const before = await context.cookies(base);
+    check(!before.some((c) => c.name === "id"), "wrong password: a session cookie was set");
+
+    // The right one: whoami answers for the user, the error is gone.
+    await signIn(page, password);
+    const right = await outcome(page);
+    check(right.user === `Signed in as ${account}` && right.error === "",
+          `after the login the page shows ${JSON.stringify(right)}`);
+    if (right.user === "") {
+      return;  // nothing signed in: the rest cannot be checked
+    }
+    const answer = JSON.parse(await page.textContent("#answer"));
+    check(answer.user === account, `whoami answered ${JSON.stringify(answer)}`);
+
+    // The session cookie is out of reach of scripts and of other sites.
+    const cookie = (await context.cookies(base)).find((c) => c.name === "id");
+    check(cookie && cookie.httpOnly && cookie.sameSite === "Strict" && cookie.path === "/",
+          `session cookie ${JSON.stringify(cookie)}`);
+    const scriptCookies = await page.evaluate(() => document.cookie);
+    check(!/(^|;\s*)id=/.test(scriptCookies), `document.cookie shows the session: "${scriptCookies}"`);
+
+    // Sign out: whoami is refused again.
+    await page.click("#logout");
+    await page.waitForSelector("#whoami", { state: "hidden" });
+    const status = await page.evaluate(async () => {
+      const r = await fetch("/webapi/entry.cgi?api=VELA.Sample&version=1&method=whoami");
+      return (await r.json()).error;
+    });
+    check(status && status.code === 119, `whoami after signing out: ${JSON.stringify(status)}`);
+  } catch (e) {
+    console.log(`FAIL: ${e.message}`);
+    failures++;
+  } finally {
+    await browser.close();
+  }
+}
+
+main().then((code) => process.exit(code), (e) => {
+  console.log(`FAIL: ${e.stack || e}`);
+  process.exit(1);
+});

@@ -1,0 +1,77 @@
+#!/usr/bin/env bash
+# Browser test of the sign-in page: a private lighttpd (tests/e2e/server.sh)
+# serves deploy/www and the web API under a temporary system root; a Linux
+# account made for the run signs in through the page in headless Chromium,
+# driven by playwright-core (login.test.js).
+#
+# usage: run.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR WORK_DIR
+# WORK_DIR receives node_modules (npm ci from package-lock.json, again only
+# when the lock changes). Exit 0 passed, 1 failed, 77 (skipped) when
+# chromium, node, npm, lighttpd or curl is missing or when not run as root
+# (the account, PAM and the identity switches need it).
+set -u
+
+[ $# -eq 4 ] || { echo "usage: run.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR WORK_DIR" >&2; exit 2; }
+VELASCGI=$(realpath -e "$1") || exit 1
+WEBAPI=$(realpath -e "$2") || exit 1
+SRC=$(realpath -e "$3") || exit 1
+WORK=$4
+
+CHROMIUM=${CHROMIUM:-/usr/bin/chromium}
+if [ ! -x "$CHROMIUM" ]; then
+  echo "SKIP: $CHROMIUM is not installed"
+  exit 77
+fi
+for tool in node npm lighttpd curl useradd chpasswd; do
+  if ! command -v "$tool" >/dev/null 2>&1; then
+    echo "SKIP: $tool is not installed"
+    exit 77
+  fi
+done
+if [ "$(id -u)" -ne 0 ]; then
+  echo "SKIP: needs root (a Linux account, PAM, identity switches)"
+  exit 77
+fi
+
+. "$SRC/tests/e2e/server.sh"
+
+failed=0
+cleanup() {
+  if [ "$failed" -ne 0 ]; then
+    srv_logs
+  fi
+  srv_cleanup
+}
+trap cleanup EXIT
+trap 'exit 1' HUP INT TERM
+
+# ---- playwright-core, exactly as the lock file pins it.
+mkdir -p "$WORK" || exit 1
+if ! cmp -s "$SRC/tests/browser/package-lock.json" "$WORK/package-lock.json" ||
+   [ ! -f "$WORK/node_modules/playwright-core/package.json" ]; then
+  cp "$SRC/tests/browser/package.json" "$SRC/tests/browser/package-lock.json" "$WORK/" || exit 1
+  if ! (cd "$WORK" && npm ci --no-audit --no-fund --loglevel=error); then
+    rm -f "$WORK/package-lock.json"
+    echo "FAIL: npm ci in $WORK"
+    exit 1
+  fi
+fi
+
+# ---- The server and an account.
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
+mkdir -p "$ROOT/etc/pam.d"
+cp "$SRC/deploy/pam/vela-webapi" "$ROOT/etc/pam.d/vela-webapi" || exit 1
+account="vtw$(printf '%04x%04x' $RANDOM $RANDOM)"
+password=$(srv_password)
+srv_add_user "$account" "$password" || { echo "FAIL: cannot create $account"; exit 1; }
+srv_start "$SRC/deploy/www" || { failed=1; exit 1; }
+
+NODE_PATH="$WORK/node_modules" CHROMIUM="$CHROMIUM" \
+  node "$SRC/tests/browser/login.test.js" "$BASE" "$account" "$password"
+rc=$?
+if [ "$rc" -eq 0 ] && grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null; then
+  echo "FAIL: sanitizer reports in the logs"
+  rc=1
+fi
+[ "$rc" -eq 0 ] || failed=1
+exit "$rc"

@@ -1,0 +1,307 @@
+#!/usr/bin/env bash
+# End-to-end: login and access control through the real web server. Real
+# Linux accounts (a user and a member of the administrators group) log in
+# through PAM with VELA.Auth, then curl calls the sample API with the session cookie
+# and the anti-forgery token, and every refusal of the session check is
+# provoked: no session, a logged-out or replaced session, an idle session,
+# another client address, a missing token, a user on an administrators' API.
+# Also: a login with parameters encrypted by openssl, blocking after repeated
+# failures, and the modes of the session files.
+#
+# usage: login.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR
+# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without
+# lighttpd, curl, openssl or the account tools, or when not run as root
+# (accounts are created, PAM reads /etc/shadow, velascgi switches identity).
+set -u
+
+[ $# -eq 3 ] || { echo "usage: login.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR" >&2; exit 2; }
+VELASCGI=$(realpath -e "$1") || exit 1
+WEBAPI=$(realpath -e "$2") || exit 1
+SRC=$(realpath -e "$3") || exit 1
+
+for tool in lighttpd curl openssl useradd chpasswd runuser; do
+  if ! command -v "$tool" >/dev/null 2>&1; then
+    echo "SKIP: $tool is not installed"
+    exit 77
+  fi
+done
+if [ "$(id -u)" -ne 0 ]; then
+  echo "SKIP: needs root (accounts, PAM, identity switches)"
+  exit 77
+fi
+
+. "$SRC/tests/e2e/server.sh"
+
+# Error codes of VELA.Auth login (webapi/auth/).
+ERR_WRONG_PASSWORD=400
+ERR_BLOCKED=407
+
+failures=0
+cleanup() {
+  if [ "$failures" -ne 0 ]; then
+    srv_logs
+  fi
+  srv_cleanup
+}
+trap cleanup EXIT
+trap 'exit 1' HUP INT TERM
+
+fail() {
+  echo "FAIL: $*"
+  failures=$((failures + 1))
+}
+
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
+mkdir -p "$ROOT/etc/pam.d" "$RUN/www"
+cp "$SRC/deploy/pam/vela-webapi" "$ROOT/etc/pam.d/vela-webapi" || exit 1
+# Names unique to the run: a run killed before its clean-up cannot collide
+# with the next, nor a run beside it on the same machine.
+tag=$(printf '%04x%04x' $RANDOM $RANDOM)
+USER1="vtu$tag" PASS1=$(srv_password)
+ADMIN="vta$tag" PASSA=$(srv_password)
+USER3="vtb$tag" PASS3=$(srv_password)
+ADMINS="vtg$tag"
+
+# The administrators group of the root is a group of the run's own
+# (admin_group), so the machine's "administrators" is never touched. Low
+# failure limits so that blocking is reached quickly; windows long enough
+# that a slow machine cannot let the block lapse during the test.
+cat >"$ROOT/etc/vela/webapi.conf" <<EOF
+admin_group="$ADMINS"
+login_max_failures="3"
+login_window_minutes="30"
+login_block_minutes="30"
+EOF
+
+srv_add_user "$USER1" "$PASS1" || { echo "FAIL: cannot create $USER1"; exit 1; }
+srv_add_user "$ADMIN" "$PASSA" "$ADMINS" || { echo "FAIL: cannot create $ADMIN"; exit 1; }
+srv_add_user "$USER3" "$PASS3" || { echo "FAIL: cannot create $USER3"; exit 1; }
+
+srv_start "$RUN/www" || { failures=1; exit 1; }
+
+# ---- Helpers. Every call leaves the answer in $TMP/body, the header block in
+# $TMP/headers and the HTTP status in $status.
+status=""
+call() {
+  status=$(curl -s --max-time 60 -D "$TMP/headers" -o "$TMP/body" -w '%{http_code}' "$@") || status="curl failed"
+}
+# expect NAME TEXT...: the JSON answer holds every TEXT (compact JSON).
+expect() {
+  local name=$1 text
+  shift
+  for text in "$@"; do
+    grep -qF -- "$text" "$TMP/body" || fail "$name: answer lacks $text: $(head -c 600 "$TMP/body")"
+  done
+}
+expect_header() {
+  grep -qi -- "^$2" "$TMP/headers" || fail "$1: no header \"$2\" in: $(tr -d '\r' <"$TMP/headers")"
+}
+# A string member of the answer.
+member() { sed -n "s/.*\"$1\":\"\\([^\"]*\\)\".*/\\1/p" "$TMP/body"; }
+# RFC 3986 percent-encoding of every byte but the unreserved ones.
+pct() {
+  local LC_ALL=C s=$1 out="" c i
+  for ((i = 0; i < ${#s}; i++)); do
+    c=${s:i:1}
+    case "$c" in
+      [A-Za-z0-9._~-]) out+=$c ;;
+      *) out+=$(printf '%%%02X' "'$c") ;;
+    esac
+  done
+  printf '%s' "$out"
+}
+# The lines velascgi logged from here on: log_mark, then log_since.
+log_mark() { log_from=$(($(wc -l <"$RUN/cgi.log" 2>/dev/null || echo 0) + 1)); }
+log_since() { tail -n "+$log_from" "$RUN/cgi.log" 2>/dev/null; }
+
+AUTH="$URL?api=VELA.Auth&version=1"
+WHOAMI="$URL?api=VELA.Sample&version=1&method=whoami"
+ADMINONLY="$URL?api=VELA.Sample&version=1&method=adminonly"
+nobody_uid=$(id -u nobody)
+
+# login NAME ACCOUNT PASSWORD [CURL ARGS...]: a plain form login; on success
+# sets $sid and $token.
+sid="" token=""
+login() {
+  local name=$1 account=$2 passwd=$3
+  shift 3
+  call "$@" --data "account=$(pct "$account")&passwd=$(pct "$passwd")" "$AUTH&method=login"
+  sid=$(member sid) token=$(member token)
+  if [ "$status" != 200 ] || ! grep -qF '"success":true' "$TMP/body" || [ -z "$sid" ] || [ -z "$token" ]; then
+    fail "$name: login of $account failed (HTTP $status): $(head -c 600 "$TMP/body")"
+    return 1
+  fi
+}
+# refused NAME CODE [WORD]: the answer is error CODE with the header
+# x-request-error WORD.
+refused() {
+  expect "$1" '"success":false'
+  grep -qE "\"code\":$2[,}]" "$TMP/body" || fail "$1: not error $2: $(head -c 600 "$TMP/body")"
+  if [ -n "${3:-}" ]; then
+    expect_header "$1" "x-request-error: $3"
+  fi
+}
+
+# ---- A user logs in: the answer, the cookie and its attributes.
+JAR1=$TMP/jar1
+if login "login" "$USER1" "$PASS1" -c "$JAR1"; then
+  expect "login" "\"account\":\"$USER1\"" '"isAdmin":false'
+  tr -d '\r' <"$TMP/headers" | grep -i '^Set-Cookie: id=' >"$TMP/setcookie"
+  grep -qF "id=$sid;" "$TMP/setcookie" || fail "login: no cookie id=<sid>: $(cat "$TMP/setcookie")"
+  for attr in HttpOnly 'SameSite=Strict' 'path=/'; do
+    grep -qi -- "; *$attr\\(;\\|\$\\)" "$TMP/setcookie" || fail "login: the cookie lacks $attr: $(cat "$TMP/setcookie")"
+  done
+fi
+SID1=$sid TOKEN1=$token
+
+# ---- The session opens a method that needs a login: cookie plus token, in
+# the header or as the parameter VelaToken.
+call -b "$JAR1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
+expect "whoami with cookie and token" '"success":true' "\"user\":\"$USER1\"" "\"uid\":[$nobody_uid,"
+call -b "$JAR1" "$WHOAMI&VelaToken=$TOKEN1"
+expect "whoami with VelaToken" '"success":true' "\"user\":\"$USER1\""
+
+# ---- No session at all.
+call -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
+refused "whoami without a session" 119 unauth
+
+# ---- The token missing or wrong: refused, and velascgi says why.
+log_mark
+call -b "$JAR1" "$WHOAMI"
+refused "whoami without the token" 105 noprivilege
+log_since | grep -qF 'Token Authentication Fail.' ||
+  fail "no \"Token Authentication Fail.\" in cgi.log: $(log_since | tail -n 5)"
+call -b "$JAR1" -H "X-Vela-Token: x${TOKEN1:1}" "$WHOAMI"
+refused "whoami with a wrong token" 105 noprivilege
+
+# ---- Another client address: a second loopback address as the source, and
+# a forwarded address from a trusted proxy (loopback by default).
+call --interface 127.0.0.2 -b "$JAR1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
+refused "whoami from 127.0.0.2" 150 errorip
+call -H "X-Forwarded-For: 192.0.2.44" -b "$JAR1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
+refused "whoami forwarded for 192.0.2.44" 150 errorip
+
+# ---- An administrators' method: refused to the user, open to an
+# administrator.
+call -b "$JAR1" -H "X-Vela-Token: $TOKEN1" "$ADMINONLY"
+refused "adminonly as a user" 105
+JARA=$TMP/jara
+if login "admin login" "$ADMIN" "$PASSA" -c "$JARA"; then
+  expect "admin login" "\"account\":\"$ADMIN\"" '"isAdmin":true'
+  call -b "$JARA" -H "X-Vela-Token: $token" "$ADMINONLY"
+  expect "adminonly as an administrator" '"success":true' "\"user\":\"$ADMIN\"" '"isAdmin":true'
+fi
+
+# ---- Session files: 0600 in a 0700 directory, out of reach of the user.
+SESSIONS=$ROOT/run/vela/sessions
+if [ -f "$SESSIONS/$SID1" ]; then
+  [ "$(stat -c %a "$SESSIONS/$SID1")" = 600 ] || fail "session file mode $(stat -c %a "$SESSIONS/$SID1")"
+  [ "$(stat -c %a "$SESSIONS")" = 700 ] || fail "session directory mode $(stat -c %a "$SESSIONS")"
+  if runuser -u "$USER1" -- cat "$SESSIONS/$SID1" >/dev/null 2>&1; then
+    fail "$USER1 can read its session file"
+  fi
+  if runuser -u "$USER1" -- ls "$SESSIONS" >/dev/null 2>&1; then
+    fail "$USER1 can list the session directory"
+  fi
+else
+  fail "no session file $SESSIONS/$SID1"
+fi
+
+# ---- A new login with the old cookie replaces the old session.
+if login "second login" "$USER1" "$PASS1" -b "$JAR1" -c "$JAR1"; then
+  [ "$sid" != "$SID1" ] || fail "second login: the same session id again"
+  call -b "id=$SID1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
+  refused "whoami with the replaced session" 105 noprivilege
+  [ -e "$SESSIONS/$SID1" ] && fail "second login: the old session file is still there"
+  call -b "$JAR1" -H "X-Vela-Token: $token" "$WHOAMI"
+  expect "whoami with the new session" '"success":true' "\"user\":\"$USER1\""
+fi
+SID2=$sid TOKEN2=$token
+
+# ---- Logout: the session is gone; the browser drops the cookie, and the
+# old id sent anyway is refused.
+call -b "$JAR1" -c "$JAR1" -H "X-Vela-Token: $TOKEN2" "$AUTH&method=logout"
+expect "logout" '"success":true'
+[ -e "$SESSIONS/$SID2" ] && fail "logout: the session file is still there"
+call -b "$JAR1" -H "X-Vela-Token: $TOKEN2" "$WHOAMI"
+refused "whoami after logout (cookie jar)" 119 unauth
+call -b "id=$SID2" -H "X-Vela-Token: $TOKEN2" "$WHOAMI"
+refused "whoami after logout (old id)" 105 noprivilege
+
+# ---- Idle timeout: a login made while webapi.conf sets a short idle
+# timeout keeps it in its session; the file's last use (and creation, which
+# may not lie after it) is then moved back past it, as root, instead of
+# waiting on the clock.
+cp "$ROOT/etc/vela/webapi.conf" "$TMP/webapi.conf"
+echo 'session_idle_timeout="60"' >>"$ROOT/etc/vela/webapi.conf"
+login "login with a short idle timeout" "$USER1" "$PASS1"
+ok=$?
+cp "$TMP/webapi.conf" "$ROOT/etc/vela/webapi.conf"
+if [ "$ok" -eq 0 ]; then
+  file=$SESSIONS/$sid
+  grep -qE '"idleTimeout" *: *60[,}[:space:]]' "$file" ||
+    fail "session_idle_timeout=60 is not the session's: $(cat "$file")"
+  call -b "id=$sid" -H "X-Vela-Token: $token" "$WHOAMI"
+  expect "whoami before the idle timeout" '"success":true'
+  past=$(($(date +%s) - 120))
+  sed -E "s/(\"(lastUse|created)\" *: *)[0-9]+/\\1$past/g" "$file" >"$file.aged" &&
+    chmod 0600 "$file.aged" && mv -f "$file.aged" "$file"
+  call -b "id=$sid" -H "X-Vela-Token: $token" "$WHOAMI"
+  refused "whoami after the idle timeout" 106 timeout
+fi
+
+# ---- Wrong passwords and unknown accounts get the same answer.
+login_fails() {
+  call "${@:4}" --data "account=$(pct "$2")&passwd=$(pct "$3")" "$AUTH&method=login"
+  refused "$1" "$ERR_WRONG_PASSWORD"
+  grep -qi '^Set-Cookie: id=' "$TMP/headers" && fail "$1: a failed login sets a cookie"
+}
+# From an address of their own, so that these failures count against no
+# other check's address.
+login_fails "wrong password" "$USER1" "x$PASS1" --interface 127.0.0.4
+login_fails "unknown account" "nosuch$tag" "$PASS1" --interface 127.0.0.4
+
+# ---- A login with the parameters encrypted by openssl: the server's public
+# key, RSA-OAEP with SHA-256, base64, percent-encoded.
+call "$AUTH&method=key"
+expect "key" '"success":true' '-----BEGIN PUBLIC KEY-----'
+member publicKey | sed 's/\\n/\n/g' >"$TMP/server.pem"
+if openssl pkey -pubin -in "$TMP/server.pem" -noout 2>"$TMP/openssl.err"; then
+  printf 'account=%s&passwd=%s' "$(pct "$USER1")" "$(pct "$PASS1")" |
+    openssl pkeyutl -encrypt -pubin -inkey "$TMP/server.pem" -pkeyopt rsa_padding_mode:oaep \
+      -pkeyopt rsa_oaep_md:sha256 -pkeyopt rsa_mgf1_md:sha256 -out "$TMP/cipher" 2>>"$TMP/openssl.err" ||
+    fail "openssl cannot encrypt: $(cat "$TMP/openssl.err")"
+  cipher=$(base64 -w0 "$TMP/cipher")
+  call -c "$TMP/jarc" --data-binary "__cIpHeRtExT=$(pct "$cipher")" "$AUTH&method=login"
+  expect "encrypted login" '"success":true' "\"account\":\"$USER1\""
+  token=$(member token)
+  call -b "$TMP/jarc" -H "X-Vela-Token: $token" "$WHOAMI"
+  expect "whoami after the encrypted login" '"success":true' "\"user\":\"$USER1\""
+else
+  fail "key: not an SPKI PEM key: $(cat "$TMP/openssl.err") $(head -c 600 "$TMP/body")"
+fi
+
+# ---- Blocking: after login_max_failures failures the right password is
+# refused as well. A third account from a third address, so that whatever
+# the block holds (account or address) it touches no other check.
+for i in 1 2 3; do
+  login_fails "failure $i before the block" "$USER3" "x$PASS3" --interface 127.0.0.3
+done
+call --interface 127.0.0.3 --data "account=$(pct "$USER3")&passwd=$(pct "$PASS3")" "$AUTH&method=login"
+refused "right password while blocked" "$ERR_BLOCKED"
+grep -qi '^Set-Cookie: id=' "$TMP/headers" && fail "a blocked login sets a cookie"
+# The account is blocked from any address.
+call --interface 127.0.0.5 --data "account=$(pct "$USER3")&passwd=$(pct "$PASS3")" "$AUTH&method=login"
+refused "right password from another address while blocked" "$ERR_BLOCKED"
+
+# ---- Nothing went wrong inside velascgi.
+if grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null; then
+  fail "sanitizer reports in the logs"
+fi
+
+if [ "$failures" -ne 0 ]; then
+  echo "$failures check(s) failed"
+  exit 1
+fi
+echo "all login checks passed ($URL)"
+exit 0

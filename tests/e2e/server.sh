@@ -1,0 +1,135 @@
+# Shared by the end-to-end scripts that drive the real server (sourced, not
+# run): a temporary system root that serves the staged web-API directory, a
+# private lighttpd from deploy/lighttpd.conf.in on a free port of 127.0.0.1,
+# and Linux accounts made for the run and removed afterwards.
+#
+#   srv_init SRC VELASCGI WEBAPI   TMP, ROOT and RUN; the root's web-API directory
+#   srv_start DOCROOT [ARG...]     lighttpd, ARGs go to scripts/lighttpd-conf.sh;
+#                                  sets BASE (http://127.0.0.1:<port>) and URL
+#                                  (the entry); 1 when it does not start
+#   srv_stop                       ends it (also done by srv_cleanup)
+#   srv_logs                       the tails of the server's and velascgi's logs
+#   srv_add_user NAME PASS [GROUP] a Linux account with that password
+#   srv_cleanup                    server, accounts, groups, TMP; call it from
+#                                  the caller's EXIT trap
+#
+# The caller checks for root, lighttpd and curl first.
+
+TMP="" ROOT="" RUN="" BASE="" URL="" LPID=""
+SRV_SRC="" SRV_VELASCGI=""
+SRV_USERS=() SRV_GROUPS=()
+
+srv_init() {
+  SRV_SRC=$1
+  SRV_VELASCGI=$2
+  TMP=$(mktemp -d "${TMPDIR:-/tmp}/vela-e2e-XXXXXX") || return 1
+  # Searchable like the real "/": what an account of the run can reach
+  # below the root then depends on the modes the server gives its files.
+  chmod 0755 "$TMP"
+  ROOT=$TMP/root
+  RUN=$TMP/run
+  mkdir -p "$ROOT/usr/vela/velaman" "$ROOT/etc/vela" "$RUN" || return 1
+  ln -s "$3" "$ROOT/usr/vela/velaman/webapi"
+}
+
+# lighttpd runs in the foreground as a child of the script (-D), so that
+# whoever ends the script's process tree ends the server as well. Another
+# program may take the port between the look and the bind: then try another.
+srv_start() {
+  local docroot=$1 port _
+  shift
+  local args=(--out "$RUN/lighttpd.conf" --run "$RUN" --pidfile "$RUN/lighttpd.pid" --docroot "$docroot"
+              --velascgi "$SRV_VELASCGI" --env "VELA_ROOT=$ROOT" --env "VELA_LOG_STDERR=1"
+              --env "PATH=/usr/sbin:/usr/bin:/sbin:/bin" "$@")
+  # Sanitizer builds: the options reach velascgi too.
+  local var
+  for var in ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS; do
+    if [ -n "${!var:-}" ]; then
+      args+=(--env "$var=${!var}")
+    fi
+  done
+  BASE="" URL=""
+  for _ in $(seq 1 20); do
+    port=$((20000 + RANDOM % 40000))
+    if (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null; then
+      continue
+    fi
+    "$SRV_SRC/scripts/lighttpd-conf.sh" "${args[@]}" --port "$port" || return 1
+    lighttpd -D -f "$RUN/lighttpd.conf" 2>>"$RUN/start.log" &
+    LPID=$!
+    # Up when it answers; gone (the port was taken meanwhile) when it exits.
+    for _ in $(seq 1 200); do
+      if ! kill -0 "$LPID" 2>/dev/null; then
+        wait "$LPID" 2>/dev/null
+        LPID=""
+        break
+      fi
+      if curl -s -o /dev/null --max-time 5 "http://127.0.0.1:$port/webapi/entry.cgi"; then
+        BASE="http://127.0.0.1:$port"
+        URL="$BASE/webapi/entry.cgi"
+        return 0
+      fi
+      sleep 0.1
+    done
+    srv_stop
+  done
+  cat "$RUN/start.log" "$RUN/error.log" 2>/dev/null
+  echo "lighttpd did not start"
+  return 1
+}
+
+srv_stop() {
+  if [ -n "$LPID" ]; then
+    kill -TERM "$LPID" 2>/dev/null
+    wait "$LPID" 2>/dev/null
+    LPID=""
+  fi
+}
+
+srv_logs() {
+  local log
+  for log in start.log error.log cgi.log; do
+    if [ -s "$RUN/$log" ]; then
+      echo "---- $log (last 100 lines)"
+      tail -n 100 "$RUN/$log"
+    fi
+  done
+}
+
+# A group made for the run is removed again; an existing one is left alone.
+srv_add_user() {
+  local name=$1 pass=$2 group=${3:-}
+  local args=(-M -N -s /usr/sbin/nologin)
+  if [ -n "$group" ]; then
+    if ! getent group "$group" >/dev/null; then
+      groupadd "$group" || return 1
+      SRV_GROUPS+=("$group")
+    fi
+    args+=(-G "$group")
+  fi
+  useradd "${args[@]}" "$name" || return 1
+  SRV_USERS+=("$name")
+  printf '%s:%s\n' "$name" "$pass" | chpasswd || return 1
+}
+
+# A random password of letters and digits (no character that needs quoting
+# in a form or a shell).
+srv_password() {
+  local pass
+  pass=$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)
+  printf 'Pw%s' "$pass"
+}
+
+srv_cleanup() {
+  local name
+  srv_stop
+  for name in "${SRV_USERS[@]+"${SRV_USERS[@]}"}"; do
+    userdel "$name" 2>/dev/null
+  done
+  for name in "${SRV_GROUPS[@]+"${SRV_GROUPS[@]}"}"; do
+    groupdel "$name" 2>/dev/null
+  done
+  SRV_USERS=() SRV_GROUPS=()
+  [ -n "$TMP" ] && rm -rf "$TMP"
+  TMP=""
+}
