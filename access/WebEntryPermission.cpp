@@ -31,6 +31,11 @@ namespace {
 // Room for any user name the platform hands back, terminator included.
 constexpr size_t kUserNameSize = 493;
 
+// Log watchers and fail2ban-style filters match the token refusal on its
+// whole text, "WebEntry:566 Token Authentication Fail.", so its line number
+// is fixed instead of following this file's layout.
+constexpr int kTokenFailLine = 566;
+
 // The API's "authLevel": 0 no login, 1 login required, 2 checked but not
 // enforced. Absent or not a number counts as 1, the safe side.
 int AuthLevel(const APIRequest* req)
@@ -205,7 +210,7 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
     const int code = CheckPermission(allowTimeout);
     const Json::Value& cached = permission_["permResult"][allowTimeout ? 0 : 1];
     if (cached.isInt() && cached.asInt() == AUTH_RESULT_TOKEN_MISSING && AuthLevel(req) == 1) {
-        VELA_WEBENTRY_LOG("Token Authentication Fail.");
+        VelaLogAt(LOG_ERR, "WebEntry", kTokenFailLine, "Token Authentication Fail.");
     }
 
     resp->SetError(code, Json::Value());

@@ -200,7 +200,7 @@ TEST_F(PermissionTest, TimeoutAddressAndTokenProtectionRefusals)
         EXPECT_FALSE(e.Check());
         EXPECT_EQ(105, e.GetResponseObject()->GetError());
         EXPECT_EQ("noprivilege", e.GetResponseObject()->GetServerError());
-        EXPECT_TRUE(log.Contains("Token Authentication Fail."));
+        EXPECT_TRUE(log.Contains("WebEntry:566 Token Authentication Fail."));
     }
 }
 
