@@ -73,6 +73,13 @@ async function run() {
     page.on("console", (m) => pageLog.push(`console.${m.type()}: ${m.text()}`));
     page.on("pageerror", (e) => pageLog.push(`page error: ${e.message}`));
     page.on("response", (r) => pageLog.push(`${r.status()} ${r.request().method()} ${r.url()}`));
+    // The bodies of the login calls, to show that no password left in clear.
+    const loginBodies = [];
+    page.on("request", (r) => {
+      if (/[?&]method=login(&|$)/.test(r.url())) {
+        loginBodies.push(r.postData() || "");
+      }
+    });
 
     const reply = await page.goto(`${base}/login.html`);
     check(reply && reply.status() === 200, `login.html: HTTP ${reply && reply.status()}`);
@@ -92,6 +99,11 @@ async function run() {
           `after the login the page shows ${JSON.stringify(right)}`);
     if (right.user === "") {
       return;  // nothing signed in: the rest cannot be checked
+    }
+    check(loginBodies.length === 2, `${loginBodies.length} login calls, expected 2`);
+    for (const body of loginBodies) {
+      check(/^__cIpHeRtExT=[A-Za-z0-9%]+$/.test(body) && !body.includes(encodeURIComponent(password)),
+            `a login body is not only the cipher text: ${body.slice(0, 120)}`);
     }
     const answer = JSON.parse(await page.textContent("#answer"));
     check(answer.user === account, `whoami answered ${JSON.stringify(answer)}`);

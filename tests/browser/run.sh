@@ -69,7 +69,7 @@ srv_start "$SRC/deploy/www" || { failed=1; exit 1; }
 NODE_PATH="$WORK/node_modules" CHROMIUM="$CHROMIUM" \
   node "$SRC/tests/browser/login.test.js" "$BASE" "$account" "$password"
 rc=$?
-if [ "$rc" -eq 0 ] && grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null; then
+if [ "$rc" -eq 0 ] && ! srv_sanitizer_clean; then
   echo "FAIL: sanitizer reports in the logs"
   rc=1
 fi

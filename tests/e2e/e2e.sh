@@ -27,109 +27,22 @@ if [ "$(id -u)" -ne 0 ]; then
   exit 77
 fi
 
-TMP=$(mktemp -d "${TMPDIR:-/tmp}/vela-e2e-XXXXXX") || exit 1
-ROOT=$TMP/root
-RUN=$TMP/run
-PIDFILE=$RUN/lighttpd.pid
-failures=0
+. "$SRC/tests/e2e/server.sh"
 
-# lighttpd runs in the foreground as a child of this script (-D), so that
-# whoever ends the script's process tree ends the server as well.
-LPID=""
-stop_server() {
-  if [ -n "$LPID" ]; then
-    kill -TERM "$LPID" 2>/dev/null
-    wait "$LPID" 2>/dev/null
-    LPID=""
-  fi
-}
 cleanup() {
-  stop_server
   if [ "$failures" -ne 0 ]; then
-    for log in error.log cgi.log; do
-      if [ -f "$RUN/$log" ]; then
-        echo "---- $log"
-        tail -n 100 "$RUN/$log"
-      fi
-    done
+    srv_logs
   fi
-  rm -rf "$TMP"
+  srv_cleanup
 }
 trap cleanup EXIT
 trap 'exit 1' HUP INT TERM
 
-fail() {
-  echo "FAIL: $*"
-  failures=$((failures + 1))
-}
-
 # ---- The system root: the staged web-API directory, one data volume.
-mkdir -p "$ROOT/usr/vela/velaman" "$ROOT/etc/vela" "$ROOT/vol1/sample" "$RUN/www"
-ln -s "$WEBAPI" "$ROOT/usr/vela/velaman/webapi"
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
+mkdir -p "$ROOT/vol1/sample" "$RUN/www"
 echo /vol1 >"$ROOT/etc/vela/volumes.conf"
-
-# ---- A private lighttpd on a free port (another program may take a port
-# between the look and the bind: then try another one).
-conf_args=(--out "$RUN/lighttpd.conf" --run "$RUN" --pidfile "$PIDFILE" --docroot "$RUN/www"
-           --velascgi "$VELASCGI" --env "VELA_ROOT=$ROOT" --env "VELA_LOG_STDERR=1"
-           --env "PATH=/usr/sbin:/usr/bin:/sbin:/bin" --xsendfile-dir "$ROOT/vol1")
-# Sanitizer builds: the options reach velascgi too.
-for var in ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS; do
-  if [ -n "${!var:-}" ]; then
-    conf_args+=(--env "$var=${!var}")
-  fi
-done
-URL=""
-for _ in $(seq 1 20); do
-  port=$((20000 + RANDOM % 40000))
-  if (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null; then
-    continue
-  fi
-  "$SRC/scripts/lighttpd-conf.sh" "${conf_args[@]}" --port "$port" || exit 1
-  lighttpd -D -f "$RUN/lighttpd.conf" 2>>"$RUN/start.log" &
-  LPID=$!
-  # Up when it answers; gone (the port was taken meanwhile) when it exits.
-  for _ in $(seq 1 200); do
-    if ! kill -0 "$LPID" 2>/dev/null; then
-      wait "$LPID" 2>/dev/null
-      LPID=""
-      break
-    fi
-    if curl -s -o /dev/null --max-time 5 "http://127.0.0.1:$port/webapi/entry.cgi"; then
-      URL="http://127.0.0.1:$port/webapi/entry.cgi"
-      break
-    fi
-    sleep 0.1
-  done
-  [ -n "$URL" ] && break
-  stop_server
-done
-if [ -z "$URL" ]; then
-  cat "$RUN/start.log" "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null
-  echo "FAIL: lighttpd did not start"
-  exit 1
-fi
-
-# ---- Helpers. Every call leaves the answer in $TMP/body, the header block in
-# $TMP/headers and the HTTP status in $status.
-status=""
-call() {
-  status=$(curl -s --max-time 60 -D "$TMP/headers" -o "$TMP/body" -w '%{http_code}' "$@") || status="curl failed"
-}
-# expect NAME TEXT...: the JSON answer holds every TEXT (compact JSON).
-expect() {
-  local name=$1 text
-  shift
-  for text in "$@"; do
-    grep -qF -- "$text" "$TMP/body" || fail "$name: answer lacks $text: $(head -c 600 "$TMP/body")"
-  done
-}
-expect_header() {
-  grep -qi -- "^$2" "$TMP/headers" || fail "$1: no header \"$2\" in: $(tr -d '\r' <"$TMP/headers")"
-}
-expect_status() {
-  [ "$status" = "$2" ] || fail "$1: HTTP status $status, expected $2"
-}
+srv_start "$RUN/www" --xsendfile-dir "$ROOT/vol1" || { failures=1; exit 1; }
 
 sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
 [ -n "$sid" ] || fail "velaadm created no session"
@@ -212,9 +125,7 @@ call --cookie "$COOKIE" -X POST -H 'Content-Type: application/x-www-form-urlenco
 expect "POST with an empty body" '"success":false' '"code":101'
 
 # ---- Nothing went wrong inside velascgi.
-if grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null; then
-  fail "sanitizer reports in the error log"
-fi
+srv_sanitizer_clean || fail "sanitizer reports in the logs"
 
 if [ "$failures" -ne 0 ]; then
   echo "$failures check(s) failed"

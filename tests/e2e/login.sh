@@ -36,7 +36,6 @@ fi
 ERR_WRONG_PASSWORD=400
 ERR_BLOCKED=407
 
-failures=0
 cleanup() {
   if [ "$failures" -ne 0 ]; then
     srv_logs
@@ -45,11 +44,6 @@ cleanup() {
 }
 trap cleanup EXIT
 trap 'exit 1' HUP INT TERM
-
-fail() {
-  echo "FAIL: $*"
-  failures=$((failures + 1))
-}
 
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 mkdir -p "$ROOT/etc/pam.d" "$RUN/www"
@@ -79,23 +73,7 @@ srv_add_user "$USER3" "$PASS3" || { echo "FAIL: cannot create $USER3"; exit 1; }
 
 srv_start "$RUN/www" || { failures=1; exit 1; }
 
-# ---- Helpers. Every call leaves the answer in $TMP/body, the header block in
-# $TMP/headers and the HTTP status in $status.
-status=""
-call() {
-  status=$(curl -s --max-time 60 -D "$TMP/headers" -o "$TMP/body" -w '%{http_code}' "$@") || status="curl failed"
-}
-# expect NAME TEXT...: the JSON answer holds every TEXT (compact JSON).
-expect() {
-  local name=$1 text
-  shift
-  for text in "$@"; do
-    grep -qF -- "$text" "$TMP/body" || fail "$name: answer lacks $text: $(head -c 600 "$TMP/body")"
-  done
-}
-expect_header() {
-  grep -qi -- "^$2" "$TMP/headers" || fail "$1: no header \"$2\" in: $(tr -d '\r' <"$TMP/headers")"
-}
+# ---- Helpers (call, expect, fail: server.sh).
 # A string member of the answer.
 member() { sed -n "s/.*\"$1\":\"\\([^\"]*\\)\".*/\\1/p" "$TMP/body"; }
 # RFC 3986 percent-encoding of every byte but the unreserved ones.
@@ -284,20 +262,27 @@ fi
 # ---- Blocking: after login_max_failures failures the right password is
 # refused as well. A third account from a third address, so that whatever
 # the block holds (account or address) it touches no other check.
+log_mark
 for i in 1 2 3; do
   login_fails "failure $i before the block" "$USER3" "x$PASS3" --interface 127.0.0.3
 done
+# Each failure and the block are logged, with the account and the address.
+n=$(log_since | grep -cF "login failed: account \"$USER3\" from 127.0.0.3")
+[ "$n" -eq 3 ] || fail "$n of 3 failures logged: $(log_since | tail -n 5)"
+log_since | grep -qF "login blocked for 30 minutes: 3 failures for account \"$USER3\"" ||
+  fail "the account's block is not logged: $(log_since | tail -n 5)"
 call --interface 127.0.0.3 --data "account=$(pct "$USER3")&passwd=$(pct "$PASS3")" "$AUTH&method=login"
 refused "right password while blocked" "$ERR_BLOCKED"
+expect "right password while blocked" '"waitSeconds":'
 grep -qi '^Set-Cookie: id=' "$TMP/headers" && fail "a blocked login sets a cookie"
 # The account is blocked from any address.
 call --interface 127.0.0.5 --data "account=$(pct "$USER3")&passwd=$(pct "$PASS3")" "$AUTH&method=login"
 refused "right password from another address while blocked" "$ERR_BLOCKED"
+log_since | grep -qF "login refused without a password check: account \"$USER3\" from 127.0.0.5" ||
+  fail "the refusal during the block is not logged: $(log_since | tail -n 5)"
 
 # ---- Nothing went wrong inside velascgi.
-if grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null; then
-  fail "sanitizer reports in the logs"
-fi
+srv_sanitizer_clean || fail "sanitizer reports in the logs"
 
 if [ "$failures" -ne 0 ]; then
   echo "$failures check(s) failed"

@@ -12,12 +12,47 @@
 #   srv_add_user NAME PASS [GROUP] a Linux account with that password
 #   srv_cleanup                    server, accounts, groups, TMP; call it from
 #                                  the caller's EXIT trap
+#   srv_sanitizer_clean            0 when no sanitizer report is in the logs
+#
+# Checks, counted in $failures:
+#   fail TEXT                      one failed check
+#   call CURL_ARGS...              the answer in $TMP/body, the header block in
+#                                  $TMP/headers, the HTTP status in $status
+#   expect NAME TEXT...            the answer holds every TEXT (compact JSON)
+#   expect_header NAME HEADER      the header block has a line starting so
+#   expect_status NAME CODE        the HTTP status was CODE
 #
 # The caller checks for root, lighttpd and curl first.
 
 TMP="" ROOT="" RUN="" BASE="" URL="" LPID=""
 SRV_SRC="" SRV_VELASCGI=""
 SRV_USERS=() SRV_GROUPS=()
+failures=0 status=""
+
+fail() {
+  echo "FAIL: $*"
+  failures=$((failures + 1))
+}
+
+call() {
+  status=$(curl -s --max-time 60 -D "$TMP/headers" -o "$TMP/body" -w '%{http_code}' "$@") || status="curl failed"
+}
+
+expect() {
+  local name=$1 text
+  shift
+  for text in "$@"; do
+    grep -qF -- "$text" "$TMP/body" || fail "$name: answer lacks $text: $(head -c 600 "$TMP/body")"
+  done
+}
+
+expect_header() {
+  grep -qi -- "^$2" "$TMP/headers" || fail "$1: no header \"$2\" in: $(tr -d '\r' <"$TMP/headers")"
+}
+
+expect_status() {
+  [ "$status" = "$2" ] || fail "$1: HTTP status $status, expected $2"
+}
 
 srv_init() {
   SRV_SRC=$1
@@ -118,6 +153,10 @@ srv_password() {
   local pass
   pass=$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)
   printf 'Pw%s' "$pass"
+}
+
+srv_sanitizer_clean() {
+  ! grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null
 }
 
 srv_cleanup() {
