@@ -154,7 +154,9 @@ int WebEntry::CheckPermission(bool allowTimeout)
         memset(user, 0, sizeof(user));
         verdict = AUTH_RESULT_NO_SESSION;
         bool facts = false;
-        if (!sid.empty()) {
+        // The cookie arrives percent-decoded: an id holding a NUL byte would
+        // reach the platform cut short, as some other id. It names no session.
+        if (!sid.empty() && sid.find('\0') == std::string::npos) {
             VELACGI_SESSION_INFO info;
             // A page that polls by itself must not keep an idle session alive.
             const int flags = allowTimeout ? VELACGI_AUTH_NO_REFRESH : 0;

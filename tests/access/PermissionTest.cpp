@@ -125,6 +125,18 @@ TEST_F(PermissionTest, NoSessionAndNoTokenIsUnauthenticated)
     EXPECT_FALSE(e.GetRequest()->IsAuthorized());
 }
 
+TEST_F(PermissionTest, ASessionIdCutByANulByteNamesNoSession)
+{
+    const std::string sid = Login("root");
+    PreparedEntry e;
+    e.Prepare(Desc(), "get", sid + "%00x");
+    ASSERT_EQ(sid + std::string(1, '\0') + "x", e.GetRequest()->GetSessionID());
+    EXPECT_FALSE(e.Check());
+    EXPECT_EQ(105, e.GetResponseObject()->GetError());
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, e.GetRequest()->GetAuthResult());
+    EXPECT_EQ("", e.GetRequest()->GetLoginUserName());
+}
+
 TEST_F(PermissionTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
 {
     VelaSessionOptions options;

@@ -143,6 +143,18 @@ expect "whoami with VelaToken" '"success":true' "\"user\":\"$USER1\""
 call -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
 refused "whoami without a session" 119 unauth
 
+# ---- Crafted session ids reach no file: refused like any unknown session,
+# whether they come as the cookie or as "_sid".
+# A NUL byte ("%00", which lighttpd refuses in the URL itself) must not cut
+# a cookie down to the real id either.
+for crafted in ../../../etc/passwd ..%2F..%2Fetc%2Fshadow "$SID1/../$SID1" "$SID1%00x"; do
+  call -b "id=$crafted" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
+  refused "whoami with the cookie id=$crafted" 105 noprivilege
+  case "$crafted" in *%00*) continue ;; esac
+  call -H "X-Vela-Token: $TOKEN1" "$WHOAMI&_sid=$crafted"
+  refused "whoami with _sid=$crafted" 105 noprivilege
+done
+
 # ---- The token missing or wrong: refused, and velascgi says why.
 log_mark
 call -b "$JAR1" "$WHOAMI"

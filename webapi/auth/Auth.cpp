@@ -82,6 +82,11 @@ bool IsAccount(const std::string& account)
     return VELAUserNameIsValid(account.c_str()) == 1 && account[0] != '-';
 }
 
+// A session id the store can be asked about: the cookie arrives
+// percent-decoded, and an id holding a NUL byte would reach the store cut
+// short, as another session's id.
+bool IsSessionId(const std::string& sid) { return !sid.empty() && sid.find('\0') == std::string::npos; }
+
 bool OverHttps(const APIRequest* req) { return req->GetURLProto("") == "https"; }
 
 void Login(APIRequest* req, APIResponse* resp)
@@ -148,7 +153,7 @@ void Login(APIRequest* req, APIResponse* resp)
 
     // A new login ends the session the caller came with.
     const std::string oldSid = req->GetSessionID();
-    if (!oldSid.empty()) {
+    if (IsSessionId(oldSid)) {
         VelaSessionRemove(oldSid.c_str());
     }
     VelaSessionOptions options;
@@ -184,7 +189,7 @@ void Login(APIRequest* req, APIResponse* resp)
 void Logout(APIRequest* req, APIResponse* resp)
 {
     const std::string sid = req->GetSessionID();
-    if (!sid.empty() && VelaSessionRemove(sid.c_str()) == -1) {
+    if (IsSessionId(sid) && VelaSessionRemove(sid.c_str()) == -1) {
         VELA_LOG_ERR("logout: the session could not be removed");
         resp->SetError(kErrServer);
         return;
