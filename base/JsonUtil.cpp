@@ -40,4 +40,24 @@ int JsonSearchArrayIndex(const Json::Value& array, const Json::Value& value)
     return -1;
 }
 
+bool JsonFlag(const Json::Value& value, bool def)
+{
+    if (value.isNull()) {
+        return def;
+    }
+    if (value.isBool()) {
+        return value.asBool();
+    }
+    if (value.isInt64()) {
+        return value.asInt64() != 0;
+    }
+    if (value.isUInt64()) {
+        return value.asUInt64() != 0;
+    }
+    if (value.isDouble()) {
+        return value.asDouble() != 0.0;
+    }
+    return false;
+}
+
 }  // namespace VELA

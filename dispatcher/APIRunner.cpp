@@ -3,6 +3,7 @@
 // Every stage returns whether to go on; the stage that refuses sets the
 // response's error code, callers never set another.
 #include "webapi/APIRunner.h"
+#include "webapi/JsonUtil.h"
 
 #include <cerrno>
 #include <climits>
@@ -53,28 +54,6 @@ void Sanitize(char* text)
             *p = '?';
         }
     }
-}
-
-// A flag of the request or the description: booleans as they are, numbers
-// when not zero, `def` for null, false for anything else.
-bool Flag(const Json::Value& v, bool def)
-{
-    if (v.isNull()) {
-        return def;
-    }
-    if (v.isBool()) {
-        return v.asBool();
-    }
-    if (v.isInt64()) {
-        return v.asInt64() != 0;
-    }
-    if (v.isUInt64()) {
-        return v.asUInt64() != 0;
-    }
-    if (v.isDouble()) {
-        return v.asDouble() != 0.0;
-    }
-    return false;
 }
 
 // What a call changes around its handler and puts back on every way out:
@@ -422,8 +401,8 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
     const bool allowDownload = GetMethodAttr(req, "allowDownload");
 
     // 3. Usage counting.
-    if (Flag(request_->GetAttr("_collector_count_webapi"), false) && !GetMethodAttr(req, "allowTimeout") &&
-        Flag(req->GetAPIInfo("count"), true)) {
+    if (JsonFlag(request_->GetAttr("_collector_count_webapi"), false) && !GetMethodAttr(req, "allowTimeout") &&
+        JsonFlag(req->GetAPIInfo("count"), true)) {
         IncreaseCounter(req);
     }
 

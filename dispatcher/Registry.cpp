@@ -18,6 +18,7 @@
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APIRunner.h"
+#include "webapi/JsonUtil.h"
 
 // The registry is part of the runner: its lines carry the runner's name.
 #define RUNNER_LOG(priority, fmt, ...) VelaLogAt((priority), "APIRunner", __LINE__, fmt, ##__VA_ARGS__)
@@ -51,24 +52,6 @@ const Json::Value& Member(const Json::Value& v, const std::string& key)
     return found ? *found : NullValue();
 }
 
-// A method flag: booleans as they are, numbers when not zero; anything else
-// (null, text, containers) is false. asBool() would throw on text.
-bool Flag(const Json::Value& v)
-{
-    if (v.isBool()) {
-        return v.asBool();
-    }
-    if (v.isInt64()) {
-        return v.asInt64() != 0;
-    }
-    if (v.isUInt64()) {
-        return v.asUInt64() != 0;
-    }
-    if (v.isDouble()) {
-        return v.asDouble() != 0.0;
-    }
-    return false;
-}
 
 bool IsNameChar(char c)
 {
@@ -312,9 +295,9 @@ bool APIRunner::GetMethodAttr(const std::string& api, int version, const std::st
     try {
         const Json::Value& found = GetMethod(api, version, method);
         if (found.isObject()) {
-            return Flag(Member(found, attr));
+            return JsonFlag(Member(found, attr));
         }
-        return Flag(Member(Member(libDef_, "methods"), attr));
+        return JsonFlag(Member(Member(libDef_, "methods"), attr));
     } catch (const std::exception&) {
         return false;
     }

@@ -20,5 +20,9 @@ std::string JsonToString(const Json::Value& value);
 // The index of the first element of the array `array` equal to `value`
 // (JSON equality), or -1 when there is none or `array` is not an array.
 int JsonSearchArrayIndex(const Json::Value& array, const Json::Value& value);
+// A yes/no setting of a description or a request: booleans as they are,
+// numbers when not zero, `def` for null, false for anything else (text,
+// arrays, objects), where Json::Value::asBool() would throw.
+bool JsonFlag(const Json::Value& value, bool def = false);
 
 }  // namespace VELA

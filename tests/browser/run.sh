@@ -22,28 +22,9 @@ if [ ! -x "$CHROMIUM" ]; then
   echo "SKIP: $CHROMIUM is not installed"
   exit 77
 fi
-for tool in node npm lighttpd curl useradd chpasswd; do
-  if ! command -v "$tool" >/dev/null 2>&1; then
-    echo "SKIP: $tool is not installed"
-    exit 77
-  fi
-done
-if [ "$(id -u)" -ne 0 ]; then
-  echo "SKIP: needs root (a Linux account, PAM, identity switches)"
-  exit 77
-fi
-
 . "$SRC/tests/e2e/server.sh"
-
-failed=0
-cleanup() {
-  if [ "$failed" -ne 0 ]; then
-    srv_logs
-  fi
-  srv_cleanup
-}
-trap cleanup EXIT
-trap 'exit 1' HUP INT TERM
+srv_require "a Linux account, PAM, identity switches" node npm useradd chpasswd
+srv_traps
 
 # ---- playwright-core, exactly as the lock file pins it.
 mkdir -p "$WORK" || exit 1
@@ -64,7 +45,7 @@ cp "$SRC/deploy/pam/vela-webapi" "$ROOT/etc/pam.d/vela-webapi" || exit 1
 account="vtw$(printf '%04x%04x' $RANDOM $RANDOM)"
 password=$(srv_password)
 srv_add_user "$account" "$password" || { echo "FAIL: cannot create $account"; exit 1; }
-srv_start "$SRC/deploy/www" || { failed=1; exit 1; }
+srv_start "$SRC/deploy/www" || { failures=1; exit 1; }
 
 NODE_PATH="$WORK/node_modules" CHROMIUM="$CHROMIUM" \
   node "$SRC/tests/browser/login.test.js" "$BASE" "$account" "$password"
@@ -73,5 +54,5 @@ if [ "$rc" -eq 0 ] && ! srv_sanitizer_clean; then
   echo "FAIL: sanitizer reports in the logs"
   rc=1
 fi
-[ "$rc" -eq 0 ] || failed=1
+[ "$rc" -eq 0 ] || failures=1
 exit "$rc"

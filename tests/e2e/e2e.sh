@@ -16,27 +16,9 @@ VELAADM=$(realpath -e "$2") || exit 1
 WEBAPI=$(realpath -e "$3") || exit 1
 SRC=$(realpath -e "$4") || exit 1
 
-for tool in lighttpd curl cksum cmp; do
-  if ! command -v "$tool" >/dev/null 2>&1; then
-    echo "SKIP: $tool is not installed"
-    exit 77
-  fi
-done
-if [ "$(id -u)" -ne 0 ]; then
-  echo "SKIP: needs root (velascgi switches to the identity each API asks for)"
-  exit 77
-fi
-
 . "$SRC/tests/e2e/server.sh"
-
-cleanup() {
-  if [ "$failures" -ne 0 ]; then
-    srv_logs
-  fi
-  srv_cleanup
-}
-trap cleanup EXIT
-trap 'exit 1' HUP INT TERM
+srv_require "velascgi switches to the identity each API asks for" cksum cmp
+srv_traps
 
 # ---- The system root: the staged web-API directory, one data volume.
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1

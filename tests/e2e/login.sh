@@ -19,31 +19,13 @@ VELASCGI=$(realpath -e "$1") || exit 1
 WEBAPI=$(realpath -e "$2") || exit 1
 SRC=$(realpath -e "$3") || exit 1
 
-for tool in lighttpd curl openssl useradd chpasswd runuser; do
-  if ! command -v "$tool" >/dev/null 2>&1; then
-    echo "SKIP: $tool is not installed"
-    exit 77
-  fi
-done
-if [ "$(id -u)" -ne 0 ]; then
-  echo "SKIP: needs root (accounts, PAM, identity switches)"
-  exit 77
-fi
-
 . "$SRC/tests/e2e/server.sh"
+srv_require "accounts, PAM, identity switches" openssl useradd chpasswd runuser
+srv_traps
 
 # Error codes of VELA.Auth login (webapi/auth/).
 ERR_WRONG_PASSWORD=400
 ERR_BLOCKED=407
-
-cleanup() {
-  if [ "$failures" -ne 0 ]; then
-    srv_logs
-  fi
-  srv_cleanup
-}
-trap cleanup EXIT
-trap 'exit 1' HUP INT TERM
 
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 mkdir -p "$ROOT/etc/pam.d" "$RUN/www"

@@ -3,6 +3,9 @@
 # private lighttpd from deploy/lighttpd.conf.in on a free port of 127.0.0.1,
 # and Linux accounts made for the run and removed afterwards.
 #
+#   srv_require WHY TOOL...        exits 77 (skipped) when a TOOL is missing or
+#                                  when not root (WHY says what needs root)
+#   srv_traps                      clean-up at exit, with the logs after a failure
 #   srv_init SRC VELASCGI WEBAPI   TMP, ROOT and RUN; the root's web-API directory
 #   srv_start DOCROOT [ARG...]     lighttpd, ARGs go to scripts/lighttpd-conf.sh;
 #                                  sets BASE (http://127.0.0.1:<port>) and URL
@@ -22,12 +25,32 @@
 #   expect_header NAME HEADER      the header block has a line starting so
 #   expect_status NAME CODE        the HTTP status was CODE
 #
-# The caller checks for root, lighttpd and curl first.
+# lighttpd and curl are always required.
 
 TMP="" ROOT="" RUN="" BASE="" URL="" LPID=""
 SRV_SRC="" SRV_VELASCGI=""
 SRV_USERS=() SRV_GROUPS=()
 failures=0 status=""
+
+srv_require() {
+  local why=$1 tool
+  shift
+  for tool in lighttpd curl "$@"; do
+    if ! command -v "$tool" >/dev/null 2>&1; then
+      echo "SKIP: $tool is not installed"
+      exit 77
+    fi
+  done
+  if [ "$(id -u)" -ne 0 ]; then
+    echo "SKIP: needs root ($why)"
+    exit 77
+  fi
+}
+
+srv_traps() {
+  trap 'if [ "$failures" -ne 0 ]; then srv_logs; fi; srv_cleanup' EXIT
+  trap 'exit 1' HUP INT TERM
+}
 
 fail() {
   echo "FAIL: $*"
