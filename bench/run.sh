@@ -5,7 +5,9 @@
 #      vela-bench-minimal-echo (JsonCpp only, same answer), fork/exec,
 #      interleaved, several rounds;
 #   2. in process: one APIRunner::Process of the echo against the same
-#      answer built with JsonCpp alone (Google Benchmark).
+#      answer built with JsonCpp alone (Google Benchmark);
+#   3. the login-session check of one call, with and without moving the
+#      session's last use, against reading and parsing the session file.
 #
 # usage: bench/run.sh [build-dir]          (default: build)
 # Environment: BENCH_RUNS=300 BENCH_ROUNDS=3 (part 1).
@@ -30,6 +32,9 @@ if [ -x "$build/bench/vela-bench-dispatch" ]; then
     echo
     echo "== in process: APIRunner::Process of the echo vs JsonCpp alone =="
     "$build/bench/vela-bench-dispatch" --benchmark_repetitions=3 --benchmark_report_aggregates_only=true
+    echo
+    echo "== session check: VelaCgiIsAuthorizedEx vs reading and parsing the session file =="
+    "$build/bench/vela-bench-session" --benchmark_repetitions=3 --benchmark_report_aggregates_only=true
 else
     echo "vela-bench-dispatch was not built (Google Benchmark missing)" >&2
 fi

@@ -102,7 +102,8 @@ bool WriteAll(int fd, const char* data, size_t len)
     return true;
 }
 
-bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid, const char*& step)
+bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid, const char*& step,
+                  bool durable)
 {
     if (fchmod(fd, mode & 07777) != 0) {
         step = "chmod";
@@ -110,7 +111,7 @@ bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, 
         step = "chown";
     } else if (!WriteAll(fd, data, len)) {
         step = "write";
-    } else if (fsync(fd) != 0) {
+    } else if (durable && fsync(fd) != 0) {
         step = "fsync";
     } else {
         return true;
@@ -119,7 +120,7 @@ bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, 
 }
 
 bool WriteFileAtomic(const std::string& path, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid,
-                     const char*& step)
+                     const char*& step, bool durable)
 {
     std::string dir;
     std::string tmpl;
@@ -137,7 +138,7 @@ bool WriteFileAtomic(const std::string& path, const char* data, size_t len, mode
         step = "mkstemp";
         return false;
     }
-    bool ok = FillTempFile(fd.Get(), data, len, mode, uid, gid, step);
+    bool ok = FillTempFile(fd.Get(), data, len, mode, uid, gid, step, durable);
     // close() can report a deferred write error (NFS): it counts.
     if (ok && close(fd.Release()) != 0) {
         step = "close";
@@ -154,7 +155,9 @@ bool WriteFileAtomic(const std::string& path, const char* data, size_t len, mode
         errno = saved;
         return false;
     }
-    SyncDir(dir);
+    if (durable) {
+        SyncDir(dir);
+    }
     return true;
 }
 

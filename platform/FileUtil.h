@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstddef>
+#include <json/json.h>
 #include <string>
 #include <sys/stat.h>
 #include <sys/types.h>
@@ -54,9 +55,11 @@ bool WriteAll(int fd, const char* data, size_t len);
 
 // Fills the new temporary file `fd` of an atomic replacement: fchmod to
 // `mode` (whatever the umask was), fchown to `uid`/`gid` unless both are -1,
-// all `len` bytes of `data`, fsync. False with errno set and `step` naming
-// the failed call ("chmod", "chown", "write", "fsync"). Nothing is logged.
-bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid, const char*& step);
+// all `len` bytes of `data`, fsync unless `durable` is false. False with
+// errno set and `step` naming the failed call ("chmod", "chown", "write",
+// "fsync"). Nothing is logged.
+bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid, const char*& step,
+                  bool durable = true);
 
 // Replaces `path` with `len` bytes of `data`: a temporary file
 // ".<name>.XXXXXX" in the same directory is filled with FillTempFile,
@@ -66,8 +69,16 @@ bool FillTempFile(int fd, const char* data, size_t len, mode_t mode, uid_t uid, 
 // ("mkstemp", "chmod", "chown", "write", "fsync", "close", "rename"); the
 // temporary file is then removed and `path` is unchanged. Nothing else is
 // logged.
+//
+// `durable` false skips both fsyncs, for state that does not outlive a
+// reboot anyway (files under /run): the rename still never shows a partial
+// file, and a crash can only lose the latest write.
 bool WriteFileAtomic(const std::string& path, const char* data, size_t len, mode_t mode, uid_t uid, gid_t gid,
-                     const char*& step);
+                     const char*& step, bool durable = true);
+
+// `value` as one line of JSON written with WriteFileAtomic (mode `mode`,
+// owner unchanged). False (logged) on failure; `path` is then unchanged.
+bool WriteJsonAtomic(const std::string& path, const Json::Value& value, mode_t mode, bool durable);
 
 // fsync of the directory `dir` (makes a rename in it durable). Failures are
 // logged and otherwise ignored.

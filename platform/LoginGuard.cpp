@@ -272,7 +272,7 @@ bool SaveRecord(const Record& rec)
         doc["attempts"].append(static_cast<Json::Int64>(t));
     }
     doc["blockedUntil"] = static_cast<Json::Int64>(rec.blockedUntil);
-    return VELA::Platform::WriteStateFile(rec.path, doc);
+    return VELA::Platform::WriteStateFile(rec.path, doc, false);
 }
 
 // The exclusive lock of the guard directory, created on the way.

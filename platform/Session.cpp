@@ -270,7 +270,8 @@ Load WriteLastUse(const std::string& sid, long long now, bool touch)
     }
     doc["lastUse"] = static_cast<Json::Int64>(lastUse);
     doc["created"] = static_cast<Json::Int64>(created);
-    return VELA::Platform::WriteStateFile(SessionPath(sid), doc) ? Load::Ok : Load::Error;
+    // Rewritten on nearly every request: no fsync (see WriteStateFile).
+    return VELA::Platform::WriteStateFile(SessionPath(sid), doc, false) ? Load::Ok : Load::Error;
 }
 
 int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize, VELACGI_SESSION_INFO* info,

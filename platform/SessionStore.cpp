@@ -295,9 +295,9 @@ ReadResult ReadStateFile(const std::string& path, size_t limit, Json::Value& out
     return ReadResult::Ok;
 }
 
-bool WriteStateFile(const std::string& path, const Json::Value& value)
+bool WriteStateFile(const std::string& path, const Json::Value& value, bool durable)
 {
-    return VELA::WebAPIUtil::WriteJsonFileAtomic(path, value, 0600);
+    return WriteJsonAtomic(path, value, 0600, durable);
 }
 
 StoreLock::StoreLock(const std::string& dir)

@@ -72,8 +72,11 @@ enum class ReadResult {
 ReadResult ReadStateFile(const std::string& path, size_t limit, Json::Value& out);
 
 // Writes `value` to `path` atomically with mode 0600 (temporary file, fsync,
-// rename). False (logged) on failure; `path` is then unchanged.
-bool WriteStateFile(const std::string& path, const Json::Value& value);
+// rename). False (logged) on failure; `path` is then unchanged. `durable`
+// false skips the fsyncs: for what changes on every request and lives under
+// /run, where nothing survives a reboot (a session's last use, login-guard
+// counts); the rename still never shows a partial file.
+bool WriteStateFile(const std::string& path, const Json::Value& value, bool durable = true);
 
 // An exclusive flock(2) on `<dir>/.lock`, waited for at most a few seconds.
 // Writers of a store hold it around read-modify-write cycles; readers never

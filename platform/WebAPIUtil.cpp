@@ -132,28 +132,7 @@ bool ReadJsonFile(const std::string& path, Json::Value& out)
 
 bool WriteJsonFileAtomic(const std::string& path, const Json::Value& value, unsigned mode)
 {
-    if (path.empty() || path.back() == '/') {
-        VELA_LOG_ERR("invalid JSON file path \"%s\"", path.c_str());
-        return false;
-    }
-    std::string text;
-    try {
-        Json::StreamWriterBuilder builder;
-        builder["indentation"] = "";
-        builder["emitUTF8"] = true;
-        text = Json::writeString(builder, value);
-        text.push_back('\n');
-    } catch (...) {
-        VELA_LOG_ERR("cannot serialize JSON for %s", path.c_str());
-        return false;
-    }
-    const char* step = nullptr;
-    if (!Platform::WriteFileAtomic(path, text.data(), text.size(), static_cast<mode_t>(mode & 07777),
-                                   static_cast<uid_t>(-1), static_cast<gid_t>(-1), step)) {
-        VELA_LOG_ERR("cannot write %s (%s): %m", path.c_str(), step);
-        return false;
-    }
-    return true;
+    return Platform::WriteJsonAtomic(path, value, static_cast<mode_t>(mode & 07777), true);
 }
 
 bool strPairToJsonObj(const std::string& text, Json::Value& out, bool urlDecode, bool overwrite)
@@ -287,4 +266,31 @@ Json::Value SzHashToJsonObj(PVLIBCSZHASH hash)
 }
 
 }  // namespace WebAPIUtil
+
+bool Platform::WriteJsonAtomic(const std::string& path, const Json::Value& value, mode_t mode, bool durable)
+{
+    if (path.empty() || path.back() == '/') {
+        VELA_LOG_ERR("invalid JSON file path \"%s\"", path.c_str());
+        return false;
+    }
+    std::string text;
+    try {
+        Json::StreamWriterBuilder builder;
+        builder["indentation"] = "";
+        builder["emitUTF8"] = true;
+        text = Json::writeString(builder, value);
+        text.push_back('\n');
+    } catch (...) {
+        VELA_LOG_ERR("cannot serialize JSON for %s", path.c_str());
+        return false;
+    }
+    const char* step = nullptr;
+    if (!WriteFileAtomic(path, text.data(), text.size(), mode, static_cast<uid_t>(-1), static_cast<gid_t>(-1), step,
+                         durable)) {
+        VELA_LOG_ERR("cannot write %s (%s): %m", path.c_str(), step);
+        return false;
+    }
+    return true;
+}
+
 }  // namespace VELA
