@@ -113,6 +113,8 @@ Create a login session for $user, then send its id as the cookie "id":
 Or log in with an account of this machine (PAM); later calls send the
 cookie and the answer's "token" as the header X-Vela-Token:
   curl -c jar --data-urlencode account=$user --data-urlencode 'passwd=<password>' '$url?api=VELA.Auth&version=1&method=login'
+or in a browser on this machine, through the sign-in page:
+  http://127.0.0.1:$port/login.html
 
 Stop it with: $stop
 EOF

@@ -3,8 +3,9 @@
 # Linux accounts (a user and a member of the administrators group) log in
 # through PAM with VELA.Auth, then curl calls the sample API with the session cookie
 # and the anti-forgery token, and every refusal of the session check is
-# provoked: no session, a logged-out or replaced session, an idle session,
-# another client address, a missing token, a user on an administrators' API.
+# provoked: no session, a logged-out or replaced session, an idle session
+# (also for a method that polls), a session past its lifetime, another
+# client address, a missing token, a user on an administrators' API.
 # Also: a login with parameters encrypted by openssl, blocking after repeated
 # failures, and the modes of the session files.
 #
@@ -200,26 +201,53 @@ refused "whoami after logout (cookie jar)" 119 unauth
 call -b "id=$SID2" -H "X-Vela-Token: $TOKEN2" "$WHOAMI"
 refused "whoami after logout (old id)" 105 noprivilege
 
-# ---- Idle timeout: a login made while webapi.conf sets a short idle
-# timeout keeps it in its session; the file's last use (and creation, which
-# may not lie after it) is then moved back past it, as root, instead of
-# waiting on the clock.
+# ---- Idle timeout and lifetime: a login made while webapi.conf sets a
+# short idle timeout and lifetime keeps them in its session; the session
+# file's times are then moved back, as root, instead of waiting on the clock.
 cp "$ROOT/etc/vela/webapi.conf" "$TMP/webapi.conf"
-echo 'session_idle_timeout="60"' >>"$ROOT/etc/vela/webapi.conf"
+printf 'session_idle_timeout="60"\nsession_lifetime="600"\n' >>"$ROOT/etc/vela/webapi.conf"
 login "login with a short idle timeout" "$USER1" "$PASS1"
 ok=$?
 cp "$TMP/webapi.conf" "$ROOT/etc/vela/webapi.conf"
+STATUS="$URL?api=VELA.Sample&version=1&method=status"
+# age CREATED LASTUSE: seconds ago, written into the session file.
+age() {
+  local now
+  now=$(date +%s)
+  sed -E -e "s/(\"created\" *: *)[0-9]+/\\1$((now - $1))/" -e "s/(\"lastUse\" *: *)[0-9]+/\\1$((now - $2))/" \
+    "$file" >"$file.aged" && chmod 0600 "$file.aged" && mv -f "$file.aged" "$file"
+}
+last_use() { sed -nE 's/.*"lastUse" *: *([0-9]+).*/\1/p' "$file"; }
 if [ "$ok" -eq 0 ]; then
   file=$SESSIONS/$sid
   grep -qE '"idleTimeout" *: *60[,}[:space:]]' "$file" ||
     fail "session_idle_timeout=60 is not the session's: $(cat "$file")"
+  grep -qE '"lifetime" *: *600[,}[:space:]]' "$file" ||
+    fail "session_lifetime=600 is not the session's: $(cat "$file")"
+  # A method a page polls ("allowTimeout") answers, but leaves the last use
+  # where it was; an ordinary one moves it to now.
+  age 40 40
+  before=$(last_use)
+  call -b "id=$sid" -H "X-Vela-Token: $token" "$STATUS"
+  expect "status (allowTimeout) of an idle session" '"success":true' "\"user\":\"$USER1\"" '"idleTimeout":60'
+  [ "$(last_use)" = "$before" ] || fail "status (allowTimeout) moved the last use from $before to $(last_use)"
   call -b "id=$sid" -H "X-Vela-Token: $token" "$WHOAMI"
   expect "whoami before the idle timeout" '"success":true'
-  past=$(($(date +%s) - 120))
-  sed -E "s/(\"(lastUse|created)\" *: *)[0-9]+/\\1$past/g" "$file" >"$file.aged" &&
-    chmod 0600 "$file.aged" && mv -f "$file.aged" "$file"
+  [ "$(last_use)" -ge "$((before + 40))" ] || fail "whoami left the last use at $(last_use) (was $before)"
+  # Idle past the timeout: polling cannot bring it back.
+  age 120 120
+  call -b "id=$sid" -H "X-Vela-Token: $token" "$STATUS"
+  refused "status (allowTimeout) after the idle timeout" 106 timeout
   call -b "id=$sid" -H "X-Vela-Token: $token" "$WHOAMI"
   refused "whoami after the idle timeout" 106 timeout
+fi
+# Used all along but past its lifetime: over, too.
+if login "login with a short lifetime" "$USER1" "$PASS1"; then
+  file=$SESSIONS/$sid
+  sed -i -E 's/("lifetime" *: *)[0-9]+/\1600/' "$file"
+  age 700 1
+  call -b "id=$sid" -H "X-Vela-Token: $token" "$WHOAMI"
+  refused "whoami after the session's lifetime" 106 timeout
 fi
 
 # ---- Wrong passwords and unknown accounts get the same answer.

@@ -10,6 +10,9 @@
 //           real, effective and saved user and group ids and the login user
 //   adminonly  open to local administrators only ("allowUser"); answers the
 //           login user
+//   status  what a page polls ("allowTimeout": the call does not keep an
+//           idle session alive); answers the login user and the session's
+//           idle timeout in seconds
 //   upload, download  (Transfer.cpp) a multipart form in, a file out
 #include <json/json.h>
 #include <string>
@@ -138,6 +141,14 @@ void AdminOnly(APIRequest* req, APIResponse* resp)
     resp->SetSuccess(data);
 }
 
+void Status(APIRequest* req, APIResponse* resp)
+{
+    Json::Value data(Json::objectValue);
+    data["user"] = req->GetLoginUserName();
+    data["idleTimeout"] = req->GetTimeoutDuration();
+    resp->SetSuccess(data);
+}
+
 // Handlers must not let an exception reach the framework.
 template <void (*Handler)(APIRequest*, APIResponse*)>
 void Guarded(APIRequest* req, APIResponse* resp)
@@ -155,6 +166,7 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Sample", 1, "typed", Guarded<Typed>},
     {"VELA.Sample", 1, "whoami", Guarded<WhoAmI>},
     {"VELA.Sample", 1, "adminonly", Guarded<AdminOnly>},
+    {"VELA.Sample", 1, "status", Guarded<Status>},
     {"VELA.Sample", 1, "upload", Guarded<Sample::Upload>},
     {"VELA.Sample", 1, "download", Guarded<Sample::Download>},
     {"VELA.Sample.Echo", 1, "echo", Guarded<Echo>},
