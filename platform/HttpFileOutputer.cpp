@@ -518,11 +518,11 @@ void AddLine(std::string& block, const char* name, const std::string& value)
 // The answer for the open regular file `fd` (status `st`): headers, then
 // the whole file or the requested range.
 bool SendOpenFile(int fd, const struct stat& st, const std::string& name, const std::string& mimeType,
-                  bool writeDisposition)
+                  bool writeDisposition, bool honourRanges)
 {
     const uint64_t size = static_cast<uint64_t>(st.st_size);
     const std::string modified = HttpDate(st.st_mtime);
-    const char* range = getenv("HTTP_RANGE");
+    const char* range = honourRanges ? getenv("HTTP_RANGE") : nullptr;
     const char* ifRange = getenv("HTTP_IF_RANGE");
     if (range != nullptr && ifRange != nullptr && (modified.empty() || modified != ifRange)) {
         range = nullptr;  // the client's copy is another version: it gets the whole file
@@ -537,6 +537,7 @@ bool SendOpenFile(int fd, const struct stat& st, const std::string& name, const 
         AddLine(block, "Content-Range", "bytes */" + std::to_string(size));
         AddLine(block, "Accept-Ranges", "bytes");
         AddLine(block, "Content-Length", "0");
+        AddLine(block, "X-Content-Type-Options", "nosniff");
         block += "\r\n";
     } else {
         const uint64_t length = size == 0 ? 0 : last - first + 1;
@@ -553,8 +554,11 @@ bool SendOpenFile(int fd, const struct stat& st, const std::string& name, const 
         if (!modified.empty()) {
             AddLine(block, "Last-Modified", modified);
         }
-        AddLine(block, "Accept-Ranges", "bytes");
+        if (honourRanges) {
+            AddLine(block, "Accept-Ranges", "bytes");
+        }
         AddLine(block, "Content-Length", std::to_string(length));
+        AddLine(block, "X-Content-Type-Options", "nosniff");
         block += "\r\n";
     }
 
@@ -595,6 +599,7 @@ bool SendByServer(const std::string& path, const std::string& mimeType, bool wri
     if (!disposition.empty()) {
         AddLine(block, "Content-Disposition", disposition);
     }
+    AddLine(block, "X-Content-Type-Options", "nosniff");
     AddLine(block, "X-Sendfile", EncodeSendfilePath(canonical));
     block += "\r\n";
     FlushStreams();
@@ -608,9 +613,11 @@ bool SendByServer(const std::string& path, const std::string& mimeType, bool wri
 
 }  // namespace
 
-HTTPFileOutputer::HTTPFileOutputer() : writeDisposition_(true) {}
+HTTPFileOutputer::HTTPFileOutputer() : writeDisposition_(true), honourRanges_(true) {}
 
 void HTTPFileOutputer::SetWriteDisposition(bool write) { writeDisposition_ = write; }
+
+void HTTPFileOutputer::SetRangesEnabled(bool enabled) { honourRanges_ = enabled; }
 
 bool HTTPFileOutputer::Output(const std::string& path, const std::string& mimeType)
 {
@@ -637,7 +644,7 @@ bool HTTPFileOutputer::Output(const std::string& path, const std::string& mimeTy
             VELA_LOG_ERR("refused to send %s: not a regular file", path.c_str());
             return false;
         }
-        return SendOpenFile(fd.Get(), st, VELA::Platform::BaseName(path), mimeType, writeDisposition_);
+        return SendOpenFile(fd.Get(), st, VELA::Platform::BaseName(path), mimeType, writeDisposition_, honourRanges_);
     } catch (const std::exception&) {
         VELA_LOG_ERR("out of memory while sending %s", path.c_str());
         return false;
@@ -670,7 +677,7 @@ bool HTTPFileOutputer::Output(FILE* file, const std::string& name, const std::st
             VELA_LOG_ERR("refused download: the stream is not open for reading");
             return false;
         }
-        return SendOpenFile(fd, st, name, mimeType, writeDisposition_);
+        return SendOpenFile(fd, st, name, mimeType, writeDisposition_, honourRanges_);
     } catch (const std::exception&) {
         VELA_LOG_ERR("out of memory while sending a file");
         return false;

@@ -85,6 +85,7 @@ void APIDownload::SetMimeTypeFromFileName(std::string const& name)
 void APIDownload::PrintHeader()
 {
     d_->outputer.SetWriteDisposition(true);
+    d_->outputer.SetRangesEnabled(true);
     if (d_->response == nullptr) {
         return;
     }
@@ -102,6 +103,9 @@ void APIDownload::PrintHeader()
             }
             if (SameName(name, "Content-Disposition")) {
                 d_->outputer.SetWriteDisposition(false);
+            }
+            if (SameName(name, "Status")) {
+                d_->outputer.SetRangesEnabled(false);  // one status line: the handler's
             }
             std::cout << name << ": " << value << "\r\n";
         }

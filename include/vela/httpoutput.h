@@ -7,8 +7,9 @@
 //   Content-Disposition: attachment; filename="<ASCII>"; filename*=UTF-8''<name>
 //       (when there is a name and the caller did not turn it off)
 //   Last-Modified: <HTTP date of the file>
-//   Accept-Ranges: bytes
+//   Accept-Ranges: bytes     (unless ranges are switched off)
 //   Content-Length: <bytes of the body>
+//   X-Content-Type-Options: nosniff
 // then, for one satisfiable byte range in the CGI variable HTTP_RANGE
 // (RFC 9110: "bytes=a-b", "bytes=a-", "bytes=-n"), "Status: 206 Partial
 // Content" and "Content-Range: bytes a-b/size"; for an unsatisfiable one
@@ -23,7 +24,7 @@
 // header (xsendfile="yes" in /etc/vela/webapi.conf under the system root)
 // and nobody switched it off (VELA::HTTP::FileOutputerHelper), Output(path)
 // writes "X-Sendfile: <canonical absolute path, percent-encoded>" with the
-// content type and the disposition, and the web server sends the file,
+// content type, nosniff and the disposition, and the web server sends the file,
 // ranges included. Output(FILE*) never uses it.
 //
 // Only regular files are sent. Output returns false, having written nothing,
@@ -60,8 +61,15 @@ public:
     // off for callers that printed one of their own.
     void SetWriteDisposition(bool write);
 
+    // Whether Output answers a Range request with 206 or 416 (on by
+    // default). Off for callers that printed a Status line of their own:
+    // the client then gets the whole file under that status, never a
+    // second Status line. Fast output leaves ranges to the web server.
+    void SetRangesEnabled(bool enabled);
+
 private:
     bool writeDisposition_;
+    bool honourRanges_;
 };
 
 namespace VELA {

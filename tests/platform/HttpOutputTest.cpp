@@ -173,6 +173,7 @@ TEST_F(HttpOutput, WholeFileThroughPipeFileAndAppendOnlyFile)
         EXPECT_EQ("application/x-test", r.Header("Content-Type"));
         EXPECT_EQ(std::to_string(data.size()), r.Header("Content-Length"));
         EXPECT_EQ("bytes", r.Header("Accept-Ranges"));
+        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options"));
         EXPECT_EQ("", r.Header("Status"));
         EXPECT_TRUE(r.body == data) << "body of " << r.body.size() << " bytes differs";
     }
@@ -264,6 +265,7 @@ TEST_F(HttpOutput, FastOutputWritesXSendfileOnlyForPaths)
         EXPECT_TRUE(r.ok && r.complete) << via;
         EXPECT_EQ(expected, r.Header("X-Sendfile")) << via;
         EXPECT_EQ("text/plain", r.Header("Content-Type"));
+        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options"));
         EXPECT_EQ("", r.Header("Content-Length"));
         EXPECT_EQ("", r.body);
     }

@@ -134,6 +134,27 @@ TEST_F(Download, OwnResponseNoResponseAndMissingFiles)
     EXPECT_TRUE(response.IsEnableOutput());
 }
 
+// A status of the handler's own is the only status line: a Range then gets
+// the whole file under it instead of a second "Status: 206".
+TEST_F(Download, HandlerStatusTurnsRangesOff)
+{
+    ScopedEnv range("HTTP_RANGE", "bytes=1-2");
+    APIResponse response(nullptr);
+    APIDownload download(&response);
+    bool ok = false;
+    std::string out = Capture([&] { return download.Output(file_); }, ok);
+    EXPECT_NE(std::string::npos, out.find("Status: 206 Partial Content\r\n")) << out;
+    EXPECT_EQ("el", out.substr(out.size() - 2));
+
+    response.SetHeader("Status", "203 Non-Authoritative Information");
+    out = Capture([&] { return download.Output(file_); }, ok);
+    EXPECT_TRUE(ok);
+    EXPECT_EQ(out.find("Status:"), out.rfind("Status:")) << out;
+    EXPECT_NE(std::string::npos, out.find("Status: 203 Non-Authoritative Information\r\n"));
+    EXPECT_EQ(std::string::npos, out.find("Accept-Ranges"));
+    EXPECT_EQ("\r\n\r\nhello", out.substr(out.size() - 9));
+}
+
 TEST_F(Download, XSendFileSwitch)
 {
     mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
