@@ -7,7 +7,10 @@
 #   2. in process: one APIRunner::Process of the echo against the same
 #      answer built with JsonCpp alone (Google Benchmark);
 #   3. the login-session check of one call, with and without moving the
-#      session's last use, against reading and parsing the session file.
+#      session's last use, against reading and parsing the session file;
+#   4. when valgrind is installed: instructions executed by one whole run of
+#      each program of part 1 (callgrind, dynamic loader included). Unlike
+#      the times, this count does not move with the machine's load.
 #
 # usage: bench/run.sh [build-dir]          (default: build)
 # Environment: BENCH_RUNS=300 BENCH_ROUNDS=3 (part 1).
@@ -37,4 +40,21 @@ if [ -x "$build/bench/vela-bench-dispatch" ]; then
     "$build/bench/vela-bench-session" --benchmark_repetitions=3 --benchmark_report_aggregates_only=true
 else
     echo "vela-bench-dispatch was not built (Google Benchmark missing)" >&2
+fi
+
+if command -v valgrind >/dev/null; then
+    echo
+    echo "== instructions per run (callgrind): velarun echo vs minimal JsonCpp program =="
+    instructions() {
+        local out
+        out=$(mktemp)
+        valgrind --tool=callgrind --callgrind-out-file=/dev/null "$@" 2>"$out" >/dev/null
+        sed -n 's/.*Collected : *\([0-9]*\).*/\1/p' "$out"
+        rm -f "$out"
+    }
+    vela=$(instructions "$build/velarun" "$PWD/bench/echo.json")
+    minimal=$(instructions "$build/bench/vela-bench-minimal-echo" "$PWD/bench/echo.json")
+    echo "velarun $vela | vela-bench-minimal-echo $minimal | ratio $(awk -v a="$vela" -v b="$minimal" 'BEGIN { printf "%.2fx", a / b }')"
+else
+    echo "valgrind not installed: no instruction counts"
 fi
