@@ -85,6 +85,7 @@ download_checks() {
   expect_status "download ($mode)" 200
   cmp -s "$TMP/body" "$ROOT/vol1/sample/data.bin" || fail "download ($mode): bytes differ"
   expect_header "download ($mode)" 'Content-Length: 2097152'
+  expect_header "download ($mode)" 'X-Content-Type-Options: nosniff'
   call --cookie "$COOKIE" -r 1000-1999 "$URL?api=VELA.Sample&version=1&method=download&name=data.bin"
   expect_status "range ($mode)" 206
   cmp -s "$TMP/body" "$TMP/range.bin" || fail "range ($mode): bytes differ"
