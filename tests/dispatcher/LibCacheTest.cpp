@@ -26,30 +26,6 @@ public:
     using APIRunner::libCache_;
 };
 
-// Every log line with its priority, while it lives.
-class PriorityLog {
-public:
-    PriorityLog() { VelaLogSetSink(&Sink, this); }
-    ~PriorityLog() { VelaLogSetSink(nullptr, nullptr); }
-    // The priority of the first line holding `text`, -1 when none does.
-    int PriorityOf(const std::string& text) const
-    {
-        for (const auto& line : lines_) {
-            if (line.second.find(text) != std::string::npos) {
-                return line.first;
-            }
-        }
-        return -1;
-    }
-
-private:
-    static void Sink(int priority, const char* line, void* arg)
-    {
-        static_cast<PriorityLog*>(arg)->lines_.emplace_back(priority, line);
-    }
-    std::vector<std::pair<int, std::string>> lines_;
-};
-
 class LibCache : public PipeFixture {
 protected:
     // A request whose description names `lib`.
@@ -129,7 +105,7 @@ TEST_F(LibCache, OneOpenPerPath)
 TEST_F(LibCache, TablesOfALoadedLibrary)
 {
     CacheRunner runner;
-    PriorityLog log;
+    VELA::Test::LogCapture log;
     _tag_API_TABLE* table = nullptr;
     _tag_API_CHECK_TABLE* check = nullptr;
     _tag_API_CHECK_TABLE untouched{};
@@ -147,7 +123,7 @@ TEST_F(LibCache, TablesOfALoadedLibrary)
     // A null check table fails its fetch, but OpenLib goes on without it.
     void* nullCheck = Cache(runner, Lib("reg_nullcheck"));
     EXPECT_FALSE(runner.GetCheckTableFunc(nullCheck, &check));
-    EXPECT_EQ(LOG_ERR, log.PriorityOf("cannot get api check table"));
+    EXPECT_EQ(LOG_ERR, log.PriorityOf({"cannot get api check table"}));
     std::unique_ptr<APIRequest> req(WithLib(Lib("reg_nullcheck")));
     table = nullptr;
     check = nullptr;
@@ -162,20 +138,20 @@ TEST_F(LibCache, TablesOfALoadedLibrary)
     EXPECT_FALSE(runner.OpenLib(req.get(), &table, &check));
     EXPECT_EQ(nullptr, table);
     EXPECT_NE(nullptr, check);
-    EXPECT_EQ(LOG_DEBUG, log.PriorityOf("cannot load table: "));
-    EXPECT_EQ(LOG_ERR, log.PriorityOf("Get API Table Fail"));
+    EXPECT_EQ(LOG_DEBUG, log.PriorityOf({"cannot load table: "}));
+    EXPECT_EQ(LOG_ERR, log.PriorityOf({"Get API Table Fail"}));
 
     // GetAPITable answering null.
     void* nullTable = Cache(runner, Lib("pipe_nulltable"));
     EXPECT_FALSE(runner.GetTableFunc(nullTable, &table));
-    EXPECT_EQ(LOG_ERR, log.PriorityOf("cannot get api table"));
+    EXPECT_EQ(LOG_ERR, log.PriorityOf({"cannot get api table"}));
 
     EXPECT_FALSE(runner.GetTableFunc(nullptr, &table));
     EXPECT_FALSE(runner.GetTableFunc(tables, nullptr));
     EXPECT_FALSE(runner.GetCheckTableFunc(nullptr, &check));
     EXPECT_FALSE(runner.OpenLib(nullptr, &table, &check));
     EXPECT_FALSE(runner.OpenLib(req.get(), nullptr, &check));
-    EXPECT_EQ(LOG_ERR, log.PriorityOf("Bad parameters"));
+    EXPECT_EQ(LOG_ERR, log.PriorityOf({"Bad parameters"}));
 }
 
 // Through the whole pipeline: two APIs share the library of one path, and a

@@ -23,35 +23,6 @@ namespace {
 
 using VELA::Test::DirEntries;
 
-// Log lines with their priority (LogCapture keeps only the text).
-class PriorityLog {
-public:
-    PriorityLog() { VelaLogSetSink(&Sink, this); }
-    ~PriorityLog() { VelaLogSetSink(nullptr, nullptr); }
-    // The priority of the first line holding every text, -1 when none does.
-    int Find(std::initializer_list<const char*> texts) const
-    {
-        for (const auto& entry : lines_) {
-            bool all = true;
-            for (const char* t : texts) {
-                all = all && entry.second.find(t) != std::string::npos;
-            }
-            if (all) {
-                return entry.first;
-            }
-        }
-        return -1;
-    }
-    const std::vector<std::pair<int, std::string>>& Lines() const { return lines_; }
-
-private:
-    static void Sink(int priority, const char* line, void* arg)
-    {
-        static_cast<PriorityLog*>(arg)->lines_.emplace_back(priority, line);
-    }
-    std::vector<std::pair<int, std::string>> lines_;
-};
-
 class LoginGuard : public StateRootTest {
 protected:
     void SetUp() override
@@ -200,18 +171,18 @@ TEST_F(LoginGuard, RecordsAreHashedPrivateFiles)
 
 TEST_F(LoginGuard, FailuresAndBlocksAreLoggedToAuthpriv)
 {
-    PriorityLog log;
+    VELA::Test::LogCapture log;
     Fail("mallory\x1b[2J", "192.0.2.66");
     Fail("mallory\x1b[2J", "192.0.2.66");
     Fail("mallory\x1b[2J", "192.0.2.66");
     Try("mallory\x1b[2J", "192.0.2.66");
     EXPECT_EQ(LOG_AUTHPRIV | LOG_WARNING,
-              log.Find({"login failed", "\"mallory\\x1b[2J\"", "192.0.2.66", "Authentication failure"}));
-    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.Find({"blocked for 15 minutes", "3 failures for account \"mallory"}));
-    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.Find({"blocked for 15 minutes", "3 failures from 192.0.2.66"}));
-    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.Find({"refused without a password check", "192.0.2.66"}));
-    for (const auto& line : log.Lines()) {
-        EXPECT_EQ(std::string::npos, line.second.find('\x1b')) << line.second;
+              log.PriorityOf({"login failed", "\"mallory\\x1b[2J\"", "192.0.2.66", "Authentication failure"}));
+    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.PriorityOf({"blocked for 15 minutes", "3 failures for account \"mallory"}));
+    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.PriorityOf({"blocked for 15 minutes", "3 failures from 192.0.2.66"}));
+    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.PriorityOf({"refused without a password check", "192.0.2.66"}));
+    for (const std::string& line : log.Lines()) {
+        EXPECT_EQ(std::string::npos, line.find('\x1b')) << line;
     }
 }
 

@@ -17,9 +17,25 @@ LogCapture::LogCapture() { VelaLogSetSink(&LogCapture::Sink, this); }
 
 LogCapture::~LogCapture() { VelaLogSetSink(nullptr, nullptr); }
 
-void LogCapture::Sink(int, const char* line, void* arg)
+void LogCapture::Sink(int priority, const char* line, void* arg)
 {
-    static_cast<LogCapture*>(arg)->lines_.emplace_back(line);
+    LogCapture* self = static_cast<LogCapture*>(arg);
+    self->lines_.emplace_back(line);
+    self->priorities_.push_back(priority);
+}
+
+int LogCapture::PriorityOf(std::initializer_list<std::string> texts) const
+{
+    for (size_t i = 0; i < lines_.size(); ++i) {
+        bool all = true;
+        for (const std::string& text : texts) {
+            all = all && lines_[i].find(text) != std::string::npos;
+        }
+        if (all) {
+            return priorities_[i];
+        }
+    }
+    return -1;
 }
 
 bool LogCapture::Contains(const std::string& text) const

@@ -1,6 +1,7 @@
 // Helpers shared by the test programs.
 #pragma once
 
+#include <initializer_list>
 #include <string>
 #include <vector>
 
@@ -15,10 +16,14 @@ public:
     const std::vector<std::string>& Lines() const { return lines_; }
     // True when some captured line contains `text`.
     bool Contains(const std::string& text) const;
+    // The priority (facility included) of the first line holding every one
+    // of `texts`; -1 when no line does.
+    int PriorityOf(std::initializer_list<std::string> texts) const;
 
 private:
     static void Sink(int priority, const char* line, void* arg);
     std::vector<std::string> lines_;
+    std::vector<int> priorities_;
 };
 
 // A fresh directory under $TMPDIR, removed with everything in it at the end
