@@ -143,18 +143,23 @@ bool strPairToJsonObj(const std::string& text, Json::Value& out, bool urlDecode,
         return false;
     }
     try {
+        // Each byte is looked at a bounded number of times: the "=" of a
+        // pair is searched for only inside that pair, never in the rest of
+        // the text, so the whole parse is linear in the length of `text`.
+        const char* const base = text.data();
         size_t start = 0;
         while (start <= text.size()) {
             size_t end = text.find('&', start);
             if (end == std::string::npos) {
                 end = text.size();
             }
-            const size_t eq = text.find('=', start);
+            const void* hit = memchr(base + start, '=', end - start);
             std::string name;
             std::string value;
-            if (eq == std::string::npos || eq > end) {
+            if (hit == nullptr) {
                 name = text.substr(start, end - start);
             } else {
+                const size_t eq = static_cast<size_t>(static_cast<const char*>(hit) - base);
                 name = text.substr(start, eq - start);
                 value = text.substr(eq + 1, end - eq - 1);
             }

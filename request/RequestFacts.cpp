@@ -3,6 +3,8 @@
 #include <climits>
 #include <cmath>
 
+#include "vela/vlibc.h"
+
 namespace VELA {
 namespace RequestFacts {
 
@@ -83,6 +85,22 @@ long long Integer(const Json::Value& v, long long def)
         return magnitude == limit ? LLONG_MIN : -static_cast<long long>(magnitude);
     }
     return static_cast<long long>(magnitude);
+}
+
+long long CheckedInteger(const Json::Value& v, long long min, long long max, long long def)
+{
+    long long value = def;
+    if (v.isInt64()) {
+        value = v.asInt64();
+        return value >= min && value <= max ? value : def;
+    }
+    const char* begin = nullptr;
+    const char* end = nullptr;
+    if (v.isString() && v.getString(&begin, &end) &&
+        ParseDecimal(begin, static_cast<size_t>(end - begin), min, max, value)) {
+        return value;
+    }
+    return def;
 }
 
 }  // namespace RequestFacts

@@ -17,6 +17,10 @@ std::string Text(const Json::Value& v);
 // blanks read up to the first non-digit; `def` for everything else and on
 // overflow. Never throws.
 long long Integer(const Json::Value& v, long long def);
+// Integer of a value that came from the client: a JSON integer, or text
+// that is exactly a decimal number (ParseDecimal), within [min, max];
+// `def` for everything else (reals, "1e0", " 1", "1\0", junk, overflow).
+long long CheckedInteger(const Json::Value& v, long long min, long long max, long long def);
 
 }  // namespace RequestFacts
 }  // namespace VELA

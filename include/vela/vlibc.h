@@ -27,6 +27,20 @@ void VelaRootReset();
 // bytes stay as they are. A null argument returns null.
 char* VLIBCStrCaseLower(char* sz);
 
+namespace VELA {
+// The one parser of decimal numbers that come from outside (parameters,
+// CGI variables, configuration keys). The whole of `text` must be digits,
+// with a leading "-" only when `min` is negative: no blanks, no "+", no
+// fraction or exponent, nothing after the digits. The value must lie in
+// [min, max]. True and `out` set, or false and `out` untouched; overflow,
+// sign, blanks and junk are refused alike.
+bool ParseDecimal(const char* text, size_t len, long long min, long long max, long long& out);
+inline bool ParseDecimal(const std::string& text, long long min, long long max, long long& out)
+{
+    return ParseDecimal(text.data(), text.size(), min, max, out);
+}
+}  // namespace VELA
+
 // ---- String table ------------------------------------------------------------
 // A table of string keys to string values that keeps insertion order. Keys
 // are unique: setting an existing key replaces its value in place.
