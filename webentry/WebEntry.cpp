@@ -8,6 +8,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
+#include <poll.h>
 #include <string>
 #include <unistd.h>
 
@@ -16,12 +17,14 @@
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/upload.h"
+#include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 #include "vela/webserver.h"
 #include "webapi/APIError.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APIUpload.h"
+#include "webentry/RequestLimits.h"
 
 namespace VELA {
 
@@ -41,21 +44,13 @@ long long ContentLength(const Json::Value& value, long long limit)
     if (!value.isString()) {
         return value.isNull() ? 0 : -1;
     }
-    const std::string text = value.asString();
-    if (text.empty()) {
+    const char* begin = nullptr;
+    const char* end = nullptr;
+    long long n = 0;
+    if (!value.getString(&begin, &end) || begin == end) {
         return 0;
     }
-    long long n = 0;
-    for (char c : text) {
-        if (c < '0' || c > '9') {
-            return -1;
-        }
-        n = n * 10 + (c - '0');
-        if (n > limit) {
-            return -1;
-        }
-    }
-    return n;
+    return ParseDecimal(begin, static_cast<size_t>(end - begin), 0, limit, n) ? n : -1;
 }
 
 // RFC 6265 section 4.1.1 cookie-octet: what may stand in a cookie value
@@ -77,13 +72,22 @@ bool Present(const APIParameter<std::string>& p)
 }
 
 // Reads exactly `want` bytes of standard input into `body`; false when the
-// input ends (or fails) first.
-bool ReadBody(std::string& body, size_t want)
+// input ends (or fails) first, or sends nothing for `idleSeconds`.
+bool ReadBody(std::string& body, size_t want, int idleSeconds)
 {
     body.assign(want, '\0');
     size_t got = 0;
     while (got < want) {
-        const ssize_t n = read(STDIN_FILENO, &body[got], want - got);
+        struct pollfd in = {STDIN_FILENO, POLLIN, 0};
+        const int ready = poll(&in, 1, idleSeconds * 1000);
+        if (ready < 0 && errno == EINTR) {
+            continue;
+        }
+        if (ready == 0) {
+            VELA_LOG_ERR("body refused: nothing arrived for %d s (%zu of %zu bytes)", idleSeconds, got, want);
+            return false;
+        }
+        const ssize_t n = ready < 0 ? -1 : read(STDIN_FILENO, &body[got], want - got);
         if (n < 0 && errno == EINTR) {
             continue;
         }
@@ -331,7 +335,7 @@ bool WebEntry::InitPostParam(Json::Value& postParam)
         return false;
     }
     std::string body;
-    const bool complete = ReadBody(body, static_cast<size_t>(length));
+    const bool complete = ReadBody(body, static_cast<size_t>(length), LoadRequestLimits().bodyIdleSeconds);
     StdinToDevNull();
     // A NUL byte inside the body is refused with the rest of the line.
     return complete && DetectAndDecryptParamLine(body, postParam);

@@ -1,13 +1,17 @@
 // velascgi: the CGI program the web server runs for every web-API call.
 // It works in the web-API directory, where the API descriptions and handler
 // libraries are named relative to, and hands the call to one WebEntry.
+#include <climits>
+#include <cstdlib>
 #include <cstring>
 #include <exception>
 #include <string>
 #include <unistd.h>
 
+#include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/vlibc.h"
+#include "webentry/RequestLimits.h"
 #include "webentry/WebEntry.h"
 
 namespace {
@@ -25,10 +29,19 @@ const char kSetupFailedReply[] =
     "\r\n"
     "{\"error\":{\"code\":117},\"success\":false}";
 
-void ReplySetupFailed()
+// The reply when the client already has as many requests under way as it
+// may: try again shortly.
+const char kBusyReply[] =
+    "Status: 503 Service Unavailable\r\n"
+    "Retry-After: 5\r\n"
+    "Content-type: application/json; charset=\"UTF-8\"\r\n"
+    "X-Content-Type-Options: nosniff\r\n"
+    "Cache-Control: max-age=0, no-cache, no-store, must-revalidate\r\n"
+    "\r\n"
+    "{\"error\":{\"code\":117},\"success\":false}";
+
+void Reply(const char* p, size_t left)
 {
-    const char* p = kSetupFailedReply;
-    size_t left = sizeof(kSetupFailedReply) - 1;
     while (left > 0) {
         const ssize_t n = write(STDOUT_FILENO, p, left);
         if (n <= 0) {
@@ -37,6 +50,32 @@ void ReplySetupFailed()
         p += n;
         left -= static_cast<size_t>(n);
     }
+}
+
+void ReplySetupFailed() { Reply(kSetupFailedReply, sizeof(kSetupFailedReply) - 1); }
+
+// Arms this request's CPU and wall-clock limits and takes its client's
+// slot. False when the client has too many requests under way (answered).
+bool LimitRequest()
+{
+    const VELA::RequestLimits limits = VELA::LoadRequestLimits();
+    long long length = 0;
+    const char* text = getenv("CONTENT_LENGTH");
+    if (text != nullptr && !VELA::ParseDecimal(text, strlen(text), 0, LLONG_MAX, length)) {
+        length = 0;  // the front end refuses it later, with the request's own answer
+    }
+    VELA::ArmRequestLimits(limits, length);
+    char address[64] = "";
+    if (VelaCgiGetRemoteIP(address, sizeof(address)) != 0) {
+        address[0] = '\0';
+    }
+    if (VELA::TakeClientSlot(limits, address) == 0) {
+        VELA_LOG_ERR("refused: %s already has %d requests under way", address[0] ? address : "(unknown client)",
+                     limits.maxPerClient);
+        Reply(kBusyReply, sizeof(kBusyReply) - 1);
+        return false;
+    }
+    return true;
 }
 
 }  // namespace
@@ -48,6 +87,9 @@ int main(int argc, char** argv)
         if (chdir(dir.c_str()) != 0) {
             VELA_LOG_ERR("cannot enter the web-API directory %s[%m]", dir.c_str());
             ReplySetupFailed();
+            return 0;
+        }
+        if (!LimitRequest()) {
             return 0;
         }
         VELA::WebEntry entry;
