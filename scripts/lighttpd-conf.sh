@@ -3,16 +3,18 @@
 #
 #   lighttpd-conf.sh --out FILE --port N --run DIR --pidfile FILE --docroot DIR
 #                    --velascgi PATH [--bind ADDR] [--env NAME=VALUE]... [--xsendfile-dir DIR]...
+#                    [--errors DIR]
 #
 # --env adds a variable to the environment of velascgi (VELA_ROOT, ...).
 # --xsendfile-dir allows X-Sendfile answers for files under DIR; without any,
-# X-Sendfile is off. The run directory gets the upload buffer directory; the
+# X-Sendfile is off. --errors names the folder of the JSON error answers
+# (default deploy/errors). The run directory gets the upload buffer directory; the
 # configuration is checked with lighttpd -tt before it replaces FILE.
 set -euo pipefail
 
 repo="$(cd "$(dirname "$0")/.." && pwd)"
 template="$repo/deploy/lighttpd.conf.in"
-out="" port="" run="" pidfile="" docroot="" velascgi="" bind="127.0.0.1"
+out="" port="" run="" pidfile="" docroot="" velascgi="" bind="127.0.0.1" errors="$repo/deploy/errors"
 envs=() sendfile_dirs=()
 
 die() { echo "lighttpd-conf.sh: $*" >&2; exit 1; }
@@ -29,6 +31,7 @@ while [ $# -gt 0 ]; do
     --bind) bind="$2" ;;
     --env) envs+=("$2") ;;
     --xsendfile-dir) sendfile_dirs+=("$2") ;;
+    --errors) errors="$2" ;;
     *) die "unknown option $1" ;;
   esac
   shift 2
@@ -39,7 +42,7 @@ case "$port" in
   '' | *[!0-9]*) die "port \"$port\" is not a number" ;;
 esac
 [ "$port" -ge 1 ] && [ "$port" -le 65535 ] || die "port $port out of range"
-for p in "$run" "$pidfile" "$docroot" "$velascgi"; do
+for p in "$run" "$pidfile" "$docroot" "$velascgi" "$errors"; do
   case "$p" in /*) ;; *) die "\"$p\" is not an absolute path" ;; esac
 done
 [ -x "$velascgi" ] || die "$velascgi is not an executable"
@@ -53,7 +56,7 @@ plain() {
 }
 quote() { plain "$1"; printf '"%s"' "$1"; }
 
-for p in "$run" "$pidfile" "$docroot" "$velascgi" "$bind"; do
+for p in "$run" "$pidfile" "$docroot" "$velascgi" "$bind" "$errors"; do
   plain "$p"
 done
 
@@ -86,6 +89,7 @@ while IFS= read -r line || [ -n "$line" ]; do
   line="${line//@CGI_ENV@/"$cgi_env"}"
   line="${line//@XSENDFILE_DOCROOT@/"$xsendfile_docroot"}"
   line="${line//@XSENDFILE@/"$xsendfile"}"
+  line="${line//@ERRORS_DIR@/"$errors"}"
   printf '%s\n' "$line"
 done <"$template" >"$tmp"
 if ! lighttpd -tt -f "$tmp" >/dev/null 2>"$tmp.err"; then

@@ -83,7 +83,10 @@ TEST(RequestParam, BodyOverridesQuery)
 
 TEST(RequestParam, VersionThatIsNotANumberReadsAsZero)
 {
-    for (const char* v : {R"("abc")", "[]", "{}", "99999999999", "-99999999999", R"("")"}) {
+    // Only an integer or exact decimal text is a version: texts that merely
+    // start with one ("1e0", " 1", "1" and a NUL byte) and reals are none.
+    for (const char* v : {R"("abc")", "[]", "{}", "99999999999", "-99999999999", R"("")", R"("1e0")", R"(" 1")",
+                          R"("1\u0000")", R"("+1")", "1.5", R"("1.0")"}) {
         SCOPED_TRACE(v);
         APIRequest r(J(std::string(R"({"getParam": {"version": )") + v + "}}"));
         EXPECT_EQ(0, r.GetAPIVersion());

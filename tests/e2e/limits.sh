@@ -1,0 +1,113 @@
+#!/usr/bin/env bash
+# End-to-end: what one client can make the server spend. A form body built to
+# make the parser quadratic, a body that never arrives, more requests at once
+# than a client may have, and "version" texts that only look like 1, each
+# through a private lighttpd.
+#
+# usage: limits.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR
+set -u
+
+[ $# -eq 3 ] || { echo "usage: limits.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR" >&2; exit 2; }
+VELASCGI=$(realpath -e "$1") || exit 1
+WEBAPI=$(realpath -e "$2") || exit 1
+SRC=$(realpath -e "$3") || exit 1
+
+. "$SRC/tests/e2e/server.sh"
+srv_require "velascgi runs as root under the server" python3
+srv_traps
+
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
+mkdir -p "$RUN/www"
+cat >"$ROOT/etc/vela/webapi.conf" <<'CONF'
+request_body_idle_seconds="2"
+request_max_per_client="3"
+CONF
+srv_start "$RUN/www" || { failures=1; exit 1; }
+port=${BASE##*:}
+
+# velascgi processes still running (the server's children).
+cgi_count() { pgrep -c -f "^$VELASCGI" || true; }
+
+# ---- 16 MiB of "&": answered at once (the parser is linear), not after
+# minutes of CPU.
+head -c 16777216 /dev/zero | tr '\0' '&' >"$TMP/amps"
+start=$(date +%s)
+call --data-binary "@$TMP/amps" -H 'Content-Type: application/x-www-form-urlencoded' "$URL"
+took=$(($(date +%s) - start))
+expect "16 MiB of &" '"success":false' '"code":101'
+[ "$took" -lt 30 ] || fail "16 MiB of & took $took s"
+echo "16 MiB of & answered in $took s"
+
+# ---- "version" texts that are not exactly a number name no version (101),
+# whoever refuses them: "1%00" is refused by lighttpd itself, in the same
+# JSON shape.
+for v in '1%00' '1e0' '%201' '+1' '1.0' '0x1' '99999999999999999999'; do
+  call "$URL?api=VELA.Sample&version=$v&method=echo"
+  expect "version $v" '"success":false' '"code":101'
+  expect_header "version $v" 'Content-Type: application/json'
+done
+call "$URL?api=VELA.Sample&version=1&method=echo"
+expect "version 1 reaches the session check" '"code":119'
+
+# ---- lighttpd's other refusals answer JSON too.
+call -H "X-Big: $(head -c 70000 /dev/zero | tr '\0' a)" "$URL?api=VELA.Sample&version=1&method=echo"
+expect "header too large" '"success":false' '"code":101'
+call "$BASE/no-such-page"
+expect_status "missing page" 404
+expect "missing page" '"success":false' '"code":101'
+
+# ---- A chunked body reaches the API like one with a length.
+call -H 'Transfer-Encoding: chunked' --data-binary 'api=VELA.Sample&version=1&method=echo' "$URL"
+expect "chunked body" '"code":119'
+
+# ---- Slow bodies: a client that announces 1000 bytes, sends 2 and waits
+# holds a root process only for the idle time, and only a few at once.
+# Each holder keeps its connection open until killed; its answer, when the
+# server gives one, goes to its own file.
+slow_body() {
+  python3 - "$port" "$1" <<'PY' &
+import socket, sys, time
+s = socket.create_connection(("127.0.0.1", int(sys.argv[1])))
+s.sendall(b"POST /webapi/entry.cgi HTTP/1.1\r\nHost: 127.0.0.1\r\n"
+          b"Content-Type: application/x-www-form-urlencoded\r\nContent-Length: 1000\r\n\r\nap")
+s.settimeout(30)
+data = b""
+try:
+    while True:
+        chunk = s.recv(65536)
+        if not chunk:
+            break
+        data += chunk
+        if b"}" in data:
+            break
+except Exception:
+    pass
+open(sys.argv[2], "wb").write(data)
+PY
+}
+slow_body "$TMP/slow1"; p1=$!
+slow_body "$TMP/slow2"; p2=$!
+slow_body "$TMP/slow3"; p3=$!
+sleep 0.7
+# A fourth request of the same client, while three are under way.
+call "$URL?api=VELA.Sample&version=1&method=echo"
+expect_status "fourth request at once" 503
+expect_header "fourth request at once" 'Retry-After:'
+expect "fourth request at once" '"success":false'
+wait "$p1" "$p2" "$p3"
+for f in "$TMP/slow1" "$TMP/slow2" "$TMP/slow3"; do
+  grep -q '"code":101' "$f" || fail "slow body: no 101 answer after the idle time: $(head -c 300 "$f")"
+done
+grep -q 'nothing arrived for 2 s' "$RUN/cgi.log" || fail "slow body: no log line"
+sleep 0.5
+[ "$(cgi_count)" -eq 0 ] || fail "velascgi processes left: $(cgi_count)"
+# Slots come back when their requests end.
+call "$URL?api=VELA.Sample&version=1&method=echo"
+expect "after the slow bodies" '"code":119'
+
+srv_sanitizer_clean || fail "sanitizer reports in the logs"
+if [ "$failures" -ne 0 ]; then
+  echo "$failures check(s) failed"
+  exit 1
+fi
+echo "all limit checks passed"

@@ -1,0 +1,33 @@
+// The checked decimal parser every number from outside goes through.
+#include <gtest/gtest.h>
+
+#include <climits>
+#include <string>
+
+#include "vela/vlibc.h"
+
+namespace {
+
+TEST(Strings, ParseDecimal)
+{
+    long long out = 42;
+    for (const std::string& bad : std::initializer_list<std::string>{"", "-", "+1", " 1", "1 ", "1e0", "1.0", "0x1", std::string("1\0", 2), "1a", "--1",
+                                  "9223372036854775808", "99999999999999999999999"}) {
+        EXPECT_FALSE(VELA::ParseDecimal(bad, LLONG_MIN, LLONG_MAX, out)) << bad;
+        EXPECT_EQ(42, out);
+    }
+    EXPECT_TRUE(VELA::ParseDecimal("007", 0, 10, out));
+    EXPECT_EQ(7, out);
+    EXPECT_TRUE(VELA::ParseDecimal("9223372036854775807", 0, LLONG_MAX, out));
+    EXPECT_EQ(LLONG_MAX, out);
+    EXPECT_TRUE(VELA::ParseDecimal("-9223372036854775808", LLONG_MIN, 0, out));
+    EXPECT_EQ(LLONG_MIN, out);
+    // The range is part of the check; a sign only where negatives may be.
+    EXPECT_FALSE(VELA::ParseDecimal("11", 0, 10, out));
+    EXPECT_FALSE(VELA::ParseDecimal("-1", 0, 10, out));
+    EXPECT_FALSE(VELA::ParseDecimal("-0", 0, 10, out));
+    EXPECT_TRUE(VELA::ParseDecimal("-3", -5, 10, out));
+    EXPECT_EQ(-3, out);
+}
+
+}  // namespace
