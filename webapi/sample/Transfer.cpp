@@ -15,6 +15,7 @@
 
 #include <cerrno>
 #include <cstdint>
+#include <cstdlib>
 #include <fcntl.h>
 #include <json/json.h>
 #include <string>
@@ -195,12 +196,20 @@ void Download(APIRequest* req, APIResponse* resp)
         resp->SetError(kSampleFailure, Json::Value("no data volume"));
         return;
     }
-    const std::string path = std::string(volume.szMountPath) + kDownloadFolder + "/" + name.Get();
-    // Only a regular file of the folder itself, not a link that leads out:
+    // The volume's own path is the administrator's and may lead through a
+    // link (a volume mounted elsewhere): it is resolved first. Below it,
+    // only a regular file of the folder itself, not a link that leads out:
     // opened once without following any link on the way, checked on the
     // descriptor, and the descriptor is what is sent. A path checked first
     // and opened later could be swapped for a link in between by anyone who
     // may write to the folder.
+    char* mount = realpath(volume.szMountPath, nullptr);
+    if (mount == nullptr) {
+        resp->SetError(kSampleFailure, Json::Value("no data volume"));
+        return;
+    }
+    const std::string path = std::string(mount) + kDownloadFolder + "/" + name.Get();
+    free(mount);
     const int fd = HTTPFileOutputer::OpenForOutput(path);
     if (fd < 0) {
         resp->SetError(kSampleFailure, Json::Value("no such file"));
