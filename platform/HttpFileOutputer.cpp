@@ -684,7 +684,7 @@ bool CheckReadableRegular(int fd, struct stat& st, const char* what)
         return false;
     }
     const int mode = fcntl(fd, F_GETFL);
-    if (mode < 0 || (mode & O_ACCMODE) == O_WRONLY) {
+    if (mode < 0 || (mode & O_ACCMODE) == O_WRONLY || (mode & O_PATH) != 0) {
         VELA_LOG_ERR("refused to send %s: not open for reading", what);
         return false;
     }

@@ -28,7 +28,8 @@ bool IsReadableRegular(int fd)
 {
     struct stat st;
     const int mode = fd < 0 ? -1 : fcntl(fd, F_GETFL);
-    return mode >= 0 && (mode & O_ACCMODE) != O_WRONLY && fstat(fd, &st) == 0 && S_ISREG(st.st_mode);
+    return mode >= 0 && (mode & O_ACCMODE) != O_WRONLY && (mode & O_PATH) == 0 && fstat(fd, &st) == 0 &&
+           S_ISREG(st.st_mode);
 }
 
 }  // namespace

@@ -447,8 +447,10 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
     ASSERT_NE(nullptr, writeOnly);
     const int dirFd = open(files_.c_str(), O_RDONLY | O_DIRECTORY);
     const int fifoFd = open(fifo.c_str(), O_RDONLY | O_NONBLOCK);
+    const int pathFd = open((files_ + "/w").c_str(), O_PATH);  // names a file, cannot read it
     ASSERT_GE(dirFd, 0);
     ASSERT_GE(fifoFd, 0);
+    ASSERT_GE(pathFd, 0);
     for (const std::string& path : {files_, fifo}) {
         errno = 0;
         EXPECT_EQ(-1, HTTPFileOutputer::OpenForOutput(path)) << path;
@@ -465,6 +467,7 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
         [&] { return out_.Output(dirFd, "n", ""); },
         [&] { return out_.Output(fifoFd, "n", ""); },
         [&] { return out_.Output(fileno(writeOnly), "n", ""); },
+        [&] { return out_.Output(pathFd, "n", ""); },
         [&] { return out_.Output(-1, "n", ""); },
     };
     for (const auto& call : calls) {
@@ -477,6 +480,7 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
     close(fds[1]);
     close(dirFd);
     close(fifoFd);
+    close(pathFd);
 }
 
 TEST_F(HttpOutput, DispositionNamesAreSafe)
