@@ -49,6 +49,24 @@ enum ReadFlags : unsigned {
 bool ReadFileBounded(const std::string& path, size_t limit, std::string& out, int& err, unsigned flags = 0,
                      struct stat* st = nullptr);
 
+// How OpenNoSymlinks resolves a path.
+enum class NoSymlinkResolve {
+    kAuto,  // openat2(RESOLVE_NO_SYMLINKS) where the kernel has it, else kWalk
+    kWalk,  // one component at a time (what kAuto falls back to)
+};
+
+// open(2) of `path` with `flags` (O_CLOEXEC and O_NOFOLLOW are added) when no
+// component of it is a symbolic link, the last one included; "." and ".."
+// are allowed. kWalk starts at "/" for an absolute path and at the working
+// directory otherwise, opens every directory with O_PATH | O_NOFOLLOW and
+// checks it with fstat before going on, and opens the last component
+// relative to its parent, so nothing is looked up twice. The descriptor, or
+// -1 with errno set: ELOOP when a component is a symbolic link, ENOTDIR when
+// one before the last is not a directory, ENAMETOOLONG when `path` reaches
+// PATH_MAX, EINVAL when it is empty or holds a NUL, else the errno of the
+// failing open. Nothing is logged.
+int OpenNoSymlinks(const std::string& path, int flags, NoSymlinkResolve how = NoSymlinkResolve::kAuto);
+
 // write(2) until all `len` bytes are written, retrying on EINTR. False with
 // errno set on failure.
 bool WriteAll(int fd, const char* data, size_t len);

@@ -574,28 +574,88 @@ bool SendOpenFile(int fd, const struct stat& st, const std::string& name, const 
     return SendBody(kOut, fd, static_cast<off_t>(first), last - first + 1);
 }
 
-// Fast output: the web server sends the file named by X-Sendfile.
-bool SendByServer(const std::string& path, const std::string& mimeType, bool writeDisposition)
+// ---- Fast output: which paths the web server may be given ----
+
+// An entry nobody less privileged than the web server can change: owned by
+// root or by the web server's own account (the real user id: the
+// dispatcher switches only the effective one), and writable neither by its
+// group nor by others.
+bool ServerOnlyWritable(const struct stat& st, uid_t server, const char*& why)
 {
-    char* real = realpath(path.c_str(), nullptr);
-    if (real == nullptr) {
-        VELA_LOG_ERR("cannot send %s: %m", path.c_str());
+    if (st.st_uid != 0 && st.st_uid != server) {
+        why = "owned by another account";
         return false;
     }
-    const std::string canonical(real);
-    free(real);
-    struct stat st;
-    if (stat(canonical.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) {
-        VELA_LOG_ERR("refused to send %s: not a regular file", path.c_str());
+    if ((st.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
+        why = "writable by its group or by others";
         return false;
     }
+    return true;
+}
+
+// The path the web server would open for the open file `fd` (status `st`),
+// when it still leads to that file and no one less privileged than the web
+// server can change what it leads to: the path the kernel keeps for the
+// descriptor (/proc/self/fd), then every directory from "/" down, each
+// opened without following links relative to the one before, and the file
+// itself must pass ServerOnlyWritable. False, with `why`, otherwise.
+bool ServerMayOpen(int fd, const struct stat& st, std::string& canonical, const char*& why)
+{
+    char link[32];
+    snprintf(link, sizeof(link), "/proc/self/fd/%d", fd);
+    std::unique_ptr<char[]> buf(new char[PATH_MAX]);
+    const ssize_t n = readlink(link, buf.get(), PATH_MAX);
+    if (n <= 0 || n >= PATH_MAX || buf[0] != '/') {
+        why = "its path is unknown";
+        return false;
+    }
+    canonical.assign(buf.get(), static_cast<size_t>(n));
     if (HasControlByte(canonical)) {
-        VELA_LOG_ERR("refused to send a file whose path holds control bytes (CR, LF, ...)");
+        canonical.clear();  // not for the log either
+        why = "its path holds control bytes";
         return false;
     }
+    const uid_t server = getuid();
+    ScopedFd dir(open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    struct stat entry;
+    if (dir.Get() < 0 || fstat(dir.Get(), &entry) != 0) {
+        why = "\"/\" cannot be examined";
+        return false;
+    }
+    if (!ServerOnlyWritable(entry, server, why)) {
+        return false;
+    }
+    size_t pos = 1;
+    for (;;) {
+        const size_t slash = canonical.find('/', pos);
+        const std::string name = canonical.substr(pos, slash == std::string::npos ? std::string::npos : slash - pos);
+        if (slash == std::string::npos) {
+            if (fstatat(dir.Get(), name.c_str(), &entry, AT_SYMLINK_NOFOLLOW) != 0 || entry.st_dev != st.st_dev ||
+                entry.st_ino != st.st_ino) {
+                why = "its path no longer leads to it";
+                return false;
+            }
+            return ServerOnlyWritable(st, server, why);
+        }
+        dir.Reset(openat(dir.Get(), name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (dir.Get() < 0 || fstat(dir.Get(), &entry) != 0) {
+            why = "its path no longer leads to it";
+            return false;
+        }
+        if (!ServerOnlyWritable(entry, server, why)) {
+            return false;
+        }
+        pos = slash + 1;
+    }
+}
+
+// Fast output: the web server sends the file at `canonical` (X-Sendfile).
+bool SendByServer(const std::string& canonical, const std::string& name, const std::string& mimeType,
+                  bool writeDisposition)
+{
     std::string block;
     AddLine(block, "Content-Type", SafeMimeType(mimeType));
-    const std::string disposition = writeDisposition ? DispositionValue(VELA::Platform::BaseName(canonical)) : "";
+    const std::string disposition = writeDisposition ? DispositionValue(name) : "";
     if (!disposition.empty()) {
         AddLine(block, "Content-Disposition", disposition);
     }
@@ -611,71 +671,116 @@ bool SendByServer(const std::string& path, const std::string& mimeType, bool wri
     return true;
 }
 
+// The readable regular file `fd`: status in `st`; false (logged, `what`
+// names it) otherwise.
+bool CheckReadableRegular(int fd, struct stat& st, const char* what)
+{
+    if (fd < 0 || fstat(fd, &st) != 0) {
+        VELA_LOG_ERR("cannot stat %s for a download: %m", what);
+        return false;
+    }
+    if (!S_ISREG(st.st_mode)) {
+        VELA_LOG_ERR("refused to send %s: not a regular file", what);
+        return false;
+    }
+    const int mode = fcntl(fd, F_GETFL);
+    if (mode < 0 || (mode & O_ACCMODE) == O_WRONLY || (mode & O_PATH) != 0) {
+        VELA_LOG_ERR("refused to send %s: not open for reading", what);
+        return false;
+    }
+    return true;
+}
+
 }  // namespace
 
-HTTPFileOutputer::HTTPFileOutputer() : writeDisposition_(true), honourRanges_(true) {}
+HTTPFileOutputer::HTTPFileOutputer() : writeDisposition_(true), honourRanges_(true), followSymlinks_(false) {}
 
 void HTTPFileOutputer::SetWriteDisposition(bool write) { writeDisposition_ = write; }
 
 void HTTPFileOutputer::SetRangesEnabled(bool enabled) { honourRanges_ = enabled; }
 
-bool HTTPFileOutputer::Output(const std::string& path, const std::string& mimeType)
+void HTTPFileOutputer::SetFollowSymlinks(bool follow) { followSymlinks_ = follow; }
+
+int HTTPFileOutputer::OpenForOutput(const std::string& path, bool followSymlinks)
 {
     try {
         if (path.empty() || path.size() >= PATH_MAX || path.find('\0') != std::string::npos) {
-            VELA_LOG_ERR("refused download path: empty, over-long or holding NUL");
-            return false;
-        }
-        if (VELA::HTTP::FileOutputerHelper::IsFastOutputEnabled()) {
-            return SendByServer(path, mimeType, writeDisposition_);
+            errno = path.size() >= PATH_MAX ? ENAMETOOLONG : EINVAL;
+            return -1;
         }
         // O_NONBLOCK: opening a FIFO must not wait; it is refused below.
-        ScopedFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
-        if (fd.Get() < 0) {
-            VELA_LOG_ERR("cannot open %s for a download: %m", path.c_str());
-            return false;
-        }
+        const int flags = O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK;
+        ScopedFd fd(followSymlinks ? open(path.c_str(), flags) : VELA::Platform::OpenNoSymlinks(path, flags));
         struct stat st;
-        if (fstat(fd.Get(), &st) != 0) {
-            VELA_LOG_ERR("cannot stat %s for a download: %m", path.c_str());
-            return false;
+        if (fd.Get() < 0 || fstat(fd.Get(), &st) != 0) {
+            return -1;
         }
         if (!S_ISREG(st.st_mode)) {
-            VELA_LOG_ERR("refused to send %s: not a regular file", path.c_str());
+            errno = EINVAL;
+            return -1;
+        }
+        return fd.Release();
+    } catch (const std::exception&) {
+        errno = ENOMEM;
+        return -1;
+    }
+}
+
+bool HTTPFileOutputer::Output(const std::string& path, const std::string& mimeType)
+{
+    try {
+        ScopedFd fd(OpenForOutput(path, followSymlinks_));
+        if (fd.Get() < 0) {
+            if (errno == ELOOP) {
+                VELA_LOG_ERR("refused to send %s: a symbolic link is on its path", path.c_str());
+            } else if (errno == EINVAL) {
+                VELA_LOG_ERR("refused to send %s: empty, holding NUL or not a regular file", path.c_str());
+            } else {
+                VELA_LOG_ERR("cannot open %s for a download: %m", path.c_str());
+            }
             return false;
         }
-        return SendOpenFile(fd.Get(), st, VELA::Platform::BaseName(path), mimeType, writeDisposition_, honourRanges_);
+        return SendDescriptor(fd.Get(), VELA::Platform::BaseName(path), mimeType, true);
     } catch (const std::exception&) {
         VELA_LOG_ERR("out of memory while sending %s", path.c_str());
         return false;
     }
 }
 
+bool HTTPFileOutputer::Output(int fd, const std::string& name, const std::string& mimeType)
+{
+    return SendDescriptor(fd, name, mimeType, true);
+}
+
 bool HTTPFileOutputer::Output(FILE* file, const std::string& name, const std::string& mimeType)
 {
+    if (file == nullptr) {
+        VELA_LOG_ERR("refused download: no file");
+        return false;
+    }
+    if (fflush(file) != 0) {
+        VELA_LOG_ERR("cannot flush the file of a download: %m");
+        return false;
+    }
+    return SendDescriptor(fileno(file), name, mimeType, false);
+}
+
+bool HTTPFileOutputer::SendDescriptor(int fd, const std::string& name, const std::string& mimeType,
+                                      bool serverMayOpen)
+{
     try {
-        if (file == nullptr) {
-            VELA_LOG_ERR("refused download: no file");
-            return false;
-        }
-        if (fflush(file) != 0) {
-            VELA_LOG_ERR("cannot flush the file of a download: %m");
-            return false;
-        }
-        const int fd = fileno(file);
         struct stat st;
-        if (fd < 0 || fstat(fd, &st) != 0) {
-            VELA_LOG_ERR("cannot stat the file of a download: %m");
+        if (!CheckReadableRegular(fd, st, "the file of a download")) {
             return false;
         }
-        if (!S_ISREG(st.st_mode)) {
-            VELA_LOG_ERR("refused download: the stream is not a regular file");
-            return false;
-        }
-        const int mode = fcntl(fd, F_GETFL);
-        if (mode < 0 || (mode & O_ACCMODE) == O_WRONLY) {
-            VELA_LOG_ERR("refused download: the stream is not open for reading");
-            return false;
+        if (serverMayOpen && VELA::HTTP::FileOutputerHelper::IsFastOutputEnabled()) {
+            std::string canonical;
+            const char* why = "";
+            if (ServerMayOpen(fd, st, canonical, why)) {
+                return SendByServer(canonical, name, mimeType, writeDisposition_);
+            }
+            VELA_LOG(LOG_INFO, "X-Sendfile not used for %s: %s; the file is sent directly",
+                     canonical.empty() ? name.c_str() : canonical.c_str(), why);
         }
         return SendOpenFile(fd, st, name, mimeType, writeDisposition_, honourRanges_);
     } catch (const std::exception&) {

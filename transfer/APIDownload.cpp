@@ -2,10 +2,12 @@
 // HTTP file outputer.
 #include "webapi/APIDownload.h"
 
+#include <cerrno>
 #include <fcntl.h>
 #include <iostream>
 #include <strings.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include "transfer/APIDownloadPrivate.h"
 #include "vela/httpoutput.h"
@@ -21,6 +23,14 @@ const char kDefaultType[] = "application/octet-stream";
 bool SameName(const std::string& a, const char* b) { return strcasecmp(a.c_str(), b) == 0; }
 
 bool HasLineBreak(const std::string& text) { return text.find_first_of("\r\n") != std::string::npos; }
+
+bool IsReadableRegular(int fd)
+{
+    struct stat st;
+    const int mode = fd < 0 ? -1 : fcntl(fd, F_GETFL);
+    return mode >= 0 && (mode & O_ACCMODE) != O_WRONLY && (mode & O_PATH) == 0 && fstat(fd, &st) == 0 &&
+           S_ISREG(st.st_mode);
+}
 
 }  // namespace
 
@@ -115,32 +125,54 @@ void APIDownload::PrintHeader()
     }
 }
 
-bool APIDownload::Output(std::string const& path)
+// The response's headers, then the open file `fd` through the outputer; no
+// JSON follows.
+bool APIDownload::SendOpen(int fd, std::string const& name, std::string const& mimeType)
 {
-    struct stat st;
-    if (stat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) {
-        VELA_LOG_ERR("download refused: %s is not a regular file", path.c_str());
-        return false;
-    }
     PrintHeader();
     if (d_->response != nullptr) {
         d_->response->SetEnableOutput(false);
     }
+    return d_->outputer.Output(fd, name, mimeType);
+}
+
+bool APIDownload::Output(std::string const& path)
+{
+    const int fd = HTTPFileOutputer::OpenForOutput(path);
+    if (fd < 0) {
+        VELA_LOG_ERR("download refused: %s: %s", path.c_str(),
+                     errno == ELOOP ? "a symbolic link is on the path" : "not a regular file that can be opened");
+        return false;
+    }
+    bool sent = false;
     try {
-        const std::string type = d_->mimeType.empty() ? HTTPFileOutputer::GetMimeType(path) : d_->mimeType;
-        return d_->outputer.Output(path, type);
+        const size_t slash = path.rfind('/');
+        const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+        sent = SendOpen(fd, name, d_->mimeType.empty() ? HTTPFileOutputer::GetMimeType(path) : d_->mimeType);
     } catch (const std::exception&) {
         VELA_LOG_ERR("out of memory sending %s", path.c_str());
+    }
+    close(fd);
+    return sent;
+}
+
+bool APIDownload::Output(int fd, std::string const& name)
+{
+    if (!IsReadableRegular(fd)) {
+        VELA_LOG_ERR("download refused: the descriptor is not a readable regular file");
+        return false;
+    }
+    try {
+        return SendOpen(fd, name, d_->mimeType.empty() ? HTTPFileOutputer::GetMimeType(name) : d_->mimeType);
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("out of memory sending a file");
         return false;
     }
 }
 
 bool APIDownload::Output(FILE* file)
 {
-    struct stat st;
-    const int fd = file == nullptr ? -1 : fileno(file);
-    const int mode = fd < 0 ? -1 : fcntl(fd, F_GETFL);
-    if (mode < 0 || (mode & O_ACCMODE) == O_WRONLY || fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+    if (file == nullptr || !IsReadableRegular(fileno(file))) {
         VELA_LOG_ERR("download refused: the stream is not a readable regular file");
         return false;
     }

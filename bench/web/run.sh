@@ -17,7 +17,10 @@
 #                             wrk: seconds per run, alternating rounds
 #   BENCH_TRANSFER_ROUNDS=3   alternating rounds of each transfer
 #   BENCH_DIR=$TMPDIR         where the state root and the big files go
-#   BENCH_XSENDFILE=1         also download with X-Sendfile on
+#   BENCH_XSENDFILE=1         also download with X-Sendfile on; velascgi uses
+#                             it only when BENCH_DIR and every directory above
+#                             it are writable by root alone (not below /tmp),
+#                             and streams the file otherwise
 #   BENCH_STREAM_REQUEST_BODY, BENCH_STREAM_RESPONSE_BODY
 #                             override lighttpd's server.stream-*-body
 #   BENCH_LIGHTTPD_EXTRA      lines added to the lighttpd configuration

@@ -20,12 +20,34 @@
 // writes), never held in memory as a whole. A HEAD request gets the headers
 // only.
 //
+// Opening: Output(path) opens the path once, without following a symbolic
+// link in any of its components (unless the caller opted out with
+// SetFollowSymlinks), and checks what it opened with fstat: only a regular
+// file is sent, and everything after (size, date, ranges, the content)
+// comes from that descriptor, never from the path again. A handler that
+// opens the file itself hands over the descriptor (Output(int) or
+// Output(FILE*)) the same way.
+//
 // Fast output: when the deployment says its web server takes the X-Sendfile
 // header (xsendfile="yes" in /etc/vela/webapi.conf under the system root)
 // and nobody switched it off (VELA::HTTP::FileOutputerHelper), Output(path)
-// writes "X-Sendfile: <canonical absolute path, percent-encoded>" with the
-// content type, nosniff and the disposition, and the web server sends the file,
-// ranges included. Output(FILE*) never uses it.
+// and Output(int) may write "X-Sendfile: <absolute path, percent-encoded>"
+// with the content type, nosniff and the disposition instead of the
+// content; the web server then opens the path itself, later, as its own
+// user, and sends the file, ranges included. So the path must be one that
+// nobody less privileged than the web server can change in between. The
+// path is the one the kernel keeps for the open descriptor
+// (/proc/self/fd/N), and it is handed over only when
+//   - it still leads to the very file that was opened (same device and
+//     inode, no symbolic link on the way), and
+//   - "/", every directory below it on the way, and the file itself are
+//     owned by root or by the web server's account (the real user id of the
+//     process), and none of them is writable by its group or by others
+//     (a sticky /tmp included).
+// Otherwise the file is streamed from the open descriptor as if fast output
+// were off (logged at LOG_INFO). Files in a folder a user may write to are
+// therefore always streamed. Output(FILE*) never uses X-Sendfile: its
+// caller may remove or change the file as soon as the call returns.
 //
 // Only regular files are sent. Output returns false, having written nothing,
 // when the file cannot be opened or is not a regular file; it returns false
@@ -48,14 +70,36 @@ public:
     // "application/octet-stream" for anything unknown.
     static std::string GetMimeType(const std::string& name);
 
+    // Opens `path` for reading as Output(path) does: read-only,
+    // close-on-exec, without following a symbolic link in any component
+    // unless `followSymlinks`, never waiting on a FIFO, and only a regular
+    // file (checked on the descriptor). The descriptor, which the caller
+    // closes, or -1 with errno set: ELOOP when a component is a symbolic
+    // link, EINVAL when `path` is empty, holds a NUL or is not a regular
+    // file, ENAMETOOLONG, or the errno of the open.
+    static int OpenForOutput(const std::string& path, bool followSymlinks = false);
+
     // Sends the file at `path` (the content, or X-Sendfile when fast output
-    // is on); the disposition names the last component of `path`.
+    // is on and allowed for it); the disposition names the last component
+    // of `path`.
     bool Output(const std::string& path, const std::string& mimeType);
+    // Sends the whole of the open regular file `fd` (not closed, read with
+    // pread from its first byte: its position does not matter), or
+    // X-Sendfile when fast output is on and allowed for it; the file must
+    // then stay where it is until the answer is sent. `name` is the file
+    // name the client is offered; empty sends no Content-Disposition.
+    bool Output(int fd, const std::string& name, const std::string& mimeType);
     // Sends the whole of the open regular file `file`, from its first byte
     // whatever its position (pending output of the stream is flushed
-    // first). `name` is the file name the client is offered; empty sends no
-    // Content-Disposition. The stream is not closed.
+    // first), never through X-Sendfile. `name` as above. The stream is not
+    // closed.
     bool Output(FILE* file, const std::string& name, const std::string& mimeType);
+
+    // Whether Output(path) follows symbolic links (off by default). Only for
+    // a caller whose path no one less privileged can change, such as a file
+    // of its own installation reached through a link it made; a path that
+    // holds anything a client or a user chose must never be followed.
+    void SetFollowSymlinks(bool follow);
 
     // Whether Output writes the Content-Disposition header (on by default);
     // off for callers that printed one of their own.
@@ -68,8 +112,11 @@ public:
     void SetRangesEnabled(bool enabled);
 
 private:
+    bool SendDescriptor(int fd, const std::string& name, const std::string& mimeType, bool serverMayOpen);
+
     bool writeDisposition_;
     bool honourRanges_;
+    bool followSymlinks_;
 };
 
 namespace VELA {

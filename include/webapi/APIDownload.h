@@ -15,6 +15,14 @@
 // The response's "Content-type" and "Content-Length" headers are not
 // printed: the outputer writes the file's; a "Content-Disposition" of the
 // response replaces the outputer's attachment header.
+//
+// A path is opened once, without following a symbolic link in any of its
+// components, and checked on the open descriptor, so a user who can write
+// to a folder on the way cannot swap the file for a link to one they may
+// not read. A handler that needs a link followed (one it trusts) opens the
+// file itself and hands over the descriptor. X-Sendfile is used only for a
+// path no one less privileged than the web server can change (see
+// vela/httpoutput.h); any other file is streamed from the open descriptor.
 #pragma once
 
 #include <cstdio>
@@ -50,9 +58,16 @@ public:
     void SetMimeTypeFromFileName(std::string const& name);
 
     // Sends the file at `path`; without a MIME type it is derived from the
-    // path. False, with nothing written, when `path` is not a regular file;
-    // false as well when sending fails after the headers went out.
+    // path. False, with nothing written, when `path` is not a regular file
+    // or a symbolic link is on it; false as well when sending fails after
+    // the headers went out.
     bool Output(std::string const& path);
+    // Sends the whole of the open regular file `fd` (not closed), offered as
+    // `name` (empty: no Content-Disposition); without a MIME type it is
+    // derived from `name`. The file must stay where it is until the answer
+    // is sent (X-Sendfile). False, with nothing written, when `fd` is not a
+    // readable regular file.
+    bool Output(int fd, std::string const& name);
     // Sends the whole of the open regular file `file` (not closed), as
     // application/octet-stream unless a MIME type was set, without a file
     // name.
@@ -67,6 +82,8 @@ public:
     void PrintHeader();
 
 private:
+    bool SendOpen(int fd, std::string const& name, std::string const& mimeType);
+
     APIDownloadPrivate* d_;
 };
 

@@ -21,6 +21,11 @@ srv_require "velascgi switches to the identity each API asks for" cksum cmp
 srv_traps
 
 # ---- The system root: the staged web-API directory, one data volume.
+# X-Sendfile is given only paths that no other account can change, so the
+# root must not lie below a directory others may write to (/tmp).
+if [ -d /run ] && [ -w /run ]; then
+  export TMPDIR=/run
+fi
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 mkdir -p "$ROOT/vol1/sample" "$RUN/www"
 echo /vol1 >"$ROOT/etc/vela/volumes.conf"

@@ -1,6 +1,7 @@
 // HTTP file output: MIME types, whole files through a pipe and a file,
-// byte ranges, X-Sendfile, refusals, the disposition header, a client that
-// goes away.
+// byte ranges, X-Sendfile only for paths nobody else can change, links on
+// the path refused, refusals, the disposition header, a client that goes
+// away.
 #include <gtest/gtest.h>
 
 #include <csignal>
@@ -13,7 +14,9 @@
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <vector>
 
+#include "platform/FileUtil.h"
 #include "platform/StateRootTest.h"
 #include "support/TestSupport.h"
 #include "vela/httpoutput.h"
@@ -239,11 +242,36 @@ TEST_F(HttpOutput, SingleRanges)
     EXPECT_EQ("bytes */0", ToFile(root_.Path(), [&] { return out_.Output(empty, ""); }).Header("Content-Range"));
 }
 
-TEST_F(HttpOutput, FastOutputWritesXSendfileOnlyForPaths)
+// A directory whose every ancestor only root or this account may change, as
+// a build directory normally is (CTest passes it), unlike $TMPDIR: the
+// place where X-Sendfile may be used at all.
+class ServerOnlyDir {
+public:
+    ServerOnlyDir() : base_("TMPDIR", getenv("VELA_TEST_BINARY_DIR")), dir_() { chmod(dir_.Path().c_str(), 0755); }
+    const std::string& Path() const { return dir_.Path(); }
+
+private:
+    ScopedEnv base_;
+    VELA::Test::TempDir dir_;
+};
+
+std::string RealPath(const std::string& path)
 {
-    mkdir((files_ + "/sub").c_str(), 0755);
-    const std::string path = Write("a b%c.txt", "content");
-    ASSERT_EQ(0, symlink(path.c_str(), (files_ + "/link").c_str()));
+    char* real = realpath(path.c_str(), nullptr);
+    const std::string out = real != nullptr ? real : "";
+    free(real);
+    return out;
+}
+
+TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
+{
+    ASSERT_NE(nullptr, getenv("VELA_TEST_BINARY_DIR")) << "run through CTest";
+    ServerOnlyDir safe;
+    const std::string dir = safe.Path();
+    mkdir((dir + "/sub").c_str(), 0755);
+    const std::string path = dir + "/a b%c.txt";
+    std::ofstream(path) << "content";
+    chmod(path.c_str(), 0644);
     ASSERT_FALSE(FileOutputerHelper::IsFastOutputEnabled());  // nothing configured
 
     std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << "xsendfile=\"YES\"\n";
@@ -255,25 +283,77 @@ TEST_F(HttpOutput, FastOutputWritesXSendfileOnlyForPaths)
     }
     VELA::VelaRootReset();
     ASSERT_TRUE(FileOutputerHelper::IsFastOutputEnabled());
-    char* real = realpath(path.c_str(), nullptr);
-    ASSERT_NE(nullptr, real);
-    std::string expected(real);
-    free(real);
-    expected.replace(expected.rfind('/') + 1, std::string::npos, "a%20b%25c.txt");
-    for (const std::string& via : {files_ + "/link", files_ + "/sub/../a b%c.txt"}) {
-        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(via, "text/plain"); });
-        EXPECT_TRUE(r.ok && r.complete) << via;
-        EXPECT_EQ(expected, r.Header("X-Sendfile")) << via;
+    std::string expected = RealPath(dir);
+    ASSERT_NE("", expected);
+    expected += "/a%20b%25c.txt";
+    const int fd = open(path.c_str(), O_RDONLY);
+    ASSERT_GE(fd, 0);
+    const std::function<bool()> byServer[] = {
+        [&] { return out_.Output(path, "text/plain"); },
+        [&] { return out_.Output(dir + "/sub/../a b%c.txt", "text/plain"); },
+        [&] { return out_.Output(fd, "a b%c.txt", "text/plain"); },
+    };
+    for (const auto& call : byServer) {
+        const Reply r = ToFile(root_.Path(), call);
+        EXPECT_TRUE(r.ok && r.complete);
+        EXPECT_EQ(expected, r.Header("X-Sendfile"));
         EXPECT_EQ("text/plain", r.Header("Content-Type"));
         EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options"));
+        EXPECT_EQ("attachment; filename=\"a b_c.txt\"; filename*=UTF-8''a%20b%25c.txt", r.Header("Content-Disposition"));
         EXPECT_EQ("", r.Header("Content-Length"));
         EXPECT_EQ("", r.body);
     }
+    close(fd);
 
-    const std::string crlf = Write("evil\r\nX-Injected: 1", "x");
-    const Reply refused = ToFile(root_.Path(), [&] { return out_.Output(crlf, ""); });
-    EXPECT_FALSE(refused.ok);
-    EXPECT_EQ("", refused.head);
+    // The same file in places someone else could change before the web
+    // server opens it: sent from the open descriptor instead.
+    const auto place = [&](const std::string& folder, mode_t folderMode, mode_t fileMode, uid_t owner) {
+        mkdir(folder.c_str(), 0755);
+        chmod(folder.c_str(), folderMode);
+        const std::string file = folder + "/f.txt";
+        std::ofstream(file) << "content";
+        chmod(file.c_str(), fileMode);
+        EXPECT_EQ(0, owner == getuid() ? 0 : chown(folder.c_str(), owner, static_cast<gid_t>(-1)));
+        return file;
+    };
+    mkdir((dir + "/open").c_str(), 0755);
+    chmod((dir + "/open").c_str(), 0777);
+    std::vector<std::string> streamed = {
+        place(dir + "/others", 0777, 0644, getuid()),
+        place(dir + "/sticky", 01777, 0644, getuid()),
+        place(dir + "/group", 0775, 0644, getuid()),
+        place(dir + "/open/deeper", 0755, 0644, getuid()),  // an ancestor others may write to
+        place(dir + "/file-others", 0755, 0666, getuid()),
+        place(dir + "/file-group", 0755, 0664, getuid()),
+        dir + "/evil\r\nX-Injected: 1",
+    };
+    std::ofstream(streamed.back()) << "content";
+    if (getuid() == 0) {
+        streamed.push_back(place(dir + "/nobody", 0755, 0644, 65534));
+    }
+    for (const std::string& file : streamed) {
+        VELA::Test::LogCapture log;
+        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(file, "text/plain"); });
+        EXPECT_TRUE(r.ok) << file;
+        EXPECT_EQ("", r.Header("X-Sendfile")) << file;
+        EXPECT_EQ("", r.Header("X-Injected")) << file;
+        EXPECT_EQ("7", r.Header("Content-Length")) << file;
+        EXPECT_EQ("content", r.body) << file;
+        EXPECT_TRUE(log.Contains("X-Sendfile not used")) << file;
+    }
+
+    // A descriptor whose path was swapped for a link after the open: its
+    // own file goes out, streamed, and the link's target never does.
+    const std::string swapped = dir + "/swapped.txt";
+    std::ofstream(swapped) << "mine";
+    const int mine = open(swapped.c_str(), O_RDONLY);
+    ASSERT_GE(mine, 0);
+    ASSERT_EQ(0, symlink(path.c_str(), (dir + "/link").c_str()));
+    ASSERT_EQ(0, rename((dir + "/link").c_str(), swapped.c_str()));
+    const Reply kept = ToFile(root_.Path(), [&] { return out_.Output(mine, "swapped.txt", ""); });
+    close(mine);
+    EXPECT_EQ("", kept.Header("X-Sendfile"));
+    EXPECT_EQ("mine", kept.body);
 
     FILE* file = fopen(path.c_str(), "r");
     ASSERT_NE(nullptr, file);
@@ -289,6 +369,72 @@ TEST_F(HttpOutput, FastOutputWritesXSendfileOnlyForPaths)
     EXPECT_EQ("content", direct.body);
 }
 
+// A link anywhere on the path, the last component or a directory on the
+// way, is refused before anything is written, by both ways of resolving;
+// everything else opens alike.
+TEST_F(HttpOutput, SymbolicLinksOnThePathAreRefused)
+{
+    const std::string target = Write("target.txt", "secret");
+    mkdir((files_ + "/dir").c_str(), 0755);
+    const std::string inDir = files_ + "/dir/in.txt";
+    std::ofstream(inDir) << "in";
+    ASSERT_EQ(0, symlink(target.c_str(), (files_ + "/last").c_str()));
+    ASSERT_EQ(0, symlink((files_ + "/dir").c_str(), (files_ + "/middle").c_str()));
+    ASSERT_EQ(0, symlink("dir", (files_ + "/relative").c_str()));
+
+    for (const std::string& link : {files_ + "/last", files_ + "/middle/in.txt", files_ + "/relative/in.txt"}) {
+        VELA::Test::LogCapture log;
+        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(link, ""); });
+        EXPECT_FALSE(r.ok) << link;
+        EXPECT_EQ("", r.head) << link;
+        EXPECT_TRUE(log.Contains("symbolic link")) << link;
+    }
+
+    using VELA::Platform::NoSymlinkResolve;
+    struct Case {
+        std::string path;
+        int err;  // 0: opens
+    };
+    const Case cases[] = {
+        {inDir, 0},
+        {files_ + "/dir/../dir/./in.txt", 0},
+        {files_ + "//dir///in.txt", 0},
+        {"files/dir/in.txt", 0},  // relative to the working directory
+        {files_ + "/last", ELOOP},
+        {files_ + "/middle/in.txt", ELOOP},
+        {"files/relative/in.txt", ELOOP},
+        {files_ + "/middle/../target.txt", ELOOP},
+        {files_ + "/dir/in.txt/", ENOTDIR},
+        {target + "/x", ENOTDIR},
+        {files_ + "/missing/x", ENOENT},
+        {"", EINVAL},
+        {std::string(5000, 'a'), ENAMETOOLONG},
+    };
+    char cwd[4096];
+    ASSERT_NE(nullptr, getcwd(cwd, sizeof(cwd)));
+    ASSERT_EQ(0, chdir(root_.Path().c_str()));
+    for (const Case& c : cases) {
+        for (NoSymlinkResolve how : {NoSymlinkResolve::kAuto, NoSymlinkResolve::kWalk}) {
+            errno = 0;
+            const int fd = VELA::Platform::OpenNoSymlinks(c.path, O_RDONLY, how);
+            const int err = fd < 0 ? errno : 0;
+            EXPECT_EQ(c.err, err) << c.path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
+            if (fd >= 0) {
+                char byte = 0;
+                EXPECT_EQ(1, read(fd, &byte, 1));
+                EXPECT_EQ('i', byte);
+                close(fd);
+            }
+        }
+    }
+    EXPECT_EQ(0, chdir(cwd));
+
+    // A caller that trusts its links may have them followed.
+    out_.SetFollowSymlinks(true);
+    EXPECT_EQ("secret", ToFile(root_.Path(), [&] { return out_.Output(files_ + "/last", ""); }).body);
+    EXPECT_EQ("in", ToFile(root_.Path(), [&] { return out_.Output(files_ + "/middle/in.txt", ""); }).body);
+}
+
 TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
 {
     const std::string fifo = files_ + "/fifo";
@@ -299,6 +445,17 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
     ASSERT_NE(nullptr, pipeStream);
     FILE* writeOnly = fopen((files_ + "/w").c_str(), "w");
     ASSERT_NE(nullptr, writeOnly);
+    const int dirFd = open(files_.c_str(), O_RDONLY | O_DIRECTORY);
+    const int fifoFd = open(fifo.c_str(), O_RDONLY | O_NONBLOCK);
+    const int pathFd = open((files_ + "/w").c_str(), O_PATH);  // names a file, cannot read it
+    ASSERT_GE(dirFd, 0);
+    ASSERT_GE(fifoFd, 0);
+    ASSERT_GE(pathFd, 0);
+    for (const std::string& path : {files_, fifo}) {
+        errno = 0;
+        EXPECT_EQ(-1, HTTPFileOutputer::OpenForOutput(path)) << path;
+        EXPECT_EQ(EINVAL, errno) << path;
+    }
     const std::function<bool()> calls[] = {
         [&] { return out_.Output(files_, ""); },
         [&] { return out_.Output(fifo, ""); },  // must not wait for a writer
@@ -307,6 +464,11 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
         [&] { return out_.Output(static_cast<FILE*>(nullptr), "n", ""); },
         [&] { return out_.Output(pipeStream, "n", ""); },
         [&] { return out_.Output(writeOnly, "n", ""); },
+        [&] { return out_.Output(dirFd, "n", ""); },
+        [&] { return out_.Output(fifoFd, "n", ""); },
+        [&] { return out_.Output(fileno(writeOnly), "n", ""); },
+        [&] { return out_.Output(pathFd, "n", ""); },
+        [&] { return out_.Output(-1, "n", ""); },
     };
     for (const auto& call : calls) {
         const Reply r = ToFile(root_.Path(), call);
@@ -316,6 +478,9 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
     fclose(pipeStream);
     fclose(writeOnly);
     close(fds[1]);
+    close(dirFd);
+    close(fifoFd);
+    close(pathFd);
 }
 
 TEST_F(HttpOutput, DispositionNamesAreSafe)

@@ -1,5 +1,6 @@
-// Downloads: the response's headers, the MIME type, the stream form and a
-// download with a response of its own.
+// Downloads: the response's headers, the MIME type, the stream and
+// descriptor forms, a link on the path, and a download with a response of
+// its own.
 #include <gtest/gtest.h>
 
 #include <cstdio>
@@ -153,6 +154,34 @@ TEST_F(Download, HandlerStatusTurnsRangesOff)
     EXPECT_NE(std::string::npos, out.find("Status: 203 Non-Authoritative Information\r\n"));
     EXPECT_EQ(std::string::npos, out.find("Accept-Ranges"));
     EXPECT_EQ("\r\n\r\nhello", out.substr(out.size() - 9));
+}
+
+// A link on the path is refused before anything is written; a descriptor
+// the handler opened itself is sent under the name it gives.
+TEST_F(Download, LinkRefusedDescriptorSent)
+{
+    const std::string link = root_.Path() + "/link.txt";
+    ASSERT_EQ(0, symlink(file_.c_str(), link.c_str()));
+    APIResponse response(nullptr);
+    APIDownload download(&response);
+    bool ok = true;
+    EXPECT_EQ("", Capture([&] { return download.Output(link); }, ok));
+    EXPECT_FALSE(ok);
+    const int dir = open(root_.Path().c_str(), O_RDONLY | O_DIRECTORY);
+    EXPECT_EQ("", Capture([&] { return download.Output(dir, "x"); }, ok));
+    EXPECT_FALSE(ok);
+    close(dir);
+    EXPECT_TRUE(response.IsEnableOutput());
+
+    const int fd = open(file_.c_str(), O_RDONLY);
+    ASSERT_GE(fd, 0);
+    const std::string out = Capture([&] { return download.Output(fd, "table.csv"); }, ok);
+    close(fd);
+    EXPECT_TRUE(ok);
+    EXPECT_NE(std::string::npos, out.find("Content-Type: text/csv\r\n")) << out;
+    EXPECT_NE(std::string::npos, out.find("filename=\"table.csv\"")) << out;
+    EXPECT_EQ("\r\n\r\nhello", out.substr(out.size() - 9));
+    EXPECT_FALSE(response.IsEnableOutput());
 }
 
 TEST_F(Download, XSendFileSwitch)

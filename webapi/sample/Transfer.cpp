@@ -9,17 +9,19 @@
 // "download" is described with "allowDownload": it answers with the file
 // instead of JSON. Files come only from <first data volume>/sample, under a
 // plain name, so that X-Sendfile (whose web server only serves the data
-// volumes) and direct output give the same answers.
+// volumes) and direct output give the same answers. The file is opened
+// once, without following links, and its descriptor is handed over.
 #include "Transfer.h"
 
 #include <cerrno>
 #include <cstdint>
+#include <cstdlib>
 #include <fcntl.h>
 #include <json/json.h>
 #include <string>
-#include <sys/stat.h>
 #include <unistd.h>
 
+#include "vela/httpoutput.h"
 #include "vela/sysfile.h"
 #include "webapi/APIDownload.h"
 #include "webapi/APIError.h"
@@ -194,18 +196,31 @@ void Download(APIRequest* req, APIResponse* resp)
         resp->SetError(kSampleFailure, Json::Value("no data volume"));
         return;
     }
-    const std::string path = std::string(volume.szMountPath) + kDownloadFolder + "/" + name.Get();
-    // Only a regular file of the folder itself, not a link that leads out.
-    struct stat st;
-    if (lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) {
+    // The volume's own path is the administrator's and may lead through a
+    // link (a volume mounted elsewhere): it is resolved first. Below it,
+    // only a regular file of the folder itself, not a link that leads out:
+    // opened once without following any link on the way, checked on the
+    // descriptor, and the descriptor is what is sent. A path checked first
+    // and opened later could be swapped for a link in between by anyone who
+    // may write to the folder.
+    char* mount = realpath(volume.szMountPath, nullptr);
+    if (mount == nullptr) {
+        resp->SetError(kSampleFailure, Json::Value("no data volume"));
+        return;
+    }
+    const std::string path = std::string(mount) + kDownloadFolder + "/" + name.Get();
+    free(mount);
+    const int fd = HTTPFileOutputer::OpenForOutput(path);
+    if (fd < 0) {
         resp->SetError(kSampleFailure, Json::Value("no such file"));
         return;
     }
     VELA::APIDownload download(resp);
-    if (!download.Output(path) && resp->IsEnableOutput()) {
+    if (!download.Output(fd, name.Get()) && resp->IsEnableOutput()) {
         // Nothing was written: the JSON error still goes out.
         resp->SetError(kSampleFailure, Json::Value("the file could not be sent"));
     }
+    close(fd);
 }
 
 }  // namespace Sample
