@@ -193,6 +193,35 @@ bool MoveIdentityParams(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)
     return true;
 }
 
+// The permission check has run on the request's API, version and method:
+// form fields of the upload never name another call. They are dropped from
+// the fields merged into the request; one that differs is logged.
+void KeepCheckedCall(const APIRequest* req, Json::Value& fields)
+{
+    const struct {
+        const char* key;
+        std::string checked;
+    } call[] = {
+        {"api", req->GetAPIClass()},
+        {"version", std::to_string(req->GetAPIVersion())},
+        {"method", req->GetAPIMethod()},
+    };
+    for (const auto& c : call) {
+        const Json::Value* field = fields.find(c.key, c.key + strlen(c.key));
+        if (field == nullptr) {
+            continue;
+        }
+        const bool same = strcmp(c.key, "version") == 0
+                              ? RequestFacts::Integer(*field, 0) == req->GetAPIVersion()
+                              : RequestFacts::Text(*field) == c.checked;
+        if (!same) {
+            VELA_LOG_ERR("upload field \"%s\" ignored: the call checked is %s %s %s", c.key,
+                         call[0].checked.c_str(), call[1].checked.c_str(), call[2].checked.c_str());
+        }
+        fields.removeMember(c.key);
+    }
+}
+
 }  // namespace
 
 WebEntry::WebEntry() : cgi_(nullptr), uploadedFiles_(Json::arrayValue), permission_(Json::objectValue)
@@ -427,6 +456,7 @@ bool WebEntry::HandleUpload(APIRequest* req, APIResponse* resp)
         resp->SetError(WEBAPI_ERR_UPLOAD_FAILED, detail);
         return false;
     }
+    KeepCheckedCall(req, param["postParam"]);
     req->InitParam(param, false);
     return true;
 }
