@@ -16,6 +16,7 @@
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/upload.h"
+#include "vela/uploaddir.h"
 #include "vela/webapiutil.h"
 #include "vela/webserver.h"
 #include "webapi/APIError.h"
@@ -242,6 +243,9 @@ WebEntry::~WebEntry()
 
 bool WebEntry::Run(const Json::Value& /*unused*/)
 {
+    // A request the web server ends (the client went away) or a time limit
+    // kills still removes what its upload stored.
+    VelaUploadCleanupOnExit();
     bool served = false;
     try {
         if (Initialize(Json::Value()) && SetProcessName(request_, response_)) {
@@ -462,19 +466,13 @@ bool WebEntry::HandleUpload(APIRequest* req, APIResponse* resp)
 }
 
 // The files an upload stored are the handler's during the call; a handler
-// that keeps one moves it away. Whatever is still in place afterwards is
-// removed, so that no upload outlives its request. The paths are the ones
-// the upload reader created, never client text.
+// that keeps one moves it out of the request's private upload directory.
+// The directory goes afterwards with whatever is still in it, so that no
+// upload outlives its request (the front end's and a deferring handler's
+// alike).
 void WebEntry::RemoveUploadedFiles()
 {
-    if (!uploadedFiles_.isArray()) {
-        return;
-    }
-    for (const Json::Value& path : uploadedFiles_) {
-        if (path.isString() && unlink(path.asCString()) != 0 && errno != ENOENT) {
-            VELA_LOG_ERR("cannot remove uploaded file %s [%m]", path.asCString());
-        }
-    }
+    VelaUploadDirRemove();  // logs what it cannot remove
     uploadedFiles_ = Json::Value(Json::arrayValue);
 }
 
