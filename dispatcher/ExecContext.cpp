@@ -89,7 +89,8 @@ bool SwitchToUser(const std::string& name, bool grantable)
     if (SetResUid(__LINE__, kKeepUid, 0, kKeepUid)) {
         uid_t uid = 0;
         gid_t gid = 0;
-        if (!grantable && VELAUserGetUGID(name.c_str(), &uid, &gid) == 0 && uid != 0) {
+        if (!grantable && VelaUploadDirPath()[0] != '\0' && VELAUserGetUGID(name.c_str(), &uid, &gid) == 0 &&
+            uid != 0) {
             // Root for good no more: what root's upload stored is removed by
             // a reaper that keeps root.
             VelaUploadDirReaper();
