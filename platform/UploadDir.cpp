@@ -526,7 +526,7 @@ int VelaUploadSweep(const char* base, unsigned minAgeSeconds)
     }
     try {
         const std::string dir = Trimmed(base);
-        ScopedFd fd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        ScopedFd fd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
         if (fd.Get() < 0) {
             VELA_LOG_ERR("cannot open the upload directory %s: %m", dir.c_str());
             return -1;
