@@ -69,7 +69,8 @@ expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$no
 # their own in its place; shortly after the client is gone, nothing of it
 # is left.
 for target in "$IDS" "$DEFERRED"; do
-  name="client gone (${target##*method=}, ${target#*api=})"
+  name=${target#*api=}
+  name="client gone (${name%%&*})"
   curl -s -o /dev/null --max-time 120 --limit-rate 1M --cookie "$COOKIE" -F "f=@$TMP/big.bin" "$target" &
   client=$!
   partial=""
