@@ -392,16 +392,20 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
         return false;
     }
 
-    // 2. The call and its method's attributes.
+    // 2. The call and its method's attributes. The call is fixed here, as
+    //    the checks saw it: whatever later steps merge into the request's
+    //    parameters (an upload's form fields), the library, the entry and
+    //    the identity below are those of this API, version and method.
     const std::string api = req->GetAPIClass();
     const std::string method = req->GetAPIMethod();
     const int version = req->GetAPIVersion();
     const Json::Value attrs = GetMethod(api, version, method);
-    const bool allowUpload = GetMethodAttr(req, "allowUpload");
-    const bool allowDownload = GetMethodAttr(req, "allowDownload");
+    auto attr = [&](const char* name) { return GetMethodAttr(api, version, method, name); };
+    const bool allowUpload = attr("allowUpload");
+    const bool allowDownload = attr("allowDownload");
 
     // 3. Usage counting.
-    if (JsonFlag(request_->GetAttr("_collector_count_webapi"), false) && !GetMethodAttr(req, "allowTimeout") &&
+    if (JsonFlag(request_->GetAttr("_collector_count_webapi"), false) && !attr("allowTimeout") &&
         JsonFlag(req->GetAPIInfo("count"), true)) {
         IncreaseCounter(req);
     }
@@ -462,9 +466,9 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
         }
     }
     want.loginName = req->GetLoginUserName();
-    want.grantable = GetMethodAttr(req, "grantable");
-    want.grantByDefault = GetMethodAttr(req, "grantByDefault");
-    want.grantByUser = GetMethodAttr(req, "grantByUser");
+    want.grantable = attr("grantable");
+    want.grantByDefault = attr("grantByDefault");
+    want.grantByUser = attr("grantByUser");
     if (!identity.Prepare(want)) {
         return false;
     }

@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include "vela/log.h"
+#include "vela/uploaddir.h"
 #include "vela/user.h"
 #include "webapi/APIUtils.h"
 
@@ -86,6 +87,14 @@ bool ReadGroups(std::vector<gid_t>& out)
 bool SwitchToUser(const std::string& name, bool grantable)
 {
     if (SetResUid(__LINE__, kKeepUid, 0, kKeepUid)) {
+        uid_t uid = 0;
+        gid_t gid = 0;
+        if (!grantable && VelaUploadDirPath()[0] != '\0' && VELAUserGetUGID(name.c_str(), &uid, &gid) == 0 &&
+            uid != 0) {
+            // Root for good no more: what root's upload stored is removed by
+            // a reaper that keeps root.
+            VelaUploadDirReaper();
+        }
         return ResetCredentialsByName(name.c_str(), grantable);
     }
     uid_t uid = 0;

@@ -18,8 +18,10 @@
 #include "FileUtil.h"
 #include "MultipartReader.h"
 #include "SysInternal.h"
+#include "UploadDir.h"
 #include "vela/log.h"
 #include "vela/upload.h"
+#include "vela/uploaddir.h"
 #include "vela/vlibc.h"
 
 using VELA::Platform::MultipartPart;
@@ -193,7 +195,12 @@ int OpenUploadDir(const char* dir, UploadDir& out)
         VELA_LOG_ERR("upload directory path too long");
         return VELA_UPLOAD_ERR_ARGUMENT;
     }
-    out.fd.Reset(open(out.path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    // The process's private upload directory is used through the descriptor
+    // it was made with; any other directory is opened by its path.
+    out.fd.Reset(VELA::Platform::DupUploadDir(out.path));
+    if (out.fd.Get() < 0) {
+        out.fd.Reset(open(out.path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    }
     if (out.fd.Get() < 0) {
         VELA_LOG_ERR("cannot open the upload directory %s: %m", out.path.c_str());
         return VELA_UPLOAD_ERR_ARGUMENT;
@@ -771,4 +778,5 @@ void VelaCgiUploadReset(void)
     ProcessUpload& process = Process();
     VelaUploadReaderFree(process.reader);
     process = ProcessUpload();
+    VelaUploadDirRemove();
 }

@@ -8,6 +8,7 @@
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/upload.h"
+#include "vela/uploaddir.h"
 #include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 #include "webapi/APIRequest.h"
@@ -151,14 +152,38 @@ bool APIUploadPrivate::FindUploadTmpDir(std::string& dir, unsigned long long siz
         VOLUME_INFO volume;
         if (VolumeAvailGet(size, &volume, 0, VOLUME_AVAIL_WRITABLE) == 1) {
             dir = std::string(volume.szMountPath) + "/" + kUploadVolumeTmpDir;
-            (void)VELAFSMkdirP(dir.c_str(), 0, 0, static_cast<uid_t>(-1), static_cast<gid_t>(-1), 0777);
-            return true;
+            // Every identity that uploads may make its private directory
+            // here; the sticky bit keeps each one's entries its own.
+            (void)VELAFSMkdirP(dir.c_str(), 0, 0, static_cast<uid_t>(-1), static_cast<gid_t>(-1),
+                               kUploadVolumeTmpMode);
+            if (VelaUploadBaseUsable(dir.c_str()) == 1) {
+                return true;
+            }
         }
     }
-    if (CanUploadtoTmp(dir, size)) {
+    if (CanUploadtoTmp(dir, size) && VelaUploadBaseUsable(dir.c_str()) == 1) {
         return true;
     }
-    return CanUploadtoRoot(dir, size);
+    return CanUploadtoRoot(dir, size) && VelaUploadBaseUsable(dir.c_str()) == 1;
+}
+
+int APIUploadPrivate::PrivateDir(unsigned long long size, std::string& dir)
+{
+    dir = VelaUploadDirPath();
+    if (!dir.empty()) {
+        return 1;  // chosen and made by an earlier call of this request
+    }
+    if (size > ULLONG_MAX - kUploadSizeMargin || !FindUploadTmpDir(dir, size + kUploadSizeMargin)) {
+        VELA_LOG_ERR("no temporary directory has room for an upload of %llu bytes", size);
+        return -1;
+    }
+    char path[PATH_MAX];
+    const int rc = VelaUploadDirGet(dir.c_str(), path, sizeof(path));
+    if (rc < 0) {
+        return -1;
+    }
+    dir = path;
+    return rc;
 }
 
 int APIUploadPrivate::GetUploadAll(Json::Value& params, Json::Value* files)
@@ -167,17 +192,20 @@ int APIUploadPrivate::GetUploadAll(Json::Value& params, Json::Value* files)
     if (size == 0) {
         return UPLOAD_RESULT_EMPTY;
     }
-    std::string dir;
-    if (size > ULLONG_MAX - kUploadSizeMargin || !FindUploadTmpDir(dir, size + kUploadSizeMargin)) {
-        VELA_LOG_ERR("no temporary directory has room for an upload of %llu bytes", size);
-        return UPLOAD_RESULT_NO_SPACE;
-    }
     UploadTables tables;
     if (tables.fields == nullptr || tables.files == nullptr) {
         VELA_LOG_ERR("cannot alloc memory for hash!");
         return UPLOAD_RESULT_MEMORY;
     }
+    std::string dir;
+    const int made = PrivateDir(size, dir);
+    if (made < 0) {
+        return UPLOAD_RESULT_NO_SPACE;
+    }
     const int rc = VelaCgiLoadUploadAll(tables.fields, tables.files, dir.c_str(), 0, progress_);
+    if (rc != 1 && made == 2) {
+        VelaUploadDirRemove();  // a failed load removed its files; nothing else is in there
+    }
     if (files != nullptr) {
         const int count = VLIBCSzHashCount(tables.files);
         try {
@@ -241,13 +269,16 @@ int APIUploadPrivate::GetUploadFile(Json::Value& result)
         return lastError_;
     }
     std::string dir;
-    if (expectedSize_ > ULLONG_MAX - kUploadSizeMargin || !FindUploadTmpDir(dir, expectedSize_ + kUploadSizeMargin)) {
-        VELA_LOG_ERR("no temporary directory has room for an upload of %llu bytes", expectedSize_);
+    const int made = PrivateDir(expectedSize_, dir);
+    if (made < 0) {
         lastError_ = UPLOAD_RESULT_NO_SPACE;
         return lastError_;
     }
     const int rc = VelaCgiLoadUploadFileToDir(cgi_, dir.c_str(), progress_, fileName_, sizeof(fileName_),
                                               fieldName_, sizeof(fieldName_), fieldValue_, sizeof(fieldValue_));
+    if (rc < 1 && made == 2) {
+        VelaUploadDirRemove();
+    }
     if (rc < 1) {
         lastError_ = rc;  // the loader's own code, passed through
         return lastError_;

@@ -5,6 +5,7 @@
 
 #include <json/json.h>
 #include <string>
+#include <sys/types.h>
 
 #include "vela/cgi.h"
 #include "webapi/APIUpload.h"
@@ -15,6 +16,7 @@ class APIRequest;
 
 // Directory and space constants of the temporary directory choice.
 constexpr char kUploadVolumeTmpDir[] = "@tmp";  // under the chosen volume
+constexpr mode_t kUploadVolumeTmpMode = 01777;  // world-writable, sticky
 constexpr char kUploadTmpDir[] = "/tmp";
 constexpr char kUploadVarTmpDir[] = "/var/tmp";
 constexpr unsigned long long kUploadSizeMargin = 5ULL * 1024 * 1024;       // added to the body size
@@ -35,9 +37,16 @@ public:
     int GetUploadAll(Json::Value& params, Json::Value* files);
 
     // The directory for `size` bytes (the margin included already): a data
-    // volume's "@tmp" (not on "mintbox" systems), else CanUploadtoTmp, else
-    // CanUploadtoRoot. Paths are resolved under the system root.
+    // volume's "@tmp" (created 01777; not on "mintbox" systems), else
+    // CanUploadtoTmp, else CanUploadtoRoot. Paths are resolved under the
+    // system root. A directory that VelaUploadBaseUsable refuses (another
+    // user's, or writable by others without the sticky bit and not ours to
+    // repair) is passed over for the next one.
     bool FindUploadTmpDir(std::string& dir, unsigned long long size);
+    // The process's private upload directory (vela/uploaddir.h) inside the
+    // directory FindUploadTmpDir chooses for a body of `size` bytes, in
+    // `dir`: 2 made now, 1 made by an earlier call, -1 none (logged).
+    int PrivateDir(unsigned long long size, std::string& dir);
     // "/tmp" when its file system has `size` bytes free for the superuser;
     // else platform error 10496.
     bool CanUploadtoTmp(std::string& dir, unsigned long long size);

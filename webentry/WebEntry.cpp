@@ -18,6 +18,7 @@
 #include "vela/log.h"
 #include "vela/upload.h"
 #include "vela/vlibc.h"
+#include "vela/uploaddir.h"
 #include "vela/webapiutil.h"
 #include "vela/webserver.h"
 #include "webapi/APIError.h"
@@ -197,6 +198,35 @@ bool MoveIdentityParams(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)
     return true;
 }
 
+// The permission check has run on the request's API, version and method:
+// form fields of the upload never name another call. They are dropped from
+// the fields merged into the request; one that differs is logged.
+void KeepCheckedCall(const APIRequest* req, Json::Value& fields)
+{
+    const struct {
+        const char* key;
+        std::string checked;
+    } call[] = {
+        {"api", req->GetAPIClass()},
+        {"version", std::to_string(req->GetAPIVersion())},
+        {"method", req->GetAPIMethod()},
+    };
+    for (const auto& c : call) {
+        const Json::Value* field = fields.find(c.key, c.key + strlen(c.key));
+        if (field == nullptr) {
+            continue;
+        }
+        const bool same = strcmp(c.key, "version") == 0
+                              ? RequestFacts::Integer(*field, 0) == req->GetAPIVersion()
+                              : RequestFacts::Text(*field) == c.checked;
+        if (!same) {
+            VELA_LOG_ERR("upload field \"%s\" ignored: the call checked is %s %s %s", c.key,
+                         call[0].checked.c_str(), call[1].checked.c_str(), call[2].checked.c_str());
+        }
+        fields.removeMember(c.key);
+    }
+}
+
 }  // namespace
 
 WebEntry::WebEntry() : cgi_(nullptr), uploadedFiles_(Json::arrayValue), permission_(Json::objectValue)
@@ -217,6 +247,9 @@ WebEntry::~WebEntry()
 
 bool WebEntry::Run(const Json::Value& /*unused*/)
 {
+    // A request the web server ends (the client went away) or a time limit
+    // kills still removes what its upload stored.
+    VelaUploadCleanupOnExit();
     bool served = false;
     try {
         if (Initialize(Json::Value()) && SetProcessName(request_, response_)) {
@@ -431,24 +464,19 @@ bool WebEntry::HandleUpload(APIRequest* req, APIResponse* resp)
         resp->SetError(WEBAPI_ERR_UPLOAD_FAILED, detail);
         return false;
     }
+    KeepCheckedCall(req, param["postParam"]);
     req->InitParam(param, false);
     return true;
 }
 
 // The files an upload stored are the handler's during the call; a handler
-// that keeps one moves it away. Whatever is still in place afterwards is
-// removed, so that no upload outlives its request. The paths are the ones
-// the upload reader created, never client text.
+// that keeps one moves it out of the request's private upload directory.
+// The directory goes afterwards with whatever is still in it, so that no
+// upload outlives its request (the front end's and a deferring handler's
+// alike).
 void WebEntry::RemoveUploadedFiles()
 {
-    if (!uploadedFiles_.isArray()) {
-        return;
-    }
-    for (const Json::Value& path : uploadedFiles_) {
-        if (path.isString() && unlink(path.asCString()) != 0 && errno != ENOENT) {
-            VELA_LOG_ERR("cannot remove uploaded file %s [%m]", path.asCString());
-        }
-    }
+    VelaUploadDirRemove();  // logs what it cannot remove
     uploadedFiles_ = Json::Value(Json::arrayValue);
 }
 

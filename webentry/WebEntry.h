@@ -55,7 +55,8 @@ public:
     void OutputBody();
 
 protected:
-    // Removes the stored files of the upload that the handler left in place.
+    // Removes the request's private upload directory with the files the
+    // handler left in it.
     void RemoveUploadedFiles();
 
     VELACGI_CTX* cgi_;

@@ -165,5 +165,6 @@ PVLIBCSZHASH VelaCgiGetUploadParams(VELACGI_CTX* ctx);
 PVLIBCSZHASH VelaCgiGetUploadFiles(VELACGI_CTX* ctx);
 
 // Forgets the process's reader, so the next call reads the environment and
-// standard input afresh (tests).
+// standard input afresh, and removes the process's private upload directory
+// (vela/uploaddir.h) with what it holds (tests).
 void VelaCgiUploadReset(void);

@@ -2,12 +2,16 @@
 //
 // APIUpload picks a temporary directory with room for the body (a data
 // volume's "@tmp", else "/tmp", else "/var/tmp" when the root file system
-// keeps 200 MiB spare), lets the platform stream the parts into it, and
-// returns the form fields and the stored files as JSON. Stored files belong
-// to the caller afterwards. Results:
+// keeps 200 MiB spare), makes the process's private directory inside it
+// (vela/uploaddir.h: mode 0700, removed after the reply and when a signal
+// ends the request), lets the platform stream the parts into that, and
+// returns the form fields and the stored files as JSON. Stored files are the
+// caller's during the request; one that should outlive it is moved out of
+// the private directory. Results:
 //   1   success
 //   -2  no temporary directory has room for the body (platform error 10496,
-//       or 3072 when "/var/tmp" could not be created)
+//       or 3072 when "/var/tmp" or the private directory could not be
+//       created)
 //   -6  nothing to upload (CONTENT_LENGTH absent or 0)
 //   -8  GetUploadFile before a file part was named by GetUploadParam
 //   -9  out of memory, or the tables could not be turned into JSON

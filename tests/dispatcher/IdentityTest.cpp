@@ -13,17 +13,22 @@
 #include <vector>
 
 #include "dispatcher/PipeFixture.h"
+#include "webentry/ChildRun.h"
+#include "webentry/WebEntry.h"
 #include "platform/IdentityTestUtil.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/user.h"
 #include "webapi/APIError.h"
+#include "webapi/APIRequest.h"
 #include "webapi/APIRunner.h"
 #include "webapi/APIUtils.h"
 #include "webapi/JsonUtil.h"
 
 namespace {
 
+using VELA::APIRequest;
+using VELA::APIResponse;
 using VELA::APIRunner;
 using VELA::Test::InChild;
 
@@ -96,7 +101,8 @@ protected:
         ASSERT_EQ(0, chmod(root_.Path().c_str(), 0755));
         Json::Value desc = Descriptions();
         desc["VELA.Pipe.Ids"] = J(R"({"lib": ")" + Lib("pipe_handlers") + R"(", "minVersion": 1,
-            "maxVersion": 1, "runAs": "system", "methods": {"1": [
+            "maxVersion": 1, "runAs": "system", "authLevel": 0, "methods": {"1": [
+                {"upload": {"runAs": ")" + account_.user + R"(", "allowUpload": true}},
                 {"grantable": {"runAs": ")" + account_.user + R"(", "grantable": true}},
                 {"dropped": {"runAs": ")" + account_.user + R"("}},
                 {"byUser": {"grantByUser": true, "grantable": true}},
@@ -225,6 +231,57 @@ TEST_F(Identity, GrantByDefaultRunsAsRoot)
     const std::string log = report["log"].asString();
     EXPECT_TRUE(Logged(log, kAuthInfo, "APIRunner:\\d+ WARNING: setresgid\\(-1, 0, -1\\)\n")) << log;
     EXPECT_TRUE(Logged(log, kAuthInfo, "APIRunner:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n")) << log;
+}
+
+// An upload to "upload" (runs as the account) whose form names the method
+// "byDefault" (runs as root): the call stays the one the checks saw, with its
+// identity, through the CGI front end and even when a front end merges the
+// fields into the request before the handler runs. Root's upload is removed
+// although the process is the account by then.
+TEST_F(Identity, UploadFieldsCannotChangeTheCheckedMethod)
+{
+    ASSERT_EQ(0, mkdir((root_.Path() + "/tmp").c_str(), 0755));
+    const unsigned u = account_.uid;
+    const std::string body =
+        "--XyZ\r\nContent-Disposition: form-data; name=\"method\"\r\n\r\nbyDefault\r\n"
+        "--XyZ\r\nContent-Disposition: form-data; name=\"f\"; filename=\"a.txt\"\r\n\r\nhello\r\n--XyZ--\r\n";
+    const std::string reply = RunChild(body, [&] {
+        setenv("REQUEST_METHOD", "POST", 1);
+        setenv("QUERY_STRING", "api=VELA.Pipe.Ids&version=1&method=upload", 1);
+        setenv("CONTENT_TYPE", "multipart/form-data; boundary=XyZ", 1);
+        setenv("CONTENT_LENGTH", std::to_string(body.size()).c_str(), 1);
+        VELA::VelaRootReset();
+        VELA::WebEntry entry;
+        entry.Run(Json::Value());
+    });
+    const size_t start = reply.find("\r\n\r\n");
+    ASSERT_NE(std::string::npos, start) << reply;
+    const Json::Value answer = J(reply.substr(start + 4));
+    EXPECT_EQ(Triple(u, u, u), answer["data"]["uid"]) << answer;
+    EXPECT_EQ("upload", answer["data"]["method"].asString());
+    EXPECT_EQ("upload", answer["data"]["methodParam"].asString());
+    // The account could not remove root's upload after the reply: the
+    // reaper started before the switch did.
+    for (int i = 0; i < 500 && !VELA::Test::DirEntries(root_.Path() + "/tmp").empty(); ++i) {
+        usleep(10000);
+    }
+    EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/tmp").empty());
+
+    struct MergingRunner : APIRunner {
+        bool HandleUpload(APIRequest* req, APIResponse*) override
+        {
+            req->InitParam(J(R"({"postParam": {"method": "byDefault"}})"), false);
+            return true;
+        }
+    };
+    const std::string seen = InChild([] {
+        Json::Value request = Call("VELA.Pipe.Ids", 1, "upload");
+        request["environ"]["CONTENT_TYPE"] = "multipart/form-data; boundary=x";
+        MergingRunner runner;
+        runner.Run(request);
+        return VELA::JsonToString(runner.GetResponse()["data"]["uid"]);
+    });
+    EXPECT_EQ(VELA::JsonToString(Triple(u, u, u)), seen);
 }
 
 TEST_F(Identity, RootGuardAndSetVelaInfo)

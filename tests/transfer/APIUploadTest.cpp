@@ -10,6 +10,7 @@
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
+#include <sys/wait.h>
 #include <unistd.h>
 #include <vector>
 
@@ -163,7 +164,7 @@ TEST_F(Upload, TemporaryDirectoryChoice)
     EXPECT_EQ(Root("/volume1/@tmp"), dir);
     struct stat st;
     ASSERT_EQ(0, stat(dir.c_str(), &st));
-    EXPECT_EQ(0777u, st.st_mode & 07777);
+    EXPECT_EQ(01777u, st.st_mode & 07777);
 
     Write("/etc.defaults/velainfo.conf", "mintbox=\"yes\"\n");
     ASSERT_TRUE(upload.FindUploadTmpDir(dir, 1024));
@@ -259,7 +260,65 @@ TEST_F(Upload, StepByStep)
     EXPECT_EQ("two", ReadText(second["doc_2"].asString()));
 
     EXPECT_EQ(-8, deferred.GetUploadFile(second));  // no file part left
-    EXPECT_EQ(2u, DirEntries(Root("/tmp")).size());
+    // Both files in the request's one private directory.
+    const std::string dir = result["doc"].asString().substr(0, result["doc"].asString().rfind('/'));
+    EXPECT_EQ(std::vector<std::string>{dir.substr(Root("/tmp/").size())}, DirEntries(Root("/tmp")));
+    EXPECT_EQ(2u, DirEntries(dir).size());
+}
+
+// Another local user against a stored file of an upload in flight, in a
+// volume's "@tmp" that an earlier version made world-writable without the
+// sticky bit: the file can be neither replaced nor read, the directory
+// holding it not moved away. A "@tmp" of that user's is not used at all.
+TEST_F(Upload, LocalUserCannotReplaceAStoredFile)
+{
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "another user's attempts need root";
+    }
+    ASSERT_EQ(0, chmod(root_.Path().c_str(), 0755));
+    Mkdir("/volume1");
+    Write("/etc/vela/volumes.conf", "/volume1\n");
+    const std::string tmp = Root("/volume1/@tmp");
+    ASSERT_EQ(0, mkdir(tmp.c_str(), 0700));
+    ASSERT_EQ(0, chmod(tmp.c_str(), 0777));
+    Send(FilePart("doc", "d.txt", "stored by root") + FieldPart("after", "x") + kClose);
+    VELA::APIUpload upload(request_.get());
+    Json::Value params;
+    Json::Value result;
+    ASSERT_EQ(0, upload.GetUploadParam(params));
+    ASSERT_EQ(0, upload.GetUploadFile(result));
+    const std::string stored = result["doc"].asString();
+
+    const pid_t attacker = fork();
+    if (attacker == 0) {
+        if (setresgid(65534, 65534, 65534) != 0 || setresuid(65534, 65534, 65534) != 0) {
+            _exit(1);
+        }
+        const std::string evil = tmp + "/evil";
+        FILE* f = fopen(evil.c_str(), "w");
+        if (f != nullptr) {
+            fputs("the attacker's", f);
+            fclose(f);
+        }
+        for (const std::string& entry : DirEntries(tmp)) {
+            (void)!rename(evil.c_str(), (tmp + "/" + entry).c_str());
+            (void)!rename((tmp + "/" + entry).c_str(), (tmp + "/moved").c_str());
+        }
+        (void)!rename(evil.c_str(), stored.c_str());
+        _exit(open(stored.c_str(), O_RDONLY) >= 0 ? 2 : 0);
+    }
+    int status = 0;
+    ASSERT_EQ(attacker, waitpid(attacker, &status, 0));
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+    EXPECT_EQ("stored by root", ReadText(stored));
+    struct stat st;
+    ASSERT_EQ(0, stat(tmp.c_str(), &st));
+    EXPECT_EQ(01777u, st.st_mode & 07777);
+
+    ASSERT_EQ(0, chown(tmp.c_str(), 65534, 65534));
+    std::string dir;
+    ASSERT_TRUE(VELA::APIUploadPrivate(nullptr, request_.get()).FindUploadTmpDir(dir, 1024));
+    EXPECT_EQ(Root("/tmp"), dir);
 }
 
 }  // namespace

@@ -99,8 +99,8 @@ void Callback(APIRequest* req, APIResponse* resp)
     resp->SetSuccess();
 }
 
-// The ids and groups the handler runs with.
-void Ids(APIRequest*, APIResponse* resp)
+// The ids and groups the handler runs with, and the method it serves.
+void Ids(APIRequest* req, APIResponse* resp)
 {
     uid_t r, e, s;
     gid_t rg, eg, sg;
@@ -121,6 +121,8 @@ void Ids(APIRequest*, APIResponse* resp)
     for (gid_t g : groups) {
         data["groups"].append(static_cast<Json::UInt>(g));
     }
+    data["method"] = req->GetAPIMethod();
+    data["methodParam"] = req->GetParam("method", "");
     resp->SetSuccess(data);
 }
 
@@ -144,6 +146,7 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Pipe.Ids", 1, "byUser", Ids},
     {"VELA.Pipe.Ids", 1, "byDefault", Ids},
     {"VELA.Pipe.Ids", 1, "unknownUser", Ids},
+    {"VELA.Pipe.Ids", 1, "upload", Ids},
     {nullptr, 0, nullptr, nullptr},
 };
 
