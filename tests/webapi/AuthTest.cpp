@@ -237,6 +237,18 @@ TEST_F(Auth, MalformedCredentialsAreRefusedBeforePam)
     EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
 }
 
+// The run-as name of the superuser is no login name: refused as a wrong
+// password even by a PAM service that lets everyone in, and counted.
+TEST_F(Auth, SystemIsNoLoginName)
+{
+    const Reply r = Login("system");
+    EXPECT_EQ(400, r.Code()) << r.body;
+    EXPECT_TRUE(r.cookies.empty());
+    EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
+    Login("system");
+    EXPECT_EQ(407, Login(user_).Code()) << "two refusals from 192.0.2.7 reach login_max_failures";
+}
+
 TEST_F(Auth, KeyAnswersThePublicKey)
 {
     const Reply r = Call("key", "");

@@ -1,5 +1,5 @@
 // The login API "VELA.Auth" (description VELA.Auth.lib): open to callers
-// without a session, run as "system".
+// without a session, run as the superuser (run-as "system").
 //
 //   login   POST account, passwd: checks the password through PAM (Pam.cpp)
 //           behind the brute-force guard (vela/loginguard.h), replaces the
@@ -10,7 +10,9 @@
 //
 // Error codes of this API (besides the framework's 101 for a malformed
 // call):
-//   400  wrong account or password (also: unknown or locked account)
+//   400  wrong account or password (also: unknown or locked account, and
+//        the account name "system", the dispatcher's run-as name of the
+//        superuser, which no login may take: refused without asking PAM)
 //   401  right password, but it has expired and must be changed first
 //   402  the login could not be completed on the server (logged)
 //   407  too many failed logins: blocked, {"waitSeconds": <seconds>}
@@ -45,6 +47,7 @@ constexpr size_t kMaxAccount = VELA_LOGIN_ACCOUNT_MAX;
 constexpr size_t kMaxPassword = 512;  // PAM's own bound of an answer
 
 const char kCookie[] = "id";
+const char kReservedName[] = "the account name \"" VELA_RUNAS_SUPERUSER "\" is reserved";
 
 // Printable bytes only: no NUL, no other control byte, no DEL.
 bool IsPrintable(const char* text, size_t len)
@@ -133,8 +136,19 @@ void Login(APIRequest* req, APIResponse* resp)
 
     std::string user;
     std::string reason;
-    const VelaAuth::PamResult checked =
-        VelaAuth::CheckPassword(account, password, passwordLen, clientIP, user, reason);
+    // The run-as name of the superuser is never a login name: refused like
+    // a wrong password, and counted as one, without asking PAM. A name PAM
+    // settles on is held to the same rule.
+    VelaAuth::PamResult checked = VelaAuth::PamResult::Denied;
+    if (VELARunAsIsSuperuser(account.c_str())) {
+        reason = kReservedName;
+    } else {
+        checked = VelaAuth::CheckPassword(account, password, passwordLen, clientIP, user, reason);
+        if (checked != VelaAuth::PamResult::Error && VELARunAsIsSuperuser(user.c_str())) {
+            checked = VelaAuth::PamResult::Denied;
+            reason = kReservedName;
+        }
+    }
     if (checked == VelaAuth::PamResult::Denied) {
         VelaLoginGuardFailed(&settings, account.c_str(), clientIP.c_str(), reason.c_str());
         resp->SetError(kErrWrongPassword);
