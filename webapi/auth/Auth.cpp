@@ -207,7 +207,7 @@ void Login(APIRequest* req, APIResponse* resp)
         resp->SetError(kErrServer);
         return;
     }
-    VelaLoginGuardSucceeded(account.c_str(), clientIP.c_str());
+    VelaLoginGuardSucceeded(&settings, account.c_str(), clientIP.c_str());
     if (checked == VelaAuth::PamResult::Expired) {
         VELA_LOG(LOG_AUTHPRIV | LOG_NOTICE, "login of \"%s\" refused: the password has expired", user.c_str());
         resp->SetError(kErrPasswordExpired);
