@@ -184,9 +184,9 @@ bool SwitchTo(uid_t uid, gid_t gid, const GroupPlan& plan, bool grantable)
 }
 
 // Every user and group id 0 and no supplementary group but 0: the run-as
-// identity "system" already holds. Most calls run as "system" in a process that the
-// web server started as root; going through NSS (initgroups) each time would
-// cost more than the rest of the call.
+// identity "system" already holds. Most calls run as "system" in a process
+// that the web server started as root; going through NSS (initgroups) each
+// time would cost more than the rest of the call.
 bool AlreadyPlainRoot()
 {
     const Identity now = Current();
