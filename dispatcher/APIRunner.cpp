@@ -457,8 +457,8 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
 
     // 10. Identity of the call.
     ExecIdentity want;
-    const Json::Value runAs = req->GetAPIInfo("runAs", "system");
-    want.runAs = runAs.isString() ? runAs.asString() : "system";
+    const Json::Value runAs = req->GetAPIInfo("runAs", VELA_RUNAS_SUPERUSER);
+    want.runAs = runAs.isString() ? runAs.asString() : VELA_RUNAS_SUPERUSER;
     if (attrs.isObject()) {
         const Json::Value* methodRunAs = attrs.find("runAs", "runAs" + 5);
         if (methodRunAs != nullptr && methodRunAs->isString()) {

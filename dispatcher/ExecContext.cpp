@@ -82,27 +82,41 @@ bool ReadGroups(std::vector<gid_t>& out)
     return true;
 }
 
-// Runs the process as user `name`. Takes back root first; when that is
-// refused, a process that already is the user goes on as it is.
-bool SwitchToUser(const std::string& name, bool grantable)
+// Who a switch is for: the description's run-as identity, where "system"
+// is the superuser, or the session's account, which is only ever an
+// account, whatever its name.
+enum class Whom { RunAs, Account };
+
+// Runs the process as `name`. Takes back root first; when that is refused,
+// a process that already is that identity goes on as it is.
+bool SwitchTo(Whom whom, const std::string& name, bool grantable)
 {
+    const auto reset = [&] {
+        return whom == Whom::RunAs ? ResetCredentialsForRunAs(name.c_str(), grantable)
+                                   : ResetCredentialsByName(name.c_str(), grantable);
+    };
     if (SetResUid(__LINE__, kKeepUid, 0, kKeepUid)) {
-        uid_t uid = 0;
-        gid_t gid = 0;
-        if (!grantable && VelaUploadDirPath()[0] != '\0' && VELAUserGetUGID(name.c_str(), &uid, &gid) == 0 &&
-            uid != 0) {
-            // Root for good no more: what root's upload stored is removed by
-            // a reaper that keeps root.
-            VelaUploadDirReaper();
+        if (!grantable && VelaUploadDirPath()[0] != '\0') {
+            uid_t uid = 0;
+            gid_t gid = 0;
+            const int found = whom == Whom::RunAs ? VELARunAsGetUGID(name.c_str(), &uid, &gid)
+                                                  : VELAUserGetUGID(name.c_str(), &uid, &gid);
+            if (found == 0 && uid != 0) {
+                // Root for good no more: what root's upload stored is
+                // removed by a reaper that keeps root.
+                VelaUploadDirReaper();
+            }
         }
-        return ResetCredentialsByName(name.c_str(), grantable);
+        return reset();
     }
     uid_t uid = 0;
     gid_t gid = 0;
-    if (VELAUserGetUGID(name.c_str(), &uid, &gid) == 0 && geteuid() == uid && getegid() == gid) {
+    const int known = whom == Whom::RunAs ? VELARunAsGetUGID(name.c_str(), &uid, &gid)
+                                          : VELAUserGetUGID(name.c_str(), &uid, &gid);
+    if (known == 0 && geteuid() == uid && getegid() == gid) {
         return true;
     }
-    return ResetCredentialsByName(name.c_str(), grantable);
+    return reset();
 }
 
 }  // namespace
@@ -127,7 +141,7 @@ bool ExecContext::Prepare(const ExecIdentity& want)
     // the identity as it found it.
     restore_ = true;
     if (!want.grantByDefault && !want.grantByUser) {
-        if (!SwitchToUser(want.runAs, want.grantable)) {
+        if (!SwitchTo(Whom::RunAs, want.runAs, want.grantable)) {
             RUNNER_LOG(LOG_ERR, "grantable failed. [%m]");
             return false;
         }
@@ -139,7 +153,7 @@ bool ExecContext::Prepare(const ExecIdentity& want)
             RUNNER_LOG(LOG_ERR, "grantByUser: failed to get login username.");
             return false;
         }
-        if (!SwitchToUser(want.loginName, want.grantable)) {
+        if (!SwitchTo(Whom::Account, want.loginName, want.grantable)) {
             RUNNER_LOG(LOG_ERR, "grantByUser failed. [%m]");
             return false;
         }

@@ -7,12 +7,14 @@
 #include <sys/types.h>
 #include <vector>
 
+#include "vela/user.h"
+
 namespace VELA {
 
 // What a call asks for, as read from its description and its request.
 struct ExecIdentity {
-    std::string runAs = "system";  // the API's "runAs", replaced by the method's
-    std::string loginName;         // the session's user, may be empty
+    std::string runAs = VELA_RUNAS_SUPERUSER;  // the API's "runAs", replaced by the method's
+    std::string loginName;                     // the session's account, may be empty; never a run-as name
     bool grantable = false;
     bool grantByDefault = false;
     bool grantByUser = false;

@@ -1,5 +1,6 @@
 // CGI library: the handle with the request's cookies (RFC 6265), the client
-// address (REMOTE_ADDR, X-Forwarded-For behind a trusted proxy).
+// address (REMOTE_ADDR, X-Forwarded-For behind a configured trusted proxy)
+// and the one decision whether the peer is such a proxy.
 #include <arpa/inet.h>
 #include <cerrno>
 #include <cstdlib>
@@ -160,26 +161,11 @@ bool SameAddress(const Address& a, const Address& b)
     return x.family == y.family && memcmp(x.bytes, y.bytes, len) == 0;
 }
 
-bool IsLoopback(const Address& addr)
-{
-    const Address a = Unmapped(addr);
-    if (a.family == AF_INET) {
-        return a.bytes[0] == 127;  // 127.0.0.0/8
-    }
-    struct in6_addr v6;
-    memcpy(&v6, a.bytes, sizeof(v6));
-    return IN6_IS_ADDR_LOOPBACK(&v6);
-}
-
 struct TrustedProxies {
-    bool configured = false;  // false: the loopback addresses
     std::vector<Address> list;
 
     bool Contains(const Address& addr) const
     {
-        if (!configured) {
-            return IsLoopback(addr);
-        }
         for (const Address& proxy : list) {
             if (SameAddress(proxy, addr)) {
                 return true;
@@ -191,12 +177,13 @@ struct TrustedProxies {
 
 // <root>/etc/vela/webapi.conf: lines of key="value" (or key=value), blank
 // lines and "#" comments ignored. trusted_proxies holds addresses separated
-// by blanks or commas; when the key is present its list replaces the
-// loopback default, so trusted_proxies="" trusts no proxy. Invalid entries
-// are logged and skipped. A missing or unreadable file keeps the default.
+// by blanks or commas. Without the key, and with a missing or unreadable
+// file, no proxy is trusted: not even loopback, where any local user can
+// connect. Invalid entries are logged and skipped.
 TrustedProxies LoadTrustedProxies()
 {
     TrustedProxies trusted;
+    bool configured = false;
     const std::string path = VELA::VelaPath(kConfPath);
     std::string text;
     int err = 0;
@@ -230,9 +217,9 @@ TrustedProxies LoadTrustedProxies()
         if (value.size() >= 2 && value.front() == '"' && value.back() == '"') {
             value = value.substr(1, value.size() - 2);
         }
-        trusted.configured = true;  // the last line of the key wins
+        configured = true;  // the last line of the key wins
     }
-    if (!trusted.configured) {
+    if (!configured) {
         return trusted;
     }
     size_t pos = 0;
@@ -253,6 +240,13 @@ TrustedProxies LoadTrustedProxies()
     return trusted;
 }
 
+// The peer address `text` (REMOTE_ADDR), bounded and parsed. False when it
+// is missing, too long or not an address.
+bool PeerAddress(const char* text, Address& out)
+{
+    return text != nullptr && strnlen(text, INET6_ADDRSTRLEN) < INET6_ADDRSTRLEN && ParseAddress(text, out);
+}
+
 // The client address: REMOTE_ADDR, or behind a trusted proxy the right-most
 // X-Forwarded-For entry that is not itself a trusted proxy (entries to its
 // left are written by the client and cannot be believed). When every entry
@@ -261,23 +255,19 @@ TrustedProxies LoadTrustedProxies()
 bool ClientAddress(Address& out)
 {
     const char* remote = getenv("REMOTE_ADDR");
-    if (remote == nullptr || strnlen(remote, INET6_ADDRSTRLEN) >= INET6_ADDRSTRLEN) {
-        VELA_LOG_ERR("REMOTE_ADDR is missing or too long");
-        return false;
-    }
     Address remoteAddr;
-    if (!ParseAddress(remote, remoteAddr)) {
-        VELA_LOG_ERR("REMOTE_ADDR \"%s\" is not an IP address", remote);
+    if (!PeerAddress(remote, remoteAddr)) {
+        VELA_LOG_ERR("REMOTE_ADDR \"%.46s\" is missing, too long or not an IP address", remote ? remote : "");
         return false;
     }
     out = remoteAddr;
-    const TrustedProxies trusted = LoadTrustedProxies();
-    if (!trusted.Contains(remoteAddr)) {
-        return true;  // a direct client: its X-Forwarded-For means nothing
-    }
     const char* forwarded = getenv("HTTP_X_FORWARDED_FOR");
     if (forwarded == nullptr) {
         return true;
+    }
+    const TrustedProxies trusted = LoadTrustedProxies();
+    if (!trusted.Contains(remoteAddr)) {
+        return true;  // a direct client: its X-Forwarded-For means nothing
     }
     if (strnlen(forwarded, kMaxForwardedHeader + 1) > kMaxForwardedHeader) {
         VELA_LOG_ERR("X-Forwarded-For longer than %zu bytes", kMaxForwardedHeader);
@@ -388,6 +378,20 @@ void VelaCgiFree(VELACGI_CTX* ctx)
     }
     VLIBCSzHashFree(ctx->cookies);
     delete ctx;
+}
+
+int VelaCgiIsTrustedProxy(const char* peer)
+{
+    Address addr;
+    if (!PeerAddress(peer, addr)) {
+        return 0;
+    }
+    try {
+        return LoadTrustedProxies().Contains(addr) ? 1 : 0;
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("out of memory reading the trusted proxies");
+        return 0;
+    }
 }
 
 int VelaCgiGetRemoteIP(char* buf, size_t size)

@@ -1,6 +1,7 @@
-// Identity switches of the process: to a named user (ResetCredentialsByName)
-// or to the owner of a file (InitCredentialsByExecutable). Contracts are in
-// vela/user.h.
+// Identity switches of the process: to an account (ResetCredentialsByName),
+// to a run-as identity (ResetCredentialsForRunAs, the only place where the
+// run-as name "system" means the superuser) or to the owner of a file
+// (InitCredentialsByExecutable). Contracts are in vela/user.h.
 #include <cerrno>
 #include <cstring>
 #include <grp.h>
@@ -182,10 +183,10 @@ bool SwitchTo(uid_t uid, gid_t gid, const GroupPlan& plan, bool grantable)
     return true;
 }
 
-// Every user and group id 0 and no supplementary group but 0: the identity
-// "system" already holds. Most calls run as "system" in a process that the
-// web server started as root; going through NSS (initgroups) each time would
-// cost more than the rest of the call.
+// Every user and group id 0 and no supplementary group but 0: the run-as
+// identity "system" already holds. Most calls run as "system" in a process
+// that the web server started as root; going through NSS (initgroups) each
+// time would cost more than the rest of the call.
 bool AlreadyPlainRoot()
 {
     const Identity now = Current();
@@ -201,40 +202,58 @@ bool AlreadyPlainRoot()
     return true;
 }
 
-bool ResetByName(const char* name, bool grantable)
+bool ValidSwitchName(const char* name)
 {
     if (!ValidAccountName(name)) {
         VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "invalid user name");
         VELA_LOG_ERR("refusing to switch to an invalid user name");
         return false;
     }
+    return true;
+}
+
+// The account `name`, whatever its name: "system" included.
+bool ResetByName(const char* name, bool grantable)
+{
+    if (!ValidSwitchName(name)) {
+        return false;
+    }
     uid_t uid = 0;
     gid_t gid = 0;
     GroupPlan plan;
-    if (strcmp(name, "system") == 0) {
-        if (AlreadyPlainRoot()) {
-            return true;  // nothing to switch: no account look-up is paid
+    std::string canonical;
+    const int found = LookupUserByName(name, uid, gid, &canonical);
+    if (found != 1) {
+        if (found == 0) {
+            VELA_RECORD_ERROR(VLIBC_ERR_NOT_FOUND, "no such user");
+            VELA_LOG_ERR("cannot switch to unknown user \"%.255s\"", name);
         }
-        std::string rootName;
-        gid_t rootGid = 0;
-        if (LookupUserByUID(0, rootName, rootGid) == 1) {
-            plan.initName = rootName;
-        } else {
-            plan.explicitList.push_back(0);
-        }
-    } else {
-        std::string canonical;
-        const int found = LookupUserByName(name, uid, gid, &canonical);
-        if (found != 1) {
-            if (found == 0) {
-                VELA_RECORD_ERROR(VLIBC_ERR_NOT_FOUND, "no such user");
-                VELA_LOG_ERR("cannot switch to unknown user \"%.255s\"", name);
-            }
-            return false;
-        }
-        plan.initName = canonical;
+        return false;
     }
+    plan.initName = canonical;
     return SwitchTo(uid, gid, plan, grantable);
+}
+
+bool ResetForRunAs(const char* runAs, bool grantable)
+{
+    if (!ValidSwitchName(runAs)) {
+        return false;
+    }
+    if (VELARunAsIsSuperuser(runAs) != 1) {
+        return ResetByName(runAs, grantable);
+    }
+    if (AlreadyPlainRoot()) {
+        return true;  // nothing to switch: no account look-up is paid
+    }
+    GroupPlan plan;
+    std::string rootName;
+    gid_t rootGid = 0;
+    if (LookupUserByUID(0, rootName, rootGid) == 1) {
+        plan.initName = rootName;
+    } else {
+        plan.explicitList.push_back(0);
+    }
+    return SwitchTo(0, 0, plan, grantable);
 }
 
 bool ByExecutable(const char* path, bool grantable)
@@ -277,6 +296,16 @@ bool ResetCredentialsByName(const char* name, bool grantable)
 {
     try {
         return ResetByName(name, grantable);
+    } catch (const std::exception&) {
+        VELA_RECORD_ERROR(VLIBC_ERR_MEMORY, "out of memory");
+        return false;
+    }
+}
+
+bool ResetCredentialsForRunAs(const char* runAs, bool grantable)
+{
+    try {
+        return ResetForRunAs(runAs, grantable);
     } catch (const std::exception&) {
         VELA_RECORD_ERROR(VLIBC_ERR_MEMORY, "out of memory");
         return false;

@@ -1,15 +1,22 @@
 // The brute-force guard of the login API and the login settings (the
-// contract is in vela/loginguard.h).
+// contract and the policy are in vela/loginguard.h).
 //
-// A record is the JSON object {"version":1, "attempts":[t, ...],
-// "blockedUntil":T}: the times of the attempts counted within the window
-// (in progress or failed) and the end of the block, 0 for none. A record
-// that holds nothing is removed rather than written.
+// A record is the JSON object {"version":2, "attempts":[[t, "tag"], ...],
+// "blockedUntil":T}: the attempts counted within the window (in progress or
+// failed), each with the tag of the other side of its (account, address)
+// pair, and the end of the block, 0 for none. A tag is the first 16 hex
+// digits of the other record's name. A record that holds nothing is removed
+// rather than written. The file's modification time is set to the moment
+// the record will hold nothing any more (its expiry), so the purge finds
+// expired records without reading them.
 #include <arpa/inet.h>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <dirent.h>
+#include <fcntl.h>
 #include <string>
+#include <sys/stat.h>
 #include <unistd.h>
 #include <vector>
 
@@ -27,7 +34,14 @@ using VELA::Platform::Now;
 
 const char kGuardDir[] = "/run/vela/login-guard";
 const char kConfPath[] = "/etc/vela/webapi.conf";
-constexpr size_t kMaxRecordFile = 64 * 1024;
+const char kAddressPrefix[] = "addr-";
+const char kAccountPrefix[] = "acct-";
+constexpr size_t kTagLen = 16;
+// An account record keeps at most this many attempts (the newest); an
+// address record never holds more than the limit, since the address is
+// blocked on reaching it.
+constexpr size_t kMaxAttempts = VELA_LOGIN_MAX_FAILURES_MAX;
+constexpr size_t kMaxRecordFile = 128 * 1024;
 constexpr int kLockSeconds = 5;
 constexpr size_t kMaxLoggedAccount = 64;
 const int kFailureLog = LOG_AUTHPRIV | LOG_WARNING;
@@ -142,8 +156,8 @@ bool AccountKey(const char* account, std::string& key)
 
 std::string GuardDir() { return VELA::VelaPath(kGuardDir); }
 
-// The record file of `key`: the hex SHA-256 of the key.
-bool RecordPath(const std::string& key, std::string& path)
+// The hex SHA-256 of `key`.
+bool Digest(const std::string& key, std::string& hex)
 {
     const VELA::Platform::CryptoApi* api = VELA::Platform::LazyCrypto();
     if (api == nullptr) {
@@ -157,19 +171,26 @@ bool RecordPath(const std::string& key, std::string& path)
         return false;
     }
     static const char kHex[] = "0123456789abcdef";
-    path = GuardDir() + "/";
+    hex.clear();
     for (unsigned char b : md) {
-        path.push_back(kHex[b >> 4]);
-        path.push_back(kHex[b & 15]);
+        hex.push_back(kHex[b >> 4]);
+        hex.push_back(kHex[b & 15]);
     }
     return true;
 }
 
 // ---- Records ---------------------------------------------------------------------------
 
+struct Attempt {
+    long long t;
+    std::string tag;  // the other side of the (account, address) pair
+};
+
 struct Record {
     std::string path;
-    std::vector<long long> attempts;  // oldest first
+    std::string tag;      // this record's tag, as the other record knows it
+    bool exists = false;  // a file was found
+    std::vector<Attempt> attempts;  // oldest first
     long long blockedUntil = 0;
 };
 
@@ -177,6 +198,7 @@ struct Limits {
     int maxFailures;
     long long window;  // seconds
     long long block;   // seconds
+    int maxRecords;
 };
 
 // The settings' limits, each forced into its bounds.
@@ -187,12 +209,13 @@ Limits LimitsOf(const VelaLoginSettings* settings)
     auto clamp = [](int v, int max) { return v < 1 ? 1 : (v > max ? max : v); };
     return Limits{clamp(s.maxFailures, VELA_LOGIN_MAX_FAILURES_MAX),
                   60LL * clamp(s.windowMinutes, VELA_LOGIN_MINUTES_MAX),
-                  60LL * clamp(s.blockMinutes, VELA_LOGIN_MINUTES_MAX)};
+                  60LL * clamp(s.blockMinutes, VELA_LOGIN_MINUTES_MAX),
+                  clamp(s.maxRecords, VELA_LOGIN_GUARD_RECORDS_MAX)};
 }
 
 // Reads the record at `rec.path`. A missing file is an empty record, and
-// so is a corrupt one (logged by the reader): it is overwritten. False
-// when the file cannot be read.
+// so is a corrupt one (logged): it is overwritten. False when the file
+// cannot be read.
 bool LoadRecord(Record& rec)
 {
     using VELA::Platform::ReadResult;
@@ -201,19 +224,25 @@ bool LoadRecord(Record& rec)
     if (r == ReadResult::Error) {
         return false;
     }
+    rec.exists = r != ReadResult::Missing;
     if (r != ReadResult::Ok) {
         return true;
     }
     const Json::Value& attempts = doc["attempts"];
     long long until = 0;
-    if (!attempts.isArray() || !VELA::Platform::GetInt(doc, "blockedUntil", 0, 1LL << 40, until)) {
+    long long version = 0;
+    if (!attempts.isArray() || !VELA::Platform::GetInt(doc, "version", 2, 2, version) ||
+        !VELA::Platform::GetInt(doc, "blockedUntil", 0, 1LL << 40, until)) {
         VELA_LOG_ERR("%s is not a login-guard record, starting afresh", rec.path.c_str());
         return true;
     }
     rec.blockedUntil = until;
-    for (const Json::Value& t : attempts) {
-        if (t.isInt64() && rec.attempts.size() < VELA_LOGIN_MAX_FAILURES_MAX) {
-            rec.attempts.push_back(t.asInt64());
+    for (const Json::Value& a : attempts) {
+        if (rec.attempts.size() >= kMaxAttempts) {
+            break;
+        }
+        if (a.isArray() && a.size() == 2 && a[0].isInt64() && a[1].isString() && a[1].asString().size() == kTagLen) {
+            rec.attempts.push_back(Attempt{a[0].asInt64(), a[1].asString()});
         }
     }
     return true;
@@ -224,13 +253,13 @@ bool LoadRecord(Record& rec)
 // longer than `limits.block` from now.
 void Prune(Record& rec, long long now, const Limits& limits)
 {
-    std::vector<long long> kept;
-    for (long long t : rec.attempts) {
-        if (t > now) {
-            t = now;
+    std::vector<Attempt> kept;
+    for (Attempt& a : rec.attempts) {
+        if (a.t > now) {
+            a.t = now;
         }
-        if (t > now - limits.window) {
-            kept.push_back(t);
+        if (a.t > now - limits.window) {
+            kept.push_back(std::move(a));
         }
     }
     rec.attempts.swap(kept);
@@ -242,21 +271,34 @@ void Prune(Record& rec, long long now, const Limits& limits)
 }
 
 // Seconds until `rec` lets an attempt through: the rest of its block, or,
-// when the counted attempts have reached the limit, until the oldest leaves
-// the window. 0 when it lets one through now.
+// when the counted attempts have reached the limit, until the one that
+// brings them under it leaves the window. 0 when it lets one through now.
 long long WaitOf(const Record& rec, long long now, const Limits& limits)
 {
     if (rec.blockedUntil > now) {
         return rec.blockedUntil - now;
     }
-    if (rec.attempts.size() >= static_cast<size_t>(limits.maxFailures)) {
-        const long long wait = rec.attempts.front() + limits.window - now;
+    const size_t limit = static_cast<size_t>(limits.maxFailures);
+    if (rec.attempts.size() >= limit) {
+        const long long wait = rec.attempts[rec.attempts.size() - limit].t + limits.window - now;
         return wait > 0 ? wait : 1;
     }
     return 0;
 }
 
-bool SaveRecord(const Record& rec)
+// When the record will hold nothing any more.
+long long ExpiryOf(const Record& rec, const Limits& limits)
+{
+    long long expiry = rec.blockedUntil;
+    for (const Attempt& a : rec.attempts) {
+        expiry = a.t + limits.window > expiry ? a.t + limits.window : expiry;
+    }
+    return expiry;
+}
+
+// Writes the record with its expiry as the file's modification time, or
+// removes the file of an empty record.
+bool SaveRecord(const Record& rec, const Limits& limits)
 {
     if (rec.attempts.empty() && rec.blockedUntil == 0) {
         if (unlink(rec.path.c_str()) != 0 && errno != ENOENT) {
@@ -266,13 +308,105 @@ bool SaveRecord(const Record& rec)
         return true;
     }
     Json::Value doc(Json::objectValue);
-    doc["version"] = 1;
+    doc["version"] = 2;
     doc["attempts"] = Json::Value(Json::arrayValue);
-    for (long long t : rec.attempts) {
-        doc["attempts"].append(static_cast<Json::Int64>(t));
+    for (const Attempt& a : rec.attempts) {
+        Json::Value pair(Json::arrayValue);
+        pair.append(static_cast<Json::Int64>(a.t));
+        pair.append(a.tag);
+        doc["attempts"].append(pair);
     }
     doc["blockedUntil"] = static_cast<Json::Int64>(rec.blockedUntil);
-    return VELA::Platform::WriteStateFile(rec.path, doc, false);
+    if (!VELA::Platform::WriteStateFile(rec.path, doc, false)) {
+        return false;
+    }
+    const struct timespec times[2] = {{static_cast<time_t>(ExpiryOf(rec, limits)), 0},
+                                      {static_cast<time_t>(ExpiryOf(rec, limits)), 0}};
+    if (utimensat(AT_FDCWD, rec.path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
+        // A record without its expiry would be purged as expired.
+        VELA_LOG_ERR("utimensat(%s): %m", rec.path.c_str());
+        unlink(rec.path.c_str());
+        return false;
+    }
+    return true;
+}
+
+// Adds an attempt at `now` tagged `tag`, dropping the oldest beyond
+// kMaxAttempts.
+void AddAttempt(Record& rec, long long now, const std::string& tag)
+{
+    if (rec.attempts.size() >= kMaxAttempts) {
+        rec.attempts.erase(rec.attempts.begin(), rec.attempts.begin() + (rec.attempts.size() - kMaxAttempts + 1));
+    }
+    rec.attempts.push_back(Attempt{now, tag});
+}
+
+// Removes the attempts of the pair whose other side is `tag`. True when
+// some were removed.
+bool RemovePair(Record& rec, const std::string& tag)
+{
+    const size_t before = rec.attempts.size();
+    std::vector<Attempt> kept;
+    for (Attempt& a : rec.attempts) {
+        if (a.tag != tag) {
+            kept.push_back(std::move(a));
+        }
+    }
+    rec.attempts.swap(kept);
+    return rec.attempts.size() != before;
+}
+
+// ---- The store ---------------------------------------------------------------------------
+
+// What the purge saw of the records that remain.
+struct StoreState {
+    int addressRecords = 0;
+    long long earliestExpiry = 0;  // of an address record; 0 for none
+};
+
+// Removes every expired record (and any other file but the lock that the
+// store holds: a temporary file a dead writer left). No file is read: the
+// expiry is the modification time. The work is one pass over the
+// directory, whose address records are bounded by login_guard_max_records
+// and whose account records by the accounts of the machine. Runs under the
+// lock.
+bool Purge(long long now, StoreState& state)
+{
+    const std::string dir = GuardDir();
+    DIR* d = opendir(dir.c_str());
+    if (d == nullptr) {
+        VELA_LOG_ERR("login guard: opendir(%s): %m", dir.c_str());
+        return false;
+    }
+    const int fd = dirfd(d);
+    size_t purged = 0;
+    for (struct dirent* e = readdir(d); e != nullptr; e = readdir(d)) {
+        const char* name = e->d_name;
+        if (strcmp(name, ".") == 0 || strcmp(name, "..") == 0 || strcmp(name, ".lock") == 0) {
+            continue;
+        }
+        struct stat st;
+        if (fstatat(fd, name, &st, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISREG(st.st_mode)) {
+            continue;
+        }
+        if (st.st_mtime <= now) {
+            if (unlinkat(fd, name, 0) == 0) {
+                ++purged;
+            }
+            continue;
+        }
+        if (strncmp(name, kAddressPrefix, sizeof(kAddressPrefix) - 1) == 0) {
+            ++state.addressRecords;
+            if (state.earliestExpiry == 0 || st.st_mtime < state.earliestExpiry) {
+                state.earliestExpiry = st.st_mtime;
+            }
+        }
+    }
+    closedir(d);
+    if (purged > 0) {
+        VELA_LOG(LOG_AUTHPRIV | LOG_INFO, "login guard: %zu expired records removed", purged);
+    }
+    return true;
 }
 
 // The exclusive lock of the guard directory, created on the way.
@@ -303,9 +437,10 @@ private:
     int handle_ = -1;
 };
 
-// The two records of one login: [0] the account's, [1] the address's.
+// The two records of one login.
 struct Pair {
-    Record rec[2];
+    Record account;
+    Record address;
     std::string loggedAccount;
     std::string loggedAddress;
 };
@@ -326,18 +461,37 @@ bool NameRecords(const char* account, const char* clientIP, Pair& pair)
         return false;
     }
     pair.loggedAddress = clientIP != nullptr && clientIP[0] != '\0' ? clientIP : "an unknown address";
-    return RecordPath(accountKey, pair.rec[0].path) && RecordPath(addressKey, pair.rec[1].path);
+    std::string accountHex;
+    std::string addressHex;
+    if (!Digest(accountKey, accountHex) || !Digest(addressKey, addressHex)) {
+        return false;
+    }
+    const std::string dir = GuardDir() + "/";
+    pair.account.path = dir + kAccountPrefix + accountHex;
+    pair.account.tag = accountHex.substr(0, kTagLen);
+    pair.address.path = dir + kAddressPrefix + addressHex;
+    pair.address.tag = addressHex.substr(0, kTagLen);
+    return true;
 }
 
 bool LoadPair(Pair& pair, long long now, const Limits& limits)
 {
-    for (Record& rec : pair.rec) {
-        if (!LoadRecord(rec)) {
+    for (Record* rec : {&pair.account, &pair.address}) {
+        if (!LoadRecord(*rec)) {
             return false;
         }
-        Prune(rec, now, limits);
+        Prune(*rec, now, limits);
     }
     return true;
+}
+
+// True unless NSS says there is no account `account`: only accounts that
+// exist get a record of their own, so their number is the machine's, never
+// the client's choice.
+bool AccountMayExist(const char* account)
+{
+    uid_t uid = 0;
+    return VELA::Platform::LookupUser(account, uid) != 0;
 }
 
 int Begin(const VelaLoginSettings* settings, const char* account, const char* clientIP, int* waitSeconds)
@@ -355,23 +509,53 @@ int Begin(const VelaLoginSettings* settings, const char* account, const char* cl
     if (!LoadPair(pair, now, limits)) {
         return VELA_LOGIN_GUARD_ERROR;
     }
+    // Which records count this attempt: the address's whenever it has or
+    // may get one; the account's when the account exists.
+    bool byAddress = pair.address.exists;
+    StoreState store;
+    if (!byAddress) {
+        if (!Purge(now, store)) {
+            return VELA_LOGIN_GUARD_ERROR;
+        }
+        byAddress = store.addressRecords < limits.maxRecords;
+    }
+    const bool byAccount = pair.account.exists || AccountMayExist(account);
     long long wait = 0;
-    for (const Record& rec : pair.rec) {
-        const long long w = WaitOf(rec, now, limits);
-        wait = w > wait ? w : wait;
+    if (byAddress) {
+        wait = WaitOf(pair.address, now, limits);
+    } else if (byAccount) {
+        // The store is full: this address is not tracked, so the account's
+        // count from every address decides.
+        wait = WaitOf(pair.account, now, limits);
+    } else {
+        // Nothing could count the attempt: no password check goes uncounted.
+        wait = store.earliestExpiry > now ? store.earliestExpiry - now : 1;
     }
     if (wait > 0) {
         if (waitSeconds != nullptr) {
             *waitSeconds = static_cast<int>(wait);
         }
-        VELA_LOG(kBlockLog,
-                 "login refused without a password check: account \"%s\" from %s, blocked for %lld more seconds",
-                 pair.loggedAccount.c_str(), pair.loggedAddress.c_str(), wait);
+        if (!byAddress) {
+            VELA_LOG(kBlockLog,
+                     "login guard: %d address records, the most login_guard_max_records allows: account \"%s\" from "
+                     "%s refused without a password check for %lld seconds",
+                     store.addressRecords, pair.loggedAccount.c_str(), pair.loggedAddress.c_str(), wait);
+        } else {
+            VELA_LOG(kBlockLog,
+                     "login refused without a password check: account \"%s\" from %s, blocked for %lld more seconds",
+                     pair.loggedAccount.c_str(), pair.loggedAddress.c_str(), wait);
+        }
         return VELA_LOGIN_GUARD_BLOCKED;
     }
-    for (Record& rec : pair.rec) {
-        rec.attempts.push_back(now);
-        if (!SaveRecord(rec)) {
+    if (byAddress) {
+        AddAttempt(pair.address, now, pair.account.tag);
+        if (!SaveRecord(pair.address, limits)) {
+            return VELA_LOGIN_GUARD_ERROR;
+        }
+    }
+    if (byAccount) {
+        AddAttempt(pair.account, now, pair.address.tag);
+        if (!SaveRecord(pair.account, limits)) {
             return VELA_LOGIN_GUARD_ERROR;
         }
     }
@@ -393,24 +577,14 @@ void Failed(const VelaLoginSettings* settings, const char* account, const char* 
     if (!lock.Held() || !LoadPair(pair, now, limits)) {
         return;
     }
-    for (int i = 0; i < 2; ++i) {
-        Record& rec = pair.rec[i];
-        if (rec.blockedUntil != 0 || rec.attempts.size() < static_cast<size_t>(limits.maxFailures)) {
-            continue;
-        }
-        const size_t failures = rec.attempts.size();
-        rec.attempts.clear();
-        rec.blockedUntil = now + limits.block;
-        if (!SaveRecord(rec)) {
-            continue;
-        }
-        if (i == 0) {
-            VELA_LOG(kBlockLog,
-                     "login blocked for %lld minutes: %zu failures for account \"%s\" within %lld minutes "
-                     "(the last from %s)",
-                     limits.block / 60, failures, pair.loggedAccount.c_str(), limits.window / 60,
-                     pair.loggedAddress.c_str());
-        } else {
+    const size_t limit = static_cast<size_t>(limits.maxFailures);
+    Record& address = pair.address;
+    if (address.blockedUntil == 0 && address.attempts.size() >= limit) {
+        // The block is the whole penalty: the counted attempts go.
+        const size_t failures = address.attempts.size();
+        address.attempts.clear();
+        address.blockedUntil = now + limits.block;
+        if (SaveRecord(address, limits)) {
             VELA_LOG(kBlockLog,
                      "login blocked for %lld minutes: %zu failures from %s within %lld minutes "
                      "(the last for account \"%s\")",
@@ -418,23 +592,36 @@ void Failed(const VelaLoginSettings* settings, const char* account, const char* 
                      pair.loggedAccount.c_str());
         }
     }
+    if (pair.account.attempts.size() == limit) {
+        VELA_LOG(kBlockLog,
+                 "login failures for account \"%s\" reached %zu within %lld minutes (the last from %s); each "
+                 "address is blocked on its own, the account is not",
+                 pair.loggedAccount.c_str(), limit, limits.window / 60, pair.loggedAddress.c_str());
+    }
+    StoreState store;
+    Purge(now, store);
 }
 
-int Succeeded(const char* account, const char* clientIP)
+int Succeeded(const VelaLoginSettings* settings, const char* account, const char* clientIP)
 {
+    const Limits limits = LimitsOf(settings);
     Pair pair;
     if (!NameRecords(account, clientIP, pair)) {
         return -1;
     }
     GuardLock lock;
-    if (!lock.Held()) {
+    const long long now = Now();
+    if (!lock.Held() || !LoadPair(pair, now, limits)) {
         return -1;
     }
+    // Only this pair's attempts go: other accounts' failures from the
+    // address, and the account's failures from other addresses, stay.
     int rc = 0;
-    for (const Record& rec : pair.rec) {
-        if (!SaveRecord(rec)) {  // empty: removes the file
-            rc = -1;
-        }
+    if (RemovePair(pair.address, pair.account.tag) && !SaveRecord(pair.address, limits)) {
+        rc = -1;
+    }
+    if (RemovePair(pair.account, pair.address.tag) && !SaveRecord(pair.account, limits)) {
+        rc = -1;
     }
     return rc;
 }
@@ -450,6 +637,7 @@ void VelaLoginSettingsLoad(VelaLoginSettings* settings)
     LoadSetting("login_max_failures", 1, VELA_LOGIN_MAX_FAILURES_MAX, settings->maxFailures);
     LoadSetting("login_window_minutes", 1, VELA_LOGIN_MINUTES_MAX, settings->windowMinutes);
     LoadSetting("login_block_minutes", 1, VELA_LOGIN_MINUTES_MAX, settings->blockMinutes);
+    LoadSetting("login_guard_max_records", 1, VELA_LOGIN_GUARD_RECORDS_MAX, settings->maxRecords);
     LoadSetting("session_idle_timeout", 1, VELA_SESSION_IDLE_MAX, settings->idleTimeout);
     LoadSetting("session_lifetime", 1, VELA_SESSION_LIFETIME_MAX, settings->lifetime);
 }
@@ -478,10 +666,10 @@ void VelaLoginGuardFailed(const VelaLoginSettings* settings, const char* account
     }
 }
 
-int VelaLoginGuardSucceeded(const char* account, const char* clientIP)
+int VelaLoginGuardSucceeded(const VelaLoginSettings* settings, const char* account, const char* clientIP)
 {
     try {
-        return Succeeded(account, clientIP);
+        return Succeeded(settings, account, clientIP);
     } catch (const std::exception&) {
         VELA_LOG_ERR("login guard: out of memory");
         return -1;

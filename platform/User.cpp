@@ -102,9 +102,6 @@ int IsAdmin(const char* user, int flags)
         VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "invalid user name or flags");
         return -1;
     }
-    if (strcmp(user, "system") == 0) {
-        return 1;
-    }
     uid_t uid = 0;
     gid_t gid = 0;
     std::string canonical;
@@ -544,9 +541,6 @@ int VELAUserGetByName(const char* name, PVELAUSER* user)
         VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "invalid user name");
         return -1;
     }
-    if (strcmp(name, "system") == 0) {
-        return VELAUserGetByUID(0, user);
-    }
     try {
         return GetUser(
             [name](struct passwd* pw, char* buf, size_t len, struct passwd** result) {
@@ -577,11 +571,6 @@ int VELAUserGetUGID(const char* name, uid_t* uid, gid_t* gid)
         VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "invalid user name or output");
         return -1;
     }
-    if (strcmp(name, "system") == 0) {
-        *uid = 0;
-        *gid = 0;
-        return 0;
-    }
     try {
         uid_t u = 0;
         gid_t g = 0;
@@ -599,6 +588,21 @@ int VELAUserGetUGID(const char* name, uid_t* uid, gid_t* gid)
         VELA_RECORD_ERROR(VLIBC_ERR_MEMORY, "out of memory");
         return -1;
     }
+}
+
+int VELARunAsIsSuperuser(const char* runAs)
+{
+    return runAs != nullptr && strcmp(runAs, VELA_RUNAS_SUPERUSER) == 0 ? 1 : 0;
+}
+
+int VELARunAsGetUGID(const char* runAs, uid_t* uid, gid_t* gid)
+{
+    if (uid != nullptr && gid != nullptr && VELARunAsIsSuperuser(runAs)) {
+        *uid = 0;
+        *gid = 0;
+        return 0;
+    }
+    return VELAUserGetUGID(runAs, uid, gid);
 }
 
 int VLIBGroupIsAdminGroupMem(const char* user, int flags)

@@ -237,11 +237,15 @@ void APIRequestPrivate::InitURL()
     ParsePathAndName();
 }
 
+// "https" when the web server says so (HTTPS=on), or when a trusted proxy
+// (VelaCgiIsTrustedProxy of REMOTE_ADDR) forwards X-Forwarded-Proto: https;
+// a client's own X-Forwarded-Proto means nothing.
 bool APIRequestPrivate::ParseProtocol()
 {
     std::string proto = "http";
     if (strcasecmp(GetText("environ", "HTTPS").c_str(), "on") == 0 ||
-        strcasecmp(GetText("environ", "HTTP_X_FORWARDED_PROTO").c_str(), "https") == 0) {
+        (strcasecmp(GetText("environ", "HTTP_X_FORWARDED_PROTO").c_str(), "https") == 0 &&
+         VelaCgiIsTrustedProxy(GetText("environ", "REMOTE_ADDR").c_str()) == 1)) {
         proto = "https";
     }
     return SetData("url", "urlProto", proto, true);

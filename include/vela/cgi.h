@@ -36,11 +36,19 @@ const char* VelaCgiGetCookie(VELACGI_CTX* ctx, const char* name);
 // Frees the handle; null is ignored.
 void VelaCgiFree(VELACGI_CTX* ctx);
 
+// 1 when `peer` (the text of REMOTE_ADDR, the address the connection came
+// from) is a trusted proxy, else 0 (also for null or anything that is not an
+// IP address). Trusted proxies are the addresses that
+// <root>/etc/vela/webapi.conf names (trusted_proxies="a b c"); none without
+// the key, loopback included, since any local user can connect there. Only
+// a trusted proxy's forwarding headers are believed: X-Forwarded-For
+// (VelaCgiGetRemoteIP) and X-Forwarded-Proto (the request's protocol).
+int VelaCgiIsTrustedProxy(const char* peer);
+
 // Writes the client address (REMOTE_ADDR; the last address of
-// X-Forwarded-For instead when REMOTE_ADDR is a trusted proxy) into `buf`
-// of `size` bytes. 0 on success; -1 when there is no valid address or it does
-// not fit. Trusted proxies are the loopback addresses unless
-// <root>/etc/vela/webapi.conf names others (trusted_proxies="a b c").
+// X-Forwarded-For that is no trusted proxy instead when REMOTE_ADDR is a
+// trusted proxy, see VelaCgiIsTrustedProxy) into `buf` of `size` bytes. 0 on
+// success; -1 when there is no valid address or it does not fit.
 int VelaCgiGetRemoteIP(char* buf, size_t size);
 
 // ---- Login sessions ------------------------------------------------------------

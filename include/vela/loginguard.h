@@ -1,18 +1,37 @@
 // Login settings and the brute-force guard of the login API.
 //
-// Failed logins are counted per client address and per account. After
-// maxFailures failures from one address, or for one account, within
-// windowMinutes, further attempts are refused for blockMinutes without the
-// password being checked at all. A successful login clears the records of
-// its account and of its address.
+// Policy. Failed logins are counted per client address (IPv4 address, IPv6
+// /64 prefix: one host holds a whole prefix) and per account, each attempt
+// tagged with its (account, address) pair.
+//  - An address with maxFailures failures within windowMinutes, for any
+//    accounts, is blocked for blockMinutes: every attempt from it is refused
+//    without the password being checked.
+//  - An account is never blocked as a whole: its owner logs in from an
+//    address of its own however many failures other addresses made for the
+//    account (no lockout of the owner by strangers; each attacking address
+//    is limited on its own). The account's count is logged when it reaches
+//    maxFailures.
+//  - A successful login clears only the failures of its own (account,
+//    address) pair: an attacker's success with an account of their own
+//    leaves the count of their address as it was.
+//  - The records are bounded: at most maxRecords address records, expired
+//    records purged whenever a new address record is wanted and after each
+//    failure. When the store is full of records that have not expired, an
+//    address without a record gets none, and its attempts count against the
+//    account alone: an account with maxFailures failures within the window,
+//    from anywhere, refuses them until the window moves on (fail safe: a
+//    flood of addresses never lifts a limit; during such a flood the owner
+//    of an attacked account may have to wait as well). Account records are
+//    made only for accounts that exist (NSS), so their number is bounded by
+//    the machine's accounts; an attempt that no record can count (unknown
+//    account, full store) is refused.
 //
 // Records are files of <root>/run/vela/login-guard (directory 0700, files
-// 0600, JSON written atomically), one per address and one per account,
-// named after the SHA-256 of the address or account, so no text of the
-// client ever becomes a path. Every update happens under the lock of the
-// directory (VLIBCFileLockTimeByFile on ".lock"). Accounts are compared
-// ignoring ASCII case; IPv6 clients count per /64 prefix (one host holds a
-// whole prefix), IPv4 clients per address.
+// 0600, JSON written atomically), "addr-" or "acct-" followed by the
+// SHA-256 of the address or account, so no text of the client ever becomes
+// a path. Every update happens under the lock of the directory
+// (VLIBCFileLockTimeByFile on ".lock"). Accounts are compared ignoring
+// ASCII case.
 //
 // An attempt counts as a failure from the moment VelaLoginGuardBegin lets
 // it through until VelaLoginGuardSucceeded clears it, so parallel attempts
@@ -20,10 +39,10 @@
 // whose process dies half-way still counts.
 //
 // Every failure is logged to the authorisation facility at warning
-// priority, every block and every attempt refused by a block at notice
-// priority, with the account (non-printable bytes escaped, cut to 64 bytes)
-// and the client address. Times come from the session store's clock
-// (VelaSetClockForTest in vela/session.h).
+// priority, every block, every attempt refused by a block and an account
+// reaching the limit at notice priority, with the account (non-printable
+// bytes escaped, cut to 64 bytes) and the client address. Times come from
+// the session store's clock (VelaSetClockForTest in vela/session.h).
 #pragma once
 
 // Defaults and bounds of the settings.
@@ -32,6 +51,8 @@
 #define VELA_LOGIN_WINDOW_DEFAULT 10   // minutes
 #define VELA_LOGIN_BLOCK_DEFAULT 15    // minutes
 #define VELA_LOGIN_MINUTES_MAX 10080   // one week, for both
+#define VELA_LOGIN_GUARD_RECORDS_DEFAULT 10000
+#define VELA_LOGIN_GUARD_RECORDS_MAX 1000000
 
 // Longest account and address text the guard takes.
 #define VELA_LOGIN_ACCOUNT_MAX 255
@@ -40,6 +61,7 @@
 //   login_max_failures     1 .. 1000
 //   login_window_minutes   1 .. 10080
 //   login_block_minutes    1 .. 10080
+//   login_guard_max_records  1 .. 1000000, address records kept at most
 //   session_idle_timeout   seconds, 1 .. VELA_SESSION_IDLE_MAX
 //   session_lifetime       seconds, 1 .. VELA_SESSION_LIFETIME_MAX
 // A missing file or key keeps the default; a value that is not a decimal
@@ -48,6 +70,7 @@ struct VelaLoginSettings {
     int maxFailures = VELA_LOGIN_MAX_FAILURES_DEFAULT;
     int windowMinutes = VELA_LOGIN_WINDOW_DEFAULT;
     int blockMinutes = VELA_LOGIN_BLOCK_DEFAULT;
+    int maxRecords = VELA_LOGIN_GUARD_RECORDS_DEFAULT;
     int idleTimeout = 0;  // 0: the session store's default
     int lifetime = 0;     // 0: the session store's default
 };
@@ -62,24 +85,26 @@ void VelaLoginSettingsLoad(VelaLoginSettings* settings);
 
 // Before a password check of `account` (1 to VELA_LOGIN_ACCOUNT_MAX bytes)
 // from `clientIP` (an IP address; null or "" counts as one unknown client).
-// When the address or the account is blocked, or the attempts still
-// counted for either have reached the limit, returns BLOCKED with
-// `*waitSeconds` set to the seconds until the block ends (at least 1).
-// Otherwise counts the attempt as a failure of both and returns ALLOW.
-// ERROR on
-// invalid arguments or a store that cannot be used (logged): refuse the
-// login then. `settings` null means the defaults; `waitSeconds` may be null.
+// Returns BLOCKED, with `*waitSeconds` set to the seconds until an attempt
+// may come through (at least 1), when the address is blocked or its counted
+// attempts have reached the limit, or, for an address the full store does
+// not track, when the account's have, or when no record can count the
+// attempt. Otherwise counts the attempt as a failure and returns ALLOW.
+// ERROR on invalid arguments or a store that cannot be used (logged):
+// refuse the login then. `settings` null means the defaults; `waitSeconds`
+// may be null.
 int VelaLoginGuardBegin(const VelaLoginSettings* settings, const char* account, const char* clientIP,
                         int* waitSeconds);
 
 // After the password check of an attempt let through by Begin failed: logs
-// the failure (with `reason`, which may be null), and starts the block of
-// the address or the account whose counted attempts have reached the limit
-// (logged; its counted attempts are then forgotten, so the block is the
-// whole penalty).
+// the failure (with `reason`, which may be null), starts the block of the
+// address when its counted attempts have reached the limit (logged; they
+// are then forgotten, so the block is the whole penalty), logs an account
+// whose count reaches the limit, and purges expired records.
 void VelaLoginGuardFailed(const VelaLoginSettings* settings, const char* account, const char* clientIP,
                           const char* reason);
 
-// After a successful password check: removes the records of `account` and
-// `clientIP`. 0, or -1 when they could not be removed (logged).
-int VelaLoginGuardSucceeded(const char* account, const char* clientIP);
+// After a successful password check: removes the attempts of this
+// (account, address) pair, and no others, from both records. 0, or -1 when
+// the records could not be updated (logged).
+int VelaLoginGuardSucceeded(const VelaLoginSettings* settings, const char* account, const char* clientIP);

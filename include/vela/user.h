@@ -7,8 +7,14 @@
 //
 // User names accepted by every call here: 1 to 255 bytes, no "/", no ":",
 // no control byte, not "." or "..". Anything else is refused before any
-// lookup. The run-as name "system" means the superuser (uid 0, gid 0, the
-// groups of root).
+// lookup.
+//
+// "system" is the dispatcher's run-as name of the superuser (an API's
+// "runAs" attribute, its default), never an account's: only the run-as
+// calls (VELARunAsGetUGID, ResetCredentialsForRunAs) map it to uid 0. Every
+// other call here takes a name as an account, so a login name, a session's
+// or an access token's user "system" is whatever the account of that name
+// is, and no account is ever taken for root by its name.
 //
 // No call throws; every configuration file is read with a size bound.
 #pragma once
@@ -38,17 +44,27 @@ int VELAUserGetByName(const char* name, PVELAUSER* user);
 // Frees a record of VELAUserGetByUID / VELAUserGetByName; null is ignored.
 void VELAUserFree(PVELAUSER user);
 
-// The uid and primary gid of user `name` ("system": 0 and 0). 0 on success,
-// -1 when the user is unknown, the name invalid, an output null or the
-// lookup fails.
+// The uid and primary gid of user `name`. 0 on success, -1 when the user is
+// unknown, the name invalid, an output null or the lookup fails.
 int VELAUserGetUGID(const char* name, uid_t* uid, gid_t* gid);
+
+// ---- Run-as identities --------------------------------------------------------------
+// The identity an API runs as: VELA_RUNAS_SUPERUSER, or an account's name.
+
+#define VELA_RUNAS_SUPERUSER "system"
+
+// 1 when `runAs` is exactly VELA_RUNAS_SUPERUSER, else 0 (null included).
+int VELARunAsIsSuperuser(const char* runAs);
+// As VELAUserGetUGID, but VELA_RUNAS_SUPERUSER gives 0 and 0 without a
+// lookup.
+int VELARunAsGetUGID(const char* runAs, uid_t* uid, gid_t* gid);
 
 // ---- Administrators ----------------------------------------------------------------
 // The administrators group is "administrators" unless /etc/vela/webapi.conf
 // (under the root) sets admin_group="name" (key="value" lines, read as
 // VLIBCFileGetKeyValue does).
 
-// 1 when `user` is root, "system", or a member of the administrators group
+// 1 when `user` is an account of uid 0 or a member of the administrators group
 // (as primary or supplementary group); 0 when not (also when the group does
 // not exist or the user is unknown); -1 on error: invalid name, `flags` not
 // 0, a corrupt configuration or an admin_group that is not a valid name, or
@@ -96,12 +112,16 @@ int VLIBAppPrivUserHas(const char* user, const char* priv, const char* remoteIP)
 // [reason]" at error priority. On failure the previous ids and groups are
 // put back when possible and false is returned.
 
-// Switches to user `name` ("system": the superuser) with the user's groups
-// (initgroups). True when the ids read back as requested. A process whose
-// user and group ids are all 0 and whose only supplementary group is 0 (or
-// none) already is "system": nothing is changed or logged and no account is
-// looked up.
+// Switches to the account `name` with its groups (initgroups). True when
+// the ids read back as requested.
 bool ResetCredentialsByName(const char* name, bool grantable);
+
+// Switches to the run-as identity `runAs`: VELA_RUNAS_SUPERUSER is uid 0,
+// gid 0 with the groups of root's account; any other name is an account, as
+// ResetCredentialsByName. A process whose user and group ids are all 0 and
+// whose only supplementary group is 0 (or none) already is the superuser:
+// nothing is changed or logged and no account is looked up.
+bool ResetCredentialsForRunAs(const char* runAs, bool grantable);
 
 // Switches to the owner and group of the regular file `path` (symbolic
 // links followed): the group of the file becomes the primary group; the

@@ -215,6 +215,20 @@ TEST_F(Identity, RefusedSwitchSkipsTheHandler)
     }
 }
 
+// A session's user "system" (an account of that name, or none) is an
+// account like any other for grantByUser: never the run-as superuser.
+TEST_F(Identity, SessionUserSystemNeverRunsAsRoot)
+{
+    const Json::Value report = RunInChild(IdsCall("byUser", J(R"({"username": "system"})")));
+    const Json::Value& seen = report["answer"]["data"];
+    EXPECT_NE(Triple(0, 0, 0), seen["uid"]) << report["answer"];
+    if (!seen.isMember("uid")) {
+        EXPECT_TRUE(Logged(report["log"].asString(), LOG_ERR, "APIRunner:\\d+ grantByUser failed\\. \\[.*\\]\n"))
+            << report["log"].asString();
+    }
+    EXPECT_EQ(rootIds_, report["after"]);
+}
+
 // grantByDefault gives the handler full rights and puts the caller's ids
 // back afterwards.
 TEST_F(Identity, GrantByDefaultRunsAsRoot)

@@ -7,18 +7,23 @@
 # (also for a method that polls), a session past its lifetime, another
 # client address, a missing token, a user on an administrators' API.
 # Also: a login with parameters encrypted by openssl, blocking after repeated
-# failures, and the modes of the session files.
+# failures, and the modes of the session files. Attacks that must fail: an
+# account named "system" (the dispatcher's run-as name) taken for root,
+# forwarding headers of a client that is no configured proxy, a password in
+# the URL, and the login guard played (locking the owner out from elsewhere,
+# resetting an address's count with an account of one's own).
 #
-# usage: login.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR
+# usage: login.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR
 # Exit 0 when every check passed, 1 otherwise, 77 (skipped) without
 # lighttpd, curl, openssl or the account tools, or when not run as root
 # (accounts are created, PAM reads /etc/shadow, velascgi switches identity).
 set -u
 
-[ $# -eq 3 ] || { echo "usage: login.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR" >&2; exit 2; }
+[ $# -eq 4 ] || { echo "usage: login.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR" >&2; exit 2; }
 VELASCGI=$(realpath -e "$1") || exit 1
-WEBAPI=$(realpath -e "$2") || exit 1
-SRC=$(realpath -e "$3") || exit 1
+VELAADM=$(realpath -e "$2") || exit 1
+WEBAPI=$(realpath -e "$3") || exit 1
+SRC=$(realpath -e "$4") || exit 1
 
 . "$SRC/tests/e2e/server.sh"
 srv_require "accounts, PAM, identity switches" openssl useradd chpasswd runuser
@@ -26,6 +31,7 @@ srv_traps
 
 # Error codes of VELA.Auth login (webapi/auth/).
 ERR_WRONG_PASSWORD=400
+ERR_PASSWORD_IN_URL=403
 ERR_BLOCKED=407
 
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
@@ -147,12 +153,38 @@ log_since | grep -qF 'Token Authentication Fail.' ||
 call -b "$JAR1" -H "X-Vela-Token: x${TOKEN1:1}" "$WHOAMI"
 refused "whoami with a wrong token" 105 noprivilege
 
-# ---- Another client address: a second loopback address as the source, and
-# a forwarded address from a trusted proxy (loopback by default).
+# ---- Another client address: a second loopback address as the source.
 call --interface 127.0.0.2 -b "$JAR1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
 refused "whoami from 127.0.0.2" 150 errorip
+
+# ---- Forwarding headers count only from a configured proxy; no proxy is
+# trusted by default, loopback included. A local client's X-Forwarded-For
+# neither moves the session's address nor binds a new session elsewhere,
+# and its X-Forwarded-Proto does not make the cookie Secure.
 call -H "X-Forwarded-For: 192.0.2.44" -b "$JAR1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
-refused "whoami forwarded for 192.0.2.44" 150 errorip
+expect "whoami with a forged X-Forwarded-For" '"success":true' "\"user\":\"$USER1\""
+if login "login with a forged X-Forwarded-For" "$USER1" "$PASS1" -H "X-Forwarded-For: 203.0.113.7" \
+  -H "X-Forwarded-Proto: https"; then
+  grep -qE '"clientIP" *: *"127\.0\.0\.1"' "$ROOT/run/vela/sessions/$sid" ||
+    fail "a forged X-Forwarded-For bound the session: $(cat "$ROOT/run/vela/sessions/$sid")"
+  tr -d '\r' <"$TMP/headers" | grep -i '^Set-Cookie: id=' | grep -qi '; *secure' &&
+    fail "a forged X-Forwarded-Proto made the cookie Secure: $(grep -i '^Set-Cookie' "$TMP/headers")"
+  call -b "id=$sid" -H "X-Vela-Token: $token" "$WHOAMI"
+  expect "whoami of a session opened with a forged X-Forwarded-For" '"success":true'
+fi
+# With 127.0.0.1 configured as the proxy, both headers count.
+cp "$ROOT/etc/vela/webapi.conf" "$TMP/webapi.conf"
+echo 'trusted_proxies="127.0.0.1"' >>"$ROOT/etc/vela/webapi.conf"
+call -H "X-Forwarded-For: 192.0.2.44" -b "$JAR1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
+refused "whoami forwarded for 192.0.2.44 by a configured proxy" 150 errorip
+if login "login through a configured proxy" "$USER1" "$PASS1" -H "X-Forwarded-For: 203.0.113.8" \
+  -H "X-Forwarded-Proto: https"; then
+  grep -qE '"clientIP" *: *"203\.0\.113\.8"' "$ROOT/run/vela/sessions/$sid" ||
+    fail "the configured proxy's X-Forwarded-For is not the session's: $(cat "$ROOT/run/vela/sessions/$sid")"
+  tr -d '\r' <"$TMP/headers" | grep -i '^Set-Cookie: id=' | grep -qi '; *secure' ||
+    fail "the configured proxy's X-Forwarded-Proto: https left the cookie without Secure"
+fi
+cp "$TMP/webapi.conf" "$ROOT/etc/vela/webapi.conf"
 
 # ---- An administrators' method: refused to the user, open to an
 # administrator.
@@ -163,6 +195,41 @@ if login "admin login" "$ADMIN" "$PASSA" -c "$JARA"; then
   expect "admin login" "\"account\":\"$ADMIN\"" '"isAdmin":true'
   call -b "$JARA" -H "X-Vela-Token: $token" "$ADMINONLY"
   expect "adminonly as an administrator" '"success":true' "\"user\":\"$ADMIN\"" '"isAdmin":true'
+fi
+
+# ---- "system" names the superuser only as the dispatcher's run-as identity;
+# as a login name, a session's user or an access token's user it is an
+# ordinary account. A real account "system" is made for the run when the
+# machine has none (and removed afterwards).
+PASSS=$(srv_password)
+if getent passwd system >/dev/null; then
+  echo "note: the machine has an account \"system\"; its password is not known here"
+elif ! srv_add_user system "$PASSS"; then
+  fail "cannot create the account system"
+fi
+log_mark
+call --interface 127.0.0.11 --data "account=system&passwd=$(pct "$PASSS")" "$AUTH&method=login"
+refused "login as system" "$ERR_WRONG_PASSWORD"
+grep -qi '^Set-Cookie: id=' "$TMP/headers" && fail "a login as system sets a cookie"
+log_since | grep -qF 'account name "system" is reserved' ||
+  fail "the refusal of \"system\" is not logged: $(log_since | tail -n 5)"
+if getent passwd system >/dev/null; then
+  out=$(VELA_ROOT=$ROOT "$VELAADM" session create system --ip 127.0.0.1 --token)
+  ssid=$(printf '%s\n' "$out" | sed -n 's/^sid=//p') stoken=$(printf '%s\n' "$out" | sed -n 's/^token=//p')
+  if [ -n "$ssid" ]; then
+    call -b "id=$ssid" -H "X-Vela-Token: $stoken" "$ADMINONLY"
+    refused "adminonly with a session of the account system" 105
+  else
+    fail "velaadm made no session for system: $out"
+  fi
+  tok=$(VELA_ROOT=$ROOT "$VELAADM" token create system --api VELA.Sample --method adminonly |
+    sed -n 's/^token=//p')
+  if [ -n "$tok" ]; then
+    call "$ADMINONLY&tid=$tok"
+    refused "adminonly with an access token of the account system" 105
+  else
+    fail "velaadm made no access token for system"
+  fi
 fi
 
 # ---- Session files: 0600 in a 0700 directory, out of reach of the user.
@@ -291,17 +358,62 @@ done
 # Each failure and the block are logged, with the account and the address.
 n=$(log_since | grep -cF "login failed: account \"$USER3\" from 127.0.0.3")
 [ "$n" -eq 3 ] || fail "$n of 3 failures logged: $(log_since | tail -n 5)"
-log_since | grep -qF "login blocked for 30 minutes: 3 failures for account \"$USER3\"" ||
-  fail "the account's block is not logged: $(log_since | tail -n 5)"
+log_since | grep -qF "login blocked for 30 minutes: 3 failures from 127.0.0.3" ||
+  fail "the address's block is not logged: $(log_since | tail -n 5)"
 call --interface 127.0.0.3 --data "account=$(pct "$USER3")&passwd=$(pct "$PASS3")" "$AUTH&method=login"
 refused "right password while blocked" "$ERR_BLOCKED"
 expect "right password while blocked" '"waitSeconds":'
 grep -qi '^Set-Cookie: id=' "$TMP/headers" && fail "a blocked login sets a cookie"
-# The account is blocked from any address.
-call --interface 127.0.0.5 --data "account=$(pct "$USER3")&passwd=$(pct "$PASS3")" "$AUTH&method=login"
-refused "right password from another address while blocked" "$ERR_BLOCKED"
-log_since | grep -qF "login refused without a password check: account \"$USER3\" from 127.0.0.5" ||
+log_since | grep -qF "login refused without a password check: account \"$USER3\" from 127.0.0.3" ||
   fail "the refusal during the block is not logged: $(log_since | tail -n 5)"
+# The block holds the address that failed, not the account: its owner still
+# logs in from elsewhere.
+login "the owner from another address while an attacker's address is blocked" "$USER3" "$PASS3" \
+  --interface 127.0.0.5
+
+# ---- An attacker's own account does not reset the count of the attacker's
+# address: failures for other accounts, a success of the attacker's own,
+# one more failure, and the address is blocked even for that account.
+for i in 1 2; do
+  login_fails "attacker's failure $i" "nosuch$i$tag" "$PASS1" --interface 127.0.0.10
+done
+login "the attacker's own account between the guesses" "$USER1" "$PASS1" --interface 127.0.0.10
+login_fails "attacker's failure 3" "nosuch3$tag" "$PASS1" --interface 127.0.0.10
+call --interface 127.0.0.10 --data "account=$(pct "$USER1")&passwd=$(pct "$PASS1")" "$AUTH&method=login"
+refused "the attacker's own account after the third failure" "$ERR_BLOCKED"
+
+# ---- Forged X-Forwarded-For addresses neither rotate the attacker's address
+# (a password spray from one client, a new forged address each time) nor
+# block an address of the attacker's choice.
+for i in 1 2 3; do
+  login_fails "spray $i" "spray$i$tag" "$PASS1" --interface 127.0.0.6 -H "X-Forwarded-For: 198.51.100.$i"
+done
+call --interface 127.0.0.6 -H "X-Forwarded-For: 198.51.100.4" \
+  --data "account=spray4$tag&passwd=$(pct "$PASS1")" "$AUTH&method=login"
+refused "spray 4 with yet another forged address" "$ERR_BLOCKED"
+for i in 1 2 3; do
+  login_fails "failure $i for the address 127.0.0.9" "victim$i$tag" "$PASS1" --interface 127.0.0.8 \
+    -H "X-Forwarded-For: 127.0.0.9"
+done
+login "a login from the address an attacker named" "$USER1" "$PASS1" --interface 127.0.0.9
+
+# ---- The password only in the POST body: in the URL, plain or in its
+# encrypted form (the cipher text of the encrypted login above), it is
+# refused before any check, and never logged.
+log_mark
+call --interface 127.0.0.12 --data "account=$(pct "$USER1")" "$AUTH&method=login&passwd=$(pct "$PASS1")"
+refused "password in the query string of a POST" "$ERR_PASSWORD_IN_URL"
+call --interface 127.0.0.12 "$AUTH&method=login&account=$(pct "$USER1")&passwd=$(pct "$PASS1")"
+refused "password in the query string of a GET" "$ERR_PASSWORD_IN_URL"
+call --interface 127.0.0.12 --data "account=$(pct "$USER1")&passwd=$(pct "$PASS1")" "$AUTH&method=login&passw%64=x"
+refused "a percent-encoded passwd in the query string" "$ERR_PASSWORD_IN_URL"
+if [ -n "${cipher:-}" ]; then
+  call --interface 127.0.0.12 --data "x=1" "$AUTH&method=login&__cIpHeRtExT=$(pct "$cipher")"
+  refused "the encrypted credentials in the query string" "$ERR_PASSWORD_IN_URL"
+fi
+log_since | grep -qF 'login refused: a password in the query string' ||
+  fail "the refusal of a password in the URL is not logged: $(log_since | tail -n 5)"
+grep -qF -- "$PASS1" "$RUN/cgi.log" && fail "a password is in cgi.log"
 
 # ---- Nothing went wrong inside velascgi.
 srv_sanitizer_clean || fail "sanitizer reports in the logs"

@@ -101,8 +101,23 @@ TEST_F(RemoteIP, DirectClientIgnoresForwardedFor)
     EXPECT_EQ("FAIL", Get("1.2.3.4:5678", nullptr));
 }
 
-TEST_F(RemoteIP, LoopbackProxyTakesRightmostUntrusted)
+// Without trusted_proxies no peer is a proxy, loopback included: a local
+// client's X-Forwarded-For would otherwise name any address it likes.
+TEST_F(RemoteIP, NoProxyIsTrustedUnlessConfigured)
 {
+    for (const char* conf : {static_cast<const char*>(nullptr), "admin_group=\"x\"\n", "trusted_proxies=\"\"\n"}) {
+        if (conf != nullptr) {
+            Conf(conf);
+        }
+        EXPECT_EQ("127.0.0.1", Get("127.0.0.1", "203.0.113.9")) << (conf ? conf : "no file");
+        EXPECT_EQ("::1", Get("::1", "203.0.113.9, 127.0.0.1")) << (conf ? conf : "no file");
+        EXPECT_EQ(0, VelaCgiIsTrustedProxy("127.0.0.1")) << (conf ? conf : "no file");
+    }
+}
+
+TEST_F(RemoteIP, ConfiguredProxyTakesRightmostUntrusted)
+{
+    Conf("trusted_proxies=\"127.0.0.1 ::1, 127.0.0.2,127.0.0.5\"\n");
     EXPECT_EQ("127.0.0.1", Get("127.0.0.1", nullptr));
     EXPECT_EQ("127.0.0.1", Get("127.0.0.1", " "));
     EXPECT_EQ("203.0.113.9", Get("127.0.0.1", "10.9.9.9, 203.0.113.9"));  // left entry spoofable
@@ -112,17 +127,19 @@ TEST_F(RemoteIP, LoopbackProxyTakesRightmostUntrusted)
     EXPECT_EQ("FAIL", Get("127.0.0.1", "garbage"));
     EXPECT_EQ("FAIL", Get("127.0.0.1", "1.2.3.4, "));
     EXPECT_EQ("FAIL", Get("127.0.0.1", std::string(70000, '1').c_str()));
+    EXPECT_EQ("127.0.0.3", Get("127.0.0.3", "203.0.113.9"));  // another loopback address is no proxy
 }
 
-TEST_F(RemoteIP, ConfiguredProxiesReplaceLoopback)
+TEST_F(RemoteIP, OnlyConfiguredAddressesAreProxies)
 {
     Conf("# proxies\nother=\"x\"\ntrusted_proxies=\"192.0.2.10 2001:db8::10 bogus\"\n");
     EXPECT_EQ("203.0.113.9", Get("192.0.2.10", "203.0.113.9"));
     EXPECT_EQ("203.0.113.9", Get("2001:db8:0:0::10", "203.0.113.9, 192.0.2.10"));
-    EXPECT_EQ("127.0.0.1", Get("127.0.0.1", "203.0.113.9"));  // loopback no longer trusted
-
-    Conf("trusted_proxies=\"\"\n");
     EXPECT_EQ("127.0.0.1", Get("127.0.0.1", "203.0.113.9"));
+    EXPECT_EQ(1, VelaCgiIsTrustedProxy("::ffff:192.0.2.10"));
+    for (const char* peer : {"192.0.2.11", "bogus", "", "192.0.2.10 ", static_cast<const char*>(nullptr)}) {
+        EXPECT_EQ(0, VelaCgiIsTrustedProxy(peer)) << (peer ? peer : "null");
+    }
 }
 
 TEST_F(RemoteIP, BufferSize)

@@ -107,10 +107,15 @@ TEST_F(Credentials, GrantableKeepsTheWayBack)
         Check(errors, Ids() == Want(a.uid, a.uid, 0, a.gid, a.gid, a.gid), "ids " + Ids());
         Check(errors, Has(Groups(), a.suppGid), "supplementary group missing");
         Check(errors, setresuid(0, 0, 0) == 0 && geteuid() == 0, "cannot return to root");
-        // And back again; then to "system", the superuser with root's groups.
+        // And back again; the account named "system" is no way to root (it
+        // is refused without such an account); the run-as "system" is the
+        // superuser with root's groups.
         Check(errors, ResetCredentialsByName(a.user.c_str(), true), "second switch failed");
         Check(errors, Ids() == Want(a.uid, a.uid, 0, a.gid, a.gid, a.gid), "ids after second switch " + Ids());
-        Check(errors, ResetCredentialsByName("system", false), "switch to system failed");
+        if (ResetCredentialsByName("system", true)) {
+            Check(errors, geteuid() != 0, "the account name system switched to root");
+        }
+        Check(errors, ResetCredentialsForRunAs("system", false), "switch to system failed");
         Check(errors, Ids() == Want(0, 0, 0, 0, 0, 0), "ids as system " + Ids());
         Check(errors, !Has(Groups(), a.suppGid), "user's group kept");
         return errors;
@@ -128,7 +133,7 @@ TEST_F(Credentials, LogsEverySwitch)
             *static_cast<std::string*>(arg) += std::to_string(prio) + "|" + line + "\n";
         }, &out);
         ResetCredentialsByName(a.user.c_str(), false);
-        if (ResetCredentialsByName("system", true)) {
+        if (ResetCredentialsForRunAs("system", true)) {
             out += "regained root\n";
         }
         VelaLogSetSink(nullptr, nullptr);
@@ -157,11 +162,11 @@ TEST_F(Credentials, SystemFromPlainRootIsAlreadyDone)
         Check(errors, setgroups(1, &zero) == 0 && setresgid(0, 0, 0) == 0, "cannot become plain root");
         std::string lines;
         VelaLogSetSink([](int, const char* line, void* arg) { *static_cast<std::string*>(arg) += line; }, &lines);
-        Check(errors, ResetCredentialsByName("system", false), "plain root refused");
+        Check(errors, ResetCredentialsForRunAs("system", false), "plain root refused");
         Check(errors, lines.empty(), "logged: " + lines);
         const gid_t extra[] = {0, a.suppGid};
         Check(errors, setgroups(2, extra) == 0, "cannot add a group");
-        Check(errors, ResetCredentialsByName("system", false), "root with a group refused");
+        Check(errors, ResetCredentialsForRunAs("system", false), "root with a group refused");
         Check(errors, !Has(Groups(), a.suppGid), "extra group kept");
         Check(errors, lines.find("WARNING: setresgid(0, 0, 0)") != std::string::npos, "no switch logged: " + lines);
         VelaLogSetSink(nullptr, nullptr);
@@ -177,6 +182,7 @@ TEST_F(Credentials, UnknownAndHostileNamesChangeNothing)
         const std::string longName(256, 'a');
         for (const char* name : {"vela-no-such-user-x", "", "a/b", "a:b", "a\nb", "..", longName.c_str()}) {
             Check(errors, !ResetCredentialsByName(name, true), std::string("accepted ") + name);
+            Check(errors, !ResetCredentialsForRunAs(name, true), std::string("run-as accepted ") + name);
         }
         Check(errors, !ResetCredentialsByName(nullptr, true), "accepted null");
         Check(errors, Ids() == before && geteuid() == 0, "ids changed: " + Ids());

@@ -1,7 +1,10 @@
 // The brute-force guard of logins against real record files under a
-// temporary VELA_ROOT, with the test clock: limits per address and per
-// account, the sliding window, the end of a block, success, hostile
-// accounts, the log lines, parallel processes, and the settings file.
+// temporary VELA_ROOT, with the test clock: the limit per address, the
+// account's owner never locked out, the sliding window, the end of a block,
+// a success clearing its own pair only, hostile accounts, the log lines,
+// the purge and the bound of the store, parallel processes, and the
+// settings file. "daemon" and "bin" are accounts every machine has; the
+// other names are no accounts.
 #include <gtest/gtest.h>
 
 #include "platform/StateRootTest.h"
@@ -47,21 +50,51 @@ protected:
     {
         return VelaLoginGuardBegin(&settings_, account, ip, wait);
     }
+    // Begin and Succeeded: a login with the right password.
+    int Succeed(const char* account, const char* ip)
+    {
+        const int verdict = VelaLoginGuardBegin(&settings_, account, ip, nullptr);
+        if (verdict == VELA_LOGIN_GUARD_ALLOW) {
+            EXPECT_EQ(0, VelaLoginGuardSucceeded(&settings_, account, ip));
+        }
+        return verdict;
+    }
     std::string GuardDir() const { return root_.Path() + "/run/vela/login-guard"; }
+    // The record files, by kind ("addr-" or "acct-").
+    size_t Records(const std::string& kind) const
+    {
+        size_t n = 0;
+        for (const std::string& name : DirEntries(GuardDir())) {
+            n += name.compare(0, kind.size(), kind) == 0 ? 1 : 0;
+        }
+        return n;
+    }
 
     VelaLoginSettings settings_;
 };
 
-TEST_F(LoginGuard, LimitPerAccountFromAnyAddress)
+// Strangers' failures never lock the owner out: the addresses that failed
+// are blocked, each on its own; the account is not.
+TEST_F(LoginGuard, OwnerIsNeverLockedOutByOtherAddresses)
 {
-    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("alice", "192.0.2.1"));
-    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("alice", "192.0.2.2"));
-    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("ALICE", "2001:db8::1"));  // accounts ignore ASCII case
+    VELA::Test::LogCapture log;
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", "192.0.2.66")) << i;
+        EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("DAEMON", ("198.51.100." + std::to_string(i)).c_str())) << i;
+    }
     int wait = 0;
-    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("alice", "198.51.100.9", &wait));
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("daemon", "192.0.2.66", &wait));
     EXPECT_EQ(15 * 60, wait);
-    // The addresses have one failure each: other accounts go on.
-    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Try("bob", "192.0.2.1"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Succeed("daemon", "203.0.113.5"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Try("daemon", "198.51.100.0"));  // one failure there only
+    // Accounts ignore ASCII case; the count is logged once it reaches the limit.
+    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE,
+              log.PriorityOf({"failures for account \"daemon\" reached 3", "the last from 192.0.2.66"}));
+    size_t notices = 0;
+    for (const std::string& line : log.Lines()) {
+        notices += line.find("failures for account") != std::string::npos ? 1 : 0;
+    }
+    EXPECT_EQ(1u, notices) << "logged once, not at every failure after";
 }
 
 TEST_F(LoginGuard, LimitPerAddressForAnyAccount)
@@ -113,16 +146,30 @@ TEST_F(LoginGuard, BlockEndsAndStartsAfresh)
     EXPECT_EQ(15 * 60, wait);
 }
 
-TEST_F(LoginGuard, SuccessClearsAccountAndAddress)
+// A success clears the failures of its own (account, address) pair and no
+// others: an attacker's own account does not reset the address's count.
+TEST_F(LoginGuard, SuccessClearsItsOwnPairOnly)
 {
-    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("erin", "192.0.2.1"));
-    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("other", "192.0.2.1"));
-    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Try("erin", "192.0.2.1"));
-    EXPECT_EQ(0, VelaLoginGuardSucceeded("erin", "192.0.2.1"));
-    EXPECT_EQ(2u, DirEntries(GuardDir()).size()) << "the lock and the record of \"other\" stay";
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("victim", "192.0.2.1"));
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("victim", "192.0.2.1"));
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Succeed("bin", "192.0.2.1"));
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Succeed("bin", "192.0.2.1"));  // its own attempts never pile up
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("other", "192.0.2.1"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("bin", "192.0.2.1"));
+
+    // The owner who mistyped: the success forgives the pair's failures, not
+    // those of the account from another address.
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", "192.0.2.2"));
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", "192.0.2.2"));
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", "192.0.2.3"));
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Succeed("daemon", "192.0.2.2"));
     for (int i = 0; i < 3; ++i) {
-        EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("erin", "192.0.2.1")) << i;
+        EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", "192.0.2.2")) << i;
     }
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("daemon", "192.0.2.2"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", "192.0.2.3"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", "192.0.2.3"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("x", "192.0.2.3"));
 }
 
 TEST_F(LoginGuard, AttemptsInProgressCountAgainstTheLimit)
@@ -144,7 +191,7 @@ TEST_F(LoginGuard, RecordsAreHashedPrivateFiles)
     const std::string longName(VELA_LOGIN_ACCOUNT_MAX, 'x');
     for (const std::string& account :
          {std::string("../../../etc/passwd"), std::string("a/b"), std::string(".."), std::string("x\n\x01\"y"),
-          longName}) {
+          longName, std::string("daemon")}) {
         EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail(account.c_str(), "")) << account;
     }
     EXPECT_EQ(VELA_LOGIN_GUARD_ERROR, Try(std::string(VELA_LOGIN_ACCOUNT_MAX + 1, 'x').c_str(), "192.0.2.1"));
@@ -156,17 +203,65 @@ TEST_F(LoginGuard, RecordsAreHashedPrivateFiles)
     ASSERT_EQ(0, stat(GuardDir().c_str(), &st));
     EXPECT_EQ(0700u, st.st_mode & 07777);
     EXPECT_EQ(std::vector<std::string>({"run"}), DirEntries(root_.Path()));
+    // The lock, the unknown address, and an account record for the one
+    // account that exists: names that are no accounts get none.
     std::vector<std::string> files = DirEntries(GuardDir());
-    EXPECT_EQ(7u, files.size());  // five accounts, the unknown address, the lock
+    EXPECT_EQ(3u, files.size());
+    EXPECT_EQ(1u, Records("addr-"));
+    EXPECT_EQ(1u, Records("acct-"));
     for (const std::string& name : files) {
         if (name == ".lock") {
             continue;
         }
-        EXPECT_EQ(64u, name.size()) << name;
-        EXPECT_EQ(std::string::npos, name.find_first_not_of("0123456789abcdef")) << name;
+        EXPECT_EQ(69u, name.size()) << name;
+        EXPECT_EQ(std::string::npos, name.find_first_not_of("0123456789abcdef", 5)) << name;
         ASSERT_EQ(0, stat((GuardDir() + "/" + name).c_str(), &st));
         EXPECT_EQ(0600u, st.st_mode & 07777) << name;
     }
+}
+
+// Expired records go at the next failure; the bound holds address records
+// to login_guard_max_records, and a full store never lifts a limit.
+TEST_F(LoginGuard, ExpiredRecordsArePurgedAndTheStoreIsBounded)
+{
+    for (int i = 0; i < 20; ++i) {
+        ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("x", ("192.0.2." + std::to_string(i)).c_str()));
+    }
+    EXPECT_EQ(20u, Records("addr-"));
+    Now() += 10 * 60;  // the window has passed for all of them
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("x", "192.0.2.99"));
+    EXPECT_EQ(std::vector<std::string>({".lock", "addr-"}), [this] {
+        std::vector<std::string> kinds;
+        for (const std::string& name : DirEntries(GuardDir())) {
+            kinds.push_back(name.substr(0, 5));
+        }
+        return kinds;
+    }());
+
+    settings_.maxRecords = 3;
+    for (int i = 0; i < 3; ++i) {
+        ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("x", "198.51.100.1")) << i;  // blocked: 15 minutes
+    }
+    Now() += 60;
+    ASSERT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("x", "198.51.100.2"));
+    // Full: an untracked address with no account to count on is refused
+    // until the earliest record expires (192.0.2.99, nine minutes on).
+    int wait = 0;
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("x", "203.0.113.1", &wait));
+    EXPECT_EQ(9 * 60, wait);
+    // An existing account counts on its own record: three failures from
+    // untracked addresses, then they are refused; a tracked address still
+    // decides by its own count, and the blocked one stays blocked.
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("daemon", ("203.0.113." + std::to_string(i)).c_str())) << i;
+    }
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("daemon", "203.0.113.9"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Try("daemon", "198.51.100.2"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("bin", "198.51.100.1"));
+    EXPECT_EQ(3u, Records("addr-"));
+    Now() += 15 * 60;  // everything expired: new addresses are tracked again
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Fail("x", "203.0.113.1"));
+    EXPECT_EQ(1u, Records("addr-"));
 }
 
 TEST_F(LoginGuard, FailuresAndBlocksAreLoggedToAuthpriv)
@@ -178,8 +273,8 @@ TEST_F(LoginGuard, FailuresAndBlocksAreLoggedToAuthpriv)
     Try("mallory\x1b[2J", "192.0.2.66");
     EXPECT_EQ(LOG_AUTHPRIV | LOG_WARNING,
               log.PriorityOf({"login failed", "\"mallory\\x1b[2J\"", "192.0.2.66", "Authentication failure"}));
-    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.PriorityOf({"blocked for 15 minutes", "3 failures for account \"mallory"}));
-    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.PriorityOf({"blocked for 15 minutes", "3 failures from 192.0.2.66"}));
+    EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE,
+              log.PriorityOf({"blocked for 15 minutes", "3 failures from 192.0.2.66", "account \"mallory"}));
     EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE, log.PriorityOf({"refused without a password check", "192.0.2.66"}));
     for (const std::string& line : log.Lines()) {
         EXPECT_EQ(std::string::npos, line.find('\x1b')) << line;
@@ -222,8 +317,8 @@ TEST_F(LoginGuard, ParallelProcessesCountExactly)
     });
     EXPECT_EQ(kChildren * kEach, allowed);
     // No failure was lost: exactly one more attempt fits under the limit.
-    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Try("grace", "192.0.2.2"));
-    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("grace", "192.0.2.3"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_ALLOW, Try("grace", "192.0.2.1"));
+    EXPECT_EQ(VELA_LOGIN_GUARD_BLOCKED, Try("grace", "192.0.2.1"));
 
     // Attempts racing for the last places: never more checks than the limit.
     settings_.maxFailures = 4;
@@ -247,6 +342,7 @@ TEST(LoginSettings, ReadFromWebapiConf)
     EXPECT_EQ(5, s.maxFailures);
     EXPECT_EQ(10, s.windowMinutes);
     EXPECT_EQ(15, s.blockMinutes);
+    EXPECT_EQ(10000, s.maxRecords);
     EXPECT_EQ(0, s.idleTimeout);
 
     ASSERT_EQ(0, mkdir((root.Path() + "/etc").c_str(), 0755));
@@ -254,6 +350,7 @@ TEST(LoginSettings, ReadFromWebapiConf)
     std::ofstream(root.Path() + "/etc/vela/webapi.conf") << "login_max_failures=\"7\"\n"
                                                            "login_window_minutes=\"0\"\n"
                                                            "login_block_minutes=\"-3\"\n"
+                                                           "login_guard_max_records=\"250\"\n"
                                                            "session_idle_timeout=\"600\"\n"
                                                            "session_lifetime=\"12h\"\n";
     VELA::Test::LogCapture log;
@@ -261,6 +358,7 @@ TEST(LoginSettings, ReadFromWebapiConf)
     EXPECT_EQ(7, s.maxFailures);
     EXPECT_EQ(10, s.windowMinutes);
     EXPECT_EQ(15, s.blockMinutes);
+    EXPECT_EQ(250, s.maxRecords);
     EXPECT_EQ(600, s.idleTimeout);
     EXPECT_EQ(0, s.lifetime);
     EXPECT_TRUE(log.Contains("login_window_minutes=\"0\" is not a number from 1 to 10080"));

@@ -66,11 +66,37 @@ TEST(UserLookup, RecordsComeFromNss)
     VELAUserFree(user);
     uid_t uid = 1;
     gid_t gid = 1;
-    ASSERT_EQ(0, VELAUserGetUGID("system", &uid, &gid));
-    EXPECT_EQ(0u, uid + gid);
     EXPECT_EQ(-1, VELAUserGetUGID("vela-no-such-user-x", &uid, &gid));
     EXPECT_EQ(-1, VELAUserGetByName("vela-no-such-user-x", &user));
     EXPECT_EQ(nullptr, user);
+}
+
+// "system" is the superuser as a run-as name only; as a user name it is
+// looked up like any other, so it is root only if an account of that name
+// has uid 0 (no machine of the tests has one).
+TEST(UserLookup, SystemIsTheSuperuserOnlyAsRunAsName)
+{
+    uid_t uid = 1;
+    gid_t gid = 1;
+    ASSERT_EQ(0, VELARunAsGetUGID(VELA_RUNAS_SUPERUSER, &uid, &gid));
+    EXPECT_EQ(0u, uid + gid);
+    EXPECT_EQ(1, VELARunAsIsSuperuser("system"));
+    for (const char* other : {"System", "system ", "root", "", static_cast<const char*>(nullptr)}) {
+        EXPECT_EQ(0, VELARunAsIsSuperuser(other)) << (other ? other : "null");
+    }
+    ASSERT_EQ(0, VELARunAsGetUGID("root", &uid, &gid));  // any other run-as name is an account
+    EXPECT_EQ(0u, uid);
+
+    uid = 0;
+    const bool found = VELAUserGetUGID("system", &uid, &gid) == 0;
+    EXPECT_FALSE(found && uid == 0) << "the name \"system\" was taken for root";
+    PVELAUSER user = nullptr;
+    if (VELAUserGetByName("system", &user) == 0) {
+        EXPECT_NE(0u, user->uid);
+        EXPECT_STREQ("system", user->szName);
+    }
+    VELAUserFree(user);
+    EXPECT_NE(1, VLIBGroupIsAdminGroupMem("system", 0));
 }
 
 // Privileges of an ordinary existing account ("nobody", primary group
@@ -153,7 +179,8 @@ TEST_F(UserAdminGroup, MembershipFollowsTheConfiguredGroup)
     Conf("webapi.conf", "# test\ntrusted_proxies=\"127.0.0.1\"\nadmin_group=\"" + admins_ + "\"\n");
     EXPECT_EQ(0, VLIBGroupIsAdminGroupMem(user, 0));
     EXPECT_EQ(1, VLIBGroupIsAdminGroupMem("root", 0));
-    EXPECT_EQ(1, VLIBGroupIsAdminGroupMem("system", 0));
+    EXPECT_NE(1, VLIBGroupIsAdminGroupMem("system", 0));  // a name, not the run-as superuser
+    EXPECT_EQ(0, VLIBAppPrivUserHas("system", "VELA.Any", "10.0.0.1"));
     EXPECT_EQ(0, VLIBAppPrivUserHas(user, "VELA.Any", "10.0.0.1"));
 
     ASSERT_TRUE(VELA::Test::RunProgram({"/usr/sbin/usermod", "--append", "--groups", admins_, user}));

@@ -1,7 +1,11 @@
 #include <gtest/gtest.h>
 
+#include <fstream>
+#include <sys/stat.h>
+
 #include "support/JsonLiteral.h"
 #include "support/TestSupport.h"
+#include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
 
 using VELA::APIRequest;
@@ -39,9 +43,32 @@ TEST(RequestURL, Scheme)
 {
     EXPECT_EQ("https", WithEnv(J(R"({"HTTPS": "on"})")).GetURLProto("x"));
     EXPECT_EQ("https", WithEnv(J(R"({"HTTPS": "ON"})")).GetURLProto("x"));
-    EXPECT_EQ("https", WithEnv(J(R"({"HTTPS": "off", "HTTP_X_FORWARDED_PROTO": "HTTPS"})")).GetURLProto("x"));
     EXPECT_EQ("http", WithEnv(J(R"({"HTTPS": "1"})")).GetURLProto("x"));
     EXPECT_EQ("http", APIRequest().GetURLProto("x"));
+}
+
+// X-Forwarded-Proto counts only when the peer is a configured trusted proxy:
+// a client's own header would make the login cookie Secure, or anything
+// else that follows the scheme.
+TEST(RequestURL, ForwardedSchemeOnlyFromATrustedProxy)
+{
+    VELA::Test::TempDir root;
+    VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
+    VELA::VelaRootReset();
+    const auto proto = [](const char* remote) {
+        Json::Value env = J(R"({"HTTPS": "off", "HTTP_X_FORWARDED_PROTO": "HTTPS"})");
+        env["REMOTE_ADDR"] = remote;
+        return WithEnv(env).GetURLProto("x");
+    };
+    EXPECT_EQ("http", proto("127.0.0.1"));  // no proxy configured, loopback included
+    ASSERT_EQ(0, mkdir((root.Path() + "/etc").c_str(), 0755));
+    ASSERT_EQ(0, mkdir((root.Path() + "/etc/vela").c_str(), 0755));
+    std::ofstream(root.Path() + "/etc/vela/webapi.conf") << "trusted_proxies=\"192.0.2.10\"\n";
+    EXPECT_EQ("https", proto("192.0.2.10"));
+    EXPECT_EQ("http", proto("192.0.2.11"));
+    EXPECT_EQ("http", proto("127.0.0.1"));
+    EXPECT_EQ("http", WithEnv(J(R"({"HTTP_X_FORWARDED_PROTO": "https"})")).GetURLProto("x"));  // no peer
+    VELA::VelaRootReset();
 }
 
 TEST(RequestURL, HostAndPort)

@@ -11,6 +11,7 @@
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <utility>
 #include <vector>
 
 #include "support/TestSupport.h"
@@ -232,9 +233,47 @@ TEST_F(Auth, MalformedCredentialsAreRefusedBeforePam)
         EXPECT_EQ(101, r.Code()) << body << " " << r.body;
         EXPECT_TRUE(r.cookies.empty()) << body;
     }
-    // Credentials in the query string of a GET are refused.
-    EXPECT_EQ(101, Call("login", "", {}, "&account=" + user_ + "&passwd=x").Code());
+    // A GET, even with the account alone in the query string.
+    EXPECT_EQ(101, Call("login", "", {}, "&account=" + user_).Code());
     EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
+}
+
+// The password, or a parameter of an encrypted form that may carry it, in
+// the query string: refused with 403 before anything else, whatever the
+// body holds, though PAM would let the login in.
+TEST_F(Auth, PasswordInTheQueryStringIsRefused)
+{
+    const std::string account = "account=" + user_;
+    const std::vector<std::pair<std::string, std::string>> cases = {
+        {account, "&passwd=s3cret"},
+        {account + "&passwd=s3cret", "&passwd=s3cret"},
+        {account, "&pass%77d=s3cret"},
+        {account, "&passwd"},
+        {account, "&x=1&passwd=&y=2"},
+        {"", "&" + account + "&passwd=s3cret"},  // a GET
+        {account, "&__cIpHeRtExT=QUJD"},
+        {account + "&passwd=s3cret", "&__nEkOtReHpIc=QUJD"},
+    };
+    for (const auto& c : cases) {
+        const Reply r = Call("login", c.first, {}, c.second);
+        EXPECT_EQ(403, r.Code()) << c.second << " " << r.body;
+        EXPECT_TRUE(r.cookies.empty()) << c.second;
+    }
+    EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
+    // Names that only resemble it do not stop a login.
+    EXPECT_EQ(0, Call("login", account + "&passwd=s3cret", {}, "&passwdx=1&xpasswd=1&a=passwd").Code());
+}
+
+// The run-as name of the superuser is no login name: refused as a wrong
+// password even by a PAM service that lets everyone in, and counted.
+TEST_F(Auth, SystemIsNoLoginName)
+{
+    const Reply r = Login("system");
+    EXPECT_EQ(400, r.Code()) << r.body;
+    EXPECT_TRUE(r.cookies.empty());
+    EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
+    Login("system");
+    EXPECT_EQ(407, Login(user_).Code()) << "two refusals from 192.0.2.7 reach login_max_failures";
 }
 
 TEST_F(Auth, KeyAnswersThePublicKey)

@@ -1,5 +1,5 @@
 // The login API "VELA.Auth" (description VELA.Auth.lib): open to callers
-// without a session, run as "system".
+// without a session, run as the superuser (run-as "system").
 //
 //   login   POST account, passwd: checks the password through PAM (Pam.cpp)
 //           behind the brute-force guard (vela/loginguard.h), replaces the
@@ -10,9 +10,16 @@
 //
 // Error codes of this API (besides the framework's 101 for a malformed
 // call):
-//   400  wrong account or password (also: unknown or locked account)
+//   400  wrong account or password (also: unknown or locked account, and
+//        the account name "system", the dispatcher's run-as name of the
+//        superuser, which no login may take: refused without asking PAM)
 //   401  right password, but it has expired and must be changed first
 //   402  the login could not be completed on the server (logged)
+//   403  the password came in the URL: the query string names "passwd" or
+//        one of the encrypted forms that carry it (__cIpHeRtExT,
+//        __nEkOtReHpIc, __tXeTrEhPiC). URLs end up in access logs and
+//        browser histories, so the secret is read from the POST body only;
+//        the refusal is logged without the query string
 //   407  too many failed logins: blocked, {"waitSeconds": <seconds>}
 #include <cstring>
 #include <json/json.h>
@@ -24,6 +31,7 @@
 #include "vela/loginguard.h"
 #include "vela/session.h"
 #include "vela/user.h"
+#include "vela/webapiutil.h"
 #include "webapi/APIError.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
@@ -39,12 +47,14 @@ using VELA::APIResponse;
 constexpr int kErrWrongPassword = 400;
 constexpr int kErrPasswordExpired = 401;
 constexpr int kErrServer = 402;
+constexpr int kErrPasswordInUrl = 403;
 constexpr int kErrBlocked = 407;
 
 constexpr size_t kMaxAccount = VELA_LOGIN_ACCOUNT_MAX;
 constexpr size_t kMaxPassword = 512;  // PAM's own bound of an answer
 
 const char kCookie[] = "id";
+const char kReservedName[] = "the account name \"" VELA_RUNAS_SUPERUSER "\" is reserved";
 
 // Printable bytes only: no NUL, no other control byte, no DEL.
 bool IsPrintable(const char* text, size_t len)
@@ -74,6 +84,40 @@ bool TextParam(const APIRequest* req, const char* name, size_t maxLen, const cha
     return len >= 1 && len <= maxLen && IsPrintable(begin, len);
 }
 
+// The parameters that carry the password: the plain one and the encrypted
+// forms, which may hold it.
+const char* const kSecretParams[] = {"passwd", "__cIpHeRtExT", "__nEkOtReHpIc", "__tXeTrEhPiC"};
+// Longer names are none of them, whatever their percent-encoding.
+constexpr size_t kMaxSecretName = 3 * 16;
+
+// True when the query string `query` names a parameter of kSecretParams.
+// One pass over the text; names are decoded as the form parser decodes
+// them ("%hh", "+"), each only when it is short enough to be one of them.
+bool QueryCarriesSecret(const std::string& query)
+{
+    size_t start = 0;      // of the current pair
+    bool inName = true;    // before the pair's "="
+    for (size_t i = 0; i <= query.size(); ++i) {
+        const bool pairEnd = i == query.size() || query[i] == '&';
+        if (inName && (pairEnd || query[i] == '=')) {
+            inName = false;
+            if (i > start && i - start <= kMaxSecretName) {
+                const std::string name = VELA::WebAPIUtil::URLDecode(query.substr(start, i - start), true);
+                for (const char* secret : kSecretParams) {
+                    if (name == secret) {
+                        return true;
+                    }
+                }
+            }
+        }
+        if (pairEnd) {
+            start = i + 1;
+            inName = true;
+        }
+    }
+    return false;
+}
+
 // A user name PAM and NSS can be asked about: the platform's rule (no "/",
 // ":", control byte, not "." or "..") and no leading "-", which helpers
 // would read as an option.
@@ -91,12 +135,20 @@ bool OverHttps(const APIRequest* req) { return req->GetURLProto("") == "https"; 
 
 void Login(APIRequest* req, APIResponse* resp)
 {
+    const std::string clientIP = req->GetRemoteIP();
+    const Json::Value query = req->GetEnv("QUERY_STRING");
+    if (query.isString() && QueryCarriesSecret(query.asString())) {
+        VELA_LOG(LOG_AUTHPRIV | LOG_WARNING,
+                 "login refused: a password in the query string, from %s; it must come in the POST body",
+                 clientIP.empty() ? "an unknown address" : clientIP.c_str());
+        resp->SetError(kErrPasswordInUrl);
+        return;
+    }
     if (req->GetRequestMethod() != VELA::REQUEST_METHOD_POST) {
         VELA_LOG_ERR("login refused: the credentials must come in a POST body");
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
         return;
     }
-    const std::string clientIP = req->GetRemoteIP();
     const char* accountText = nullptr;
     const char* password = nullptr;
     size_t accountLen = 0;
@@ -133,8 +185,19 @@ void Login(APIRequest* req, APIResponse* resp)
 
     std::string user;
     std::string reason;
-    const VelaAuth::PamResult checked =
-        VelaAuth::CheckPassword(account, password, passwordLen, clientIP, user, reason);
+    // The run-as name of the superuser is never a login name: refused like
+    // a wrong password, and counted as one, without asking PAM. A name PAM
+    // settles on is held to the same rule.
+    VelaAuth::PamResult checked = VelaAuth::PamResult::Denied;
+    if (VELARunAsIsSuperuser(account.c_str())) {
+        reason = kReservedName;
+    } else {
+        checked = VelaAuth::CheckPassword(account, password, passwordLen, clientIP, user, reason);
+        if (checked != VelaAuth::PamResult::Error && VELARunAsIsSuperuser(user.c_str())) {
+            checked = VelaAuth::PamResult::Denied;
+            reason = kReservedName;
+        }
+    }
     if (checked == VelaAuth::PamResult::Denied) {
         VelaLoginGuardFailed(&settings, account.c_str(), clientIP.c_str(), reason.c_str());
         resp->SetError(kErrWrongPassword);
@@ -144,7 +207,7 @@ void Login(APIRequest* req, APIResponse* resp)
         resp->SetError(kErrServer);
         return;
     }
-    VelaLoginGuardSucceeded(account.c_str(), clientIP.c_str());
+    VelaLoginGuardSucceeded(&settings, account.c_str(), clientIP.c_str());
     if (checked == VelaAuth::PamResult::Expired) {
         VELA_LOG(LOG_AUTHPRIV | LOG_NOTICE, "login of \"%s\" refused: the password has expired", user.c_str());
         resp->SetError(kErrPasswordExpired);
