@@ -5,6 +5,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <memory>
+#include <string_view>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -189,17 +190,21 @@ Json::Value ParseToArray(const char* text, const char* separator)
             result.append(text);
             return result;
         }
-        const size_t sepLen = strlen(separator);
-        const char* start = text;
+        // The text is measured once and searched with its length known, so
+        // the split is linear whatever the text (strstr on each rest would
+        // measure the rest again, and sanitizer builds do exactly that).
+        const std::string_view all(text);
+        const std::string_view sep(separator);
+        size_t start = 0;
         for (;;) {
-            const char* hit = strstr(start, separator);
-            if (hit == nullptr) {
-                result.append(std::string(start));
+            const size_t hit = all.find(sep, start);
+            if (hit == std::string_view::npos) {
+                result.append(std::string(all.substr(start)));
                 break;
             }
-            result.append(std::string(start, static_cast<size_t>(hit - start)));
-            start = hit + sepLen;
-            while (*start == ' ' || *start == '\t') {
+            result.append(std::string(all.substr(start, hit - start)));
+            start = hit + sep.size();
+            while (start < all.size() && (all[start] == ' ' || all[start] == '\t')) {
                 ++start;
             }
         }
