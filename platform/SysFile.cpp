@@ -545,6 +545,43 @@ int VLIBCFileGetKeyValue(const char* path, const char* key, char* buf, size_t si
     }
 }
 
+int VELA::ReadKeyValueFile(const char* rawPath, std::vector<std::pair<std::string, std::string>>& out)
+{
+    out.clear();
+    try {
+        const std::string path = ResolvePath(rawPath);
+        if (path.empty()) {
+            VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "invalid path");
+            return -1;
+        }
+        std::string text;
+        int err = 0;
+        if (!ReadFileBounded(path, kMaxKeyValueFile, text, err)) {
+            if (err == ENOENT || err == ENOTDIR) {
+                return 0;
+            }
+            errno = err;
+            VELA_LOG_ERR("cannot read %s: %m", path.c_str());
+            return -1;
+        }
+        std::vector<KeyValueLine> lines;
+        if (!ParseKeyValueText(text, lines)) {
+            VELA_LOG_ERR("%s is corrupt", path.c_str());
+            return -1;
+        }
+        for (const KeyValueLine& line : lines) {
+            if (!line.key.empty()) {
+                out.emplace_back(line.key, line.value);
+            }
+        }
+        return 1;
+    } catch (const std::exception&) {
+        VELA_RECORD_ERROR(VLIBC_ERR_MEMORY, "out of memory");
+        out.clear();
+        return -1;
+    }
+}
+
 int VLIBCFileSetKeyValue(const char* path, const char* key, const char* value)
 {
     try {

@@ -11,6 +11,8 @@
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <utility>
+#include <vector>
 
 #include "vela/log.h"
 #include "vela/sysfile.h"
@@ -33,27 +35,29 @@ constexpr uint64_t kBuckets = 4096;
 constexpr unsigned kMaxWallSeconds = 24u * 3600u;
 constexpr int kCpuGraceSeconds = 5;
 
-void LoadKey(const char* key, long long min, long long max, long long& value)
+using Settings = std::vector<std::pair<std::string, std::string>>;
+
+// `value` from the last line of `key` in `settings`, when that is a number
+// in [min, max]; a bad one is logged and the value kept.
+template <typename T>
+void Setting(const Settings& settings, const char* key, long long min, long long max, T& value)
 {
-    char buf[64];
-    const int found = VLIBCFileGetKeyValue(kConfPath, key, buf, sizeof(buf));
-    if (found == 0) {
-        return;
+    const std::string* text = nullptr;
+    for (const auto& line : settings) {
+        if (line.first == key) {
+            text = &line.second;
+        }
     }
     long long parsed = 0;
-    if (found < 0 || !ParseDecimal(buf, strlen(buf), min, max, parsed)) {
-        VELA_LOG_ERR("%s: %s=\"%.32s\" is not a number from %lld to %lld, keeping %lld", kConfPath, key,
-                     found < 0 ? "" : buf, min, max, value);
+    if (text == nullptr) {
         return;
     }
-    value = parsed;
-}
-
-void LoadKey(const char* key, int min, int max, int& value)
-{
-    long long wide = value;
-    LoadKey(key, static_cast<long long>(min), static_cast<long long>(max), wide);
-    value = static_cast<int>(wide);
+    if (!ParseDecimal(*text, min, max, parsed)) {
+        VELA_LOG_ERR("%s: %s=\"%.32s\" is not a number from %lld to %lld, keeping %lld", kConfPath, key,
+                     text->c_str(), min, max, static_cast<long long>(value));
+        return;
+    }
+    value = static_cast<T>(parsed);
 }
 
 uint64_t KeyedHash(const unsigned char* key, const unsigned char* data, size_t len)
@@ -155,11 +159,15 @@ int OpenSlotFile(unsigned char* key)
 RequestLimits LoadRequestLimits()
 {
     RequestLimits limits;
-    LoadKey("request_cpu_seconds", 1, 86400, limits.cpuSeconds);
-    LoadKey("request_time_seconds", 1, 86400, limits.timeSeconds);
-    LoadKey("request_body_idle_seconds", 1, 3600, limits.bodyIdleSeconds);
-    LoadKey("request_body_min_rate", 1LL, 1LL << 40, limits.bodyMinRate);
-    LoadKey("request_max_per_client", 0, 4096, limits.maxPerClient);
+    Settings settings;
+    if (ReadKeyValueFile(kConfPath, settings) <= 0) {
+        return limits;  // missing (defaults) or unreadable (logged)
+    }
+    Setting(settings, "request_cpu_seconds", 1, 86400, limits.cpuSeconds);
+    Setting(settings, "request_time_seconds", 1, 86400, limits.timeSeconds);
+    Setting(settings, "request_body_idle_seconds", 1, 3600, limits.bodyIdleSeconds);
+    Setting(settings, "request_body_min_rate", 1, 1LL << 40, limits.bodyMinRate);
+    Setting(settings, "request_max_per_client", 0, 4096, limits.maxPerClient);
     return limits;
 }
 

@@ -13,6 +13,10 @@
 // and leave errno describing the failing system call where there is one.
 #pragma once
 
+#include <string>
+#include <utility>
+#include <vector>
+
 #include <stddef.h>
 #include <sys/types.h>
 
@@ -79,6 +83,13 @@ int VLIBCFileCheckKeyValue(const char* path, const char* key, const char* value,
 // -1 on invalid arguments, a corrupt or unreadable file, or a value that
 // does not fit.
 int VLIBCFileGetKeyValue(const char* path, const char* key, char* buf, size_t size);
+
+namespace VELA {
+// Every key="value" line of the file at `path` in one read, in file order
+// (a later line of a key follows its earlier ones). 1 when read, 0 when the
+// file is missing (`out` empty), -1 when it is corrupt or unreadable.
+int ReadKeyValueFile(const char* path, std::vector<std::pair<std::string, std::string>>& out);
+}  // namespace VELA
 
 // Sets `key` to `value` in the file at `path`, creating it (mode 0644) when
 // missing: the first line of the key is replaced, its later lines dropped,
