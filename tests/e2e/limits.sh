@@ -19,7 +19,7 @@ srv_traps
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 mkdir -p "$RUN/www"
 cat >"$ROOT/etc/vela/webapi.conf" <<'CONF'
-request_body_idle_seconds="2"
+request_body_idle_seconds="3"
 request_max_per_client="3"
 CONF
 srv_start "$RUN/www" || { failures=1; exit 1; }
@@ -88,7 +88,10 @@ PY
 slow_body "$TMP/slow1"; p1=$!
 slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
-sleep 0.7
+for _ in $(seq 1 100); do
+  [ "$(cgi_count)" -ge 3 ] && break
+  sleep 0.05
+done
 # A fourth request of the same client, while three are under way.
 call "$URL?api=VELA.Sample&version=1&method=echo"
 expect_status "fourth request at once" 503
@@ -98,7 +101,7 @@ wait "$p1" "$p2" "$p3"
 for f in "$TMP/slow1" "$TMP/slow2" "$TMP/slow3"; do
   grep -q '"code":101' "$f" || fail "slow body: no 101 answer after the idle time: $(head -c 300 "$f")"
 done
-grep -q 'nothing arrived for 2 s' "$RUN/cgi.log" || fail "slow body: no log line"
+grep -q 'nothing arrived for 3 s' "$RUN/cgi.log" || fail "slow body: no log line"
 sleep 0.5
 [ "$(cgi_count)" -eq 0 ] || fail "velascgi processes left: $(cgi_count)"
 # Slots come back when their requests end.

@@ -22,6 +22,9 @@ using Parser = std::function<void(const std::string&)>;
 
 constexpr size_t kLarge = 16u << 20;
 constexpr double kMaxGrowth = 16.0 * 4;
+// Times below this count as this: a parse of a few milliseconds says more
+// about caches, page faults and the machine's load than about the parser.
+constexpr double kFloor = 0.01;
 
 std::string Repeat(const std::string& piece, size_t size)
 {
@@ -53,9 +56,7 @@ double Seconds(const Parser& parse, const std::string& input)
 // seconds instead of running for hours.
 void ExpectLinear(const char* name, const Parser& parse, const std::string& piece, size_t large = kLarge)
 {
-    // Floor the figures so that a parser too fast to time does not turn
-    // clock noise into a ratio.
-    double before = std::max(Seconds(parse, Repeat(piece, large / 256)), 1e-3);
+    double before = std::max(Seconds(parse, Repeat(piece, large / 256)), kFloor);
     for (size_t size = large / 16; size <= large; size *= 16) {
         const std::string input = Repeat(piece, size);
         const unsigned budget = static_cast<unsigned>(before * kMaxGrowth * 2) + 2;
@@ -65,7 +66,7 @@ void ExpectLinear(const char* name, const Parser& parse, const std::string& piec
         ASSERT_GE(child, 0);
         if (child == 0) {
             alarm(budget);
-            const double took = std::max(Seconds(parse, input), 1e-3);
+            const double took = std::max(Seconds(parse, input), kFloor);
             _exit(write(fds[1], &took, sizeof(took)) == sizeof(took) ? 0 : 1);
         }
         close(fds[1]);
