@@ -25,8 +25,15 @@ CONF
 srv_start "$RUN/www" || { failures=1; exit 1; }
 port=${BASE##*:}
 
-# velascgi processes still running (the server's children).
-cgi_count() { pgrep -c -f "^$VELASCGI" || true; }
+# velascgi processes running (by their executable: the process renames
+# itself after the API it serves).
+cgi_count() {
+  local exe n=0
+  for exe in /proc/[0-9]*/exe; do
+    [ "$(readlink "$exe" 2>/dev/null)" = "$VELASCGI" ] && n=$((n + 1))
+  done
+  echo "$n"
+}
 
 # ---- 16 MiB of "&": answered at once (the parser is linear), not after
 # minutes of CPU.
@@ -88,10 +95,12 @@ PY
 slow_body "$TMP/slow1"; p1=$!
 slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
+# Started, then a moment to load and take their slots.
 for _ in $(seq 1 100); do
   [ "$(cgi_count)" -ge 3 ] && break
   sleep 0.05
 done
+sleep 1
 # A fourth request of the same client, while three are under way.
 call "$URL?api=VELA.Sample&version=1&method=echo"
 expect_status "fourth request at once" 503
