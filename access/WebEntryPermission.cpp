@@ -12,6 +12,7 @@
 #include <string.h>
 #include <string>
 
+#include "vela/vlibc.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 
@@ -87,13 +88,8 @@ std::string UserClass(bool isAdmin, const std::string& user)
 // Whole decimal number of an option text; 0 for anything else.
 int DecimalOption(const char* text)
 {
-    if (text == nullptr || *text == '\0') {
-        return 0;
-    }
-    char* end = nullptr;
-    errno = 0;
-    const long value = strtol(text, &end, 10);
-    if (errno != 0 || *end != '\0' || value < 0 || value > INT_MAX) {
+    long long value = 0;
+    if (text == nullptr || !ParseDecimal(text, strlen(text), 0, INT_MAX, value)) {
         return 0;
     }
     return static_cast<int>(value);

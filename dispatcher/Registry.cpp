@@ -14,6 +14,7 @@
 
 #include "vela/log.h"
 #include "vela/sysfile.h"
+#include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
@@ -28,8 +29,6 @@ namespace VELA {
 
 namespace {
 
-// Longer names are refused; no API of the system comes near.
-constexpr size_t kMaxAPIName = 128;
 // Candidate description files tried for one API name.
 constexpr int kMaxCandidates = 4;
 // Bytes of a refused name shown in the log line.
@@ -53,27 +52,8 @@ const Json::Value& Member(const Json::Value& v, const std::string& key)
 }
 
 
-bool IsNameChar(char c)
-{
-    return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '.' || c == '_' ||
-           c == '-';
-}
-
-// An API name from which file names may be built: 1 to kMaxAPIName bytes of
-// ASCII letters, digits, ".", "_" and "-", not starting with "." and without
-// "..". No "/" and no NUL can therefore reach a path.
-bool IsSafeAPIName(const std::string& api)
-{
-    if (api.empty() || api.size() > kMaxAPIName || api[0] == '.' || api.find("..") != std::string::npos) {
-        return false;
-    }
-    for (char c : api) {
-        if (!IsNameChar(c)) {
-            return false;
-        }
-    }
-    return true;
-}
+// An API name from which file names may be built (IsAPIName of vlibc.h).
+bool IsSafeAPIName(const std::string& api) { return IsAPIName(api); }
 
 // `name` cut to kMaxLoggedName bytes, with every byte outside printable
 // ASCII (and the backslash) written as \xHH, for one log line.

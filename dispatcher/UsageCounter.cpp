@@ -108,15 +108,8 @@ std::string FileStem(const std::string& api)
         from = cut + 1;
     }
     const std::string stem = api.substr(0, cut);
-    if (stem.empty() || stem.size() > kMaxStem || stem == "." || stem == "..") {
+    if (stem == "." || stem == ".." || !IsCheckedName(stem, kNameDotted, kMaxStem)) {
         return "";
-    }
-    for (unsigned char c : stem) {
-        const bool ok = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '.' ||
-                        c == '_' || c == '-';
-        if (!ok) {
-            return "";
-        }
     }
     return stem;
 }

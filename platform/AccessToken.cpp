@@ -42,12 +42,6 @@ std::string TokenDir() { return VELA::VelaPath(kTokenDir); }
 
 std::string TokenPath(const std::string& id) { return TokenDir() + "/" + id; }
 
-bool IsNameChar(char c)
-{
-    return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '.' ||
-           c == '_' || c == '-';
-}
-
 // An api or method name as the caller passes it: 1 to kMaxPattern name
 // characters.
 bool IsName(const char* name)
@@ -55,8 +49,7 @@ bool IsName(const char* name)
     if (name == nullptr) {
         return false;
     }
-    const size_t len = strnlen(name, kMaxPattern + 1);
-    return len > 0 && len <= kMaxPattern && std::all_of(name, name + len, IsNameChar);
+    return VELA::IsCheckedName(name, strnlen(name, kMaxPattern + 1), VELA::kNameDotted, kMaxPattern);
 }
 
 bool IsPattern(const std::string& pattern)
@@ -65,7 +58,8 @@ bool IsPattern(const std::string& pattern)
         return false;
     }
     const size_t stem = pattern.back() == '*' ? pattern.size() - 1 : pattern.size();
-    return std::all_of(pattern.begin(), pattern.begin() + static_cast<std::ptrdiff_t>(stem), IsNameChar);
+    // "*" alone stands for every name.
+    return stem == 0 || VELA::IsCheckedName(pattern.data(), stem, VELA::kNameDotted, kMaxPattern);
 }
 
 bool Matches(const std::string& pattern, const char* name)

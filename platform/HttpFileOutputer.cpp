@@ -418,13 +418,17 @@ bool IsOws(char c) { return c == ' ' || c == '\t'; }
 bool ParseDigits(const std::string& text, size_t& pos, uint64_t& value)
 {
     const size_t start = pos;
-    value = 0;
     while (pos < text.size() && text[pos] >= '0' && text[pos] <= '9') {
-        const uint64_t digit = static_cast<uint64_t>(text[pos] - '0');
-        value = value > (UINT64_MAX - digit) / 10 ? UINT64_MAX : value * 10 + digit;
         ++pos;
     }
-    return pos > start;
+    if (pos == start) {
+        return false;
+    }
+    // The run holds digits only: ParseDecimal refuses it only on overflow.
+    long long parsed = 0;
+    value = VELA::ParseDecimal(text.data() + start, pos - start, 0, LLONG_MAX, parsed) ? static_cast<uint64_t>(parsed)
+                                                                                       : UINT64_MAX;
+    return true;
 }
 
 // Reads the Range header `header` against a file of `size` bytes. One

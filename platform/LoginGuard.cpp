@@ -49,24 +49,14 @@ const int kBlockLog = LOG_AUTHPRIV | LOG_NOTICE;
 
 // ---- Settings ------------------------------------------------------------------------
 
-// A decimal number of at most nine digits, nothing else, within min .. max.
+// A decimal number, nothing else, within min .. max.
 bool ParseSetting(const char* text, int min, int max, int& out)
 {
-    const size_t len = strlen(text);
-    if (len == 0 || len > 9) {
+    long long value = 0;
+    if (!VELA::ParseDecimal(text, strlen(text), min, max, value)) {
         return false;
     }
-    int value = 0;
-    for (size_t i = 0; i < len; ++i) {
-        if (text[i] < '0' || text[i] > '9') {
-            return false;
-        }
-        value = value * 10 + (text[i] - '0');
-    }
-    if (value < min || value > max) {
-        return false;
-    }
-    out = value;
+    out = static_cast<int>(value);
     return true;
 }
 

@@ -19,6 +19,7 @@
 
 #include "FileUtil.h"
 #include "SysInternal.h"
+#include "vela/vlibc.h"
 #include "vela/log.h"
 #include "vela/session.h"
 #include "vela/webapiutil.h"
@@ -32,12 +33,6 @@ constexpr int kLockWaitMs = 3000;
 constexpr size_t kMaxDirEntries = 100000;  // bound of one directory scan
 
 const char kBase64Url[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-_";
-
-bool IsBase64UrlChar(unsigned char c)
-{
-    return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' ||
-           c == '_';
-}
 
 long long MonotonicMs()
 {
@@ -106,15 +101,7 @@ bool RandomId(size_t bytes, std::string& out)
 
 bool IsId(const char* text, size_t len)
 {
-    if (text == nullptr || strnlen(text, len + 1) != len) {
-        return false;
-    }
-    for (size_t i = 0; i < len; ++i) {
-        if (!IsBase64UrlChar(static_cast<unsigned char>(text[i]))) {
-            return false;
-        }
-    }
-    return true;
+    return text != nullptr && strnlen(text, len + 1) == len && VELA::IsCheckedName(text, len, VELA::kNameId, len);
 }
 
 bool ListIds(const std::string& dir, size_t len, std::vector<std::string>& ids)

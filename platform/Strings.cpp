@@ -2,6 +2,7 @@
 #include "vela/vlibc.h"
 
 #include <climits>
+#include <cstring>
 
 char* VLIBCStrCaseLower(char* sz)
 {
@@ -60,4 +61,34 @@ bool VELA::ParseDecimal(const char* text, size_t len, long long min, long long m
     }
     out = value;
     return true;
+}
+
+long long VELA::ContentLength(const char* text, size_t len, long long max)
+{
+    if (text == nullptr || len == 0) {
+        return 0;
+    }
+    long long value = 0;
+    return ParseDecimal(text, len, 0, max, value) ? value : -1;
+}
+
+bool VELA::IsCheckedName(const char* name, size_t len, const char* punctuation, size_t maxLen)
+{
+    if (name == nullptr || len == 0 || len > maxLen) {
+        return false;
+    }
+    for (size_t i = 0; i < len; ++i) {
+        const char c = name[i];
+        const bool ok = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
+                        (c != '\0' && punctuation != nullptr && strchr(punctuation, c) != nullptr);
+        if (!ok) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool VELA::IsAPIName(const std::string& api)
+{
+    return IsCheckedName(api, kNameDotted, kMaxAPIName) && api[0] != '.' && api.find("..") == std::string::npos;
 }

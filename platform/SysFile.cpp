@@ -406,19 +406,7 @@ bool ValidKey(const char* key)
     if (key == nullptr) {
         return false;
     }
-    const size_t len = strnlen(key, kMaxKey + 1);
-    if (len == 0 || len > kMaxKey) {
-        return false;
-    }
-    for (size_t i = 0; i < len; ++i) {
-        const unsigned char c = static_cast<unsigned char>(key[i]);
-        const bool ok = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '_' ||
-                        c == '-' || c == '.';
-        if (!ok) {
-            return false;
-        }
-    }
-    return true;
+    return VELA::IsCheckedName(key, strnlen(key, kMaxKey + 1), VELA::kNameDotted, kMaxKey);
 }
 
 bool ValidValue(const char* value)

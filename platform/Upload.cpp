@@ -439,39 +439,20 @@ ProcessUpload& Process()
     return process;
 }
 
-// CONTENT_LENGTH: 1 to 20 decimal digits, no sign or blank, no overflow.
-bool ParseContentLength(const char* text, unsigned long long& out)
-{
-    out = 0;
-    if (text == nullptr || text[0] == '\0') {
-        return false;
-    }
-    for (const char* p = text; *p != '\0'; ++p) {
-        if (*p < '0' || *p > '9') {
-            return false;
-        }
-        const unsigned digit = static_cast<unsigned>(*p - '0');
-        if (out > (ULLONG_MAX - digit) / 10) {
-            return false;
-        }
-        out = out * 10 + digit;
-    }
-    return true;
-}
-
 int ProcessReader(VELA_UPLOAD_READER** reader)
 {
     ProcessUpload& process = Process();
     if (!process.opened) {
         process.opened = true;
         const char* lengthText = getenv("CONTENT_LENGTH");
-        unsigned long long length = 0;
-        if (!ParseContentLength(lengthText, length)) {
+        const long long length =
+            VELA::ContentLength(lengthText, lengthText != nullptr ? strlen(lengthText) : 0, LLONG_MAX);
+        if (length <= 0) {
             VELA_LOG_ERR("upload refused: CONTENT_LENGTH \"%.32s\" is not a length",
                          lengthText != nullptr ? lengthText : "(none)");
             process.openResult = VELA_UPLOAD_ERR_NO_BODY;
         } else {
-            process.openResult = VelaUploadReaderOpen(STDIN_FILENO, length, getenv("CONTENT_TYPE"), &process.reader);
+            process.openResult = VelaUploadReaderOpen(STDIN_FILENO, static_cast<unsigned long long>(length), getenv("CONTENT_TYPE"), &process.reader);
         }
     }
     *reader = process.reader;

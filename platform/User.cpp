@@ -14,6 +14,7 @@
 
 #include "FileUtil.h"
 #include "SysInternal.h"
+#include "vela/vlibc.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/user.h"
@@ -146,19 +147,7 @@ bool ValidPrivilege(const char* priv)
     if (priv == nullptr) {
         return false;
     }
-    const size_t len = strnlen(priv, 129);
-    if (len == 0 || len > 128) {
-        return false;
-    }
-    for (size_t i = 0; i < len; ++i) {
-        const unsigned char c = static_cast<unsigned char>(priv[i]);
-        const bool ok = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '_' ||
-                        c == '-' || c == '.' || c == ':';
-        if (!ok) {
-            return false;
-        }
-    }
-    return true;
+    return VELA::IsCheckedName(priv, strnlen(priv, 129), "_-.:", 128);
 }
 
 struct Address {
@@ -200,11 +189,11 @@ bool AddressMatches(const Address& client, const std::string& rule)
     const int maxBits = net.family == AF_INET ? 32 : 128;
     int bits = maxBits;
     if (slash != std::string::npos) {
-        const std::string len = rule.substr(slash + 1);
-        if (len.empty() || len.size() > 3 || len.find_first_not_of("0123456789") != std::string::npos) {
+        long long prefix = 0;
+        if (!VELA::ParseDecimal(rule.substr(slash + 1), 0, 128, prefix)) {
             return false;
         }
-        bits = atoi(len.c_str());
+        bits = static_cast<int>(prefix);
         // An IPv4-mapped rule ("::ffff:10.0.0.0/104") counts its prefix in
         // IPv6 bits; after mapping it is an IPv4 prefix.
         if (net.family == AF_INET && rule.find(':') != std::string::npos) {

@@ -47,17 +47,7 @@ const char* SignalText(int number)
 
 bool ValidName(const std::string& name)
 {
-    if (name.empty() || name.size() > kMaxName) {
-        return false;
-    }
-    for (char c : name) {
-        const bool ok = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '.' ||
-                        c == '_' || c == '-';
-        if (!ok) {
-            return false;
-        }
-    }
-    return true;
+    return VELA::IsCheckedName(name, VELA::kNameDotted, kMaxName);
 }
 
 // An absolute path without "." or ".." components.
@@ -104,17 +94,8 @@ bool ParsePid(const std::string& text, pid_t& pid)
                        text[end - 1] == '\t')) {
         --end;
     }
-    if (end == 0 || end > 10) {
-        return false;
-    }
     long long value = 0;
-    for (size_t i = 0; i < end; ++i) {
-        if (text[i] < '0' || text[i] > '9') {
-            return false;
-        }
-        value = value * 10 + (text[i] - '0');
-    }
-    if (value <= 1 || value > INT_MAX) {
+    if (!VELA::ParseDecimal(text.data(), end, 2, INT_MAX, value)) {
         return false;
     }
     pid = static_cast<pid_t>(value);

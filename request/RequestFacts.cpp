@@ -55,36 +55,14 @@ long long Integer(const Json::Value& v, long long def)
     if (!v.isString()) {
         return def;
     }
-    // Decimal text: optional blanks, optional sign, digits; what follows the
-    // digits is ignored. No digits at all gives `def`.
-    std::string s = v.asString();
-    size_t i = 0;
-    while (i < s.size() && (s[i] == ' ' || s[i] == '\t')) {
-        ++i;
+    // Decimal text: the whole text a ParseDecimal number, `def` otherwise.
+    const char* begin = nullptr;
+    const char* end = nullptr;
+    long long value = def;
+    if (v.getString(&begin, &end) && ParseDecimal(begin, static_cast<size_t>(end - begin), LLONG_MIN, LLONG_MAX, value)) {
+        return value;
     }
-    bool negative = false;
-    if (i < s.size() && (s[i] == '+' || s[i] == '-')) {
-        negative = s[i] == '-';
-        ++i;
-    }
-    size_t first = i;
-    unsigned long long magnitude = 0;
-    const unsigned long long limit = negative ? static_cast<unsigned long long>(LLONG_MAX) + 1ULL
-                                              : static_cast<unsigned long long>(LLONG_MAX);
-    for (; i < s.size() && s[i] >= '0' && s[i] <= '9'; ++i) {
-        unsigned digit = static_cast<unsigned>(s[i] - '0');
-        if (magnitude > (limit - digit) / 10) {
-            return def;
-        }
-        magnitude = magnitude * 10 + digit;
-    }
-    if (i == first) {
-        return def;
-    }
-    if (negative) {
-        return magnitude == limit ? LLONG_MIN : -static_cast<long long>(magnitude);
-    }
-    return static_cast<long long>(magnitude);
+    return def;
 }
 
 long long CheckedInteger(const Json::Value& v, long long min, long long max, long long def)
@@ -101,6 +79,19 @@ long long CheckedInteger(const Json::Value& v, long long min, long long max, lon
         return value;
     }
     return def;
+}
+
+long long ContentLength(const Json::Value& v, long long max)
+{
+    if (v.isNull()) {
+        return 0;
+    }
+    const char* begin = nullptr;
+    const char* end = nullptr;
+    if (!v.isString() || !v.getString(&begin, &end)) {
+        return -1;
+    }
+    return VELA::ContentLength(begin, static_cast<size_t>(end - begin), max);
 }
 
 }  // namespace RequestFacts

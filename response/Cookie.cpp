@@ -7,6 +7,7 @@
 #include <locale.h>
 #include <type_traits>
 
+#include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 
 namespace VELA {
@@ -19,15 +20,7 @@ static_assert(std::is_integral<time_t>::value && std::is_signed<time_t>::value,
 
 bool IsValidName(const std::string& name)
 {
-    if (name.empty()) {
-        return false;
-    }
-    for (char c : name) {
-        if (!isalnum(static_cast<unsigned char>(c)) && c != '_' && c != '-') {
-            return false;
-        }
-    }
-    return true;
+    return VELA::IsCheckedName(name, VELA::kNameId, name.size());
 }
 
 bool HasLineBreak(const std::string& text)
@@ -39,30 +32,15 @@ bool HasLineBreak(const std::string& text)
 // False on any other character or when the number leaves time_t.
 static bool ParseDecimal(const std::string& text, time_t& out)
 {
-    size_t i = 0;
-    bool negative = false;
-    if (i < text.size() && (text[i] == '+' || text[i] == '-')) {
-        negative = text[i] == '-';
-        ++i;
-    }
-    if (i == text.size()) {
+    // A leading "+" is allowed here besides the "-" of VELA::ParseDecimal.
+    const bool plus = !text.empty() && text[0] == '+';
+    long long value = 0;
+    if (!VELA::ParseDecimal(text.data() + (plus ? 1 : 0), text.size() - (plus ? 1 : 0),
+                            plus ? 0 : std::numeric_limits<time_t>::min(), std::numeric_limits<time_t>::max(),
+                            value)) {
         return false;
     }
-    time_t result = 0;
-    for (; i < text.size(); ++i) {
-        char c = text[i];
-        if (c < '0' || c > '9') {
-            return false;
-        }
-        // Accumulate towards the sign so that the most negative value fits.
-        time_t digit = c - '0';
-        if (__builtin_mul_overflow(result, static_cast<time_t>(10), &result) ||
-            (negative ? __builtin_sub_overflow(result, digit, &result)
-                      : __builtin_add_overflow(result, digit, &result))) {
-            return false;
-        }
-    }
-    out = result;
+    out = static_cast<time_t>(value);
     return true;
 }
 

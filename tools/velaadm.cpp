@@ -14,6 +14,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "vela/vlibc.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/session.h"
@@ -82,17 +83,7 @@ int Fail(const std::string& message)
 // (signs, blanks, trailing text, overflow).
 bool ParseSeconds(const char* text, long long max, long long& out)
 {
-    if (text == nullptr || text[0] < '0' || text[0] > '9') {
-        return false;
-    }
-    errno = 0;
-    char* end = nullptr;
-    const long long value = strtoll(text, &end, 10);
-    if (errno != 0 || end == text || *end != '\0' || value < 1 || value > max) {
-        return false;
-    }
-    out = value;
-    return true;
+    return text != nullptr && VELA::ParseDecimal(text, strlen(text), 1, max, out);
 }
 
 std::string FormatTime(long long t)

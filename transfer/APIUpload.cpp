@@ -4,6 +4,7 @@
 #include <string>
 #include <sys/statvfs.h>
 
+#include "request/RequestFacts.h"
 #include "transfer/APIUploadPrivate.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
@@ -85,29 +86,9 @@ unsigned long long APIUploadPrivate::ContentLength() const
     if (request_ == nullptr) {
         return 0;
     }
-    const Json::Value value = request_->GetEnv("CONTENT_LENGTH");
-    if (value.isUInt64()) {
-        return value.asUInt64();
-    }
-    if (!value.isString()) {
-        return 0;
-    }
-    const std::string text = value.asString();
-    if (text.empty() || text.size() > 20) {
-        return 0;
-    }
-    unsigned long long size = 0;
-    for (char c : text) {
-        if (c < '0' || c > '9') {
-            return 0;
-        }
-        const unsigned digit = static_cast<unsigned>(c - '0');
-        if (size > (ULLONG_MAX - digit) / 10) {
-            return 0;
-        }
-        size = size * 10 + digit;
-    }
-    return size;
+    // Junk answers 0, no body, as an absent or empty CONTENT_LENGTH does.
+    const long long size = RequestFacts::ContentLength(request_->GetEnv("CONTENT_LENGTH"), LLONG_MAX);
+    return size > 0 ? static_cast<unsigned long long>(size) : 0;
 }
 
 bool APIUploadPrivate::CanUploadtoTmp(std::string& dir, unsigned long long size)

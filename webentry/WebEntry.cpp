@@ -38,22 +38,6 @@ const char kCipherToken[] = "__cIpHeRtOkEn";
 // allocated for it; uploads are streamed and not bound by it.
 constexpr long long kMaxPostBody = VELACGI_MAX_PARAM_LINE;
 
-// CONTENT_LENGTH (RFC 9110 section 8.6, 1*DIGIT). The length, or -1 when the
-// value is not a string of digits or exceeds `limit`.
-long long ContentLength(const Json::Value& value, long long limit)
-{
-    if (!value.isString()) {
-        return value.isNull() ? 0 : -1;
-    }
-    const char* begin = nullptr;
-    const char* end = nullptr;
-    long long n = 0;
-    if (!value.getString(&begin, &end) || begin == end) {
-        return 0;
-    }
-    return ParseDecimal(begin, static_cast<size_t>(end - begin), 0, limit, n) ? n : -1;
-}
-
 // RFC 6265 section 4.1.1 cookie-octet: what may stand in a cookie value
 // without ending it or starting another cookie.
 bool IsCookieValue(const std::string& value)
@@ -357,7 +341,7 @@ bool WebEntry::InitPostParam(Json::Value& postParam)
         return false;
     }
     const Json::Value lengthText = request_->GetEnv("CONTENT_LENGTH");
-    const long long length = ContentLength(lengthText, kMaxPostBody);
+    const long long length = RequestFacts::ContentLength(lengthText, kMaxPostBody);
     if (length < 0) {
         VELA_LOG_ERR("body refused: CONTENT_LENGTH \"%.32s\" is not a length of at most %lld bytes",
                      RequestFacts::Text(lengthText).c_str(), kMaxPostBody);

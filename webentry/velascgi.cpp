@@ -59,9 +59,9 @@ void ReplySetupFailed() { Reply(kSetupFailedReply, sizeof(kSetupFailedReply) - 1
 bool LimitRequest()
 {
     const VELA::RequestLimits limits = VELA::LoadRequestLimits();
-    long long length = 0;
     const char* text = getenv("CONTENT_LENGTH");
-    if (text != nullptr && !VELA::ParseDecimal(text, strlen(text), 0, LLONG_MAX, length)) {
+    long long length = VELA::ContentLength(text, text != nullptr ? strlen(text) : 0, LLONG_MAX);
+    if (length < 0) {
         length = 0;  // the front end refuses it later, with the request's own answer
     }
     VELA::ArmRequestLimits(limits, length);

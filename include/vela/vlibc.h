@@ -39,6 +39,29 @@ inline bool ParseDecimal(const std::string& text, long long min, long long max, 
 {
     return ParseDecimal(text.data(), text.size(), min, max, out);
 }
+// CONTENT_LENGTH as every reader of the request body sees it: no variable
+// (null) or empty text is 0, no body (RFC 3875 section 4.1.2); otherwise the
+// whole text must be a ParseDecimal number in [0, max]. -1 for anything
+// else (junk, a sign, blanks, overflow, more than `max`).
+long long ContentLength(const char* text, size_t len, long long max);
+
+// The one check of a name that comes from outside before it names a file,
+// a record or a table entry: 1 to `maxLen` bytes, each an ASCII letter, a
+// digit or one of the bytes of `punctuation` (which never admits NUL).
+bool IsCheckedName(const char* name, size_t len, const char* punctuation, size_t maxLen);
+inline bool IsCheckedName(const std::string& name, const char* punctuation, size_t maxLen)
+{
+    return IsCheckedName(name.data(), name.size(), punctuation, maxLen);
+}
+// The punctuation of the usual profiles: API, method and configuration key
+// names ("._-"), random ids of sessions and tokens (base64url, "-_").
+constexpr const char kNameDotted[] = "._-";
+constexpr const char kNameId[] = "-_";
+constexpr size_t kMaxAPIName = 128;
+// An API name from which file names may be built: 1 to kMaxAPIName bytes of
+// kNameDotted characters, not starting with "." and without "..". No "/"
+// and no NUL can therefore reach a path.
+bool IsAPIName(const std::string& api);
 }  // namespace VELA
 
 // ---- String table ------------------------------------------------------------

@@ -30,4 +30,28 @@ TEST(Strings, ParseDecimal)
     EXPECT_EQ(-3, out);
 }
 
+TEST(Strings, ContentLength)
+{
+    EXPECT_EQ(0, VELA::ContentLength(nullptr, 0, 100));
+    EXPECT_EQ(0, VELA::ContentLength("", 0, 100));
+    EXPECT_EQ(100, VELA::ContentLength("100", 3, 100));
+    EXPECT_EQ(-1, VELA::ContentLength("101", 3, 100));
+    EXPECT_EQ(-1, VELA::ContentLength(" 1", 2, 100));
+    EXPECT_EQ(-1, VELA::ContentLength("-1", 2, 100));
+}
+
+TEST(Strings, CheckedName)
+{
+    EXPECT_TRUE(VELA::IsCheckedName("a-Z_9", VELA::kNameId, 5));
+    EXPECT_FALSE(VELA::IsCheckedName("a-Z_9", VELA::kNameId, 4));
+    EXPECT_FALSE(VELA::IsCheckedName("", VELA::kNameId, 5));
+    EXPECT_FALSE(VELA::IsCheckedName("a.b", VELA::kNameId, 5));
+    EXPECT_FALSE(VELA::IsCheckedName(std::string("a\0b", 3), VELA::kNameId, 5));
+    EXPECT_FALSE(VELA::IsCheckedName("\xc3\xa9", VELA::kNameId, 5));
+    EXPECT_TRUE(VELA::IsAPIName("VELA.Sample-1_x"));
+    EXPECT_FALSE(VELA::IsAPIName(".VELA"));
+    EXPECT_FALSE(VELA::IsAPIName("VELA..x"));
+    EXPECT_FALSE(VELA::IsAPIName(std::string(129, 'a')));
+}
+
 }  // namespace
