@@ -12,12 +12,10 @@
 #include <string.h>
 #include <string>
 
+#include "dispatcher/Refusal.h"
 #include "vela/vlibc.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
-
-// The checks are members of WebEntry; their lines carry its name.
-#define VELA_WEBENTRY_LOG(fmt, ...) VelaLogAt(LOG_ERR, "WebEntry", __LINE__, fmt, ##__VA_ARGS__)
 #include "vela/token.h"
 #include "vela/user.h"
 #include "webapi/APIError.h"
@@ -32,10 +30,15 @@ namespace {
 // Room for any user name the platform hands back, terminator included.
 constexpr size_t kUserNameSize = 493;
 
-// Log watchers and fail2ban-style filters match the token refusal on its
-// whole text, "WebEntry:566 Token Authentication Fail.", so its line number
-// is fixed instead of following this file's layout.
-constexpr int kTokenFailLine = 566;
+// The token refusal's line, "WebEntry:566 Token Authentication Fail.": log
+// watchers and fail2ban-style filters match its whole text, so its source
+// and line are fixed instead of following this file's name and layout.
+struct FixedLogLine {
+    const char* source;
+    int line;
+    const char* text;
+};
+constexpr FixedLogLine kTokenFail = {"WebEntry", 566, "Token Authentication Fail."};
 
 // The API's "authLevel": 0 no login, 1 login required, 2 checked but not
 // enforced. Absent or not a number counts as 1, the safe side.
@@ -132,7 +135,7 @@ int WebEntry::CheckPermission(bool allowTimeout)
     // A check before Initialize (a runner built by hand) still needs a
     // handle for the skip-IP flag and the session facts.
     if (cgi_ == nullptr && (VelaCgiInit("", &cgi_) != 0 || VelaCgiLoadInCookies(cgi_) != 0)) {
-        VELA_WEBENTRY_LOG("cannot set up the CGI handle for the session check");
+        VELA_LOG_ERR("cannot set up the CGI handle for the session check");
     }
 
     const std::string sid = req->GetSessionID();
@@ -207,11 +210,14 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
     const bool allowTimeout = GetMethodAttr(req, "allowTimeout");
     const int code = CheckPermission(allowTimeout);
     const Json::Value& cached = permission_["permResult"][allowTimeout ? 0 : 1];
-    if (cached.isInt() && cached.asInt() == AUTH_RESULT_TOKEN_MISSING && AuthLevel(req) == 1) {
-        VelaLogAt(LOG_ERR, "WebEntry", kTokenFailLine, "Token Authentication Fail.");
+    if (code == WEBAPI_ERR_NONE) {
+        resp->SetError(code);
+    } else if (cached.isInt() && cached.asInt() == AUTH_RESULT_TOKEN_MISSING && AuthLevel(req) == 1) {
+        RefuseAt(resp, code, kTokenFail.source, kTokenFail.line, "%s", kTokenFail.text);
+    } else {
+        VELA_REFUSE(resp, code, "session check refused %s %s (verdict %d)", LogSafe(req->GetAPIClass()).c_str(),
+                    LogSafe(req->GetAPIMethod()).c_str(), cached.isInt() ? cached.asInt() : 0);
     }
-
-    resp->SetError(code, Json::Value());
     switch (code) {
     case WEBAPI_ERR_NONE:
         break;
@@ -249,8 +255,8 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
             }
         }
         if (!allowed) {
-            VELA_WEBENTRY_LOG("user \"%s\" (%s) may not call %s", user.c_str(), cls.c_str(), req->GetAPIClass().c_str());
-            resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
+            VELA_REFUSE(resp, WEBAPI_ERR_NO_PERMISSION, "user \"%s\" (%s) may not call %s", LogSafe(user).c_str(),
+                        cls.c_str(), LogSafe(req->GetAPIClass()).c_str());
             return false;
         }
     }
@@ -258,9 +264,8 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
     const Json::Value privValue = req->GetAPIInfo("appPriv", Json::Value(""));
     const std::string appPriv = privValue.isString() ? privValue.asString() : "";
     if (!appPriv.empty() && VLIBAppPrivUserHas(user.c_str(), appPriv.c_str(), req->GetRemoteIP().c_str()) != 1) {
-        VELA_WEBENTRY_LOG("user \"%s\" lacks the application privilege %s for %s", user.c_str(), appPriv.c_str(),
-                     req->GetAPIClass().c_str());
-        resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
+        VELA_REFUSE(resp, WEBAPI_ERR_NO_PERMISSION, "user \"%s\" lacks the application privilege %s for %s",
+                    LogSafe(user).c_str(), appPriv.c_str(), LogSafe(req->GetAPIClass()).c_str());
         return false;
     }
 
@@ -285,11 +290,8 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
 bool WebEntry::CheckSharingPermission(APIRequest* req, APIResponse* resp)
 {
     // Sharing links are not served yet: refuse, whatever the link says.
-    VELA_WEBENTRY_LOG("sharing links are not available; %s refused",
-                 req != nullptr ? req->GetAPIClass().c_str() : "request");
-    if (resp != nullptr) {
-        resp->SetError(WEBAPI_ERR_NO_PERMISSION, Json::Value());
-    }
+    VELA_REFUSE(resp, WEBAPI_ERR_NO_PERMISSION, "sharing links are not available; %s refused",
+                req != nullptr ? LogSafe(req->GetAPIClass()).c_str() : "request");
     return false;
 }
 

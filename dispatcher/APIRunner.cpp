@@ -19,6 +19,7 @@
 
 #include "dispatcher/APIRunnerPrivate.h"
 #include "dispatcher/ExecContext.h"
+#include "dispatcher/Refusal.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
@@ -253,7 +254,7 @@ bool APIRunner::Run(const Json::Value& request)
 {
     try {
         if (request.isNull()) {
-            response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+            VELA_REFUSE(response_, WEBAPI_ERR_BAD_REQUEST, "request refused: no request JSON");
             return false;
         }
         if (!Initialize(request)) {
@@ -264,16 +265,15 @@ bool APIRunner::Run(const Json::Value& request)
         }
         // Relayed requests are the front end's business, never run from JSON.
         if (request_->HasParam("relay_ds")) {
-            response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+            VELA_REFUSE(response_, WEBAPI_ERR_BAD_REQUEST, "request refused: relayed requests are not run from JSON");
             return false;
         }
         return Process(request_, response_);
     } catch (const std::exception& e) {
-        VELA_LOG_ERR("request failed: %s", e.what());
+        VELA_REFUSE(response_, WEBAPI_ERR_NO_RESPONSE, "request failed: %s", e.what());
     } catch (...) {
-        VELA_LOG_ERR("request failed");
+        VELA_REFUSE(response_, WEBAPI_ERR_NO_RESPONSE, "request failed");
     }
-    response_->SetError(WEBAPI_ERR_NO_RESPONSE);
     return false;
 }
 
@@ -296,7 +296,7 @@ bool APIRunner::Initialize(const Json::Value& request)
 {
     Json::Value env(Json::objectValue);
     if (!InitEnv(env)) {
-        response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+        VELA_REFUSE(response_, WEBAPI_ERR_BAD_REQUEST, "request refused: no environment");
         return false;
     }
     request_->InitEnv(env);
@@ -315,7 +315,7 @@ bool APIRunner::Initialize(const Json::Value& request)
         }
     }
     if (request.empty()) {
-        response_->SetError(WEBAPI_ERR_BAD_REQUEST);
+        VELA_REFUSE(response_, WEBAPI_ERR_BAD_REQUEST, "request refused: empty request JSON");
         return false;
     }
     request_->InitParam(request, false);
@@ -334,7 +334,8 @@ bool APIRunner::Process(APIRequest* req, APIResponse* resp)
         return false;
     }
     if (req->HasParam("relay_ds")) {
-        resp->SetError(WEBAPI_ERR_RELAY_FAILED);
+        VELA_REFUSE(resp, WEBAPI_ERR_RELAY_FAILED, "relaying %s to another service is not available",
+                    LogSafe(req->GetAPIClass()).c_str());
         return false;
     }
     bool result = false;
@@ -361,17 +362,14 @@ bool APIRunner::ProcessEntry(APIRequest* req, APIResponse* resp)
         --compoundDepth_;
         return result;
     }
-    resp->SetError(WEBAPI_ERR_COMPOUND_OR_FORK);
+    VELA_REFUSE(resp, WEBAPI_ERR_COMPOUND_OR_FORK, "%s request without \"compound\"", kEntryAPI);
     return false;
 }
 
 bool APIRunner::HandleCompound(APIRequest* req, APIResponse* resp)
 {
     // Compound requests are not served yet: refuse rather than pretend.
-    VELA_LOG_ERR("compound requests are not available");
-    if (resp != nullptr) {
-        resp->SetError(WEBAPI_ERR_NO_RESPONSE);
-    }
+    VELA_REFUSE(resp, WEBAPI_ERR_NO_RESPONSE, "compound requests are not available");
     return false;
 }
 
@@ -420,8 +418,13 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
     // 5. Handler library and its tables.
     _tag_API_TABLE* table = nullptr;
     _tag_API_CHECK_TABLE* check = nullptr;
-    if (!OpenLib(req, &table, &check) || table == nullptr) {
+    if (!OpenLib(req, &table, &check)) {
+        // OpenLib has logged why.
         resp->SetError(WEBAPI_ERR_LOAD_LIBRARY);
+        return false;
+    }
+    if (table == nullptr) {
+        VELA_REFUSE(resp, WEBAPI_ERR_LOAD_LIBRARY, "library of %s has no API table", LogSafe(api).c_str());
         return false;
     }
 
@@ -443,7 +446,8 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
     }
     const _tag_API_TABLE* entry = FindEntry(table, api, version, method);
     if (entry == nullptr) {
-        resp->SetError(WEBAPI_ERR_METHOD_NOT_IN_TABLE);
+        VELA_REFUSE(resp, WEBAPI_ERR_METHOD_NOT_IN_TABLE, "%s %d %s is not in its library's API table",
+                    LogSafe(api).c_str(), version, LogSafe(method).c_str());
         return false;
     }
     // A handler that answers nothing answers 117.
@@ -451,7 +455,11 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
 
     // 9. Working directory and ids to come back to.
     ExecContext identity;
-    if (!scope.SaveCwd() || !identity.SaveIds()) {
+    if (!scope.SaveCwd()) {
+        return false;  // logged by SaveCwd; the preset 117 answers
+    }
+    if (!identity.SaveIds()) {
+        VELA_REFUSE(resp, WEBAPI_ERR_NO_RESPONSE, "cannot read the ids to come back to");
         return false;
     }
 
@@ -495,7 +503,7 @@ bool APIRunner::SetProcessName(APIRequest* req, APIResponse* resp)
     }
     const std::string api = req->GetAPIClass();
     if (api.empty()) {
-        resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+        VELA_REFUSE(resp, WEBAPI_ERR_BAD_REQUEST, "request refused: no API name");
         return false;
     }
     const std::string method = req->GetAPIMethod();
@@ -511,8 +519,7 @@ bool APIRunner::SetProcessName(APIRequest* req, APIResponse* resp)
     snprintf(ThreadName(), kThreadNameSize, "%s_%d_%s", api.c_str(), version, method.c_str());
     Sanitize(ThreadName());
     if (prctl(PR_SET_NAME, ThreadName(), 0, 0, 0) != 0) {
-        resp->SetError(WEBAPI_ERR_PROCESS_NAME);
-        VELA_LOG_ERR("Set process name fail[%m]");
+        VELA_REFUSE(resp, WEBAPI_ERR_PROCESS_NAME, "Set process name fail[%m]");
         return false;
     }
     return true;

@@ -1,6 +1,6 @@
 // The identity of a handler call, and the scoped guard that runs a few
-// statements with full rights. The call's switches log as the dispatcher
-// (source name APIRunner); the guard logs under the file its user names.
+// statements with full rights. The call's switches log under this file's
+// name; the guard logs under the file its user names.
 #include "dispatcher/ExecContext.h"
 
 #include <algorithm>
@@ -13,9 +13,6 @@
 #include "vela/uploaddir.h"
 #include "vela/user.h"
 #include "webapi/APIUtils.h"
-
-// Lines of the identity switch belong to the dispatcher's log source.
-#define RUNNER_LOG(priority, fmt, ...) VelaLogAt((priority), "APIRunner", __LINE__, fmt, ##__VA_ARGS__)
 
 namespace VELA {
 
@@ -32,10 +29,10 @@ void LogSet(int line, bool ok, const char* what, int r, int e, int s, int err)
 {
     const int saved = errno;
     if (ok) {
-        VelaLogAt(LOG_AUTHPRIV | LOG_INFO, "APIRunner", line, "WARNING: set%s(%d, %d, %d)", what, r, e, s);
+        VelaLogAt(LOG_AUTHPRIV | LOG_INFO, __FILE__, line, "WARNING: set%s(%d, %d, %d)", what, r, e, s);
     } else {
         char buf[256];
-        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, "APIRunner", line, "ERROR: set%s(%d, %d, %d) [%s]", what, r, e, s,
+        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, line, "ERROR: set%s(%d, %d, %d) [%s]", what, r, e, s,
                   strerror_r(err, buf, sizeof(buf)));
     }
     errno = saved;
@@ -142,7 +139,7 @@ bool ExecContext::Prepare(const ExecIdentity& want)
     restore_ = true;
     if (!want.grantByDefault && !want.grantByUser) {
         if (!SwitchTo(Whom::RunAs, want.runAs, want.grantable)) {
-            RUNNER_LOG(LOG_ERR, "grantable failed. [%m]");
+            VELA_LOG(LOG_ERR, "grantable failed. [%m]");
             return false;
         }
         restore_ = want.grantable;
@@ -150,11 +147,11 @@ bool ExecContext::Prepare(const ExecIdentity& want)
     }
     if (!want.grantByDefault) {
         if (want.loginName.empty()) {
-            RUNNER_LOG(LOG_ERR, "grantByUser: failed to get login username.");
+            VELA_LOG(LOG_ERR, "grantByUser: failed to get login username.");
             return false;
         }
         if (!SwitchTo(Whom::Account, want.loginName, want.grantable)) {
-            RUNNER_LOG(LOG_ERR, "grantByUser failed. [%m]");
+            VELA_LOG(LOG_ERR, "grantByUser failed. [%m]");
             return false;
         }
         restore_ = want.grantable;
@@ -162,11 +159,11 @@ bool ExecContext::Prepare(const ExecIdentity& want)
     }
     // grantByDefault: the handler runs with full rights.
     if (egid_ != 0 && !SetResGid(__LINE__, kKeepGid, 0, kKeepGid)) {
-        RUNNER_LOG(LOG_ERR, "grantByDefault failed. [%m]");
+        VELA_LOG(LOG_ERR, "grantByDefault failed. [%m]");
         return false;
     }
     if (euid_ != 0 && !SetResUid(__LINE__, kKeepUid, 0, kKeepUid)) {
-        RUNNER_LOG(LOG_ERR, "grantByDefault failed. [%m]");
+        VELA_LOG(LOG_ERR, "grantByDefault failed. [%m]");
         return false;
     }
     return true;
@@ -192,7 +189,7 @@ void ExecContext::Restore()
     }
     if (groupsDiffer && setgroups(groups_.size(), groups_.data()) != 0) {
         char buf[256];
-        RUNNER_LOG(LOG_AUTHPRIV | LOG_ERR, "ERROR: setgroups(%zu) [%s]", groups_.size(),
+        VELA_LOG(LOG_AUTHPRIV | LOG_ERR, "ERROR: setgroups(%zu) [%s]", groups_.size(),
                    strerror_r(errno, buf, sizeof(buf)));
     }
     SetResGid(__LINE__, rgid_, egid_, sgid_, egid_ == 0);

@@ -10,10 +10,6 @@
 #include "webapi/APIRequest.h"
 #include "webapi/APIRunner.h"
 
-// The library cache is part of the runner: its lines carry the runner's name.
-#define RUNNER_LOG(priority, fmt, ...) VelaLogAt((priority), "APIRunner", __LINE__, fmt, ##__VA_ARGS__)
-#define RUNNER_LOG_ERR(fmt, ...) RUNNER_LOG(LOG_ERR, fmt, ##__VA_ARGS__)
-
 namespace VELA {
 
 bool APIRunner::CacheLib(APIRequest* req, void** handle)
@@ -25,7 +21,7 @@ bool APIRunner::CacheLib(APIRequest* req, void** handle)
         const Json::Value lib = req->GetAPIInfo("lib", "");
         const std::string path = lib.isString() ? lib.asString() : std::string();
         if (path.empty()) {
-            RUNNER_LOG_ERR("library path empty");
+            VELA_LOG_ERR("library path empty");
             return false;
         }
         auto cached = libCache_.find(path);
@@ -41,7 +37,7 @@ bool APIRunner::CacheLib(APIRequest* req, void** handle)
                 *handle = nullptr;
             }
             const char* err = dlerror();
-            RUNNER_LOG_ERR("cannot open library: %s. error = %s", path.c_str(), err ? err : "");
+            VELA_LOG_ERR("cannot open library: %s. error = %s", path.c_str(), err ? err : "");
             return false;
         }
         libCache_[path] = opened;
@@ -63,12 +59,12 @@ bool APIRunner::GetTableFunc(void* handle, _tag_API_TABLE** table)
     void* sym = dlsym(handle, "GetAPITable");
     const char* err = dlerror();
     if (err || !sym) {
-        RUNNER_LOG(LOG_DEBUG, "cannot load table: %s", err ? err : "GetAPITable is null");
+        VELA_LOG(LOG_DEBUG, "cannot load table: %s", err ? err : "GetAPITable is null");
         return false;
     }
     _tag_API_TABLE* found = reinterpret_cast<GetAPITableFn>(sym)();
     if (!found) {
-        RUNNER_LOG_ERR("cannot get api table");
+        VELA_LOG_ERR("cannot get api table");
         return false;
     }
     *table = found;
@@ -87,7 +83,7 @@ bool APIRunner::GetCheckTableFunc(void* handle, _tag_API_CHECK_TABLE** check)
     }
     _tag_API_CHECK_TABLE* found = reinterpret_cast<GetAPICheckTableFn>(sym)();
     if (!found) {
-        RUNNER_LOG_ERR("cannot get api check table");
+        VELA_LOG_ERR("cannot get api check table");
         return false;
     }
     *check = found;
@@ -97,7 +93,7 @@ bool APIRunner::GetCheckTableFunc(void* handle, _tag_API_CHECK_TABLE** check)
 bool APIRunner::OpenLib(APIRequest* req, _tag_API_TABLE** table, _tag_API_CHECK_TABLE** check)
 {
     if (!req || !table) {
-        RUNNER_LOG_ERR("Bad parameters");
+        VELA_LOG_ERR("Bad parameters");
         return false;
     }
     void* handle = nullptr;
@@ -110,7 +106,7 @@ bool APIRunner::OpenLib(APIRequest* req, _tag_API_TABLE** table, _tag_API_CHECK_
         GetCheckTableFunc(handle, check);
     }
     if (!GetTableFunc(handle, table)) {
-        RUNNER_LOG_ERR("Get API Table Fail");
+        VELA_LOG_ERR("Get API Table Fail");
         return false;
     }
     return true;

@@ -6,12 +6,12 @@
 // resolved against the working directory, the web-API directory. API names
 // come from the client: they are checked for length and characters before
 // any file name is built from them.
-#include <cstdio>
 #include <exception>
 #include <glob.h>
 #include <set>
 #include <string>
 
+#include "dispatcher/Refusal.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
@@ -21,18 +21,12 @@
 #include "webapi/APIRunner.h"
 #include "webapi/JsonUtil.h"
 
-// The registry is part of the runner: its lines carry the runner's name.
-#define RUNNER_LOG(priority, fmt, ...) VelaLogAt((priority), "APIRunner", __LINE__, fmt, ##__VA_ARGS__)
-#define RUNNER_LOG_ERR(fmt, ...) RUNNER_LOG(LOG_ERR, fmt, ##__VA_ARGS__)
-
 namespace VELA {
 
 namespace {
 
 // Candidate description files tried for one API name.
 constexpr int kMaxCandidates = 4;
-// Bytes of a refused name shown in the log line.
-constexpr size_t kMaxLoggedName = 64;
 
 const Json::Value& NullValue()
 {
@@ -54,28 +48,6 @@ const Json::Value& Member(const Json::Value& v, const std::string& key)
 
 // An API name from which file names may be built (IsAPIName of vlibc.h).
 bool IsSafeAPIName(const std::string& api) { return IsAPIName(api); }
-
-// `name` cut to kMaxLoggedName bytes, with every byte outside printable
-// ASCII (and the backslash) written as \xHH, for one log line.
-std::string Printable(const std::string& name)
-{
-    std::string out;
-    const size_t n = name.size() < kMaxLoggedName ? name.size() : kMaxLoggedName;
-    for (size_t i = 0; i < n; ++i) {
-        const unsigned char c = static_cast<unsigned char>(name[i]);
-        if (c < 0x20 || c >= 0x7f || c == '\\') {
-            char hex[5];
-            snprintf(hex, sizeof(hex), "\\x%02x", c);
-            out += hex;
-        } else {
-            out += static_cast<char>(c);
-        }
-    }
-    if (name.size() > n) {
-        out += "...";
-    }
-    return out;
-}
 
 }  // namespace
 
@@ -143,7 +115,7 @@ static void AddDescriptions(APIRunner& runner, Json::Value& table, const Json::V
         }
         Json::Value desc = *it;
         if (!runner.CheckLibDescription(desc)) {
-            RUNNER_LOG_ERR("WebAPI description %s is not valid.", Printable(name).c_str());
+            VELA_LOG_ERR("WebAPI description %s is not valid.", LogSafe(name).c_str());
             continue;
         }
         table[name] = runner.ApplyLibDef(desc);
@@ -166,7 +138,7 @@ bool APIRunner::InitLibDesc(Json::Value& table)
         for (size_t i = 0; i < files.gl_pathc; ++i) {
             Json::Value file;
             if (!WebAPIUtil::ReadJsonFile(files.gl_pathv[i], file) || !file.isObject()) {
-                RUNNER_LOG_ERR("WebAPI description file %s is not valid", files.gl_pathv[i]);
+                VELA_LOG_ERR("WebAPI description file %s is not valid", files.gl_pathv[i]);
                 continue;
             }
             AddDescriptions(*this, table, file, added);
@@ -185,7 +157,7 @@ bool APIRunner::InitLibDesc(Json::Value& table, const std::string& api)
         return false;
     }
     if (!IsSafeAPIName(api)) {
-        RUNNER_LOG_ERR("WebAPI name refused: \"%s\"", Printable(api).c_str());
+        VELA_LOG_ERR("WebAPI name refused: \"%s\"", LogSafe(api).c_str());
         return false;
     }
     if (!table.isNull() && !table.isObject()) {
@@ -213,12 +185,12 @@ bool APIRunner::InitLibDesc(Json::Value& table, const std::string& api)
             dot = next;
         }
         if (chosen.empty()) {
-            RUNNER_LOG_ERR("WebAPI %s is not valid", api.c_str());
+            VELA_LOG_ERR("WebAPI %s is not valid", api.c_str());
             return false;
         }
         Json::Value file;
         if (!WebAPIUtil::ReadJsonFile(chosen, file) || !file.isObject()) {
-            RUNNER_LOG_ERR("WebAPI description file %s is not valid", chosen.c_str());
+            VELA_LOG_ERR("WebAPI description file %s is not valid", chosen.c_str());
             return false;
         }
         std::set<std::string> added;
@@ -316,11 +288,18 @@ bool APIRunner::CheckRequestParam(APIRequest* req, APIResponse* resp)
         const int version = req->GetAPIVersion();
         const std::string method = req->GetAPIMethod();
         if (api.empty() || version < 1 || method.empty()) {
+            // A call without API, version or method is refused before
+            // anything is read or logged.
             resp->SetError(WEBAPI_ERR_BAD_REQUEST);
             return false;
         }
-        if (!InitLibDesc(libDesc_, req) || !libDesc_.isMember(api)) {
+        if (!InitLibDesc(libDesc_, req)) {
+            // InitLibDesc has logged why (name refused, no file, file invalid).
             resp->SetError(WEBAPI_ERR_NO_SUCH_API);
+            return false;
+        }
+        if (!libDesc_.isMember(api)) {
+            VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_API, "WebAPI %s is not described", LogSafe(api).c_str());
             return false;
         }
         const Json::Value& desc = Member(libDesc_, api);
@@ -328,7 +307,8 @@ bool APIRunner::CheckRequestParam(APIRequest* req, APIResponse* resp)
         const Json::Value& maxVersion = Member(desc, "maxVersion");
         if (!minVersion.isInt() || !maxVersion.isInt() || version < minVersion.asInt() ||
             version > maxVersion.asInt()) {
-            resp->SetError(WEBAPI_ERR_NOT_SUPPORTED_VERSION);
+            VELA_REFUSE(resp, WEBAPI_ERR_NOT_SUPPORTED_VERSION, "WebAPI %s has no version %d",
+                        LogSafe(api).c_str(), version);
             return false;
         }
         // Any member of an object entry makes its method callable, though
@@ -345,20 +325,23 @@ bool APIRunner::CheckRequestParam(APIRequest* req, APIResponse* resp)
             }
         }
         if (!listed) {
-            resp->SetError(WEBAPI_ERR_NO_SUCH_METHOD);
+            VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_METHOD, "WebAPI %s version %d has no method \"%s\"",
+                        LogSafe(api).c_str(), version, LogSafe(method).c_str());
             return false;
         }
         if (!GetMethodAttr(api, version, method, "allowUpload") && req->IsUploadRequest()) {
-            resp->SetError(WEBAPI_ERR_UPLOAD_NOT_ALLOWED);
+            VELA_REFUSE(resp, WEBAPI_ERR_UPLOAD_NOT_ALLOWED, "WebAPI %s %d %s takes no upload",
+                        LogSafe(api).c_str(), version, LogSafe(method).c_str());
             return false;
         }
         if (!GetMethodAttr(api, version, method, "allowDemo") && req->IsDemoMode()) {
-            resp->SetError(WEBAPI_ERR_DEMO_MODE);
+            VELA_REFUSE(resp, WEBAPI_ERR_DEMO_MODE, "WebAPI %s %d %s is not served in demo mode",
+                        LogSafe(api).c_str(), version, LogSafe(method).c_str());
             return false;
         }
         return true;
-    } catch (const std::exception&) {
-        resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+    } catch (const std::exception& e) {
+        VELA_REFUSE(resp, WEBAPI_ERR_BAD_REQUEST, "request check failed: %s", e.what());
         return false;
     }
 }

@@ -6,6 +6,7 @@
 #include <regex.h>
 #include <strings.h>
 
+#include "request/EncryptedParams.h"
 #include "request/RequestFacts.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
@@ -20,14 +21,6 @@ const char kSharingSidCookie[] = "sharing_sid";
 namespace {
 
 const char* const kCategories[] = {"environ", "cookie", "reqLib", "session", "param", "attr", "url", "userAgent"};
-
-// Encrypted-parameter member names (protocol literals).
-const char kCipherText[] = "__cIpHeRtExT";
-const char kAESToken[] = "__nEkOtReHpIc";
-const char kAESCipher[] = "__tXeTrEhPiC";
-
-// Nesting of "webapi" objects that DecryptParam follows.
-const int kMaxDecryptDepth = 8;
 
 const char kMobilePattern[] =
     "(SymbianOS|Windows CE|PalmOS|BlackBerry|Vodafone|Opera Mobi|Opera Mini|UP\\.Browser|AvantGo|"
@@ -403,65 +396,8 @@ uid_t APIRequestPrivate::GetLoginUID()
 
 // ---- Encrypted parameters --------------------------------------------------
 
-static bool DecryptParamAt(APIRequestPrivate& self, Json::Value& params, int depth)
-{
-    if (!params.isObject()) {
-        return true;
-    }
-    if (params.isMember(kCipherText)) {
-        std::string text = RequestFacts::Text(params[kCipherText]);
-        params.removeMember(kCipherText);
-        if (VelaCgiDecryptParam(text) != 0) {
-            return false;
-        }
-        if (!WebAPIUtil::strPairToJsonObj(text, params, true, true)) {
-            return false;
-        }
-    }
-    if (!params.empty() && !self.DecryptAESParam(params)) {
-        return false;
-    }
-    if (params.isMember("webapi")) {
-        if (depth >= kMaxDecryptDepth) {
-            VELA_LOG_ERR("encrypted parameters nested deeper than %d levels", kMaxDecryptDepth);
-            return false;
-        }
-        return DecryptParamAt(self, params["webapi"], depth + 1);
-    }
-    return true;
-}
+bool APIRequestPrivate::DecryptParam(Json::Value& params) { return EncryptedParams::DecryptMembers(params); }
 
-bool APIRequestPrivate::DecryptParam(Json::Value& params)
-{
-    return DecryptParamAt(*this, params, 0);
-}
-
-bool APIRequestPrivate::DecryptAESParam(Json::Value& params)
-{
-    if (!params.isObject() || !params.isMember(kAESToken) || !params.isMember(kAESCipher)) {
-        return true;
-    }
-    const std::string token = RequestFacts::Text(params[kAESToken]);
-    const std::string cipher = RequestFacts::Text(params[kAESCipher]);
-    params.removeMember(kAESToken);
-    params.removeMember(kAESCipher);
-    if (token.empty() || cipher.empty()) {
-        return false;
-    }
-    char key[33] = {0};
-    if (VELACloudServiceHubtokenGenerateToken(token.c_str(), key, sizeof(key)) < 0) {
-        explicit_bzero(key, sizeof(key));
-        return false;
-    }
-    key[sizeof(key) - 1] = '\0';
-    std::string plain;
-    const bool decrypted = CredRequestUtil::GetDecryptAESString(key, cipher, plain);
-    explicit_bzero(key, sizeof(key));
-    bool parsed = decrypted && WebAPIUtil::strPairToJsonObj(plain, params, true, true);
-    if (!plain.empty()) {
-        explicit_bzero(&plain[0], plain.size());
-    }
-    return parsed;
-}
+bool APIRequestPrivate::DecryptAESParam(Json::Value& params) { return EncryptedParams::DecryptAES(params); }
 
 }  // namespace VELA

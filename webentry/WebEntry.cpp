@@ -13,6 +13,7 @@
 #include <unistd.h>
 
 #include "request/APIRequestPrivate.h"
+#include "request/EncryptedParams.h"
 #include "request/RequestFacts.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
@@ -30,9 +31,6 @@
 namespace VELA {
 
 namespace {
-
-const char kCipherText[] = "__cIpHeRtExT";
-const char kCipherToken[] = "__cIpHeRtOkEn";
 
 // A form-encoded body larger than this is refused before anything is
 // allocated for it; uploads are streamed and not bound by it.
@@ -360,43 +358,15 @@ bool WebEntry::InitPostParam(Json::Value& postParam)
 
 bool WebEntry::DetectAndDecryptParamLine(const std::string& line, Json::Value& out)
 {
-    std::string plain = line;
-    if (!VelaCgiDetectAndDecryptParamLine(plain)) {
-        return false;
-    }
-    if (!WebAPIUtil::strPairToJsonObj(plain, out, true, true)) {
-        return false;
-    }
-    if (!out.empty() && !DecryptAESParam(out)) {
-        VELA_LOG_ERR("parameters refused: __tXeTrEhPiC does not decrypt");
-        return false;
-    }
-    Json::Value* webapi = out.isObject() && out.isMember("webapi") ? &out["webapi"] : nullptr;
-    if (webapi != nullptr && webapi->isObject() && webapi->isMember(kCipherText)) {
-        const std::string cipher = RequestFacts::Text((*webapi)[kCipherText]);
-        webapi->removeMember(kCipherText);
-        DecryptParam(cipher, *webapi);
-        webapi->removeMember(kCipherToken);
-    }
-    return true;
+    return EncryptedParams::DecryptLine(line, out);
 }
 
 bool WebEntry::DecryptParam(const std::string& cipher, Json::Value& out)
 {
-    std::string plain = cipher;
-    if (VelaCgiDecryptParam(plain) != 0) {
-        return false;
-    }
-    if (!WebAPIUtil::strPairToJsonObj(plain, out, true, true)) {
-        return false;
-    }
-    return out.empty() || DecryptAESParam(out);
+    return EncryptedParams::DecryptCipher(cipher, out);
 }
 
-bool WebEntry::DecryptAESParam(Json::Value& param)
-{
-    return request_->GetPrivate()->DecryptAESParam(param);
-}
+bool WebEntry::DecryptAESParam(Json::Value& param) { return EncryptedParams::DecryptAES(param); }
 
 // The identity of an upload whose query string lacks it comes from the form
 // fields before the first file part. The platform keeps one multipart reader

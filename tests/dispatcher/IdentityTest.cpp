@@ -171,7 +171,7 @@ TEST_F(Identity, GrantableSwitchComesBackToRoot)
         EXPECT_EQ(Triple(g, g, g), seen["gid"]) << method;
         EXPECT_TRUE(HasGroup(seen, account_.suppGid)) << method;
         EXPECT_EQ(rootIds_, report["after"]) << method;
-        EXPECT_TRUE(Logged(report["log"].asString(), kAuthInfo, "APIRunner:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n"))
+        EXPECT_TRUE(Logged(report["log"].asString(), kAuthInfo, "ExecContext:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n"))
             << report["log"].asString();
     }
 }
@@ -191,7 +191,7 @@ TEST_F(Identity, NotGrantableStaysTheUser)
     });
     EXPECT_EQ(Json::Value(true), again["result"]);
     EXPECT_EQ(Triple(u, u, u), again["answer"]["data"]["uid"]);
-    EXPECT_TRUE(Logged(again["log"].asString(), kAuthErr, "APIRunner:\\d+ ERROR: setresuid\\(-1, 0, -1\\) \\[.+\\]\n"))
+    EXPECT_TRUE(Logged(again["log"].asString(), kAuthErr, "ExecContext:\\d+ ERROR: setresuid\\(-1, 0, -1\\) \\[.+\\]\n"))
         << again["log"].asString();
 }
 
@@ -202,8 +202,8 @@ TEST_F(Identity, RefusedSwitchSkipsTheHandler)
         const char* method;
         const char* line;
     } cases[] = {
-        {"byUser", "APIRunner:\\d+ grantByUser: failed to get login username\\.\n"},
-        {"unknownUser", "APIRunner:\\d+ grantable failed\\. \\[.*\\]\n"},
+        {"byUser", "ExecContext:\\d+ grantByUser: failed to get login username\\.\n"},
+        {"unknownUser", "ExecContext:\\d+ grantable failed\\. \\[.*\\]\n"},
     };
     for (const auto& c : cases) {
         const Json::Value report = RunInChild(IdsCall(c.method));
@@ -223,7 +223,7 @@ TEST_F(Identity, SessionUserSystemNeverRunsAsRoot)
     const Json::Value& seen = report["answer"]["data"];
     EXPECT_NE(Triple(0, 0, 0), seen["uid"]) << report["answer"];
     if (!seen.isMember("uid")) {
-        EXPECT_TRUE(Logged(report["log"].asString(), LOG_ERR, "APIRunner:\\d+ grantByUser failed\\. \\[.*\\]\n"))
+        EXPECT_TRUE(Logged(report["log"].asString(), LOG_ERR, "ExecContext:\\d+ grantByUser failed\\. \\[.*\\]\n"))
             << report["log"].asString();
     }
     EXPECT_EQ(rootIds_, report["after"]);
@@ -243,8 +243,8 @@ TEST_F(Identity, GrantByDefaultRunsAsRoot)
     EXPECT_EQ(Triple(0, u, 0), report["after"]["uid"]);
     EXPECT_EQ(Triple(0, g, 0), report["after"]["gid"]);
     const std::string log = report["log"].asString();
-    EXPECT_TRUE(Logged(log, kAuthInfo, "APIRunner:\\d+ WARNING: setresgid\\(-1, 0, -1\\)\n")) << log;
-    EXPECT_TRUE(Logged(log, kAuthInfo, "APIRunner:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n")) << log;
+    EXPECT_TRUE(Logged(log, kAuthInfo, "ExecContext:\\d+ WARNING: setresgid\\(-1, 0, -1\\)\n")) << log;
+    EXPECT_TRUE(Logged(log, kAuthInfo, "ExecContext:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n")) << log;
 }
 
 // An upload to "upload" (runs as the account) whose form names the method

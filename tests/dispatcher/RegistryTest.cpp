@@ -349,4 +349,29 @@ TEST_F(Registry, HostileNamesReachNoFile)
     EXPECT_EQ(0, Check(runner, Call("R.M", 1, "get")));
 }
 
+
+// A version outside minVersion..maxVersion and a method not listed for the
+// version are each refused with one line, stamped with the registry's own
+// name, that names what the client sent.
+TEST_F(Registry, VersionAndMethodRefusalsLogOnce)
+{
+    WriteJson("R.M.lib", One("R.M", Desc("r.so")));
+    TableRunner runner;
+    const struct {
+        Json::Value request;
+        int code;
+        const char* named;
+    } cases[] = {
+        {Call("R.M", 7, "get"), WEBAPI_ERR_NOT_SUPPORTED_VERSION, "R.M has no version 7"},
+        {Call("R.M", 1, "no\nsuch"), WEBAPI_ERR_NO_SUCH_METHOD, "R.M version 1 has no method \"no\\x0asuch\""},
+    };
+    for (const auto& c : cases) {
+        VELA::Test::LogCapture log;
+        EXPECT_EQ(c.code, Check(runner, c.request)) << c.named;
+        ASSERT_EQ(1u, log.Lines().size()) << c.named;
+        EXPECT_EQ(0u, log.Lines()[0].rfind("Registry:", 0)) << log.Lines()[0];
+        EXPECT_NE(std::string::npos, log.Lines()[0].find(c.named)) << log.Lines()[0];
+    }
+}
+
 }  // namespace
