@@ -214,6 +214,10 @@ bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
         resp->SetError(code);
     } else if (cached.isInt() && cached.asInt() == AUTH_RESULT_TOKEN_MISSING && AuthLevel(req) == 1) {
         RefuseAt(resp, code, kTokenFail.source, kTokenFail.line, "%s", kTokenFail.text);
+    } else if (AuthLevel(req) == 2) {
+        // Checked but not required: the call goes on, so this is no refusal
+        // and logs nothing.
+        resp->SetError(code);
     } else {
         VELA_REFUSE(resp, code, "session check refused %s %s (verdict %d)", LogSafe(req->GetAPIClass()).c_str(),
                     LogSafe(req->GetAPIMethod()).c_str(), cached.isInt() ? cached.asInt() : 0);
