@@ -11,7 +11,7 @@ packages=(
   libgtest-dev libgmock-dev googletest
   libbenchmark-dev
   clang libclang-rt-dev
-  wrk curl
+  wrk curl python3
   lighttpd media-types
   chromium
 )
