@@ -25,12 +25,15 @@ CONF
 srv_start "$RUN/www" || { failures=1; exit 1; }
 port=${BASE##*:}
 
-# velascgi processes running (by their executable: the process renames
-# itself after the API it serves).
+# velascgi processes this test's lighttpd is running (by their executable:
+# the process renames itself after the API it serves; by their parent: other
+# tests run servers of their own at the same time).
 cgi_count() {
-  local exe n=0
-  for exe in /proc/[0-9]*/exe; do
-    [ "$(readlink "$exe" 2>/dev/null)" = "$VELASCGI" ] && n=$((n + 1))
+  local dir ppid n=0
+  for dir in /proc/[0-9]*; do
+    [ "$(readlink "$dir/exe" 2>/dev/null)" = "$VELASCGI" ] || continue
+    ppid=$(awk '/^PPid:/ { print $2 }' "$dir/status" 2>/dev/null)
+    [ "$ppid" = "$LPID" ] && n=$((n + 1))
   done
   echo "$n"
 }
