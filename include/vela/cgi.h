@@ -9,18 +9,7 @@
 #include <stddef.h>
 #include <string>
 
-// Verdict of the login-session check (VelaCgiIsAuthorizedEx).
-enum _tag_authorized_result_ : int {
-    AUTH_RESULT_AUTHORIZED = 1,       // valid session
-    AUTH_RESULT_TIMEOUT = -1,         // idle timeout passed
-    AUTH_RESULT_NO_SESSION = -2,      // no such session
-    AUTH_RESULT_REJECTED = -3,        // refused by the platform
-    AUTH_RESULT_NONE = -4,            // no verdict was ever stored
-    AUTH_RESULT_UNAUTHENTICATED = -5, // not authenticated
-    AUTH_RESULT_TOKEN_MISSING = -7,   // anti-forgery token missing or wrong
-    AUTH_RESULT_IP_MISMATCH = -8,     // client address differs from the session's
-};
-typedef enum _tag_authorized_result_ AUTHORIZED_RESULT;
+#include "vela/authresult.h"
 
 // Handle of the CGI library: the parsed cookies of the process environment
 // and what later calls fill in.

@@ -13,7 +13,7 @@
 #include <string>
 #include <sys/types.h>
 
-#include "vela/cgi.h"
+#include "vela/authresult.h"
 #include "webapi/APIParameter.h"
 
 namespace VELA {

@@ -1,4 +1,4 @@
-#include "ParamTestUtil.h"
+#include "support/ParamTestUtil.h"
 
 namespace VELA {
 namespace {

@@ -2,7 +2,7 @@
 #include <thread>
 #include <vector>
 
-#include "ParamTestUtil.h"
+#include "support/ParamTestUtil.h"
 #include "support/TestSupport.h"
 #include "webapi/APIValidator.h"
 

@@ -1,6 +1,6 @@
 #include <memory>
 
-#include "ParamTestUtil.h"
+#include "support/ParamTestUtil.h"
 #include "webapi/APIRequest.h"
 
 namespace VELA {

@@ -1,4 +1,4 @@
-// Helpers shared by the parameter tests.
+// Helpers shared by the tests of typed parameters and their getters.
 #pragma once
 
 #include <gtest/gtest.h>
