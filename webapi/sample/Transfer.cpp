@@ -117,6 +117,44 @@ bool IsDownloadName(std::string const& name)
     return name.size() <= 128 && VELA::APIValidator::CheckRegex(name, "^[A-Za-z0-9_-][A-Za-z0-9._-]*$");
 }
 
+// Describes each parameter of `params` that is a stored file (its value is
+// a path in `stored`) with its checksum, and copies the other parameters
+// into `fields`. False when a stored file could not be read.
+bool DescribeUpload(const Json::Value& params, const Json::Value& stored, Json::Value& files, Json::Value& fields)
+{
+    bool readable = true;
+    for (const std::string& key : params.getMemberNames()) {
+        const Json::Value& value = params[key];
+        bool isFile = false;
+        for (const Json::Value& path : stored) {
+            isFile = isFile || value == path;
+        }
+        if (!isFile) {
+            continue;
+        }
+        unsigned long long size = 0;
+        uint32_t crc = 0;
+        readable = readable && Checksum(value.asString(), size, crc);
+        Json::Value file(Json::objectValue);
+        file["field"] = key;
+        file["name"] = params.get(key + "_name", "").asString();
+        file["size"] = static_cast<Json::UInt64>(size);
+        file["cksum"] = static_cast<Json::UInt>(crc);
+        files.append(file);
+    }
+    for (const std::string& key : params.getMemberNames()) {
+        bool fileEntry = false;
+        for (const Json::Value& file : files) {
+            const std::string field = file["field"].asString();
+            fileEntry = fileEntry || key == field || key == field + "_name";
+        }
+        if (!fileEntry) {
+            fields[key] = params[key];
+        }
+    }
+    return readable;
+}
+
 }  // namespace
 
 void Upload(APIRequest* req, APIResponse* resp)
@@ -126,42 +164,9 @@ void Upload(APIRequest* req, APIResponse* resp)
     VELA::APIUpload upload(req);
     const int rc = upload.GetUploadAll(params, &stored);
 
-    // Which parameters are stored files: exactly those whose value is a path
-    // the reader reported.
     Json::Value files(Json::arrayValue);
     Json::Value fields(Json::objectValue);
-    bool readable = true;
-    if (rc == VELA::UPLOAD_RESULT_SUCCESS) {
-        for (const std::string& key : params.getMemberNames()) {
-            const Json::Value& value = params[key];
-            bool isFile = false;
-            for (const Json::Value& path : stored) {
-                isFile = isFile || value == path;
-            }
-            if (!isFile) {
-                continue;
-            }
-            unsigned long long size = 0;
-            uint32_t crc = 0;
-            readable = readable && Checksum(value.asString(), size, crc);
-            Json::Value file(Json::objectValue);
-            file["field"] = key;
-            file["name"] = params.get(key + "_name", "").asString();
-            file["size"] = static_cast<Json::UInt64>(size);
-            file["cksum"] = static_cast<Json::UInt>(crc);
-            files.append(file);
-        }
-        for (const std::string& key : params.getMemberNames()) {
-            bool fileEntry = false;
-            for (const Json::Value& file : files) {
-                const std::string field = file["field"].asString();
-                fileEntry = fileEntry || key == field || key == field + "_name";
-            }
-            if (!fileEntry) {
-                fields[key] = params[key];
-            }
-        }
-    }
+    const bool readable = rc != VELA::UPLOAD_RESULT_SUCCESS || DescribeUpload(params, stored, files, fields);
     for (const Json::Value& path : stored) {
         if (path.isString()) {
             unlink(path.asString().c_str());
