@@ -1,0 +1,490 @@
+// What APIRequest derives from the environment and the cookies: session
+// facts, the client kind from the user agent, URL and protocol.
+#include <fstream>
+#include <gtest/gtest.h>
+#include <string>
+#include <sys/stat.h>
+
+#include "support/JsonLiteral.h"
+#include "support/TestSupport.h"
+#include "vela/vlibc.h"
+#include "webapi/APIRequest.h"
+
+using VELA::APIRequest;
+
+namespace {
+
+APIRequest WithCookie(const std::string& header)
+{
+    Json::Value request(Json::objectValue);
+    request["environ"]["HTTP_COOKIE"] = header;
+    return APIRequest(request);
+}
+
+}  // namespace
+
+TEST(RequestCookieHeader, PiecesNamesAndValues)
+{
+    APIRequest r = WithCookie("id=abc; lang=en%20US;broken;k=a=b;  sp=1;=novalue;e=");
+    EXPECT_EQ("abc", r.GetSessionID());
+    EXPECT_EQ("en US", r.GetCookie("lang"));
+    EXPECT_EQ("a=b", r.GetCookie("k"));
+    EXPECT_EQ("1", r.GetCookie("sp"));  // blanks after ";" are not part of the name
+    EXPECT_EQ("", r.GetCookie("e", "d"));
+    EXPECT_FALSE(r.HasCookie("broken"));
+    EXPECT_FALSE(r.HasCookie(""));
+}
+
+TEST(RequestCookieHeader, LaterCookieWinsAndSetCookiesSurviveAMerge)
+{
+    APIRequest r = WithCookie("id=one; id=two");
+    EXPECT_EQ("two", r.GetSessionID());
+    r.SetCookie("local", "x");
+    r.InitEnv(J(R"({"HTTP_COOKIE": "id=three"})"));
+    EXPECT_EQ("three", r.GetSessionID());
+    EXPECT_EQ("x", r.GetCookie("local"));
+}
+
+TEST(RequestCookieHeader, OddEncodingsAndSizes)
+{
+    APIRequest r = WithCookie("a=%; b=%4; c=%zz; d=%41%42; e=x+y; f=%00z; ;;; ");
+    EXPECT_EQ("%", r.GetCookie("a"));
+    EXPECT_EQ("%4", r.GetCookie("b"));
+    EXPECT_EQ("%zz", r.GetCookie("c"));
+    EXPECT_EQ("AB", r.GetCookie("d"));
+    EXPECT_EQ(std::string("\0z", 2), r.GetCookie("f"));
+    APIRequest big = WithCookie("id=" + std::string(1 << 20, 'v') + ";" + std::string(100000, ';'));
+    EXPECT_EQ(size_t(1) << 20, big.GetSessionID().size());
+}
+
+TEST(RequestSessionFacts, DefaultsOfAnEmptySession)
+{
+    APIRequest r;
+    EXPECT_TRUE(r.IsTimeout());
+    EXPECT_TRUE(r.IsSkipCheckIP());
+    EXPECT_FALSE(r.IsAuthorized());
+    EXPECT_FALSE(r.IsAdmin());
+    EXPECT_EQ("enu", r.GetUILanguage());
+    EXPECT_EQ(0, r.GetTimeoutDuration());
+    EXPECT_EQ("", r.GetLoginUserName());
+    EXPECT_EQ("", r.GetApplication());
+    EXPECT_EQ("", r.GetWebAPIPriv());
+    EXPECT_EQ("", r.GetSessionFilePath());
+    EXPECT_TRUE(r.HasAppPriv(""));
+    EXPECT_FALSE(r.HasAppPriv("x"));
+    EXPECT_EQ(static_cast<uid_t>(-1), r.GetLoginUID());
+}
+
+TEST(RequestSessionFacts, StoredFactsAndTheirConversions)
+{
+    APIRequest r(J(R"({"session": {"username": "alice", "isAdmin": "yes", "isTimeout": 0,
+        "isSkipCheckIP": [], "isAuthorized": 2, "timeout": "900", "uiLang": "ger", "app": "a",
+        "webapi": "w", "sessFile": "/f", "appPriv": "VELA.App"}})"));
+    EXPECT_EQ("alice", r.GetLoginUserName());
+    EXPECT_TRUE(r.IsAdmin());        // non-empty text counts as true
+    EXPECT_FALSE(r.IsTimeout());     // 0
+    EXPECT_FALSE(r.IsSkipCheckIP()); // empty container
+    EXPECT_TRUE(r.IsAuthorized());
+    EXPECT_EQ(900, r.GetTimeoutDuration());
+    EXPECT_EQ("ger", r.GetUILanguage());
+    EXPECT_EQ("a", r.GetApplication());
+    EXPECT_EQ("w", r.GetWebAPIPriv());
+    EXPECT_EQ("/f", r.GetSessionFilePath());
+    EXPECT_TRUE(r.HasAppPriv("VELA.App"));
+    EXPECT_FALSE(r.HasAppPriv(""));
+}
+
+TEST(RequestLoginUID, StoredUidIsUsedAsIs)
+{
+    APIRequest r(J(R"({"session": {"uid": 1000, "username": "alice"}})"));
+    EXPECT_EQ(1000u, r.GetLoginUID());
+    APIRequest neg(J(R"({"session": {"uid": -1}})"));
+    EXPECT_EQ(static_cast<uid_t>(-1), neg.GetLoginUID());
+    APIRequest bad(J(R"({"session": {"uid": "1000"}})"));
+    EXPECT_EQ(static_cast<uid_t>(-1), bad.GetLoginUID());
+}
+
+TEST(RequestLoginUID, PlatformAnswerIsStoredEvenWhenItFails)
+{
+    APIRequest r(J(R"({"session": {"username": "nobody-such-user"}, "environ": {"HTTP_COOKIE": "id=abc"}})"));
+    VELA::Test::LogCapture log;
+    const uid_t first = r.GetLoginUID();
+    EXPECT_EQ(static_cast<uid_t>(-1), first);
+    // The verdict is cached in the session: the platform is not asked again.
+    const size_t linesAfterFirst = log.Lines().size();
+    EXPECT_EQ(first, r.GetLoginUID());
+    EXPECT_EQ(linesAfterFirst, log.Lines().size());
+    r.InitSession(J(R"({"username": "nobody-such-user", "uid": 42})"));
+    EXPECT_EQ(42u, r.GetLoginUID());
+}
+
+TEST(RequestAllowUser, BitsFromTheDescription)
+{
+    APIRequest r(J(R"({"reqLib": {"allowUser": ["admin.local", "normal.ldap", 5, "Admin.local"]}})"));
+    EXPECT_EQ(0x21, r.GetAllowUser());
+    // Cached in the session: a new description does not change it.
+    r.InitAPIInfo(J(R"({"allowUser": ["admin.domain"]})"));
+    EXPECT_EQ(0x21, r.GetAllowUser());
+    // A zero mask is never a cached answer.
+    APIRequest z(J(R"({"reqLib": {"allowUser": ["nobody"]}})"));
+    EXPECT_EQ(0, z.GetAllowUser());
+    z.InitAPIInfo(J(R"({"allowUser": ["normal.local", "normal.domain", "admin.ldap"]})"));
+    EXPECT_EQ(0x1C, z.GetAllowUser());
+}
+
+TEST(RequestAllowUser, NoListYieldsZeroAndStoresNothing)
+{
+    for (const char* desc : {"{}", R"({"allowUser": "admin.local"})", R"({"allowUser": []})"}) {
+        SCOPED_TRACE(desc);
+        Json::Value request(Json::objectValue);
+        request["reqLib"] = J(desc);
+        APIRequest r(request);
+        EXPECT_EQ(0, r.GetAllowUser());
+        EXPECT_EQ(0, r.GetAllowUser());
+    }
+}
+
+TEST(RequestUpload, ContentTypeAndSliceHeader)
+{
+    auto upload = [](const char* env) { return APIRequest(J(std::string(R"({"environ": )") + env + "}")).IsUploadRequest(); };
+    EXPECT_TRUE(upload(R"({"CONTENT_TYPE": "multipart/form-data; boundary=x"})"));
+    EXPECT_FALSE(upload(R"({"CONTENT_TYPE": "Multipart/Form-Data; boundary=x"})"));
+    EXPECT_TRUE(upload(R"({"CONTENT_TYPE": "Multipart/Form-Data", "HTTP_X_TYPE_NAME": "sliceUpload"})"));
+    EXPECT_FALSE(upload(R"({"CONTENT_TYPE": "application/json"})"));
+    EXPECT_FALSE(upload("{}"));
+    EXPECT_FALSE(upload(R"({"HTTP_X_TYPE_NAME": "SLICEUPLOADX"})"));
+}
+
+TEST(RequestPollingTask, NeedsBothIdAndUser)
+{
+    EXPECT_FALSE(APIRequest(J(R"({"environ": {"task_id": "t"}})")).IsPollingTask());
+    APIRequest r(J(R"({"environ": {"task_id": "t", "task_user": "u", "full_task_id": "@u/t"}})"));
+    EXPECT_TRUE(r.IsPollingTask());
+    EXPECT_EQ("@u/t", r.GetPollingTaskId());
+    EXPECT_EQ("", APIRequest().GetPollingTaskId());
+}
+
+TEST(RequestEncryptedParams, HalfAPairIsLeftAlone)
+{
+    APIRequest r(J(R"({"getParam": {"__nEkOtReHpIc": "tok", "a": 1}})"));
+    EXPECT_TRUE(r.HasParam("__nEkOtReHpIc"));
+    EXPECT_EQ(1, r.GetParam("a").asInt());
+}
+
+TEST(RequestEncryptedParams, EmptyMemberDropsThePairAndNothingElse)
+{
+    APIRequest r(J(R"({"postParam": {"__nEkOtReHpIc": "tok", "__tXeTrEhPiC": "", "a": 1}})"));
+    EXPECT_FALSE(r.HasParam("__nEkOtReHpIc"));
+    EXPECT_FALSE(r.HasParam("__tXeTrEhPiC"));
+    EXPECT_EQ(1, r.GetParam("a").asInt());
+}
+
+TEST(RequestEncryptedParams, FailedDecryptionKeepsTheRestAndNeverSucceedsFalsely)
+{
+    VELA::Test::LogCapture log;
+    APIRequest r(J(R"({"getParam": {"__cIpHeRtExT": "AAAA", "api": "VELA.A",
+                                    "webapi": {"__nEkOtReHpIc": "t", "__tXeTrEhPiC": "c", "b": 2}}})"));
+    EXPECT_FALSE(r.HasParam("__cIpHeRtExT"));
+    EXPECT_EQ("VELA.A", r.GetAPIClass());
+    // Decryption failed before the nested object was reached: it is kept.
+    EXPECT_TRUE(r.GetParam("webapi").isMember("__tXeTrEhPiC"));
+}
+
+TEST(RequestPreferenceDir, UnderTheRootOrTmp)
+{
+    VELA::Test::TempDir root;
+    VELA::Test::ScopedEnv env("VELA_ROOT", root.Path().c_str());
+    VELA::VelaRootReset();
+    APIRequest r(J(R"({"session": {"username": "alice"}})"));
+    const std::string dir = r.GetPreferenceDir();
+    EXPECT_EQ(0u, dir.find(root.Path() + "/"));
+    struct stat st;
+    EXPECT_EQ(0, stat(dir.c_str(), &st));
+    EXPECT_TRUE(S_ISDIR(st.st_mode));
+    EXPECT_EQ(0u, r.GetGroupPreferenceDir("staff").find(root.Path() + "/"));
+    EXPECT_EQ("/tmp", r.GetGroupPreferenceDir("../etc"));
+    EXPECT_EQ("/tmp", r.GetGroupPreferenceDir(""));
+    EXPECT_EQ("/tmp", APIRequest(J(R"({"session": {"username": "a/b"}})")).GetPreferenceDir());
+    EXPECT_EQ("/tmp", APIRequest().GetPreferenceDir());
+    VELA::VelaRootReset();
+}
+
+TEST(RequestToken, AccessTokenComesFromTheProcessEnvironment)
+{
+    APIRequest r(J(R"({"environ": {"velaAccessToken": "fromRequest"}})"));
+    {
+        VELA::Test::ScopedEnv env("velaAccessToken", nullptr);
+        EXPECT_EQ(nullptr, r.GetVelaAccessTokenID());
+    }
+    VELA::Test::ScopedEnv env("velaAccessToken", "tok");
+    ASSERT_NE(nullptr, r.GetVelaAccessTokenID());
+    EXPECT_STREQ("tok", r.GetVelaAccessTokenID());
+}
+
+namespace {
+
+// The ten flags in one string, so a case reads as one line:
+// M=mobile D=device I=iPhone A=android E=ieMobile P=iPad B=playBook
+// K=blackBerry6 W=webKit S=supportWebApp; "-" for false.
+std::string Flags(const APIRequest& r)
+{
+    std::string s;
+    s += r.IsMobile() ? 'M' : '-';
+    s += r.IsMobileDevice() ? 'D' : '-';
+    s += r.IsIPhone() ? 'I' : '-';
+    s += r.IsAndroid() ? 'A' : '-';
+    s += r.IsIEMobile() ? 'E' : '-';
+    s += r.IsIPad() ? 'P' : '-';
+    s += r.IsPlayBook() ? 'B' : '-';
+    s += r.IsBlackBerry6() ? 'K' : '-';
+    s += r.IsWebKit() ? 'W' : '-';
+    s += r.IsSupportWebApp() ? 'S' : '-';
+    return s;
+}
+
+std::string FlagsFor(const std::string& ua, Json::Value extraEnv = Json::Value(Json::objectValue))
+{
+    Json::Value request(Json::objectValue);
+    request["environ"] = extraEnv;
+    request["environ"]["HTTP_USER_AGENT"] = ua;
+    return Flags(APIRequest(request));
+}
+
+}  // namespace
+
+TEST(RequestClient, NoUserAgentIsADesktopWhateverTheGatewaySays)
+{
+    APIRequest r(J(R"({"environ": {"HTTP_X_WAP_PROFILE": "x", "HTTP_UA_OS": "y"}})"));
+    EXPECT_EQ("----------", Flags(r));
+}
+
+TEST(RequestClient, DeviceFamilies)
+{
+    struct Case {
+        const char* ua;
+        const char* flags;
+    } cases[] = {
+        {"Mozilla/5.0 (iPad; CPU OS 17_0) AppleWebKit/605.1.15", "MDI--P--WS"},
+        {"Mozilla/5.0 (iPhone; CPU iPhone OS 17_0) AppleWebKit/605.1.15", "MDI-----WS"},
+        {"Mozilla/5.0 (iPod touch) AppleWebKit/605", "MDI-----WS"},
+        {"Mozilla/5.0 (Linux; Android 14) AppleWebKit/537.36 Chrome/120", "MD-A----WS"},
+        {"Opera/9.80 (iPad; Opera Mini/7)", "MDI--P----"},
+        {"Opera/9.80 (Android; Opera Mini/7)", "MD-A------"},
+        {"Mozilla/5.0 (PlayBook; U; RIM Tablet OS 2.1.0) AppleWebKit/536.2+", "MD----B-WS"},
+        {"Mozilla/5.0 (PlayBook)", "MD----B---"},
+        {"Mozilla/5.0 (BlackBerry; U; BlackBerry 9800) AppleWebKit/534.1+", "MD-----KWS"},
+        {"BlackBerry9000/4.6.0.167", "MD--------"},
+        {"Mozilla/4.0 (compatible; MSIE 6.0; Windows CE; IEMobile 7.11)", "MD--E-----"},
+        {"Mozilla/5.0 (X11; Linux x86_64) AppleWebKit/537.36 Chrome/120", "--------W-"},
+        {"Mozilla/4.0 (compatible; MSIE 8.0; Windows NT 6.1)", "----------"},
+        {"Mozilla/5.0 (X11; Linux x86_64; rv:120.0) Gecko/20100101 Firefox/120.0", "----------"},
+        {"NOKIA SYMBIANOS", "MD--------"},
+        {"mIxEd iPhOnE aNdRoId", "MDI-------"},
+        {"", "----------"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.ua);
+        EXPECT_EQ(c.flags, FlagsFor(c.ua));
+    }
+}
+
+TEST(RequestClient, GatewayHeadersMakeADesktopAgentMobile)
+{
+    EXPECT_EQ("MD--------", FlagsFor("Mozilla/5.0 (X11)", J(R"({"HTTP_UA_OS": "x"})")));
+    EXPECT_EQ("MD--------", FlagsFor("Mozilla/5.0 (X11)", J(R"({"HTTP_X_WAP_PROFILE": "x"})")));
+    EXPECT_EQ("MD--E---W-", FlagsFor("AppleWebKit MSIE", J(R"({"HTTP_UA_OS": "x"})")));
+}
+
+TEST(RequestClient, ForceDesktopCookieKeepsTheDevice)
+{
+    const char* iphone = "Mozilla/5.0 (iPhone) AppleWebKit/605";
+    EXPECT_EQ("-DI-----WS", FlagsFor(iphone, J(R"({"HTTP_COOKIE": "forceDesktop=1"})")));
+    EXPECT_EQ("-DI-----WS", FlagsFor(iphone, J(R"({"HTTP_COOKIE": "forceDesktop=-2x"})")));
+    EXPECT_EQ("-DI-----WS", FlagsFor(iphone, J(R"({"HTTP_COOKIE": "forceDesktop=99999999999999999999999"})")));
+    EXPECT_EQ("MDI-----WS", FlagsFor(iphone, J(R"({"HTTP_COOKIE": "forceDesktop=0"})")));
+    EXPECT_EQ("MDI-----WS", FlagsFor(iphone, J(R"({"HTTP_COOKIE": "forceDesktop=yes"})")));
+}
+
+TEST(RequestClient, ClassifiedOnceAndFrozen)
+{
+    APIRequest r(J(R"j({"environ": {"HTTP_USER_AGENT": "Mozilla/5.0 (X11)"}})j"));
+    EXPECT_FALSE(r.IsMobile());
+    r.InitEnv(J(R"j({"HTTP_USER_AGENT": "Mozilla/5.0 (iPhone) AppleWebKit"})j"));
+    EXPECT_FALSE(r.IsMobile());
+    EXPECT_FALSE(r.IsIPhone());
+    APIRequest copy(r);
+    EXPECT_FALSE(copy.IsIPhone());
+}
+
+TEST(RequestClient, HostileUserAgentsAreClassifiedWithoutHarm)
+{
+    std::string binary;
+    for (int i = 0; i < 256; ++i) {
+        binary += static_cast<char>(i);
+    }
+    EXPECT_EQ(10u, FlagsFor(binary + "iphone").size());
+    EXPECT_EQ("MDI-------", FlagsFor(std::string(1 << 20, 'x') + "iPhone"));
+}
+
+namespace {
+
+APIRequest WithEnv(const Json::Value& env)
+{
+    Json::Value request(Json::objectValue);
+    request["environ"] = env;
+    return APIRequest(request);
+}
+
+}  // namespace
+
+TEST(RequestMethod, ExactNamesOnly)
+{
+    EXPECT_EQ(VELA::REQUEST_METHOD_GET, WithEnv(J(R"({"REQUEST_METHOD": "GET"})")).GetRequestMethod());
+    EXPECT_EQ(VELA::REQUEST_METHOD_POST, WithEnv(J(R"({"REQUEST_METHOD": "POST"})")).GetRequestMethod());
+    EXPECT_EQ(VELA::REQUEST_METHOD_HEAD, WithEnv(J(R"({"REQUEST_METHOD": "HEAD"})")).GetRequestMethod());
+    EXPECT_EQ(0, WithEnv(J(R"({"REQUEST_METHOD": "get"})")).GetRequestMethod());
+    EXPECT_EQ(0, WithEnv(J(R"({"REQUEST_METHOD": "PUT"})")).GetRequestMethod());
+}
+
+TEST(RequestMethod, RederivedOnEveryMergeButUnknownKeepsTheOld)
+{
+    APIRequest r = WithEnv(J(R"({"REQUEST_METHOD": "GET"})"));
+    r.InitEnv(J(R"({"REQUEST_METHOD": "POST"})"));
+    EXPECT_EQ(VELA::REQUEST_METHOD_POST, r.GetRequestMethod());
+    r.InitEnv(J(R"({"REQUEST_METHOD": "DELETE"})"));
+    EXPECT_EQ(VELA::REQUEST_METHOD_POST, r.GetRequestMethod());
+}
+
+TEST(RequestURL, Scheme)
+{
+    EXPECT_EQ("https", WithEnv(J(R"({"HTTPS": "on"})")).GetURLProto("x"));
+    EXPECT_EQ("https", WithEnv(J(R"({"HTTPS": "ON"})")).GetURLProto("x"));
+    EXPECT_EQ("http", WithEnv(J(R"({"HTTPS": "1"})")).GetURLProto("x"));
+    EXPECT_EQ("http", APIRequest().GetURLProto("x"));
+}
+
+// X-Forwarded-Proto counts only when the peer is a configured trusted proxy:
+// a client's own header would make the login cookie Secure, or anything
+// else that follows the scheme.
+TEST(RequestURL, ForwardedSchemeOnlyFromATrustedProxy)
+{
+    VELA::Test::TempDir root;
+    VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
+    VELA::VelaRootReset();
+    const auto proto = [](const char* remote) {
+        Json::Value env = J(R"({"HTTPS": "off", "HTTP_X_FORWARDED_PROTO": "HTTPS"})");
+        env["REMOTE_ADDR"] = remote;
+        return WithEnv(env).GetURLProto("x");
+    };
+    EXPECT_EQ("http", proto("127.0.0.1"));  // no proxy configured, loopback included
+    ASSERT_EQ(0, mkdir((root.Path() + "/etc").c_str(), 0755));
+    ASSERT_EQ(0, mkdir((root.Path() + "/etc/vela").c_str(), 0755));
+    std::ofstream(root.Path() + "/etc/vela/webapi.conf") << "trusted_proxies=\"192.0.2.10\"\n";
+    EXPECT_EQ("https", proto("192.0.2.10"));
+    EXPECT_EQ("http", proto("192.0.2.11"));
+    EXPECT_EQ("http", proto("127.0.0.1"));
+    EXPECT_EQ("http", WithEnv(J(R"({"HTTP_X_FORWARDED_PROTO": "https"})")).GetURLProto("x"));  // no peer
+    VELA::VelaRootReset();
+}
+
+TEST(RequestURL, HostAndPort)
+{
+    struct Case {
+        const char* env;
+        const char* host;
+        int port;
+    } cases[] = {
+        {R"({"HTTP_HOST": "myhost", "HTTPS": "on"})", "myhost", 443},
+        {R"({"HTTP_HOST": "myhost"})", "myhost", 80},
+        {R"({"HTTP_HOST": "10.0.0.5:5001"})", "10.0.0.5", 5001},
+        {R"({"HTTP_HOST": "[fe80::1]:5001"})", "[fe80::1]", 5001},
+        {R"({"HTTP_HOST": "[fe80::1]", "HTTPS": "on"})", "[fe80::1]", 443},
+        {R"({"HTTP_HOST": "[fe80::1]junk"})", "[fe80::1]", 80},
+        {R"({"HTTP_HOST": "fe80::1"})", "fe80:", 1},
+        {R"({"HTTP_HOST": "host:"})", "host", 80},
+        {R"({"HTTP_HOST": "host:abc"})", "host", 0},
+        {R"({"HTTP_HOST": "host:99999999999999999999"})", "host", 0},
+        {R"({"HTTP_HOST": ":"})", "", 80},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.env);
+        APIRequest r = WithEnv(J(c.env));
+        EXPECT_EQ(c.host, r.GetURLHost("dflt"));
+        EXPECT_EQ(c.port, r.GetURLPort(-1));
+    }
+}
+
+TEST(RequestURL, UnusableHostLeavesHostAndPortToTheDefaults)
+{
+    for (const char* env : {R"({"HTTP_HOST": "[::1"})", R"({"HTTP_HOST": ""})", "{}"}) {
+        SCOPED_TRACE(env);
+        Json::Value e = J(env);
+        e["REQUEST_URI"] = "/a/b";
+        APIRequest r = WithEnv(e);
+        EXPECT_EQ("dflt", r.GetURLHost("dflt"));
+        EXPECT_EQ(-1, r.GetURLPort(-1));
+        EXPECT_EQ("http", r.GetURLProto("x"));
+        EXPECT_EQ("/a/", r.GetURLPath("x"));
+    }
+}
+
+TEST(RequestURL, PathAndName)
+{
+    APIRequest a = WithEnv(J(R"({"REQUEST_URI": "/webapi/entry.cgi?api=x/y"})"));
+    EXPECT_EQ("/webapi/", a.GetURLPath("d"));
+    EXPECT_EQ("entry.cgi", a.GetURLName("d"));
+    APIRequest b = WithEnv(J(R"({"REQUEST_URI": "/webapi/"})"));
+    EXPECT_EQ("/webapi/", b.GetURLPath("d"));
+    EXPECT_EQ("", b.GetURLName("d"));
+    APIRequest c = WithEnv(J(R"({"REQUEST_URI": "entry.cgi"})"));
+    EXPECT_EQ("d", c.GetURLPath("d"));
+    EXPECT_EQ("d", c.GetURLName("d"));
+    APIRequest d = WithEnv(J(R"({"REQUEST_URI": "/a/../b//c%2f"})"));
+    EXPECT_EQ("/a/../b//", d.GetURLPath("d"));  // no decoding, no normalisation
+    EXPECT_EQ("c%2f", d.GetURLName("d"));
+}
+
+TEST(RequestURL, FactsAreFrozenAtFirstUse)
+{
+    APIRequest r = WithEnv(J(R"({"HTTP_HOST": "first:1", "REQUEST_URI": "/a/x"})"));
+    EXPECT_EQ("first", r.GetURLHost(""));
+    r.InitEnv(J(R"({"HTTP_HOST": "second:2", "REQUEST_URI": "/b/y", "HTTPS": "on"})"));
+    EXPECT_EQ("first", r.GetURLHost(""));
+    EXPECT_EQ(1, r.GetURLPort(0));
+    EXPECT_EQ("/a/", r.GetURLPath(""));
+    EXPECT_EQ("http", r.GetURLProto(""));
+}
+
+TEST(RequestRemoteIP, StoredAddressWinsOverThePlatform)
+{
+    VELA::Test::ScopedEnv remote("REMOTE_ADDR", "192.0.2.7");
+    APIRequest r = WithEnv(J(R"({"vela_remoteIP": "198.51.100.1"})"));
+    EXPECT_EQ("198.51.100.1", r.GetRemoteIP());
+}
+
+TEST(RequestRemoteIP, AskedOnceAndCached)
+{
+    VELA::Test::TempDir root;
+    VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
+    VELA::Test::ScopedEnv forwarded("HTTP_X_FORWARDED_FOR", nullptr);
+    APIRequest r;
+    {
+        VELA::Test::ScopedEnv remote("REMOTE_ADDR", "192.0.2.7");
+        EXPECT_EQ("192.0.2.7", r.GetRemoteIP());
+    }
+    VELA::Test::ScopedEnv remote("REMOTE_ADDR", "192.0.2.8");
+    EXPECT_EQ("192.0.2.7", r.GetRemoteIP());
+    EXPECT_EQ("192.0.2.7", r.GetEnv("vela_remoteIP").asString());
+}
+
+TEST(RequestRemoteIP, UnknownAddressIsEmptyAndRetried)
+{
+    APIRequest r;
+    {
+        VELA::Test::ScopedEnv remote("REMOTE_ADDR", nullptr);
+        EXPECT_EQ("", r.GetRemoteIP());
+        EXPECT_FALSE(r.HasEnv("vela_remoteIP"));
+    }
+    VELA::Test::ScopedEnv remote("REMOTE_ADDR", "2001:db8::1");
+    EXPECT_EQ("2001:db8::1", r.GetRemoteIP());
+}
