@@ -211,17 +211,10 @@ void KeepCheckedCall(const APIRequest* req, Json::Value& fields)
 
 }  // namespace
 
-WebEntry::WebEntry() : cgi_(nullptr), uploadedFiles_(Json::arrayValue), permission_(Json::objectValue)
-{
-    Json::Value slots(Json::arrayValue);
-    slots.append(Json::Value());
-    slots.append(Json::Value());
-    permission_["permResult"] = slots;
-}
+WebEntry::WebEntry() : cgi_(nullptr), uploadedFiles_(Json::arrayValue), permission_(*this) {}
 
 WebEntry::~WebEntry()
 {
-    permission_ = Json::Value();
     uploadedFiles_ = Json::Value();
     VelaCgiFree(cgi_);
     cgi_ = nullptr;
@@ -442,6 +435,22 @@ bool WebEntry::ProcessRelay(APIRequest* req, APIResponse* resp)
     resp->SetError(WEBAPI_ERR_RELAY_FAILED);
     return false;
 }
+
+bool WebEntry::CheckSharingPermission(APIRequest* req, APIResponse* resp)
+{
+    return PermissionCheck::CheckSharingPermission(req, resp);
+}
+
+bool WebEntry::NeedPermission(APIRequest* req) { return PermissionCheck::NeedPermission(req); }
+
+bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
+{
+    return permission_.CheckPermission(req, resp, cgi_);
+}
+
+bool WebEntry::SkipPermission(APIRequest* req) { return PermissionCheck::SkipPermission(req); }
+
+int WebEntry::CheckPermission(bool allowTimeout) { return permission_.CheckPermission(allowTimeout, cgi_); }
 
 void RestartHttpd(void* /*unused*/)
 {
