@@ -96,76 +96,117 @@ void StdinToDevNull()
     }
 }
 
-// Steps 7 to 11 of Initialize: the session id ("_sid"), access token
-// ("tid") and sharing-link parameters ("_sharing_id", "_sharing_sid") of the
-// query move into the process environment and the request's cookie header,
-// where the session checks look for them.
+// The session id ("_sid"), access token ("tid") and sharing-link
+// parameters ("_sharing_id", "_sharing_sid") of the query; a value is empty
+// when its flag says it is absent.
+struct IdentityParams {
+    std::string sid, tid, sharingId, sharingSid;
+    bool hasSid = false;
+    bool hasTid = false;
+    bool hasSharingId = false;
+    bool hasSharingSid = false;  // with or without a sharing id
+};
+
+IdentityParams ReadIdentityParams(APIRequest* req)
+{
+    IdentityParams p;
+    const struct {
+        const char* name;
+        std::string& value;
+        bool& present;
+    } params[] = {{"_sid", p.sid, p.hasSid},
+                  {"tid", p.tid, p.hasTid},
+                  {"_sharing_id", p.sharingId, p.hasSharingId},
+                  {"_sharing_sid", p.sharingSid, p.hasSharingSid}};
+    for (const auto& param : params) {
+        const APIParameter<std::string> value = req->GetAndCheckString(param.name, APIRequest::OPTIONAL);
+        param.present = Present(value);
+        if (param.present) {
+            param.value = value.Get();
+        }
+    }
+    return p;
+}
+
+// setenv(name, value); a failure is logged and, with a response, answered
+// with 101.
+bool SetEnv(const char* name, const std::string& value, APIResponse* resp)
+{
+    if (setenv(name, value.c_str(), 1) == 0) {
+        return true;
+    }
+    VELA_LOG_ERR("setenv %s failed[%m]", name);
+    if (resp != nullptr) {
+        resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+    }
+    return false;
+}
+
+// A sharing id becomes the sharing header; with it, a sharing session id
+// joins the cookie header. A sharing session id alone changes nothing.
+bool MoveSharingParams(const IdentityParams& p, APIResponse* resp, std::string& cookie, std::string& sharingHeader)
+{
+    if (!p.hasSharingId) {
+        return true;
+    }
+    sharingHeader = p.sharingId;
+    if (!SetEnv(kSharingHeaderEnv, sharingHeader, resp)) {
+        return false;
+    }
+    if (!p.hasSharingSid) {
+        return true;
+    }
+    if (!cookie.empty()) {
+        cookie += "; ";
+    }
+    cookie += std::string(kSharingSidCookie) + "=" + p.sharingSid;
+    return SetEnv("HTTP_COOKIE", cookie, resp);
+}
+
+// The session id of the query replaces the one of the cookie header: the
+// first "id=" in the header (a plain substring search, which can also hit
+// the end of a longer name) becomes "abandoned=", and the new id is
+// appended. Without a session id, an access token goes into the
+// environment (a failure there sets no error).
+bool MoveSessionParams(const IdentityParams& p, APIResponse* resp, std::string& cookie)
+{
+    if (!p.hasSid) {
+        return !p.hasTid || SetEnv("velaAccessToken", p.tid, nullptr);
+    }
+    if (!cookie.empty()) {
+        cookie += "; ";
+        const size_t at = cookie.find("id=");
+        if (at != std::string::npos) {
+            cookie.replace(at, 2, "abandoned");
+        }
+    }
+    cookie += "id=" + p.sid;
+    return SetEnv("HTTP_COOKIE", cookie, resp);
+}
+
+// Steps 7 to 11 of Initialize: the identity parameters of the query move
+// into the process environment and the request's cookie header, where the
+// session checks look for them.
 bool MoveIdentityParams(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)
 {
-    const APIParameter<std::string> sid = req->GetAndCheckString("_sid", APIRequest::OPTIONAL);
-    const APIParameter<std::string> tid = req->GetAndCheckString("tid", APIRequest::OPTIONAL);
-    const APIParameter<std::string> sharingId = req->GetAndCheckString("_sharing_id", APIRequest::OPTIONAL);
-    const APIParameter<std::string> sharingSid = req->GetAndCheckString("_sharing_sid", APIRequest::OPTIONAL);
-    const bool hasSid = Present(sid);
-    const bool hasSharing = Present(sharingId);
-    const bool hasSharingSid = hasSharing && Present(sharingSid);
-    if (!hasSid && !Present(tid) && !hasSharing && !Present(sharingSid)) {
+    const IdentityParams p = ReadIdentityParams(req);
+    if (!p.hasSid && !p.hasTid && !p.hasSharingId && !p.hasSharingSid) {
         return true;
     }
     // The values become part of a Cookie header: one that would end its
     // cookie and start another is refused.
-    if ((hasSid && !IsCookieValue(sid.Get())) || (hasSharingSid && !IsCookieValue(sharingSid.Get()))) {
+    const bool sharingSid = p.hasSharingId && p.hasSharingSid;
+    if ((p.hasSid && !IsCookieValue(p.sid)) || (sharingSid && !IsCookieValue(p.sharingSid))) {
         VELA_LOG_ERR("refused a session id parameter that is not a cookie value (%zu bytes)",
-                     hasSid ? sid.Get().size() : sharingSid.Get().size());
+                     p.hasSid ? p.sid.size() : p.sharingSid.size());
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
         return false;
     }
 
     std::string cookie = RequestFacts::Text(req->GetEnv("HTTP_COOKIE"));
     std::string sharingHeader = RequestFacts::Text(req->GetEnv(kSharingHeaderEnv));
-
-    if (hasSharing) {
-        sharingHeader = sharingId.Get();
-        if (setenv(kSharingHeaderEnv, sharingHeader.c_str(), 1) != 0) {
-            VELA_LOG_ERR("setenv %s failed[%m]", kSharingHeaderEnv);
-            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
-            return false;
-        }
-    }
-    if (hasSharingSid) {
-        if (!cookie.empty()) {
-            cookie += "; ";
-        }
-        cookie += std::string(kSharingSidCookie) + "=" + sharingSid.Get();
-        if (setenv("HTTP_COOKIE", cookie.c_str(), 1) != 0) {
-            VELA_LOG_ERR("setenv HTTP_COOKIE failed[%m]");
-            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
-            return false;
-        }
-    }
-    if (!hasSid) {
-        if (Present(tid) && setenv("velaAccessToken", tid.Get().c_str(), 1) != 0) {
-            VELA_LOG_ERR("setenv velaAccessToken failed[%m]");
-            return false;
-        }
-    } else {
-        // The session id of the query replaces the one of the cookie header:
-        // the first "id=" in the header (a plain substring search, which can
-        // also hit the end of a longer name) becomes "abandoned=", and the
-        // new id is appended.
-        if (!cookie.empty()) {
-            cookie += "; ";
-            const size_t at = cookie.find("id=");
-            if (at != std::string::npos) {
-                cookie.replace(at, 2, "abandoned");
-            }
-        }
-        cookie += "id=" + sid.Get();
-        if (setenv("HTTP_COOKIE", cookie.c_str(), 1) != 0) {
-            VELA_LOG_ERR("setenv HTTP_COOKIE failed[%m]");
-            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
-            return false;
-        }
+    if (!MoveSharingParams(p, resp, cookie, sharingHeader) || !MoveSessionParams(p, resp, cookie)) {
+        return false;
     }
 
     VelaCgiLoadInCookies(cgi);
@@ -211,17 +252,10 @@ void KeepCheckedCall(const APIRequest* req, Json::Value& fields)
 
 }  // namespace
 
-WebEntry::WebEntry() : cgi_(nullptr), uploadedFiles_(Json::arrayValue), permission_(Json::objectValue)
-{
-    Json::Value slots(Json::arrayValue);
-    slots.append(Json::Value());
-    slots.append(Json::Value());
-    permission_["permResult"] = slots;
-}
+WebEntry::WebEntry() : cgi_(nullptr), uploadedFiles_(Json::arrayValue), permission_(*this) {}
 
 WebEntry::~WebEntry()
 {
-    permission_ = Json::Value();
     uploadedFiles_ = Json::Value();
     VelaCgiFree(cgi_);
     cgi_ = nullptr;
@@ -442,6 +476,22 @@ bool WebEntry::ProcessRelay(APIRequest* req, APIResponse* resp)
     resp->SetError(WEBAPI_ERR_RELAY_FAILED);
     return false;
 }
+
+bool WebEntry::CheckSharingPermission(APIRequest* req, APIResponse* resp)
+{
+    return PermissionCheck::CheckSharingPermission(req, resp);
+}
+
+bool WebEntry::NeedPermission(APIRequest* req) { return PermissionCheck::NeedPermission(req); }
+
+bool WebEntry::CheckPermission(APIRequest* req, APIResponse* resp)
+{
+    return permission_.CheckPermission(req, resp, cgi_);
+}
+
+bool WebEntry::SkipPermission(APIRequest* req) { return PermissionCheck::SkipPermission(req); }
+
+int WebEntry::CheckPermission(bool allowTimeout) { return permission_.CheckPermission(allowTimeout, cgi_); }
 
 void RestartHttpd(void* /*unused*/)
 {

@@ -4,12 +4,13 @@
 // Initialize builds the request from the CGI environment, the query string,
 // the body (decrypting encrypted parameters) and the cookies; the pipeline of
 // APIRunner then runs it; OutputHeader and OutputBody write the CGI reply to
-// standard output. The permission hooks live in access/.
+// standard output. The permission hooks hand the call to a PermissionCheck.
 #pragma once
 
 #include <json/json.h>
 #include <string>
 
+#include "access/PermissionCheck.h"
 #include "vela/cgi.h"
 #include "webapi/APIRunner.h"
 
@@ -24,7 +25,7 @@ public:
     bool Run(const Json::Value& unused) override;
     bool Initialize(const Json::Value& unused) override;
 
-    // ---- Permission (access/) ----
+    // ---- Permission: answered by permission_ ----
     bool CheckSharingPermission(APIRequest* req, APIResponse* resp) override;
     bool NeedPermission(APIRequest* req) override;
     bool CheckPermission(APIRequest* req, APIResponse* resp) override;
@@ -60,8 +61,8 @@ protected:
     void RemoveUploadedFiles();
 
     VELACGI_CTX* cgi_;
-    Json::Value uploadedFiles_;  // stored files of the upload, in body order
-    Json::Value permission_;     // {"permResult": [verdict with timeout allowed, without]}
+    Json::Value uploadedFiles_;   // stored files of the upload, in body order
+    PermissionCheck permission_;  // the session check and its verdict cache
 };
 
 // After-reply callback: asks the platform to restart the web server.

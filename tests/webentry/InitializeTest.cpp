@@ -142,12 +142,16 @@ TEST_F(WebEntryInit, SessionIdReplacesTheCookieId)
 TEST_F(WebEntryInit, SessionIdThatWouldAddACookieIsRefused)
 {
     Set("REQUEST_METHOD", "GET");
-    Set("QUERY_STRING", "_sid=abc%3B%20sharing_sid%3Devil");
     Set("HTTP_COOKIE", "x=1");
-    VELA::WebEntry entry;
-    EXPECT_FALSE(entry.Initialize(Json::Value()));
-    EXPECT_EQ(101, entry.GetResponseObject()->GetError());
-    EXPECT_EQ("x=1", EnvOr("HTTP_COOKIE", "-"));
+    for (const char* query : {"_sid=abc%3B%20sharing_sid%3Devil", "_sharing_id=L1&_sharing_sid=q%3B%20id%3Devil",
+                              "_sid=ok&_sharing_id=L1&_sharing_sid=q%2C"}) {
+        Set("QUERY_STRING", query);
+        VELA::WebEntry entry;
+        EXPECT_FALSE(entry.Initialize(Json::Value())) << query;
+        EXPECT_EQ(101, entry.GetResponseObject()->GetError()) << query;
+        EXPECT_EQ("x=1", EnvOr("HTTP_COOKIE", "-")) << query;
+        EXPECT_EQ("-", EnvOr("HTTP_X_VELA_SHARING", "-")) << query;
+    }
 }
 
 TEST_F(WebEntryInit, AccessTokenOnlyWithoutSessionId)

@@ -1,0 +1,68 @@
+// The session permission check of a call: whether its method needs a login,
+// the login-session / access-token verdict of the platform with its cache,
+// the user classes and the application privilege of the API.
+//
+// A runner owns one PermissionCheck for its life and hands it the calls of
+// its permission hooks. The verdict of the platform (VelaCgiIsAuthorizedEx,
+// VelaAccessTokenGrant) is asked at most once per value of "allowTimeout"
+// and kept in the check: {"permResult": [verdict with timeout allowed,
+// verdict without]}, null until asked.
+#pragma once
+
+#include <json/json.h>
+#include <string>
+
+#include "vela/cgi.h"
+
+namespace VELA {
+
+class APIRequest;
+class APIResponse;
+class APIRunner;
+
+class PermissionCheck {
+public:
+    // `runner` answers the method attributes the check reads ("allowTimeout",
+    // "skipCheckIP", the method's own "allowUser") and holds the request
+    // whose session is checked: the call the runner built.
+    explicit PermissionCheck(APIRunner& runner);
+    ~PermissionCheck();
+    PermissionCheck(const PermissionCheck&) = delete;
+    PermissionCheck& operator=(const PermissionCheck&) = delete;
+
+    // From the API's "authLevel" (absent or not a number: 1): a login is
+    // needed unless it is 0 (true for a null request); a refusal is not
+    // enforced when it is 2 (false for a null request).
+    static bool NeedPermission(const APIRequest* req);
+    static bool SkipPermission(const APIRequest* req);
+
+    // The session check of the runner's request: the error code of the
+    // platform's verdict (0 allowed, 105, 106, 119 or 150), the verdict and
+    // the session facts stored in the request. `cgi` is the runner's CGI
+    // handle; null (a runner built by hand) uses one of the check's own.
+    int CheckPermission(bool allowTimeout, VELACGI_CTX* cgi);
+    // The whole check of `req`: the session check with the method's
+    // "allowTimeout", its error code and server-error word on `resp`, then
+    // the user classes and the application privilege (105). True when the
+    // call may go on; the session facts are rebuilt with "appPriv".
+    bool CheckPermission(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi);
+
+    // A call through a sharing link: refused (105) until sharing links are
+    // served.
+    static bool CheckSharingPermission(APIRequest* req, APIResponse* resp);
+
+    // {"permResult": [verdict with timeout allowed, without]}.
+    const Json::Value& Verdicts() const { return permission_; }
+
+private:
+    Json::Value& Slot(bool allowTimeout);
+    VELACGI_CTX* Handle(VELACGI_CTX* cgi);
+    int AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTimeout);
+    bool CheckUserClass(APIRequest* req, APIResponse* resp, const std::string& user);
+
+    APIRunner& runner_;
+    VELACGI_CTX* ownCgi_;     // the handle of a check without the runner's
+    Json::Value permission_;  // {"permResult": [with timeout allowed, without]}
+};
+
+}  // namespace VELA

@@ -1,0 +1,411 @@
+// PermissionCheck against real login sessions and access tokens under a
+// fresh VELA_ROOT: verdicts and their error codes, the session facts, the
+// verdict cache, user classes and application privileges; and the same
+// check behind WebEntry's permission hooks after Initialize.
+#include <gtest/gtest.h>
+
+#include <climits>
+#include <stdlib.h>
+#include <string>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <vector>
+
+#include "access/PermissionCheck.h"
+#include "platform/StateRootTest.h"
+#include "support/JsonLiteral.h"
+#include "support/TestSupport.h"
+#include "vela/session.h"
+#include "vela/token.h"
+#include "vela/webapiutil.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webapi/APIRunner.h"
+#include "webapi/JsonUtil.h"
+#include "webentry/WebEntry.h"
+
+namespace {
+
+using VELA::APIRequest;
+using VELA::APIResponse;
+using VELA::PermissionCheck;
+using VELA::Test::LogCapture;
+using VELA::Test::ScopedEnv;
+
+const char kApi[] = "VELA.Test.Perm";
+const char kClient[] = "192.0.2.7";
+
+// Methods: "get" plain, "poll" with allowTimeout, "anywhere" with
+// skipCheckIP, "own" with its own "allowUser" list. `apiLevel` (JSON text)
+// adds or replaces members of the API's description.
+Json::Value Desc(const std::string& apiLevel = "")
+{
+    Json::Value desc = J(R"({"lib": "libperm.so", "minVersion": 1, "maxVersion": 1, "authLevel": 1,
+        "methods": {"1": ["get", {"poll": {"allowTimeout": true}}, {"anywhere": {"skipCheckIP": true}},
+                          {"own": {"allowUser": ["normal.local"]}}]}})");
+    if (!apiLevel.empty()) {
+        for (const auto& name : J(apiLevel).getMemberNames()) {
+            desc[name] = J(apiLevel)[name];
+        }
+    }
+    return desc;
+}
+
+// A runner whose request calls `method` of kApi (version 1) with the session
+// cookie `sid` ("" for none), as the front end would have built it, and the
+// check of that runner. kApi is read from the working directory.
+struct PreparedCall {
+    PreparedCall(const std::string& method, const std::string& sid)
+    {
+        Json::Value env(Json::objectValue);
+        env["REQUEST_METHOD"] = "GET";
+        if (!sid.empty()) {
+            env["HTTP_COOKIE"] = "lang=x; id=" + sid;
+        }
+        Req()->InitEnv(env);
+        Json::Value param;
+        param["getParam"]["api"] = kApi;
+        param["getParam"]["version"] = "1";
+        param["getParam"]["method"] = method;
+        Req()->InitParam(param, true);
+        EXPECT_TRUE(runner.CheckRequestParam(Req(), Resp())) << method;
+        EXPECT_TRUE(runner.AddAPIInfo(Req()));
+    }
+    APIRequest* Req() { return runner.GetRequest(); }
+    APIResponse* Resp() { return runner.GetResponseObject(); }
+    bool Check() { return check.CheckPermission(Req(), Resp(), nullptr); }
+    const Json::Value& Slots() { return check.Verdicts()["permResult"]; }
+
+    VELA::APIRunner runner;
+    PermissionCheck check{runner};
+};
+
+// A fresh system root whose web-API directory is the working directory.
+class PermissionCheckTest : public StateRootTest {
+protected:
+    void SetUp() override
+    {
+        StateRootTest::SetUp();
+        char cwd[PATH_MAX];
+        ASSERT_NE(nullptr, getcwd(cwd, sizeof(cwd)));
+        oldCwd_ = cwd;
+        webapiDir_ = root_.Path() + "/usr/vela/velaman/webapi";
+        ASSERT_EQ(0, system(("mkdir -p '" + webapiDir_ + "'").c_str()));
+        ASSERT_EQ(0, chdir(webapiDir_.c_str()));
+        Declare(Desc());
+    }
+    void TearDown() override
+    {
+        if (!oldCwd_.empty()) {
+            EXPECT_EQ(0, chdir(oldCwd_.c_str()));
+        }
+        StateRootTest::TearDown();
+    }
+
+    // kApi as `desc` for the runners made from now on.
+    void Declare(const Json::Value& desc)
+    {
+        Json::Value file(Json::objectValue);
+        file[kApi] = desc;
+        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + kApi + ".lib", file, 0644));
+    }
+    std::string Login(const char* user, VelaSessionOptions options = VelaSessionOptions())
+    {
+        std::string sid, token;
+        EXPECT_EQ(0, VelaSessionCreate(user, kClient, &options, sid, token));
+        return sid;
+    }
+    long long LastUse(const std::string& sid)
+    {
+        std::vector<VelaSessionRecord> all;
+        EXPECT_EQ(0, VelaSessionList(all));
+        for (const VelaSessionRecord& r : all) {
+            if (r.sid == sid) {
+                return r.lastUse;
+            }
+        }
+        ADD_FAILURE() << "no session " << sid;
+        return -1;
+    }
+
+    std::string oldCwd_;
+    std::string webapiDir_;
+    ScopedEnv remote_{"REMOTE_ADDR", kClient};
+    ScopedEnv token_{"velaAccessToken", nullptr};
+    ScopedEnv user_{"VELA_WEBAPI_USERNAME", nullptr};
+    ScopedEnv protect_{"HTTP_X_VELA_TOKEN", nullptr};
+};
+
+TEST(PermissionCheckAuthLevel, DecidesWhetherTheCheckRunsAndIsEnforced)
+{
+    EXPECT_TRUE(PermissionCheck::NeedPermission(nullptr));
+    EXPECT_FALSE(PermissionCheck::SkipPermission(nullptr));
+    const struct {
+        const char* desc;
+        bool need;
+        bool skip;
+    } cases[] = {{R"({"authLevel": 0})", false, false}, {R"({"authLevel": 1})", true, false},
+                 {R"({"authLevel": 2})", true, true},   {R"({"authLevel": null})", true, false},
+                 {R"({"authLevel": "0"})", true, false}, {R"({})", true, false}};
+    for (const auto& c : cases) {
+        APIRequest req;
+        req.InitAPIInfo(J(c.desc));
+        EXPECT_EQ(c.need, PermissionCheck::NeedPermission(&req)) << c.desc;
+        EXPECT_EQ(c.skip, PermissionCheck::SkipPermission(&req)) << c.desc;
+    }
+}
+
+TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticated)
+{
+    LogCapture log;
+    PreparedCall c("get", "");
+    EXPECT_FALSE(c.Check());
+    EXPECT_EQ(119, c.Resp()->GetError());
+    EXPECT_EQ("unauth", c.Resp()->GetServerError());
+    EXPECT_EQ(AUTH_RESULT_UNAUTHENTICATED, c.Req()->GetAuthResult());
+    EXPECT_FALSE(c.Req()->IsAuthorized());
+    EXPECT_EQ(J("[null, -5]"), c.Slots());
+    int refusals = 0;
+    for (const std::string& line : log.Lines()) {
+        refusals += line.find("session check refused") != std::string::npos;
+    }
+    EXPECT_EQ(1, refusals);
+}
+
+TEST_F(PermissionCheckTest, OptionalLoginIsNoRefusalAndLogsNothing)
+{
+    Declare(Desc(R"({"authLevel": 2})"));
+    LogCapture log;
+    PreparedCall c("get", "");
+    EXPECT_FALSE(c.Check());
+    EXPECT_TRUE(PermissionCheck::SkipPermission(c.Req()));
+    EXPECT_EQ(119, c.Resp()->GetError());
+    EXPECT_EQ("unauth", c.Resp()->GetServerError());
+    EXPECT_FALSE(log.Contains("session check refused"));
+}
+
+TEST_F(PermissionCheckTest, ASessionIdCutByANulByteNamesNoSession)
+{
+    const std::string sid = Login("root");
+    PreparedCall c("get", sid + "%00x");
+    ASSERT_EQ(sid + std::string(1, '\0') + "x", c.Req()->GetSessionID());
+    EXPECT_FALSE(c.Check());
+    EXPECT_EQ(105, c.Resp()->GetError());
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, c.Req()->GetAuthResult());
+    EXPECT_EQ("", c.Req()->GetLoginUserName());
+}
+
+TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
+{
+    VelaSessionOptions options;
+    options.idleTimeout = 600;
+    options.app = "VELA.App";
+    options.webapi = "full";
+    options.lang = "ger";
+    const std::string sid = Login("root", options);
+    PreparedCall c("get", sid);
+    ASSERT_TRUE(c.Check());
+    APIRequest* r = c.Req();
+    EXPECT_EQ(0, c.Resp()->GetError());
+    EXPECT_FALSE(c.Resp()->HasServerError());
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, r->GetAuthResult());
+    EXPECT_EQ("root", r->GetLoginUserName());
+    EXPECT_TRUE(r->IsAdmin());
+    EXPECT_TRUE(r->IsAuthorized());
+    EXPECT_FALSE(r->IsTimeout());
+    EXPECT_FALSE(r->IsSkipCheckIP());
+    EXPECT_EQ(600, r->GetTimeoutDuration());
+    EXPECT_EQ("ger", r->GetUILanguage());
+    EXPECT_EQ("VELA.App", r->GetApplication());
+    EXPECT_EQ("full", r->GetWebAPIPriv());
+    EXPECT_EQ(root_.Path() + "/run/vela/sessions/" + sid, r->GetSessionFilePath());
+    EXPECT_TRUE(r->HasAppPriv(""));
+    ASSERT_NE(nullptr, getenv("VELA_WEBAPI_USERNAME"));
+    EXPECT_STREQ("root", getenv("VELA_WEBAPI_USERNAME"));
+    EXPECT_EQ(J("[null, 1]"), c.Slots());
+
+    // The session goes away: the slot already computed is reused, the other
+    // one asks the platform and learns that there is no session.
+    ASSERT_EQ(0, VelaSessionRemove(sid.c_str()));
+    EXPECT_EQ(0, c.check.CheckPermission(false, nullptr));
+    EXPECT_EQ(105, c.check.CheckPermission(true, nullptr));
+    EXPECT_EQ(J("[-2, 1]"), c.Slots());
+}
+
+TEST_F(PermissionCheckTest, TimeoutAddressAndTokenProtectionRefusals)
+{
+    VelaSessionOptions options;
+    options.idleTimeout = 60;
+    const std::string sid = Login("root", options);
+    {
+        Now() += 61;
+        PreparedCall c("get", sid);
+        EXPECT_FALSE(c.Check());
+        EXPECT_EQ(106, c.Resp()->GetError());
+        EXPECT_EQ("timeout", c.Resp()->GetServerError());
+        EXPECT_EQ(AUTH_RESULT_TIMEOUT, c.Req()->GetAuthResult());
+    }
+    const std::string other = Login("root");
+    {
+        ScopedEnv moved("REMOTE_ADDR", "198.51.100.1");
+        PreparedCall c("get", other);
+        EXPECT_FALSE(c.Check());
+        EXPECT_EQ(150, c.Resp()->GetError());
+        EXPECT_EQ("errorip", c.Resp()->GetServerError());
+
+        PreparedCall anywhere("anywhere", other);
+        EXPECT_TRUE(anywhere.Check());
+        EXPECT_EQ("root", anywhere.Req()->GetLoginUserName());
+    }
+    options.tokenProtect = true;
+    const std::string guarded = Login("root", options);
+    {
+        LogCapture log;
+        PreparedCall c("get", guarded);
+        EXPECT_FALSE(c.Check());
+        EXPECT_EQ(105, c.Resp()->GetError());
+        EXPECT_EQ("noprivilege", c.Resp()->GetServerError());
+        EXPECT_TRUE(log.Contains("WebEntry:566 Token Authentication Fail."));
+    }
+}
+
+TEST_F(PermissionCheckTest, AllowTimeoutDoesNotMoveTheLastUse)
+{
+    const std::string sid = Login("root");
+    Now() += 100;
+    {
+        PreparedCall c("poll", sid);
+        EXPECT_TRUE(c.Check());
+        EXPECT_EQ(J("[1, null]"), c.Slots());
+    }
+    EXPECT_EQ(kStart, LastUse(sid));
+    {
+        PreparedCall c("get", sid);
+        EXPECT_TRUE(c.Check());
+    }
+    EXPECT_EQ(kStart + 100, LastUse(sid));
+}
+
+TEST_F(PermissionCheckTest, UserClassesOfTheApiAndTheMethod)
+{
+    const std::string admin = Login("root");
+    const std::string normal = Login("daemon");
+    const struct {
+        const char* apiLevel;
+        const char* method;
+        const std::string& sid;
+        bool allowed;
+    } cases[] = {
+        {R"({"allowUser": ["admin.local"]})", "get", normal, false},
+        {R"({"allowUser": ["admin.local"]})", "get", admin, true},
+        {R"({"allowUser": ["admin.domain", "normal.local"]})", "get", normal, true},
+        {R"({"allowUser": ["Normal.local", 8]})", "get", normal, false},
+        {R"({"allowUser": []})", "get", normal, true},
+        {R"({"allowUser": "admin.local"})", "get", normal, true},
+        {R"({"allowUser": ["admin.local"]})", "own", normal, true},
+    };
+    for (const auto& c : cases) {
+        Declare(Desc(c.apiLevel));
+        PreparedCall call(c.method, c.sid);
+        EXPECT_EQ(c.allowed, call.Check()) << c.apiLevel << " " << c.method;
+        if (!c.allowed) {
+            EXPECT_EQ(105, call.Resp()->GetError());
+            EXPECT_FALSE(call.Resp()->HasServerError());
+        }
+    }
+}
+
+TEST_F(PermissionCheckTest, ApplicationPrivilegeIsCheckedFromTheClientAddress)
+{
+    const std::string normal = Login("daemon");
+    const std::string admin = Login("root");
+    Declare(Desc(R"({"appPriv": "VELA.Photo"})"));
+    {
+        PreparedCall c("get", normal);
+        EXPECT_FALSE(c.Check());
+        EXPECT_EQ(105, c.Resp()->GetError());
+    }
+    {
+        PreparedCall c("get", admin);
+        ASSERT_TRUE(c.Check());
+        EXPECT_TRUE(c.Req()->HasAppPriv("VELA.Photo"));
+    }
+    ASSERT_EQ(0, mkdir((root_.Path() + "/etc").c_str(), 0755));
+    ASSERT_EQ(0, mkdir((root_.Path() + "/etc/vela").c_str(), 0755));
+    ASSERT_TRUE(VELA::JsonWriteFile(root_.Path() + "/etc/vela/app_privileges.json",
+                                    J(R"({"applications": {"VELA.Photo": {"users": ["daemon"],
+                                        "allow_from": ["192.0.2.0/24"]}}})")));
+    {
+        PreparedCall c("get", normal);
+        EXPECT_TRUE(c.Check());
+    }
+}
+
+TEST_F(PermissionCheckTest, AccessTokenGrantsOnlyItsMethods)
+{
+    std::string token, id;
+    ASSERT_EQ(0, VelaAccessTokenCreate("daemon", {"VELA.Test.*"}, {"get"}, 0, token, id));
+    ScopedEnv tid("velaAccessToken", token.c_str());
+    {
+        PreparedCall c("get", "");
+        ASSERT_TRUE(c.Check());
+        EXPECT_EQ("daemon", c.Req()->GetLoginUserName());
+        EXPECT_FALSE(c.Req()->IsAdmin());
+        EXPECT_EQ("", c.Req()->GetSessionFilePath());
+        EXPECT_STREQ("daemon", getenv("VELA_WEBAPI_USERNAME"));
+    }
+    {
+        // A stale session cookie falls back to the token.
+        PreparedCall c("get", std::string(VELA_SESSION_ID_LEN, 'A'));
+        EXPECT_TRUE(c.Check());
+    }
+    {
+        PreparedCall c("poll", "");
+        EXPECT_FALSE(c.Check());
+        EXPECT_EQ(119, c.Resp()->GetError());
+        EXPECT_EQ("unauth", c.Resp()->GetServerError());
+        EXPECT_EQ("", c.Req()->GetLoginUserName());
+    }
+}
+
+TEST_F(PermissionCheckTest, SharingLinksAreRefused)
+{
+    LogCapture log;
+    PreparedCall c("get", "");
+    EXPECT_FALSE(PermissionCheck::CheckSharingPermission(c.Req(), c.Resp()));
+    EXPECT_EQ(105, c.Resp()->GetError());
+    EXPECT_TRUE(log.Contains("sharing links are not available"));
+}
+
+// The front end's hooks on a request built by Initialize from the CGI
+// environment: "_sid" of the query reaches the check through the cookie,
+// with the front end's own CGI handle, and both overloads share one cache.
+TEST_F(PermissionCheckTest, WebEntryHooksCheckTheSessionOfItsRequest)
+{
+    const std::string sid = Login("root");
+    ScopedEnv method("REQUEST_METHOD", "GET");
+    ScopedEnv cookie("HTTP_COOKIE", "id=stale");
+    ScopedEnv query("QUERY_STRING", ("api=VELA.Test.Perm&version=1&method=get&_sid=" + sid).c_str());
+    VELA::WebEntry entry;
+    APIRequest* req = entry.GetRequest();
+    APIResponse* resp = entry.GetResponseObject();
+    ASSERT_TRUE(entry.Initialize(Json::Value()));
+    ASSERT_TRUE(entry.CheckRequestParam(req, resp));
+    ASSERT_TRUE(entry.AddAPIInfo(req));
+
+    EXPECT_TRUE(entry.NeedPermission(req));
+    EXPECT_FALSE(entry.SkipPermission(req));
+    ASSERT_TRUE(entry.CheckPermission(req, resp));
+    EXPECT_EQ("root", req->GetLoginUserName());
+    EXPECT_EQ(root_.Path() + "/run/vela/sessions/" + sid, req->GetSessionFilePath());
+    ASSERT_EQ(0, VelaSessionRemove(sid.c_str()));
+    EXPECT_EQ(0, entry.CheckPermission(false));
+    EXPECT_EQ(105, entry.CheckPermission(true));
+
+    LogCapture log;
+    EXPECT_FALSE(entry.CheckSharingPermission(req, resp));
+    EXPECT_EQ(105, resp->GetError());
+    EXPECT_TRUE(log.Contains("sharing links are not available"));
+}
+
+}  // namespace
