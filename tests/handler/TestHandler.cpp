@@ -84,6 +84,10 @@ HANDLER_EXPORT void HandlerRefuse(VELA::APIRequest* req, VELA::APIResponse* resp
     try {
         Json::Value details(Json::objectValue);
         details["reason"] = "not admin";
+        // The verdict type under both of its spellings.
+        const _tag_authorized_result verdict = req->GetAuthResult();
+        const _tag_authorized_result_ same = verdict;
+        details["verdict"] = static_cast<int>(same);
         resp->SetError(WEBAPI_ERR_NO_PERMISSION, details);
         if (!resp->SetStatus(HTTP_STATUS_FORBIDDEN, "Forbidden") ||
             !resp->SetServerError("admin only")) {
