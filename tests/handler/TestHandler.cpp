@@ -18,6 +18,13 @@ using VELA::APIRequest;
 
 bool IsPositive(int const& v) { return v > 0; }
 
+// A handler picks a background-task code by its name; the client reads the
+// number. Each name must give the number of its meaning.
+static_assert(WEBAPI_ERR_POLLING_FINISH_FAILED == 501 && WEBAPI_ERR_POLLING_BAD_PARAMETER == 502 &&
+                  WEBAPI_ERR_POLLING_BAD_TASK_ID == 503 && WEBAPI_ERR_POLLING_NO_ADMIN_PERMISSION == 505 &&
+                  WEBAPI_ERR_POLLING_SIGNAL_FAILED == 506 && WEBAPI_ERR_POLLING_NO_SUCH_TASK == 508,
+              "background-task error codes");
+
 template <typename T>
 Json::Value Describe(APIParameter<T> const& p, Json::Value const& value)
 {
