@@ -251,20 +251,16 @@ bool APIValidator::IsBelong(APIParameter<std::string> const& p, Json::Value cons
     return ListHolds(list, Json::Value(p.Get()));
 }
 
-// An array or object is checked member value by member value; null (no
-// value at all) passes like an empty array; any other value is checked as a
-// single element.
+// An array or object is checked member value by member value. Null and the
+// scalars have no member values, so nothing of them is checked and they pass.
 bool APIValidator::IsBelong(APIParameter<Json::Value> const& p, Json::Value const& list)
 {
     if (p.IsInvalid() || !list.isArray()) {
         return false;
     }
     Json::Value const& value = p.Get();
-    if (value.isNull()) {
-        return true;
-    }
     if (!value.isArray() && !value.isObject()) {
-        return ListHolds(list, value);
+        return true;
     }
     for (Json::Value const& element : value) {
         if (!ListHolds(list, element)) {

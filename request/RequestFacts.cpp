@@ -37,48 +37,36 @@ std::string Text(const Json::Value& v)
     return v.isString() ? v.asString() : std::string();
 }
 
-long long Integer(const Json::Value& v, long long def)
-{
-    if (v.isInt64()) {
-        return v.asInt64();
-    }
-    if (v.isUInt64()) {
-        return def;  // above LLONG_MAX
-    }
-    if (v.isDouble()) {
-        double d = v.asDouble();
-        if (std::isfinite(d) && d > static_cast<double>(LLONG_MIN) && d < static_cast<double>(LLONG_MAX)) {
-            return static_cast<long long>(d);
-        }
-        return def;
-    }
-    if (!v.isString()) {
-        return def;
-    }
-    // Decimal text: the whole text a ParseDecimal number, `def` otherwise.
-    const char* begin = nullptr;
-    const char* end = nullptr;
-    long long value = def;
-    if (v.getString(&begin, &end) && ParseDecimal(begin, static_cast<size_t>(end - begin), LLONG_MIN, LLONG_MAX, value)) {
-        return value;
-    }
-    return def;
-}
-
 long long CheckedInteger(const Json::Value& v, long long min, long long max, long long def)
 {
     long long value = def;
     if (v.isInt64()) {
         value = v.asInt64();
-        return value >= min && value <= max ? value : def;
+    } else if (v.isDouble() && !v.isUInt64()) {
+        // A real: truncated when it fits long long (2^63 is the first
+        // double that does not; NaN fails both comparisons).
+        const double t = std::trunc(v.asDouble());
+        if (!(t >= -9223372036854775808.0 && t < 9223372036854775808.0)) {
+            return def;
+        }
+        value = static_cast<long long>(t);
+    } else if (v.isString()) {
+        const char* begin = nullptr;
+        const char* end = nullptr;
+        if (v.getString(&begin, &end) &&
+            ParseNumberText(begin, static_cast<size_t>(end - begin), min, max, value)) {
+            return value;
+        }
+        return def;
+    } else {
+        return def;  // also an unsigned integer above LLONG_MAX
     }
-    const char* begin = nullptr;
-    const char* end = nullptr;
-    if (v.isString() && v.getString(&begin, &end) &&
-        ParseDecimal(begin, static_cast<size_t>(end - begin), min, max, value)) {
-        return value;
-    }
-    return def;
+    return value >= min && value <= max ? value : def;
+}
+
+long long Integer(const Json::Value& v, long long def)
+{
+    return CheckedInteger(v, LLONG_MIN, LLONG_MAX, def);
 }
 
 long long ContentLength(const Json::Value& v, long long max)

@@ -12,14 +12,15 @@ namespace RequestFacts {
 bool Truthy(const Json::Value& v);
 // Text of a stored value: the string itself, "" for anything else.
 std::string Text(const Json::Value& v);
-// Integer of a stored value: integral numbers in range as they are, reals
-// truncated when in range, text that is exactly a decimal number
-// (ParseDecimal); `def` for everything else and on overflow. Never throws.
-long long Integer(const Json::Value& v, long long def);
-// Integer of a value that came from the client: a JSON integer, or text
-// that is exactly a decimal number (ParseDecimal), within [min, max];
-// `def` for everything else (reals, "1e0", " 1", "1\0", junk, overflow).
+// Integer of a value, the one reading of every number a client sends,
+// as a JSON number or as text: integers as they are, reals truncated
+// toward zero, text read by ParseNumberText (blanks around it and a
+// fraction allowed: " 5", "5.9" and 5.9 are all 5). Within [min, max];
+// `def` for everything else (booleans, null, containers, "1e0", "0x1",
+// "1\0", junk, NaN, overflow). Never throws.
 long long CheckedInteger(const Json::Value& v, long long min, long long max, long long def);
+// CheckedInteger over the whole range of long long, for stored values.
+long long Integer(const Json::Value& v, long long def);
 // CONTENT_LENGTH of the request's environment (VELA::ContentLength): 0 when
 // absent or empty, -1 for junk or more than `max`.
 long long ContentLength(const Json::Value& v, long long max);

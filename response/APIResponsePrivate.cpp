@@ -181,10 +181,11 @@ bool APIResponsePrivate::AddCookie(const std::string& name, const std::string& v
                 "AddCookie", name.c_str());
         return false;
     }
-    // The value is URL-encoded, but path and domain go into the line as they
-    // are: a line break there would end the Set-Cookie header early.
-    if (Cookie::HasLineBreak(value) || Cookie::HasLineBreak(path) || Cookie::HasLineBreak(domain)) {
-        VELA_LOG_ERR("cookie [%s] refused: line break in value, path or domain", name.c_str());
+    // The value is URL-encoded ("a\nb" goes out as "a%0Ab"), but path and
+    // domain go into the line as they are: a line break there would end the
+    // Set-Cookie header early.
+    if (Cookie::HasLineBreak(path) || Cookie::HasLineBreak(domain)) {
+        VELA_LOG_ERR("cookie [%s] refused: line break in path or domain", name.c_str());
         return false;
     }
     if (!sameSite.empty() && sameSite != "Strict" && sameSite != "Lax" && sameSite != "None") {

@@ -7,6 +7,7 @@
 #include <locale.h>
 #include <type_traits>
 
+#include "request/RequestFacts.h"
 #include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 
@@ -28,38 +29,10 @@ bool HasLineBreak(const std::string& text)
     return text.find_first_of("\r\n") != std::string::npos;
 }
 
-// Decimal text with an optional sign and at least one digit, nothing else.
-// False on any other character or when the number leaves time_t.
-static bool ParseDecimal(const std::string& text, time_t& out)
-{
-    // A leading "+" is allowed here besides the "-" of VELA::ParseDecimal.
-    const bool plus = !text.empty() && text[0] == '+';
-    long long value = 0;
-    if (!VELA::ParseDecimal(text.data() + (plus ? 1 : 0), text.size() - (plus ? 1 : 0),
-                            plus ? 0 : std::numeric_limits<time_t>::min(), std::numeric_limits<time_t>::max(),
-                            value)) {
-        return false;
-    }
-    out = static_cast<time_t>(value);
-    return true;
-}
-
 time_t ParseClientTime(const Json::Value& value)
 {
-    if (value.isString()) {
-        time_t parsed = 0;
-        return ParseDecimal(value.asString(), parsed) ? parsed : 0;
-    }
-    // isInt64() holds for integers and for doubles with an integral value in
-    // range, and never for booleans, so asInt64() can not throw here.
-    if (value.isInt64()) {
-        Json::Int64 n = value.asInt64();
-        if (n < std::numeric_limits<time_t>::min() || n > std::numeric_limits<time_t>::max()) {
-            return 0;
-        }
-        return static_cast<time_t>(n);
-    }
-    return 0;
+    return static_cast<time_t>(RequestFacts::CheckedInteger(value, std::numeric_limits<time_t>::min(),
+                                                            std::numeric_limits<time_t>::max(), 0));
 }
 
 // The "C" locale for strftime_l, so a locale the process may have set can not

@@ -19,9 +19,10 @@ bool IsValidName(const std::string& name);
 // True when `text` holds CR or LF.
 bool HasLineBreak(const std::string& text);
 
-// The seconds of a "client_time" parameter: an integral JSON number, or text
-// of decimal digits with an optional sign. Anything else, or a number that
-// does not fit time_t, gives 0.
+// The seconds of a "client_time" parameter, read as an integer like every
+// number a client sends (RequestFacts::CheckedInteger: a real or a text with
+// a fraction is truncated, blanks around a text are skipped). Anything else,
+// or a number that does not fit time_t, gives 0.
 time_t ParseClientTime(const Json::Value& value);
 
 // Writes the expiry date `reference` + `minutes` * 60 as

@@ -15,3 +15,7 @@ enum _tag_authorized_result_ : int {
     AUTH_RESULT_IP_MISMATCH = -8,     // client address differs from the session's
 };
 typedef enum _tag_authorized_result_ AUTHORIZED_RESULT;
+// The same type without the trailing underscore, the spelling some handler
+// code uses: `_tag_authorized_result v = AUTH_RESULT_AUTHORIZED;` compiles
+// as with the name above.
+typedef enum _tag_authorized_result_ _tag_authorized_result;

@@ -39,6 +39,60 @@ inline bool ParseDecimal(const std::string& text, long long min, long long max, 
 {
     return ParseDecimal(text.data(), text.size(), min, max, out);
 }
+// The integer of a number a client sent as text in a parameter, read as the
+// integer conversion of a JSON number reads it: blanks (space, tab) before
+// and after it are skipped, a "+" or "-" may lead, and a fraction ("." and
+// at least one digit) is dropped, truncating toward zero ("-0.5" is 0).
+// Nothing else: no exponent, no hex, no other byte (NUL included), at
+// least one digit before any ".". The digits before the "." go through
+// ParseDecimal, so the same range check and overflow refusal apply. Linear;
+// true and `out` set, or false and `out` untouched.
+inline bool ParseNumberText(const char* text, size_t len, long long min, long long max, long long& out)
+{
+    if (text == nullptr) {
+        return false;
+    }
+    const auto isBlank = [](char c) { return c == ' ' || c == '\t'; };
+    const auto isDigit = [](char c) { return c >= '0' && c <= '9'; };
+    size_t begin = 0;
+    size_t end = len;
+    while (begin < end && isBlank(text[begin])) {
+        ++begin;
+    }
+    while (end > begin && isBlank(text[end - 1])) {
+        --end;
+    }
+    size_t sign = begin;  // where the "-" is, when there is one
+    if (begin < end && (text[begin] == '+' || text[begin] == '-')) {
+        ++begin;
+    }
+    size_t digits = begin;
+    bool zero = true;
+    while (digits < end && isDigit(text[digits])) {
+        zero = zero && text[digits] == '0';
+        ++digits;
+    }
+    if (digits == begin) {
+        return false;
+    }
+    size_t i = digits;
+    if (i < end && text[i] == '.') {
+        const size_t fraction = ++i;
+        while (i < end && isDigit(text[i])) {
+            ++i;
+        }
+        if (i == fraction) {
+            return false;
+        }
+    }
+    if (i != end) {
+        return false;
+    }
+    // A "-" before a zero integer part is no sign at all: "-0.5" is 0.
+    const bool negative = sign < begin && text[sign] == '-' && !zero;
+    const size_t from = negative ? sign : begin;
+    return ParseDecimal(text + from, digits - from, min, max, out);
+}
 // CONTENT_LENGTH as every reader of the request body sees it: no variable
 // (null) or empty text is 0, no body (RFC 3875 section 4.1.2); otherwise the
 // whole text must be a ParseDecimal number in [0, max]. -1 for anything

@@ -27,12 +27,13 @@ enum _tag_WEBAPI_ERR {
     WEBAPI_ERR_SHARING_FIRST = 122,         // 122..127: sharing-link refusals
     WEBAPI_ERR_SHARING_LAST = 127,
     WEBAPI_ERR_REMOTE_IP = 150,             // client address refused for this session
-    WEBAPI_ERR_POLLING_START = 501,
-    WEBAPI_ERR_POLLING_STATUS = 502,
-    WEBAPI_ERR_POLLING_STOP = 503,
-    WEBAPI_ERR_POLLING_LIST = 505,
-    WEBAPI_ERR_POLLING_GROUP = 506,
-    WEBAPI_ERR_POLLING_OTHER = 508,
+    // Background tasks (APIPolling), named after what went wrong:
+    WEBAPI_ERR_POLLING_FINISH_FAILED = 501,       // the task could not be marked finished
+    WEBAPI_ERR_POLLING_BAD_PARAMETER = 502,       // no request, or bad parameters
+    WEBAPI_ERR_POLLING_BAD_TASK_ID = 503,         // malformed task id, or its owner refused
+    WEBAPI_ERR_POLLING_NO_ADMIN_PERMISSION = 505, // the "admin" group asked by a non-administrator
+    WEBAPI_ERR_POLLING_SIGNAL_FAILED = 506,       // the task's worker could not be signalled
+    WEBAPI_ERR_POLLING_NO_SUCH_TASK = 508,        // no task of that id
 };
 
 // HTTP status codes; the value is the code itself.

@@ -82,7 +82,8 @@ public:
     // `path` required. `expireMinutes` > 0 expires that many minutes after
     // the reference time (the request's "client_time" when given, else now),
     // 0 lasts the browser session, < 0 deletes the cookie. The value is
-    // URL-encoded; `domain` is written when non-empty.
+    // URL-encoded, so any bytes may be in it; `domain` is written when
+    // non-empty. A path or domain holding CR or LF refuses the cookie.
     bool AddCookie(std::string const& name, std::string const& value, std::string const& path,
                    long expireMinutes, std::string const& domain, bool secure, bool httpOnly);
     // The same, with "; SameSite=<sameSite>" at the end of the line:

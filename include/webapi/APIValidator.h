@@ -55,8 +55,10 @@ public:
 
     // `list` is an array holding the string.
     static bool IsBelong(APIParameter<std::string> const& p, Json::Value const& list);
-    // `list` is an array holding every element (member value) of the value;
-    // an empty value passes.
+    // `list` is an array holding every element (member value) of the value.
+    // A value without elements passes: null, an empty array or object, and
+    // any number, string or boolean, whether `list` holds it or not. Check
+    // a single value with the string form above or with IsEqual.
     static bool IsBelong(APIParameter<Json::Value> const& p, Json::Value const& list);
 
 private:

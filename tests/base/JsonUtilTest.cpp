@@ -1,4 +1,5 @@
 // JsonFlag: how description and request settings read as yes or no.
+// JsonToString: the text every answer is written as.
 #include <gtest/gtest.h>
 
 #include "support/JsonLiteral.h"
@@ -17,6 +18,47 @@ TEST(JsonFlag, BooleansNumbersAndEverythingElse)
     }
     EXPECT_FALSE(VELA::JsonFlag(Json::Value()));
     EXPECT_TRUE(VELA::JsonFlag(Json::Value(), true));
+}
+
+// Bytes that are not UTF-8 (a file name can hold any) reach the text as one
+// U+FFFD each; well-formed text, however long its sequences, is untouched.
+TEST(JsonToString, EveryByteOutsideUTF8BecomesOneReplacementCharacter)
+{
+    const std::string R = "\xef\xbf\xbd";
+    const struct {
+        std::string in, out;
+    } cases[] = {
+        // U+00E9, U+20AC, U+1F600, U+FFFD itself, U+D7FF, U+E000, U+10FFFF, DEL.
+        {"\xc3\xa9\xe2\x82\xac\xf0\x9f\x98\x80\xef\xbf\xbd\xed\x9f\xbf\xee\x80\x80\xf4\x8f\xbf\xbf\x7f",
+         "\xc3\xa9\xe2\x82\xac\xf0\x9f\x98\x80\xef\xbf\xbd\xed\x9f\xbf\xee\x80\x80\xf4\x8f\xbf\xbf\x7f"},
+        // Overlong forms of "/" and of U+07FF.
+        {"\xc0\xaf", R + R},
+        {"\xc1\xbf", R + R},
+        {"\xe0\x80\xaf", R + R + R},
+        {"\xe0\x9f\xbf", R + R + R},
+        {"\xf0\x80\x80\xaf", R + R + R + R},
+        // Surrogates, high and low.
+        {"\xed\xa0\x80", R + R + R},
+        {"\xed\xbf\xbf", R + R + R},
+        // Above U+10FFFF, and bytes that never start a sequence.
+        {"\xf4\x90\x80\x80", R + R + R + R},
+        {"\xf5\x80\x80\x80", R + R + R + R},
+        {"a\xf8\xfe\xff" "b", "a" + R + R + R + "b"},
+        // Stray continuation bytes; a sequence cut short, inside and at the end.
+        {"\x80\xbf", R + R},
+        {"\xe2\x82" "a", R + R + "a"},
+        {"\xff\xc3\xa9", R + "\xc3\xa9"},
+        {"a\xc3", "a" + R},
+        {"a\xe2\x82", "a" + R + R},
+        {"a\xf0\x9f\x98", "a" + R + R + R},
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ("\"" + c.out + "\"", VELA::JsonToString(Json::Value(c.in))) << c.in;
+    }
+    // Member names are text of the answer as well; escapes stay escapes.
+    Json::Value object(Json::objectValue);
+    object["k\xff"] = std::string("\x01\"\xed\xa0\x80", 5);
+    EXPECT_EQ("{\"k" + R + "\":\"\\u0001\\\"" + R + R + R + "\"}", VELA::JsonToString(object));
 }
 
 }  // namespace

@@ -106,7 +106,7 @@ void RunRefuse(HandlerFn fn)
     VELA::APIRequest req(Parse(R"({"environ": {"HTTP_HOST": "nas"}})"));
     VELA::APIResponse resp(&req);
     fn(&req, &resp);
-    CheckJson(Parse(R"({"success": false, "error": {"code": 105, "errors": {"reason": "not admin"}}})"),
+    CheckJson(Parse(R"({"success": false, "error": {"code": 105, "errors": {"reason": "not admin", "verdict": -4}}})"),
               resp.GetBody(), "refuse: body");
     Check(resp.GetError() == 105, "refuse: error code");
     Check(resp.GetStatus() == 403, "refuse: status");

@@ -18,6 +18,13 @@ using VELA::APIRequest;
 
 bool IsPositive(int const& v) { return v > 0; }
 
+// A handler picks a background-task code by its name; the client reads the
+// number. Each name must give the number of its meaning.
+static_assert(WEBAPI_ERR_POLLING_FINISH_FAILED == 501 && WEBAPI_ERR_POLLING_BAD_PARAMETER == 502 &&
+                  WEBAPI_ERR_POLLING_BAD_TASK_ID == 503 && WEBAPI_ERR_POLLING_NO_ADMIN_PERMISSION == 505 &&
+                  WEBAPI_ERR_POLLING_SIGNAL_FAILED == 506 && WEBAPI_ERR_POLLING_NO_SUCH_TASK == 508,
+              "background-task error codes");
+
 template <typename T>
 Json::Value Describe(APIParameter<T> const& p, Json::Value const& value)
 {
@@ -84,6 +91,10 @@ HANDLER_EXPORT void HandlerRefuse(VELA::APIRequest* req, VELA::APIResponse* resp
     try {
         Json::Value details(Json::objectValue);
         details["reason"] = "not admin";
+        // The verdict type under both of its spellings.
+        const _tag_authorized_result verdict = req->GetAuthResult();
+        const _tag_authorized_result_ same = verdict;
+        details["verdict"] = static_cast<int>(same);
         resp->SetError(WEBAPI_ERR_NO_PERMISSION, details);
         if (!resp->SetStatus(HTTP_STATUS_FORBIDDEN, "Forbidden") ||
             !resp->SetServerError("admin only")) {

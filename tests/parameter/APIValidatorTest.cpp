@@ -145,11 +145,13 @@ TEST(Membership, StringAndJson)
     EXPECT_FALSE(V::IsBelong(Param(std::string("a"), true), strings));
     EXPECT_FALSE(V::IsBelong(Param(std::string("a")), Parse("{\"a\":\"a\"}")));
 
+    // Every element of the value must be in the list: a scalar has none, so
+    // any scalar passes, in the list or not.
     Json::Value list = Parse("[1,2,3,\"x\"]");
-    for (const char* in : {"[1,2]", "{\"p\":3,\"q\":\"x\"}", "[]", "null", "2"}) {
+    for (const char* in : {"[1,2]", "{\"p\":3,\"q\":\"x\"}", "[]", "null", "2", "4", "\"y\"", "true", "0.5"}) {
         EXPECT_TRUE(V::IsBelong(Param(Parse(in)), list)) << in;
     }
-    for (const char* out : {"[1,4]", "{\"p\":4}", "4"}) {
+    for (const char* out : {"[1,4]", "{\"p\":4}", "[[1]]"}) {
         EXPECT_FALSE(V::IsBelong(Param(Parse(out)), list)) << out;
     }
     EXPECT_FALSE(V::IsBelong(Param(Parse("[1]")), Parse("{\"a\":1}")));
