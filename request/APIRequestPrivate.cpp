@@ -161,8 +161,8 @@ void APIRequestPrivate::SetAPIDesc(const Json::Value& params)
     }
     if (const Json::Value* version = params.find("version", "version" + 7)) {
         // Only an integer or exact decimal text names a version: "1e0",
-        // " 1" or "1%00" name none (0), which the registry refuses.
-        apiVersion = static_cast<int>(RequestFacts::CheckedInteger(*version, INT_MIN, INT_MAX, 0));
+        // " 1", "1.0" or "1%00" name none (0), which the registry refuses.
+        apiVersion = static_cast<int>(RequestFacts::ExactInteger(*version, INT_MIN, INT_MAX, 0));
     }
     if (const Json::Value* method = params.find("method", "method" + 6)) {
         apiMethod = RequestFacts::Text(*method);

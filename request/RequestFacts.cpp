@@ -64,6 +64,22 @@ long long CheckedInteger(const Json::Value& v, long long min, long long max, lon
     return value >= min && value <= max ? value : def;
 }
 
+long long ExactInteger(const Json::Value& v, long long min, long long max, long long def)
+{
+    long long value = def;
+    if (v.isInt64()) {
+        value = v.asInt64();
+        return value >= min && value <= max ? value : def;
+    }
+    const char* begin = nullptr;
+    const char* end = nullptr;
+    if (v.isString() && v.getString(&begin, &end) &&
+        ParseDecimal(begin, static_cast<size_t>(end - begin), min, max, value)) {
+        return value;
+    }
+    return def;
+}
+
 long long Integer(const Json::Value& v, long long def)
 {
     return CheckedInteger(v, LLONG_MIN, LLONG_MAX, def);

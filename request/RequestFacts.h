@@ -19,6 +19,12 @@ std::string Text(const Json::Value& v);
 // `def` for everything else (booleans, null, containers, "1e0", "0x1",
 // "1\0", junk, NaN, overflow). Never throws.
 long long CheckedInteger(const Json::Value& v, long long min, long long max, long long def);
+// Integer of a value that selects what runs ("version"): a JSON integer, or
+// text that is exactly a decimal number (ParseDecimal), within [min, max];
+// `def` for everything else (" 1", "+1", "1.0", reals, "1e0", "1\0").
+// Stricter than CheckedInteger on purpose: whoever else reads the request
+// on its way (a proxy, a filter, a log reader) must see the same version.
+long long ExactInteger(const Json::Value& v, long long min, long long max, long long def);
 // CheckedInteger over the whole range of long long, for stored values.
 long long Integer(const Json::Value& v, long long def);
 // CONTENT_LENGTH of the request's environment (VELA::ContentLength): 0 when

@@ -1,8 +1,8 @@
 #!/usr/bin/env bash
 # End-to-end: what one client can make the server spend. A form body built to
 # make the parser quadratic, a body that never arrives, more requests at once
-# than a client may have, and "version" texts around 1, each through a
-# private lighttpd.
+# than a client may have, and "version" texts that only look like 1, each
+# through a private lighttpd.
 #
 # usage: limits.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR
 set -u
@@ -49,18 +49,17 @@ took=$(($(date +%s) - start))
 expect "16 MiB of &" '"success":false' '"code":101'
 echo "16 MiB of & answered in $took s"
 
-# ---- "version" texts that are no number name no version (101), whoever
-# refuses them: "1%00" is refused by lighttpd itself, in the same JSON shape.
-for v in '1%00' '1e0' '0x1' '1.' '99999999999999999999'; do
+# ---- "version" texts that are not exactly a number name no version (101),
+# whoever refuses them: "1%00" is refused by lighttpd itself, in the same
+# JSON shape. Other numbers sent as text may carry blanks or a fraction;
+# the version, which selects what runs, may not.
+for v in '1%00' '1e0' '%201' '%2B1' '1.0' '1.' '0x1' '99999999999999999999'; do
   call "$URL?api=VELA.Sample&version=$v&method=echo"
   expect "version $v" '"success":false' '"code":101'
   expect_header "version $v" 'Content-Type: application/json'
 done
-# A number read as an integer, blanks around it, sign and fraction allowed.
-for v in '1' '%201' '%2B1' '1.0' '1.9%20'; do
-  call "$URL?api=VELA.Sample&version=$v&method=echo"
-  expect "version $v reaches the session check" '"code":119'
-done
+call "$URL?api=VELA.Sample&version=1&method=echo"
+expect "version 1 reaches the session check" '"code":119'
 
 # ---- lighttpd's other refusals answer JSON too.
 call -H "X-Big: $(head -c 70000 /dev/zero | tr '\0' a)" "$URL?api=VELA.Sample&version=1&method=echo"

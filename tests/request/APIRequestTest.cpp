@@ -81,18 +81,17 @@ TEST(RequestParam, BodyOverridesQuery)
     EXPECT_EQ(J("[1]"), r.GetParam("p"));
 }
 
-TEST(RequestParam, VersionReadsAsAnInteger)
+TEST(RequestParam, OnlyAnIntegerOrExactDecimalTextIsAVersion)
 {
-    // Like every number sent as text: blanks around it and a sign are
-    // allowed, a fraction is dropped, a real is truncated.
-    for (const char* v : {R"(" 2")", R"("2\t ")", R"("+2")", R"("2.9")", R"("02.0")", "2.5"}) {
+    for (const char* v : {"2", R"("2")", R"("02")"}) {
         SCOPED_TRACE(v);
         APIRequest r(J(std::string(R"({"getParam": {"version": )") + v + "}}"));
         EXPECT_EQ(2, r.GetAPIVersion());
     }
-    // Anything else, or a number outside int, is no version at all.
-    for (const char* v : {R"("abc")", "[]", "{}", "true", "99999999999", "-99999999999", "1e10", R"("")", R"(" ")",
-                          R"("1e0")", R"("0x1")", R"("1\u0000")", R"("1.")", R"(".5")", R"("1 2")", R"("- 1")"}) {
+    // Texts that merely look like 2 (blanks, sign, fraction), reals and
+    // numbers outside int name no version, unlike other numbers sent as text.
+    for (const char* v : {R"(" 2")", R"("2\t ")", R"("+2")", R"("2.9")", R"("2.0")", "2.5", R"("abc")", "[]", "{}",
+                          "true", "99999999999", "-99999999999", R"("")", R"("1e0")", R"("0x1")", R"("1\u0000")"}) {
         SCOPED_TRACE(v);
         APIRequest r(J(std::string(R"({"getParam": {"version": )") + v + "}}"));
         EXPECT_EQ(0, r.GetAPIVersion());
