@@ -8,6 +8,7 @@
 #include <sys/stat.h>
 #include <vector>
 
+#include "dispatcher/APIRunnerPrivate.h"
 #include "platform/StateRootTest.h"
 #include "support/JsonLiteral.h"
 #include "support/TestSupport.h"
@@ -35,7 +36,7 @@ public:
     // (version 1) with the session cookie `sid` ("" for none).
     void Prepare(const Json::Value& desc, const std::string& method, const std::string& sid)
     {
-        libDesc_[kApi] = desc;
+        d_->registry.Table()[kApi] = desc;
         Json::Value env(Json::objectValue);
         env["REQUEST_METHOD"] = "GET";
         if (!sid.empty()) {
