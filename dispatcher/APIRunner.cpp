@@ -1,25 +1,20 @@
-// The runner pipeline: Run -> Initialize -> SetProcessName -> Process ->
-// (CheckRequestParam, AddAPIInfo) -> ProcessEntry or ProcessLib -> handler.
-// Every stage returns whether to go on; the stage that refuses sets the
-// response's error code, callers never set another.
+// The runner: Run -> Initialize -> SetProcessName -> Process, which walks the
+// road of Road.cpp. This file holds the runner's life, the default hooks,
+// the entry points of the road and the road's stages that ask the hooks.
+// The stage that refuses sets the response's error code; callers never set
+// another.
 #include "webapi/APIRunner.h"
 #include "webapi/JsonUtil.h"
 
-#include <cerrno>
-#include <climits>
-#include <cstdio>
 #include <cstring>
 #include <exception>
-#include <fstream>
-#include <iostream>
-#include <sys/prctl.h>
-#include <sys/resource.h>
-#include <syslog.h>
 #include <unistd.h>
 
 #include "dispatcher/APIRunnerPrivate.h"
-#include "dispatcher/ExecContext.h"
+#include "dispatcher/ProcessName.h"
 #include "dispatcher/Refusal.h"
+#include "dispatcher/ResolvedCall.h"
+#include "dispatcher/Road.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
@@ -37,155 +32,6 @@ namespace {
 const char kLibDefPath[] = "/usr/vela/velaman/webapi/lib.def";
 const char kEntryAPI[] = "VELA.Entry.Request";
 
-// The log identity (first 1,024 bytes) and the thread name (last 17). syslog
-// keeps the pointer given to openlog, so this outlives every call.
-constexpr size_t kIdentSize = 1024;
-constexpr size_t kThreadNameSize = 17;
-char g_procName[kIdentSize + kThreadNameSize];
-
-char* LogIdent() { return g_procName; }
-char* ThreadName() { return g_procName + kIdentSize; }
-
-// Control bytes of a client-chosen name must not reach the log identity or
-// ps: they become "?".
-void Sanitize(char* text)
-{
-    for (unsigned char* p = reinterpret_cast<unsigned char*>(text); *p; ++p) {
-        if (*p < 0x20 || *p == 0x7f) {
-            *p = '?';
-        }
-    }
-}
-
-// What a call changes around its handler and puts back on every way out:
-// the standard stream objects, the scheduling priority and the working
-// directory.
-class CallScope {
-public:
-    CallScope() = default;
-    CallScope(const CallScope&) = delete;
-    CallScope& operator=(const CallScope&) = delete;
-    ~CallScope() { Restore(); }
-
-    // std::cin reads /dev/null unless `keepIn`; std::cout writes to
-    // /dev/null unless `keepOut`. Only the stream objects change; the file
-    // descriptors stay as they are.
-    void RedirectStreams(bool keepIn, bool keepOut)
-    {
-        if (!keepIn) {
-            if (nullIn_.open("/dev/null", std::ios::in)) {
-                oldIn_ = std::cin.rdbuf(&nullIn_);
-            } else {
-                VELA_LOG_ERR("cannot open /dev/null for reading");
-            }
-        }
-        if (!keepOut) {
-            std::cout.flush();
-            if (nullOut_.open("/dev/null", std::ios::out | std::ios::trunc)) {
-                oldOut_ = std::cout.rdbuf(&nullOut_);
-            } else {
-                VELA_LOG_ERR("cannot open /dev/null for writing");
-            }
-        }
-    }
-
-    // Sets the nice value `priority` when the process runs with another.
-    void SetPriority(int priority)
-    {
-        errno = 0;
-        const int current = getpriority(PRIO_PROCESS, 0);
-        if (current == -1 && errno != 0) {
-            VELA_LOG_ERR("getpriority failed [%m]");
-            return;
-        }
-        if (current == priority) {
-            return;
-        }
-        if (setpriority(PRIO_PROCESS, 0, priority) != 0) {
-            VELA_LOG_ERR("setpriority(%d) failed [%m]", priority);
-            return;
-        }
-        oldPriority_ = current;
-        priorityChanged_ = true;
-    }
-
-    bool SaveCwd()
-    {
-        char buf[PATH_MAX];
-        if (getcwd(buf, sizeof(buf)) == nullptr) {
-            VELA_LOG_ERR("getcwd failed [%m]");
-            return false;
-        }
-        cwd_ = buf;
-        return true;
-    }
-
-    void Restore()
-    {
-        if (priorityChanged_) {
-            priorityChanged_ = false;
-            if (setpriority(PRIO_PROCESS, 0, oldPriority_) != 0) {
-                VELA_LOG_ERR("setpriority(%d) failed [%m]", oldPriority_);
-            }
-        }
-        if (oldIn_) {
-            std::cin.rdbuf(oldIn_);
-            oldIn_ = nullptr;
-        }
-        if (oldOut_) {
-            std::cout.rdbuf(oldOut_);
-            oldOut_ = nullptr;
-        }
-        nullIn_.close();
-        nullOut_.close();
-        if (!cwd_.empty()) {
-            if (chdir(cwd_.c_str()) != 0) {
-                VELA_LOG_ERR("cannot change back to %s [%m]", cwd_.c_str());
-            }
-            cwd_.clear();
-        }
-    }
-
-private:
-    std::filebuf nullIn_;
-    std::filebuf nullOut_;
-    std::streambuf* oldIn_ = nullptr;
-    std::streambuf* oldOut_ = nullptr;
-    int oldPriority_ = 0;
-    bool priorityChanged_ = false;
-    std::string cwd_;
-};
-
-bool Matches(const char* api, int version, const char* method, const std::string& wantApi, int wantVersion,
-             const std::string& wantMethod)
-{
-    return version == wantVersion && api != nullptr && method != nullptr && wantApi == api &&
-           wantMethod == method;
-}
-
-// The check of the entry for the call, or of the terminating entry when none
-// names it: a terminating entry's check vets every call no entry names.
-APICheckFn FindCheck(const _tag_API_CHECK_TABLE* check, const std::string& api, int version,
-                     const std::string& method)
-{
-    const _tag_API_CHECK_TABLE* e = check;
-    while (e->api != nullptr && !Matches(e->api, e->version, e->method, api, version, method)) {
-        ++e;
-    }
-    return e->check;
-}
-
-const _tag_API_TABLE* FindEntry(const _tag_API_TABLE* table, const std::string& api, int version,
-                                const std::string& method)
-{
-    for (const _tag_API_TABLE* e = table; e->api != nullptr; ++e) {
-        if (Matches(e->api, e->version, e->method, api, version, method)) {
-            return e;
-        }
-    }
-    return nullptr;
-}
-
 // The answer of the exec calls until the exec handler exists.
 void ExecUnavailable(Json::Value& out, const char* api, const char* method)
 {
@@ -199,21 +45,12 @@ void ExecUnavailable(Json::Value& out, const char* api, const char* method)
 
 // ---- Construction -----------------------------------------------------------------
 
-APIRunner::APIRunner()
-    : libDef_(Json::objectValue),
-      libDesc_(Json::objectValue),
-      request_(new APIRequest()),
-      response_(nullptr),
-      compoundDepth_(0),
-      d_(nullptr)
+APIRunner::APIRunner() : request_(new APIRequest()), response_(nullptr), d_(nullptr)
 {
     response_ = new APIResponse(request_);
     d_ = new APIRunnerPrivate(this);
     setsid();
-    Json::Value def;
-    if (WebAPIUtil::ReadJsonFile(VelaPath(kLibDefPath), def) && def.isObject()) {
-        libDef_ = def;
-    }
+    d_->registry.LoadDefaults(VelaPath(kLibDefPath));
 }
 
 APIRunner::~APIRunner()
@@ -223,14 +60,7 @@ APIRunner::~APIRunner()
     response_ = nullptr;
     delete request_;
     request_ = nullptr;
-
-    const std::string& orig = d_->GetOrigProcName();
-    d_->SetArgv0(orig.c_str());
-    closelog();
-    snprintf(LogIdent(), kIdentSize, "%s", orig.c_str());
-    openlog(LogIdent(), LOG_CONS | LOG_PID, LOG_USER);
-    snprintf(ThreadName(), kThreadNameSize, "%.16s", orig.c_str());
-    prctl(PR_SET_NAME, ThreadName(), 0, 0, 0);
+    RestoreProcessName(*d_);
     delete d_;
 }
 
@@ -327,39 +157,29 @@ bool APIRunner::Process(APIRequest* req, APIResponse* resp)
     if (req == nullptr || resp == nullptr) {
         return false;
     }
-    if (!SetProcessName(req, resp)) {
-        return false;
+    ResolvedCall call(*this, *d_, req, resp);
+    const bool served = WalkRoad(call, RoadStart());
+    if (call.named) {
+        // A sub-request may have renamed the process.
+        NameProcess(*d_, call.name, call.version, call.method, resp);
     }
-    if (!CheckRequestParam(req, resp) || !AddAPIInfo(req)) {
-        return false;
-    }
-    if (req->HasParam("relay_ds")) {
-        VELA_REFUSE(resp, WEBAPI_ERR_RELAY_FAILED, "relaying %s to another service is not available",
-                    LogSafe(req->GetAPIClass()).c_str());
-        return false;
-    }
-    bool result = false;
-    try {
-        result = req->GetAPIClass() == kEntryAPI ? ProcessEntry(req, resp) : ProcessLib(req, resp);
-    } catch (const std::exception& e) {
-        VELA_LOG_ERR("%s failed: %s", req->GetAPIClass().c_str(), e.what());
-    } catch (...) {
-        VELA_LOG_ERR("%s failed", req->GetAPIClass().c_str());
-    }
-    // A compound sub-request may have renamed the process.
-    SetProcessName(req, resp);
-    return result;
+    return served;
 }
 
 bool APIRunner::ProcessEntry(APIRequest* req, APIResponse* resp)
 {
-    if (req == nullptr || resp == nullptr || req->GetAPIMethod() != "request") {
+    if (req == nullptr || resp == nullptr) {
+        return false;
+    }
+    if (req->GetAPIMethod() != "request") {
+        // No error code of its own: the response stays as it is.
+        VELA_LOG_ERR("%s has no method \"%s\" here", kEntryAPI, LogSafe(req->GetAPIMethod()).c_str());
         return false;
     }
     if (req->HasParam("compound")) {
-        ++compoundDepth_;
+        ++d_->compoundDepth;
         const bool result = HandleCompound(req, resp);
-        --compoundDepth_;
+        --d_->compoundDepth;
         return result;
     }
     VELA_REFUSE(resp, WEBAPI_ERR_COMPOUND_OR_FORK, "%s request without \"compound\"", kEntryAPI);
@@ -378,151 +198,60 @@ bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)
     if (req == nullptr || resp == nullptr) {
         return false;
     }
-    // 1. Permission: a refusal stops the call unless SkipPermission says
-    //    to go on.
-    bool allowed = true;
-    if (req->IsSharing()) {
-        allowed = CheckSharingPermission(req, resp);
-    } else if (NeedPermission(req)) {
-        allowed = CheckPermission(req, resp);
-    }
-    if (!allowed && !SkipPermission(req)) {
-        return false;
-    }
-
-    // 2. The call and its method's attributes. The call is fixed here, as
-    //    the checks saw it: whatever later steps merge into the request's
-    //    parameters (an upload's form fields), the library, the entry and
-    //    the identity below are those of this API, version and method.
-    const std::string api = req->GetAPIClass();
-    const std::string method = req->GetAPIMethod();
-    const int version = req->GetAPIVersion();
-    const Json::Value attrs = GetMethod(api, version, method);
-    auto attr = [&](const char* name) { return GetMethodAttr(api, version, method, name); };
-    const bool allowUpload = attr("allowUpload");
-    const bool allowDownload = attr("allowDownload");
-
-    // 3. Usage counting.
-    if (JsonFlag(request_->GetAttr("_collector_count_webapi"), false) && !attr("allowTimeout") &&
-        JsonFlag(req->GetAPIInfo("count"), true)) {
-        IncreaseCounter(req);
-    }
-
-    // 4. Upload.
-    if (req->IsUploadRequest()) {
-        if (!allowUpload || !HandleUpload(req, resp)) {
-            return false;
-        }
-    }
-
-    // 5. Handler library and its tables.
-    _tag_API_TABLE* table = nullptr;
-    _tag_API_CHECK_TABLE* check = nullptr;
-    if (!OpenLib(req, &table, &check)) {
-        // OpenLib has logged why.
-        resp->SetError(WEBAPI_ERR_LOAD_LIBRARY);
-        return false;
-    }
-    if (table == nullptr) {
-        VELA_REFUSE(resp, WEBAPI_ERR_LOAD_LIBRARY, "library of %s has no API table", LogSafe(api).c_str());
-        return false;
-    }
-
-    // 6., 7. Standard streams and priority; put back by `scope` (step 12)
-    //    on every way out from here on.
-    CallScope scope;
-    scope.RedirectStreams(allowUpload, allowDownload);
-    const Json::Value priority = req->GetAPIInfo("priority");
-    int nice = priority.isInt() ? priority.asInt() : 0;
-    nice = nice < -20 ? -20 : (nice > 19 ? 19 : nice);
-    scope.SetPriority(nice);
-
-    // 8. Check table, then the API table.
-    if (check != nullptr) {
-        APICheckFn checkFn = FindCheck(check, api, version, method);
-        if (checkFn != nullptr && !checkFn(req, resp)) {
-            return false;
-        }
-    }
-    const _tag_API_TABLE* entry = FindEntry(table, api, version, method);
-    if (entry == nullptr) {
-        VELA_REFUSE(resp, WEBAPI_ERR_METHOD_NOT_IN_TABLE, "%s %d %s is not in its library's API table",
-                    LogSafe(api).c_str(), version, LogSafe(method).c_str());
-        return false;
-    }
-    // A handler that answers nothing answers 117.
-    resp->SetError(WEBAPI_ERR_NO_RESPONSE);
-
-    // 9. Working directory and ids to come back to.
-    ExecContext identity;
-    if (!scope.SaveCwd()) {
-        return false;  // logged by SaveCwd; the preset 117 answers
-    }
-    if (!identity.SaveIds()) {
-        VELA_REFUSE(resp, WEBAPI_ERR_NO_RESPONSE, "cannot read the ids to come back to");
-        return false;
-    }
-
-    // 10. Identity of the call.
-    ExecIdentity want;
-    const Json::Value runAs = req->GetAPIInfo("runAs", VELA_RUNAS_SUPERUSER);
-    want.runAs = runAs.isString() ? runAs.asString() : VELA_RUNAS_SUPERUSER;
-    if (attrs.isObject()) {
-        const Json::Value* methodRunAs = attrs.find("runAs", "runAs" + 5);
-        if (methodRunAs != nullptr && methodRunAs->isString()) {
-            want.runAs = methodRunAs->asString();
-        }
-    }
-    want.loginName = req->GetLoginUserName();
-    want.grantable = attr("grantable");
-    want.grantByDefault = attr("grantByDefault");
-    want.grantByUser = attr("grantByUser");
-    if (!identity.Prepare(want)) {
-        return false;
-    }
-
-    // 11. The handler, then the identity back.
-    if (entry->handler != nullptr) {
-        try {
-            entry->handler(req, resp);
-        } catch (const std::exception& e) {
-            VELA_LOG_ERR("handler of %s %s failed: %s", api.c_str(), method.c_str(), e.what());
-        } catch (...) {
-            VELA_LOG_ERR("handler of %s %s failed", api.c_str(), method.c_str());
-        }
-    }
-    identity.Restore();
-    // 12. `scope` puts streams, priority and working directory back.
-    return entry->handler != nullptr;
+    ResolvedCall call(*this, *d_, req, resp);
+    ResolveFromRequest(call);
+    return WalkRoad(call, AskPermission);
 }
 
-bool APIRunner::SetProcessName(APIRequest* req, APIResponse* resp)
+// ---- Stages that ask the runner's hooks ---------------------------------------------
+
+Step RefuseRelay(ResolvedCall& call)
 {
-    if (req == nullptr || resp == nullptr) {
-        return false;
+    if (!call.req->HasParam("relay_ds")) {
+        return Step::kGoOn;
     }
-    const std::string api = req->GetAPIClass();
-    if (api.empty()) {
-        VELA_REFUSE(resp, WEBAPI_ERR_BAD_REQUEST, "request refused: no API name");
-        return false;
-    }
-    const std::string method = req->GetAPIMethod();
-    const int version = req->GetAPIVersion();
+    VELA_REFUSE(call.resp, WEBAPI_ERR_RELAY_FAILED, "relaying %s to another service is not available",
+                LogSafe(call.api).c_str());
+    return Step::kStop;
+}
 
-    snprintf(LogIdent(), kIdentSize, "%s_%s_%d_%s", d_->GetProcName().c_str(), api.c_str(), version,
-             method.c_str());
-    Sanitize(LogIdent());
-    closelog();
-    openlog(LogIdent(), LOG_CONS | LOG_PID, LOG_USER);
-    d_->SetArgv0(LogIdent());
-
-    snprintf(ThreadName(), kThreadNameSize, "%s_%d_%s", api.c_str(), version, method.c_str());
-    Sanitize(ThreadName());
-    if (prctl(PR_SET_NAME, ThreadName(), 0, 0, 0) != 0) {
-        VELA_REFUSE(resp, WEBAPI_ERR_PROCESS_NAME, "Set process name fail[%m]");
-        return false;
+Step RunEntryAPI(ResolvedCall& call)
+{
+    if (call.api != kEntryAPI) {
+        return Step::kGoOn;
     }
-    return true;
+    return call.runner.ProcessEntry(call.req, call.resp) ? Step::kServed : Step::kStop;
+}
+
+// A refusal of the permission hooks stops the call unless SkipPermission
+// says to go on; the hook has set the error.
+Step AskPermission(ResolvedCall& call)
+{
+    APIRunner& runner = call.runner;
+    bool allowed = true;
+    if (call.req->IsSharing()) {
+        allowed = runner.CheckSharingPermission(call.req, call.resp);
+    } else if (runner.NeedPermission(call.req)) {
+        allowed = runner.CheckPermission(call.req, call.resp);
+    }
+    if (!allowed && !runner.SkipPermission(call.req)) {
+        return Step::kStop;
+    }
+    return Step::kGoOn;
+}
+
+Step ReceiveUpload(ResolvedCall& call)
+{
+    if (!call.req->IsUploadRequest()) {
+        return Step::kGoOn;
+    }
+    if (!call.Flag("allowUpload")) {
+        // Only a call that skipped the description check gets here.
+        VELA_LOG_ERR("upload to %s %d %s refused: no \"allowUpload\"", LogSafe(call.api).c_str(), call.version,
+                     LogSafe(call.method).c_str());
+        return Step::kStop;
+    }
+    return call.runner.HandleUpload(call.req, call.resp) ? Step::kGoOn : Step::kStop;
 }
 
 // ---- Answer and after-reply work ----------------------------------------------------

@@ -63,6 +63,7 @@ void APIRunnerPrivate::SetArgs(int argc, char** argv)
     }
     argv0_ = argv[0];
     argv0Len_ = strlen(argv0_);
+    shown_ = kCgiName;
     memset(argv0_, 0, argv0Len_);
     memcpy(argv0_, kCgiName, std::min(argv0Len_, sizeof(kCgiName) - 1));
 }
@@ -75,6 +76,22 @@ void APIRunnerPrivate::SetArgv0(const char* name)
     memset(argv0_, 0, argv0Len_);
     // The byte after the area is argv[0]'s own terminator.
     snprintf(argv0_, argv0Len_ + 1, "%s", name);
+    shown_ = name;
+}
+
+bool APIRunnerPrivate::ShowsName(const char* name) const { return argv0_ == nullptr || shown_ == name; }
+
+bool APIRunnerPrivate::CheckName(const std::string& api, APIName& out)
+{
+    if (!api.empty() && api == lastChecked_.Text()) {
+        out = lastChecked_;
+        return true;
+    }
+    if (!APIName::Check(api, out)) {
+        return false;
+    }
+    lastChecked_ = out;
+    return true;
 }
 
 }  // namespace VELA

@@ -1,17 +1,29 @@
-// The identity of a handler call, and the scoped guard that runs a few
-// statements with full rights. The call's switches log under this file's
-// name; the guard logs under the file its user names.
+// What a handler call runs in: its standard streams, priority and working
+// directory, its identity, and the scoped guard that runs a few statements
+// with full rights; the road's stages that set them up and call the handler.
+// The call's switches log under this file's name; the guard logs under the
+// file its user names.
 #include "dispatcher/ExecContext.h"
 
 #include <algorithm>
 #include <cerrno>
+#include <climits>
 #include <cstring>
+#include <exception>
 #include <grp.h>
+#include <iostream>
+#include <sys/resource.h>
 #include <unistd.h>
 
+#include "dispatcher/Refusal.h"
+#include "dispatcher/ResolvedCall.h"
+#include "dispatcher/Road.h"
 #include "vela/log.h"
 #include "vela/uploaddir.h"
 #include "vela/user.h"
+#include "webapi/APIError.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
 #include "webapi/APIUtils.h"
 
 namespace VELA {
@@ -118,6 +130,83 @@ bool SwitchTo(Whom whom, const std::string& name, bool grantable)
 
 }  // namespace
 
+// ---- CallScope ------------------------------------------------------------------
+
+void CallScope::RedirectStreams(bool keepIn, bool keepOut)
+{
+    if (!keepIn) {
+        if (nullIn_.open("/dev/null", std::ios::in)) {
+            oldIn_ = std::cin.rdbuf(&nullIn_);
+        } else {
+            VELA_LOG_ERR("cannot open /dev/null for reading");
+        }
+    }
+    if (!keepOut) {
+        std::cout.flush();
+        if (nullOut_.open("/dev/null", std::ios::out | std::ios::trunc)) {
+            oldOut_ = std::cout.rdbuf(&nullOut_);
+        } else {
+            VELA_LOG_ERR("cannot open /dev/null for writing");
+        }
+    }
+}
+
+void CallScope::SetPriority(int priority)
+{
+    errno = 0;
+    const int current = getpriority(PRIO_PROCESS, 0);
+    if (current == -1 && errno != 0) {
+        VELA_LOG_ERR("getpriority failed [%m]");
+        return;
+    }
+    if (current == priority) {
+        return;
+    }
+    if (setpriority(PRIO_PROCESS, 0, priority) != 0) {
+        VELA_LOG_ERR("setpriority(%d) failed [%m]", priority);
+        return;
+    }
+    oldPriority_ = current;
+    priorityChanged_ = true;
+}
+
+bool CallScope::SaveCwd()
+{
+    char buf[PATH_MAX];
+    if (getcwd(buf, sizeof(buf)) == nullptr) {
+        VELA_LOG_ERR("getcwd failed [%m]");
+        return false;
+    }
+    cwd_ = buf;
+    return true;
+}
+
+void CallScope::Restore()
+{
+    if (priorityChanged_) {
+        priorityChanged_ = false;
+        if (setpriority(PRIO_PROCESS, 0, oldPriority_) != 0) {
+            VELA_LOG_ERR("setpriority(%d) failed [%m]", oldPriority_);
+        }
+    }
+    if (oldIn_) {
+        std::cin.rdbuf(oldIn_);
+        oldIn_ = nullptr;
+    }
+    if (oldOut_) {
+        std::cout.rdbuf(oldOut_);
+        oldOut_ = nullptr;
+    }
+    nullIn_.close();
+    nullOut_.close();
+    if (!cwd_.empty()) {
+        if (chdir(cwd_.c_str()) != 0) {
+            VELA_LOG_ERR("cannot change back to %s [%m]", cwd_.c_str());
+        }
+        cwd_.clear();
+    }
+}
+
 // ---- ExecContext ------------------------------------------------------------------
 
 ExecContext::~ExecContext() { Restore(); }
@@ -194,6 +283,53 @@ void ExecContext::Restore()
     }
     SetResGid(__LINE__, rgid_, egid_, sgid_, egid_ == 0);
     SetResUid(__LINE__, ruid_, euid_, suid_, euid_ == 0);
+}
+
+// ---- Stages -----------------------------------------------------------------------
+
+Step EnterCallScope(ResolvedCall& call)
+{
+    call.scope.RedirectStreams(call.Flag("allowUpload"), call.Flag("allowDownload"));
+    call.scope.SetPriority(call.priority);
+    return Step::kGoOn;
+}
+
+Step SwitchIdentity(ResolvedCall& call)
+{
+    if (!call.scope.SaveCwd()) {
+        return Step::kStop;  // logged by SaveCwd; the preset 117 answers
+    }
+    if (!call.identity.SaveIds()) {
+        VELA_REFUSE(call.resp, WEBAPI_ERR_NO_RESPONSE, "cannot read the ids to come back to");
+        return Step::kStop;
+    }
+    ExecIdentity want;
+    want.runAs = call.runAs;
+    want.loginName = call.req->GetLoginUserName();
+    want.grantable = call.Flag("grantable");
+    want.grantByDefault = call.Flag("grantByDefault");
+    want.grantByUser = call.Flag("grantByUser");
+    // A failed switch is logged by Prepare; the preset 117 answers.
+    return call.identity.Prepare(want) ? Step::kGoOn : Step::kStop;
+}
+
+Step CallHandler(ResolvedCall& call)
+{
+    const APIHandlerFn handler = call.entry->handler;
+    if (handler == nullptr) {
+        VELA_REFUSE(call.resp, WEBAPI_ERR_NO_RESPONSE, "%s %d %s has no handler in its library's API table",
+                    LogSafe(call.api).c_str(), call.version, LogSafe(call.method).c_str());
+        return Step::kStop;
+    }
+    try {
+        handler(call.req, call.resp);
+    } catch (const std::exception& e) {
+        VELA_LOG_ERR("handler of %s %s failed: %s", call.api.c_str(), call.method.c_str(), e.what());
+    } catch (...) {
+        VELA_LOG_ERR("handler of %s %s failed", call.api.c_str(), call.method.c_str());
+    }
+    call.identity.Restore();
+    return Step::kServed;
 }
 
 // ---- RunAsRootGuard -----------------------------------------------------------------

@@ -1,8 +1,10 @@
-// The identity under which one handler runs: chosen from the API's and the
-// method's "runAs", "grantable", "grantByDefault" and "grantByUser", and put
-// back after the handler.
+// What a handler call runs in, and what is put back after it: the standard
+// stream objects, the scheduling priority and the working directory
+// (CallScope), and the identity chosen from the API's and the method's
+// "runAs", "grantable", "grantByDefault" and "grantByUser" (ExecContext).
 #pragma once
 
+#include <fstream>
 #include <string>
 #include <sys/types.h>
 #include <vector>
@@ -10,6 +12,36 @@
 #include "vela/user.h"
 
 namespace VELA {
+
+// What a call changes around its handler and puts back on every way out
+// (Restore, or the destructor).
+class CallScope {
+public:
+    CallScope() = default;
+    CallScope(const CallScope&) = delete;
+    CallScope& operator=(const CallScope&) = delete;
+    ~CallScope() { Restore(); }
+
+    // std::cin reads /dev/null unless `keepIn`; std::cout writes to
+    // /dev/null unless `keepOut`. Only the stream objects change; the file
+    // descriptors stay as they are.
+    void RedirectStreams(bool keepIn, bool keepOut);
+    // Sets the nice value `priority` when the process runs with another.
+    void SetPriority(int priority);
+    // Remembers the working directory to come back to. False (logged) when
+    // it cannot be read.
+    bool SaveCwd();
+    void Restore();
+
+private:
+    std::filebuf nullIn_;
+    std::filebuf nullOut_;
+    std::streambuf* oldIn_ = nullptr;
+    std::streambuf* oldOut_ = nullptr;
+    int oldPriority_ = 0;
+    bool priorityChanged_ = false;
+    std::string cwd_;
+};
 
 // What a call asks for, as read from its description and its request.
 struct ExecIdentity {

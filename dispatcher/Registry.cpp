@@ -6,16 +6,23 @@
 // resolved against the working directory, the web-API directory. API names
 // come from the client: they are checked for length and characters before
 // any file name is built from them.
+#include "dispatcher/Registry.h"
+
 #include <exception>
 #include <glob.h>
 #include <set>
 #include <string>
 
+#include "dispatcher/APIRunnerPrivate.h"
 #include "dispatcher/Refusal.h"
+#include "dispatcher/ResolvedCall.h"
+#include "dispatcher/Road.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
+#include "vela/user.h"
 #include "vela/vlibc.h"
 #include "vela/webapiutil.h"
+#include "webapi/APIError.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APIRunner.h"
@@ -34,9 +41,20 @@ const Json::Value& NullValue()
     return kNull;
 }
 
-// The member `key` of `v`, or null when `v` is not an object or lacks it.
-// Never throws (the const operator[] of JsonCpp does on arrays and scalars).
-const Json::Value& Member(const Json::Value& v, const std::string& key)
+// `api` as an APIName; a name that fails the check is one line and, with
+// `resp`, error 102 on `resp`.
+bool CheckedName(APIRunnerPrivate& d, const std::string& api, APIName& out, APIResponse* resp)
+{
+    if (d.CheckName(api, out)) {
+        return true;
+    }
+    VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_API, "WebAPI name refused: \"%s\"", LogSafe(api).c_str());
+    return false;
+}
+
+}  // namespace
+
+const Json::Value& JsonMember(const Json::Value& v, const std::string& key)
 {
     if (!v.isObject()) {
         return NullValue();
@@ -45,31 +63,49 @@ const Json::Value& Member(const Json::Value& v, const std::string& key)
     return found ? *found : NullValue();
 }
 
+bool APIName::Check(const std::string& text, APIName& out)
+{
+    if (!IsAPIName(text)) {
+        return false;
+    }
+    out.text_ = text;
+    return true;
+}
 
-// An API name from which file names may be built (IsAPIName of vlibc.h).
-bool IsSafeAPIName(const std::string& api) { return IsAPIName(api); }
-
-}  // namespace
+bool ResolvedCall::Flag(const std::string& attr) const
+{
+    return flags != nullptr && JsonFlag(JsonMember(*flags, attr));
+}
 
 // ---- Descriptions -------------------------------------------------------------
 
-Json::Value& APIRunner::ApplyLibDef(Json::Value& desc)
+Registry::Registry() : defaults_(Json::objectValue), table_(Json::objectValue) {}
+
+void Registry::LoadDefaults(const std::string& path)
+{
+    Json::Value def;
+    if (WebAPIUtil::ReadJsonFile(path, def) && def.isObject()) {
+        defaults_ = def;
+    }
+}
+
+Json::Value& Registry::ApplyLibDef(Json::Value& desc) const
 {
     if (!desc.isObject()) {
         return desc;
     }
     try {
         if (!desc.isMember("authLevel")) {
-            desc["authLevel"] = Member(libDef_, "authLevel");
+            desc["authLevel"] = JsonMember(defaults_, "authLevel");
         }
         if (!desc.isMember("allowUser")) {
-            desc["allowUser"] = Member(libDef_, "allowUser");
+            desc["allowUser"] = JsonMember(defaults_, "allowUser");
         }
         if (!desc.isMember("requestFormat")) {
             desc["requestFormat"] = "JSON";
         }
         if (!desc.isMember("priority")) {
-            desc["priority"] = Member(libDef_, "priority");
+            desc["priority"] = JsonMember(defaults_, "priority");
         }
     } catch (const std::exception&) {
         // Out of memory: the description keeps what it had.
@@ -77,19 +113,19 @@ Json::Value& APIRunner::ApplyLibDef(Json::Value& desc)
     return desc;
 }
 
-bool APIRunner::CheckLibDescription(Json::Value& desc)
+bool Registry::CheckLibDescription(const Json::Value& desc)
 {
     if (!desc.isObject()) {
         return false;
     }
-    const Json::Value& lib = Member(desc, "lib");
+    const Json::Value& lib = JsonMember(desc, "lib");
     if (!lib.isString() || lib.asString().empty()) {
         return false;
     }
-    if (!Member(desc, "minVersion").isInt() || !Member(desc, "maxVersion").isInt()) {
+    if (!JsonMember(desc, "minVersion").isInt() || !JsonMember(desc, "maxVersion").isInt()) {
         return false;
     }
-    if (!Member(desc, "methods").isObject()) {
+    if (!JsonMember(desc, "methods").isObject()) {
         return false;
     }
     if (desc.isMember("priority")) {
@@ -105,7 +141,7 @@ bool APIRunner::CheckLibDescription(Json::Value& desc)
 // earlier in the same load (`added`) is replaced by the later file; an entry
 // that was in the table before the load is kept, since entries live, and
 // references to them stay valid, for the runner's whole life.
-static void AddDescriptions(APIRunner& runner, Json::Value& table, const Json::Value& file,
+static void AddDescriptions(const Registry& registry, Json::Value& table, const Json::Value& file,
                             std::set<std::string>& added)
 {
     for (Json::Value::const_iterator it = file.begin(); it != file.end(); ++it) {
@@ -114,16 +150,16 @@ static void AddDescriptions(APIRunner& runner, Json::Value& table, const Json::V
             continue;
         }
         Json::Value desc = *it;
-        if (!runner.CheckLibDescription(desc)) {
+        if (!Registry::CheckLibDescription(desc)) {
             VELA_LOG_ERR("WebAPI description %s is not valid.", LogSafe(name).c_str());
             continue;
         }
-        table[name] = runner.ApplyLibDef(desc);
+        table[name] = registry.ApplyLibDef(desc);
         added.insert(name);
     }
 }
 
-bool APIRunner::InitLibDesc(Json::Value& table)
+bool Registry::LoadAll(Json::Value& table) const
 {
     if (!table.isNull() && !table.isObject()) {
         return false;
@@ -151,15 +187,32 @@ bool APIRunner::InitLibDesc(Json::Value& table)
     return true;
 }
 
-bool APIRunner::InitLibDesc(Json::Value& table, const std::string& api)
+// The description file of `api`: the prefixes ending before the second,
+// third, ... dot, then the whole name: for A.B.C.D the files A.B.lib,
+// A.B.C.lib, A.B.C.D.lib. The first component alone is never tried; the
+// longest existing file wins; at most kMaxCandidates names are tried. Empty
+// when none exists.
+static std::string DescriptionFile(const std::string& api)
 {
-    if (api.empty()) {
-        return false;
+    std::string chosen;
+    size_t dot = api.find('.');
+    for (int i = 0; i < kMaxCandidates; ++i) {
+        const size_t next = dot == std::string::npos ? std::string::npos : api.find('.', dot + 1);
+        const std::string candidate = (next == std::string::npos ? api : api.substr(0, next)) + ".lib";
+        if (VLIBCFileExist(candidate.c_str())) {
+            chosen = candidate;
+        }
+        if (next == std::string::npos) {
+            break;
+        }
+        dot = next;
     }
-    if (!IsSafeAPIName(api)) {
-        VELA_LOG_ERR("WebAPI name refused: \"%s\"", LogSafe(api).c_str());
-        return false;
-    }
+    return chosen;
+}
+
+bool Registry::Load(Json::Value& table, const APIName& name, APIResponse* resp) const
+{
+    const std::string& api = name.Text();
     if (!table.isNull() && !table.isObject()) {
         return false;
     }
@@ -167,63 +220,39 @@ bool APIRunner::InitLibDesc(Json::Value& table, const std::string& api)
         return true;
     }
     try {
-        // The prefixes ending before the second, third, ... dot, then the
-        // whole name: for A.B.C.D the files A.B.lib, A.B.C.lib, A.B.C.D.lib.
-        // The first component alone is never tried; the longest existing
-        // file wins; at most kMaxCandidates names are tried.
-        std::string chosen;
-        size_t dot = api.find('.');
-        for (int i = 0; i < kMaxCandidates; ++i) {
-            const size_t next = dot == std::string::npos ? std::string::npos : api.find('.', dot + 1);
-            const std::string candidate = (next == std::string::npos ? api : api.substr(0, next)) + ".lib";
-            if (VLIBCFileExist(candidate.c_str())) {
-                chosen = candidate;
-            }
-            if (next == std::string::npos) {
-                break;
-            }
-            dot = next;
-        }
+        const std::string chosen = DescriptionFile(api);
         if (chosen.empty()) {
-            VELA_LOG_ERR("WebAPI %s is not valid", api.c_str());
+            VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_API, "WebAPI %s is not valid", api.c_str());
             return false;
         }
         Json::Value file;
         if (!WebAPIUtil::ReadJsonFile(chosen, file) || !file.isObject()) {
-            VELA_LOG_ERR("WebAPI description file %s is not valid", chosen.c_str());
+            VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_API, "WebAPI description file %s is not valid", chosen.c_str());
             return false;
         }
         std::set<std::string> added;
         AddDescriptions(*this, table, file, added);
         return true;
-    } catch (const std::exception&) {
+    } catch (const std::exception& e) {
+        VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_API, "WebAPI %s could not be loaded: %s", api.c_str(), e.what());
         return false;
     }
 }
 
-bool APIRunner::InitLibDesc(Json::Value& table, APIRequest* req)
+const Json::Value* Registry::Find(const std::string& api) const
 {
-    if (!req) {
-        return false;
+    if (!table_.isObject()) {
+        return nullptr;
     }
-    return InitLibDesc(table, req->GetAPIClass());
+    return table_.find(api.data(), api.data() + api.size());
 }
 
 // ---- Methods ------------------------------------------------------------------
 
-const Json::Value& APIRunner::GetMethod(const std::string& api, int version, const std::string& method)
+const Json::Value& Registry::MethodOf(const Json::Value& desc, int version, const std::string& method) const
 {
-    const Json::Value& defaults = Member(libDef_, "methods");
-    if (!InitLibDesc(libDesc_, api)) {
-        return defaults;
-    }
-    std::string key;
-    try {
-        key = std::to_string(version);
-    } catch (const std::exception&) {
-        return defaults;
-    }
-    const Json::Value& list = Member(Member(Member(libDesc_, api), "methods"), key);
+    const Json::Value& defaults = JsonMember(defaults_, "methods");
+    const Json::Value& list = JsonMember(JsonMember(desc, "methods"), std::to_string(version));
     if (!list.isArray()) {
         return defaults;
     }
@@ -241,15 +270,73 @@ const Json::Value& APIRunner::GetMethod(const std::string& api, int version, con
     return defaults;
 }
 
+bool Registry::Lists(const Json::Value& desc, int version, const std::string& method)
+{
+    // Any member of an object entry makes its method callable, though only
+    // the first member gets the entry's attributes (MethodOf).
+    const Json::Value& list = JsonMember(JsonMember(desc, "methods"), std::to_string(version));
+    if (!list.isArray()) {
+        return false;
+    }
+    for (const Json::Value& entry : list) {
+        if ((entry.isString() && entry.asString() == method) || (entry.isObject() && entry.isMember(method))) {
+            return true;
+        }
+    }
+    return false;
+}
+
+const Json::Value& Registry::FlagsOf(const Json::Value& method) const
+{
+    return method.isObject() ? method : JsonMember(defaults_, "methods");
+}
+
+// ---- The members of APIRunner that ask the registry --------------------------------
+
+Json::Value& APIRunner::ApplyLibDef(Json::Value& desc) { return d_->registry.ApplyLibDef(desc); }
+
+bool APIRunner::CheckLibDescription(Json::Value& desc) { return Registry::CheckLibDescription(desc); }
+
+bool APIRunner::InitLibDesc(Json::Value& table) { return d_->registry.LoadAll(table); }
+
+bool APIRunner::InitLibDesc(Json::Value& table, const std::string& api)
+{
+    APIName name;
+    if (api.empty() || !CheckedName(*d_, api, name, nullptr)) {
+        return false;
+    }
+    return d_->registry.Load(table, name, nullptr);
+}
+
+bool APIRunner::InitLibDesc(Json::Value& table, APIRequest* req)
+{
+    if (!req) {
+        return false;
+    }
+    return InitLibDesc(table, req->GetAPIClass());
+}
+
+const Json::Value& APIRunner::GetMethod(const std::string& api, int version, const std::string& method)
+{
+    // The call on the road has its answer already.
+    const ResolvedCall* call = d_->Current();
+    if (call != nullptr && call->methodAttrs != nullptr && call->version == version && call->api == api &&
+        call->method == method) {
+        return *call->methodAttrs;
+    }
+    Registry& registry = d_->registry;
+    const Json::Value* desc = nullptr;
+    if (InitLibDesc(registry.Table(), api)) {
+        desc = registry.Find(api);
+    }
+    return registry.MethodOf(desc != nullptr ? *desc : NullValue(), version, method);
+}
+
 bool APIRunner::GetMethodAttr(const std::string& api, int version, const std::string& method,
                               const std::string& attr)
 {
     try {
-        const Json::Value& found = GetMethod(api, version, method);
-        if (found.isObject()) {
-            return JsonFlag(Member(found, attr));
-        }
-        return JsonFlag(Member(Member(libDef_, "methods"), attr));
+        return JsonFlag(JsonMember(d_->registry.FlagsOf(GetMethod(api, version, method)), attr));
     } catch (const std::exception&) {
         return false;
     }
@@ -260,6 +347,10 @@ bool APIRunner::GetMethodAttr(APIRequest* req, const std::string& attr)
     if (!req || attr.empty()) {
         return false;
     }
+    const ResolvedCall* call = d_->Current();
+    if (call != nullptr && call->req == req && call->flags != nullptr) {
+        return call->Flag(attr);
+    }
     return GetMethodAttr(req->GetAPIClass(), req->GetAPIVersion(), req->GetAPIMethod(), attr);
 }
 
@@ -268,75 +359,56 @@ bool APIRunner::AddAPIInfo(APIRequest* req)
     if (!req) {
         return false;
     }
-    const std::string api = req->GetAPIClass();
-    if (!libDesc_.isObject() || !libDesc_.isMember(api)) {
+    const Json::Value* desc = d_->registry.Find(req->GetAPIClass());
+    if (desc == nullptr) {
         return false;
     }
-    req->InitAPIInfo(Member(libDesc_, api));
+    req->InitAPIInfo(*desc);
     return true;
 }
 
 // ---- The first check of a request -----------------------------------------------
 
-bool APIRunner::CheckRequestParam(APIRequest* req, APIResponse* resp)
+// The description of the call: the file of its (checked) API loaded, the
+// version in range, the method listed, the method's attributes found, the
+// upload and demo rules kept. One refusal, with its code, on failure.
+static bool CheckDescribed(ResolvedCall& call)
 {
-    if (!req || !resp) {
-        return false;
-    }
+    Registry& registry = call.d.registry;
+    APIResponse* resp = call.resp;
     try {
-        const std::string api = req->GetAPIClass();
-        const int version = req->GetAPIVersion();
-        const std::string method = req->GetAPIMethod();
-        if (api.empty() || version < 1 || method.empty()) {
-            // A call without API, version or method is refused before
-            // anything is read or logged.
-            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+        if (!registry.Load(registry.Table(), call.name, resp)) {
             return false;
         }
-        if (!InitLibDesc(libDesc_, req)) {
-            // InitLibDesc has logged why (name refused, no file, file invalid).
-            resp->SetError(WEBAPI_ERR_NO_SUCH_API);
+        const Json::Value* desc = registry.Find(call.api);
+        if (desc == nullptr) {
+            VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_API, "WebAPI %s is not described", LogSafe(call.api).c_str());
             return false;
         }
-        if (!libDesc_.isMember(api)) {
-            VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_API, "WebAPI %s is not described", LogSafe(api).c_str());
-            return false;
-        }
-        const Json::Value& desc = Member(libDesc_, api);
-        const Json::Value& minVersion = Member(desc, "minVersion");
-        const Json::Value& maxVersion = Member(desc, "maxVersion");
-        if (!minVersion.isInt() || !maxVersion.isInt() || version < minVersion.asInt() ||
-            version > maxVersion.asInt()) {
+        const Json::Value& minVersion = JsonMember(*desc, "minVersion");
+        const Json::Value& maxVersion = JsonMember(*desc, "maxVersion");
+        if (!minVersion.isInt() || !maxVersion.isInt() || call.version < minVersion.asInt() ||
+            call.version > maxVersion.asInt()) {
             VELA_REFUSE(resp, WEBAPI_ERR_NOT_SUPPORTED_VERSION, "WebAPI %s has no version %d",
-                        LogSafe(api).c_str(), version);
+                        LogSafe(call.api).c_str(), call.version);
             return false;
         }
-        // Any member of an object entry makes its method callable, though
-        // only the first member gets the entry's attributes (GetMethod).
-        bool listed = false;
-        const Json::Value& list = Member(Member(desc, "methods"), std::to_string(version));
-        if (list.isArray()) {
-            for (const Json::Value& entry : list) {
-                if ((entry.isString() && entry.asString() == method) ||
-                    (entry.isObject() && entry.isMember(method))) {
-                    listed = true;
-                    break;
-                }
-            }
-        }
-        if (!listed) {
+        if (!Registry::Lists(*desc, call.version, call.method)) {
             VELA_REFUSE(resp, WEBAPI_ERR_NO_SUCH_METHOD, "WebAPI %s version %d has no method \"%s\"",
-                        LogSafe(api).c_str(), version, LogSafe(method).c_str());
+                        LogSafe(call.api).c_str(), call.version, LogSafe(call.method).c_str());
             return false;
         }
-        if (!GetMethodAttr(api, version, method, "allowUpload") && req->IsUploadRequest()) {
+        call.description = desc;
+        call.methodAttrs = &registry.MethodOf(*desc, call.version, call.method);
+        call.flags = &registry.FlagsOf(*call.methodAttrs);
+        if (!call.Flag("allowUpload") && call.req->IsUploadRequest()) {
             VELA_REFUSE(resp, WEBAPI_ERR_UPLOAD_NOT_ALLOWED, "WebAPI %s %d %s takes no upload",
-                        LogSafe(api).c_str(), version, LogSafe(method).c_str());
+                        LogSafe(call.api).c_str(), call.version, LogSafe(call.method).c_str());
             return false;
         }
-        if (!GetMethodAttr(api, version, method, "allowDemo") && req->IsDemoMode()) {
+        if (!call.Flag("allowDemo") && call.req->IsDemoMode()) {
             VELA_REFUSE(resp, WEBAPI_ERR_DEMO_MODE, "WebAPI %s %d %s is not served in demo mode",
-                        LogSafe(api).c_str(), version, LogSafe(method).c_str());
+                        LogSafe(call.api).c_str(), call.version, LogSafe(call.method).c_str());
             return false;
         }
         return true;
@@ -344,6 +416,82 @@ bool APIRunner::CheckRequestParam(APIRequest* req, APIResponse* resp)
         VELA_REFUSE(resp, WEBAPI_ERR_BAD_REQUEST, "request check failed: %s", e.what());
         return false;
     }
+}
+
+// What the road takes from the API's description `info` (the registry's, or
+// the one handed to the request): the library, the priority, the identity
+// and whether calls are counted.
+static void TakeDescription(ResolvedCall& call, const Json::Value& info)
+{
+    const Json::Value& lib = JsonMember(info, "lib");
+    call.lib = lib.isString() ? lib.asString() : std::string();
+    const Json::Value& priority = JsonMember(info, "priority");
+    const int nice = priority.isInt() ? priority.asInt() : 0;
+    call.priority = nice < -20 ? -20 : (nice > 19 ? 19 : nice);
+    const Json::Value& runAs = JsonMember(info, "runAs");
+    call.runAs = runAs.isString() ? runAs.asString() : VELA_RUNAS_SUPERUSER;
+    const Json::Value& methodRunAs = JsonMember(*call.methodAttrs, "runAs");
+    if (methodRunAs.isString()) {
+        call.runAs = methodRunAs.asString();
+    }
+    call.counted = JsonFlag(JsonMember(info, "count"), true);
+}
+
+bool APIRunner::CheckRequestParam(APIRequest* req, APIResponse* resp)
+{
+    if (!req || !resp) {
+        return false;
+    }
+    try {
+        ResolvedCall call(*this, *d_, req, resp);
+        return CheckCallNames(call) == Step::kGoOn && CheckDescribed(call);
+    } catch (const std::exception& e) {
+        VELA_REFUSE(resp, WEBAPI_ERR_BAD_REQUEST, "request check failed: %s", e.what());
+        return false;
+    }
+}
+
+Step CheckCallNames(ResolvedCall& call)
+{
+    call.api = call.req->GetAPIClass();
+    call.version = call.req->GetAPIVersion();
+    call.method = call.req->GetAPIMethod();
+    if (call.api.empty()) {
+        VELA_REFUSE(call.resp, WEBAPI_ERR_BAD_REQUEST, "request refused: no API name");
+        return Step::kStop;
+    }
+    if (call.version < 1 || call.method.empty()) {
+        VELA_REFUSE(call.resp, WEBAPI_ERR_BAD_REQUEST, "request refused: %s without a version from 1 and a method",
+                    LogSafe(call.api).c_str());
+        return Step::kStop;
+    }
+    return CheckedName(call.d, call.api, call.name, call.resp) ? Step::kGoOn : Step::kStop;
+}
+
+Step DescribeCall(ResolvedCall& call)
+{
+    if (!CheckDescribed(call)) {
+        return Step::kStop;
+    }
+    TakeDescription(call, *call.description);
+    // Hands the request its API's description (AddAPIInfo).
+    call.req->InitAPIInfo(*call.description);
+    return Step::kGoOn;
+}
+
+void ResolveFromRequest(ResolvedCall& call)
+{
+    APIRequest* req = call.req;
+    call.api = req->GetAPIClass();
+    call.version = req->GetAPIVersion();
+    call.method = req->GetAPIMethod();
+    call.methodAttrs = &call.runner.GetMethod(call.api, call.version, call.method);
+    call.flags = &call.d.registry.FlagsOf(*call.methodAttrs);
+    Json::Value info(Json::objectValue);
+    for (const char* key : {"lib", "priority", "runAs", "count"}) {
+        info[key] = req->GetAPIInfo(key);
+    }
+    TakeDescription(call, info);
 }
 
 }  // namespace VELA

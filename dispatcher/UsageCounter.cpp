@@ -18,6 +18,8 @@
 #include <string>
 #include <unistd.h>
 
+#include "dispatcher/ResolvedCall.h"
+#include "dispatcher/Road.h"
 #include "platform/FileUtil.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
@@ -161,16 +163,38 @@ void ResetUsageCounterState()
     state.dirReady = false;
 }
 
-void APIRunner::IncreaseCounter(APIRequest* req)
+// Counts one call when usage data collection is on.
+static void CountCall(const std::string& api, int version, const std::string& method)
 {
-    if (req == nullptr || !CollectEnabled()) {
+    if (!CollectEnabled()) {
         return;
     }
     const std::string dir = VelaPath(kCounterDir);
     if (!CounterDirReady(dir)) {
         return;
     }
-    Count(dir, req->GetAPIClass(), req->GetAPIMethod(), req->GetAPIVersion());
+    Count(dir, api, method, version);
+}
+
+void APIRunner::IncreaseCounter(APIRequest* req)
+{
+    if (req == nullptr) {
+        return;
+    }
+    CountCall(req->GetAPIClass(), req->GetAPIVersion(), req->GetAPIMethod());
+}
+
+// The road counts what the front end marked for counting ("_collector_count_
+// webapi" on the runner's own request), never a method with "allowTimeout"
+// nor an API with "count": false.
+Step CountUsage(ResolvedCall& call)
+{
+    const APIRequest* own = call.runner.GetRequest();
+    if (own != nullptr && JsonFlag(own->GetAttr("_collector_count_webapi"), false) && !call.Flag("allowTimeout") &&
+        call.counted) {
+        CountCall(call.api, call.version, call.method);
+    }
+    return Step::kGoOn;
 }
 
 }  // namespace VELA

@@ -13,7 +13,6 @@
 #pragma once
 
 #include <json/json.h>
-#include <map>
 #include <string>
 
 #include "webapi/APITable.h"
@@ -49,13 +48,15 @@ public:
     // Lets the runner show the API being served in argument 0 (ps).
     void SetArgs(int argc, char** argv);
 
-    // ---- Pipeline stages (public for the compound handler) ----
+    // ---- The road of a call (public for the compound handler) ----
     bool Process(APIRequest* req, APIResponse* resp);
     bool ProcessEntry(APIRequest* req, APIResponse* resp);
     bool ProcessLib(APIRequest* req, APIResponse* resp);
     bool HandleCompound(APIRequest* req, APIResponse* resp);
     // Names the process, the log identity and the thread after the call:
-    // "<prefix>_<api>_<version>_<method>". Errors 101 and 118.
+    // "<prefix>_<api>_<version>_<method>". Errors 101 and 118. An API name
+    // that fails the name check is never shown: the process keeps its name
+    // and the road refuses the call.
     bool SetProcessName(APIRequest* req, APIResponse* resp);
 
     // The response body plus "httpd_restart"; null without a response.
@@ -73,6 +74,30 @@ public:
     void Exec(Json::Value& out, const char* api, int version, const char* method,
               const Json::Value& params, const char* user);
 
+    // ---- Method attributes, as every part of a call reads them ----
+    // The attribute object of one method; the defaults' "methods" when the
+    // method has none of its own. For the call being processed the answers
+    // come from its description check, without asking the registry again.
+    const Json::Value& GetMethod(const std::string& api, int version, const std::string& method);
+    bool GetMethodAttr(const std::string& api, int version, const std::string& method,
+                       const std::string& attr);
+    bool GetMethodAttr(APIRequest* req, const std::string& attr);
+
+    // ---- For running sub-requests (compound requests) ----
+    // Hands the request its API's description (already loaded).
+    bool AddAPIInfo(APIRequest* req);
+    // Loads (or finds) the handler library of the request's API.
+    bool CacheLib(APIRequest* req, void** handle);
+
+    APIRequest* GetRequest() const { return request_; }
+    APIResponse* GetResponseObject() const { return response_; }
+
+protected:
+    // ---- For runners deriving from this one (front ends, tests) ----
+    // Collects the process environment ("NAME=value" entries) into the
+    // object `env`. False when `env` is not an object (or null).
+    bool InitEnv(Json::Value& env);
+
     // ---- Description registry ----
     // Copies the defaults' "authLevel", "allowUser" and "priority" into
     // `desc` where absent; "requestFormat" defaults to "JSON".
@@ -85,19 +110,10 @@ public:
     // refused before any file is touched.
     bool InitLibDesc(Json::Value& table, const std::string& api);
     bool InitLibDesc(Json::Value& table, APIRequest* req);
-    // The attribute object of one method; the defaults' "methods" when the
-    // method has none of its own.
-    const Json::Value& GetMethod(const std::string& api, int version, const std::string& method);
-    bool GetMethodAttr(const std::string& api, int version, const std::string& method,
-                       const std::string& attr);
-    bool GetMethodAttr(APIRequest* req, const std::string& attr);
-    // Hands the request its API's description (already loaded).
-    bool AddAPIInfo(APIRequest* req);
     // Errors 101, 102, 103, 104, 115, 116.
     bool CheckRequestParam(APIRequest* req, APIResponse* resp);
 
     // ---- Handler libraries ----
-    bool CacheLib(APIRequest* req, void** handle);
     bool OpenLib(APIRequest* req, _tag_API_TABLE** table, _tag_API_CHECK_TABLE** check);
     bool GetTableFunc(void* handle, _tag_API_TABLE** table);
     bool GetCheckTableFunc(void* handle, _tag_API_CHECK_TABLE** check);
@@ -108,21 +124,10 @@ public:
     // data collection is on; never fails the call.
     void IncreaseCounter(APIRequest* req);
 
-    APIRequest* GetRequest() const { return request_; }
-    APIResponse* GetResponseObject() const { return response_; }
-    int GetCompoundDepth() const { return compoundDepth_; }
-
-protected:
-    // Collects the process environment ("NAME=value" entries) into the
-    // object `env`. False when `env` is not an object (or null).
-    bool InitEnv(Json::Value& env);
-
-    Json::Value libDef_;   // lib.def, an empty object when missing
-    Json::Value libDesc_;  // API name -> merged description
     APIRequest* request_;
     APIResponse* response_;
-    std::map<std::string, void*> libCache_;  // "lib" path -> dlopen handle
-    int compoundDepth_;
+    // The registry, the library cache, the compound depth, the names of the
+    // process.
     APIRunnerPrivate* d_;
 };
 

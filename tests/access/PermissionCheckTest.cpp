@@ -26,6 +26,15 @@
 
 namespace {
 
+// The description check is the runner's own business; these tests call it
+// to prepare a request the way the road would have.
+struct Runner : VELA::APIRunner {
+    using VELA::APIRunner::CheckRequestParam;
+};
+struct Entry : VELA::WebEntry {
+    using VELA::WebEntry::CheckRequestParam;
+};
+
 using VELA::APIRequest;
 using VELA::APIResponse;
 using VELA::PermissionCheck;
@@ -76,7 +85,7 @@ struct PreparedCall {
     bool Check() { return check.CheckPermission(Req(), Resp(), nullptr); }
     const Json::Value& Slots() { return check.Verdicts()["permResult"]; }
 
-    VELA::APIRunner runner;
+    Runner runner;
     PermissionCheck check{runner};
 };
 
@@ -386,7 +395,7 @@ TEST_F(PermissionCheckTest, WebEntryHooksCheckTheSessionOfItsRequest)
     ScopedEnv method("REQUEST_METHOD", "GET");
     ScopedEnv cookie("HTTP_COOKIE", "id=stale");
     ScopedEnv query("QUERY_STRING", ("api=VELA.Test.Perm&version=1&method=get&_sid=" + sid).c_str());
-    VELA::WebEntry entry;
+    Entry entry;
     APIRequest* req = entry.GetRequest();
     APIResponse* resp = entry.GetResponseObject();
     ASSERT_TRUE(entry.Initialize(Json::Value()));

@@ -23,6 +23,12 @@ namespace {
 using VELA::APIRequest;
 using VELA::APIRunner;
 
+// Shows the counter to the tests.
+class CountingRunner : public APIRunner {
+public:
+    using APIRunner::IncreaseCounter;
+};
+
 class Counter : public PipeFixture {
 protected:
     void SetUp() override
@@ -44,7 +50,7 @@ protected:
                                           value));
     }
 
-    static void Count(APIRunner& runner, const std::string& api, int version, const std::string& method)
+    static void Count(CountingRunner& runner, const std::string& api, int version, const std::string& method)
     {
         APIRequest req(Call(api, version, method));
         runner.IncreaseCounter(&req);
@@ -63,7 +69,7 @@ protected:
 TEST_F(Counter, CountsPerCallKindInOneFilePerStem)
 {
     Collect("yes");
-    APIRunner runner;
+    CountingRunner runner;
     const long long before = time(nullptr);
     Count(runner, "VELA.Core.Share.List", 1, "get");
     const long long after = time(nullptr);
@@ -108,12 +114,12 @@ TEST_F(Counter, SwitchOffCreatesNothing)
     for (const char* value : {"no", "YES", ""}) {
         VELA::ResetUsageCounterState();
         Collect(value);
-        APIRunner runner;
+        CountingRunner runner;
         Count(runner, "VELA.Core.Share", 1, "get");
     }
     VELA::ResetUsageCounterState();
     ASSERT_EQ(0, unlink((root_.Path() + "/etc/velainfo.conf").c_str()));
-    APIRunner runner;
+    CountingRunner runner;
     Count(runner, "VELA.Core.Share", 1, "get");
     struct stat st;
     EXPECT_NE(0, stat((root_.Path() + "/var/spool").c_str(), &st));
@@ -122,7 +128,7 @@ TEST_F(Counter, SwitchOffCreatesNothing)
 TEST_F(Counter, ConcurrentProcessesLoseNoCount)
 {
     Collect("yes");
-    APIRunner runner;
+    CountingRunner runner;
     const int kProcesses = 8;
     const int kCounts = 50;
     const auto start = std::chrono::steady_clock::now();

@@ -9,6 +9,7 @@
 #include <utility>
 #include <vector>
 
+#include "dispatcher/APIRunnerPrivate.h"
 #include "dispatcher/PipeFixture.h"
 #include "support/TestSupport.h"
 #include "vela/log.h"
@@ -21,9 +22,14 @@ namespace {
 using VELA::APIRequest;
 using VELA::APIRunner;
 
+// Shows the library members and the size of the runner's cache to the tests.
 class CacheRunner : public APIRunner {
 public:
-    using APIRunner::libCache_;
+    using APIRunner::CloseLib;
+    using APIRunner::GetCheckTableFunc;
+    using APIRunner::GetTableFunc;
+    using APIRunner::OpenLib;
+    size_t Cached() const { return d_->libs.Size(); }
 };
 
 class LibCache : public PipeFixture {
@@ -69,13 +75,13 @@ TEST_F(LibCache, OneOpenPerPath)
         void* first = Cache(runner, path);
         ASSERT_NE(nullptr, first);
         EXPECT_EQ(first, Cache(runner, path));
-        EXPECT_EQ(1u, runner.libCache_.size());
+        EXPECT_EQ(1u, runner.Cached());
         // The loader knows the file under its other name and hands back the
         // same object, counted twice.
         EXPECT_EQ(first, Cache(runner, alias));
-        EXPECT_EQ(2u, runner.libCache_.size());
+        EXPECT_EQ(2u, runner.Cached());
         runner.CloseLib();
-        EXPECT_TRUE(runner.libCache_.empty());
+        EXPECT_TRUE(runner.Cached() == 0);
         EXPECT_FALSE(Loaded(path));
 
         Cache(runner, path);
@@ -181,7 +187,7 @@ TEST_F(LibCache, CallsThroughTheRunner)
         EXPECT_TRUE(runner.Process(&req, &resp)) << c.api;
         EXPECT_EQ(J(c.data), resp.GetBody()["data"]) << c.api;
     }
-    EXPECT_EQ(2u, runner.libCache_.size());
+    EXPECT_EQ(2u, runner.Cached());
 }
 
 }  // namespace

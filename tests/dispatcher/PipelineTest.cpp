@@ -278,9 +278,17 @@ TEST_F(Pipeline, ProcessNameFollowsTheCall)
         EXPECT_EQ(prefix + "_VELA.Pipe.Test_1_echo", std::string(area));
         EXPECT_EQ("VELA.Pipe.Test_\n", VELA::Test::ReadText("/proc/self/comm"));
 
-        // Control bytes of a client's API name never reach ps or syslog.
-        runner.Run(Call("VELA.Pipe\nX", 1, "echo"));
-        EXPECT_EQ(prefix + "_VELA.Pipe?X_1_echo", std::string(area));
+        // An API name that fails the name check is never shown: the call is
+        // refused and the process keeps the name of its last call.
+        for (const char* api : {"VELA.Pipe\nX", "../VELA.Pipe.Test", "VELA.Pipe.Test/x"}) {
+            EXPECT_FALSE(runner.Run(Call(api, 1, "echo")));
+            EXPECT_EQ(WEBAPI_ERR_NO_SUCH_API, runner.GetResponseObject()->GetError()) << api;
+            EXPECT_EQ(prefix + "_VELA.Pipe.Test_1_echo", std::string(area)) << api;
+            EXPECT_EQ("VELA.Pipe.Test_\n", VELA::Test::ReadText("/proc/self/comm")) << api;
+        }
+        // Control bytes of a method never reach ps or syslog.
+        runner.Run(Call("VELA.Pipe.Test", 1, "ec\nho"));
+        EXPECT_EQ(prefix + "_VELA.Pipe.Test_1_ec?ho", std::string(area));
     }
     EXPECT_EQ(prefix.substr(0, sizeof(area) - 1), std::string(area));
     EXPECT_EQ(comm, VELA::Test::ReadText("/proc/self/comm"));

@@ -7,6 +7,7 @@
 #include <string>
 #include <unistd.h>
 
+#include "dispatcher/APIRunnerPrivate.h"
 #include "dispatcher/PipeFixture.h"
 #include "support/TestSupport.h"
 #include "webapi/APIRequest.h"
@@ -19,11 +20,15 @@ using VELA::APIRequest;
 using VELA::APIResponse;
 using VELA::APIRunner;
 
-// Shows the registry's tables to the tests.
+// Shows the registry's members and the runner's description table to the
+// tests.
 class TableRunner : public APIRunner {
 public:
-    using APIRunner::libDef_;
-    using APIRunner::libDesc_;
+    using APIRunner::ApplyLibDef;
+    using APIRunner::CheckLibDescription;
+    using APIRunner::CheckRequestParam;
+    using APIRunner::InitLibDesc;
+    const Json::Value& Descriptions() const { return d_->registry.Table(); }
 };
 
 class Registry : public PipeFixture {
@@ -58,7 +63,7 @@ protected:
     }
 
     // The code CheckRequestParam answers for one request JSON (0: passed).
-    static int Check(APIRunner& runner, const Json::Value& request)
+    static int Check(TableRunner& runner, const Json::Value& request)
     {
         APIRequest req(request);
         APIResponse resp(&req);
@@ -109,7 +114,7 @@ TEST_F(Registry, ValidationAndDefaults)
     // lib.def that is not an object reads as no defaults at all.
     WriteText("lib.def", "[1, 2]");
     TableRunner bareRunner;
-    EXPECT_EQ(Json::Value(Json::objectValue), bareRunner.libDef_);
+    EXPECT_EQ(Json::Value(), bareRunner.GetMethod("No.Such", 1, "get"));
     Json::Value desc = J(R"({"lib": "x.so"})");
     EXPECT_EQ(J(R"({"lib": "x.so", "authLevel": null, "allowUser": null, "priority": null,
                     "requestFormat": "JSON"})"),
@@ -214,12 +219,14 @@ TEST_F(Registry, MethodAttributes)
               {"set": {"allowUpload": "yes", "allowDemo": 1}}, 7, {}],
         "2": [{"get": {"allowTimeout": true}}]})")));
     TableRunner runner;
-    const Json::Value& defaults = runner.libDef_["methods"];
+    // lib.def's "methods", one object whatever the method that falls back
+    // to it.
+    const Json::Value& defaults = runner.GetMethod("No.Such", 1, "get");
+    EXPECT_EQ(J(R"({"allowUpload": false, "allowDownload": true})"), defaults);
 
     EXPECT_EQ(&defaults, &runner.GetMethod("R.M", 1, "list"));
     EXPECT_EQ(&defaults, &runner.GetMethod("R.M", 1, "put"));
     EXPECT_EQ(&defaults, &runner.GetMethod("R.M", 3, "get"));
-    EXPECT_EQ(&defaults, &runner.GetMethod("No.Such", 1, "get"));
     EXPECT_EQ(J(R"({"allowUpload": true})"), runner.GetMethod("R.M", 1, "get"));
 
     const struct {
@@ -299,7 +306,10 @@ TEST_F(Registry, DiskTouchedOnlyWhenNeeded)
     {
         VELA::Test::LogCapture log;
         EXPECT_EQ(WEBAPI_ERR_BAD_REQUEST, Check(runner, Call("Z.Y", 0, "get")));
-        EXPECT_TRUE(log.Lines().empty());
+        // The refusal's one line, and nothing about the file.
+        ASSERT_EQ(1u, log.Lines().size());
+        EXPECT_EQ(0u, log.Lines()[0].rfind("Registry:", 0)) << log.Lines()[0];
+        EXPECT_EQ(std::string::npos, log.Lines()[0].find("file")) << log.Lines()[0];
         EXPECT_EQ(WEBAPI_ERR_NO_SUCH_API, Check(runner, Call("Z.Y", 1, "get")));
         EXPECT_TRUE(log.Contains("WebAPI description file Z.Y.lib is not valid"));
     }
@@ -344,7 +354,7 @@ TEST_F(Registry, HostileNamesReachNoFile)
             EXPECT_LT(line.size(), 120u) << line;
         }
     }
-    EXPECT_EQ(Json::Value(Json::objectValue), runner.libDesc_);
+    EXPECT_EQ(Json::Value(Json::objectValue), runner.Descriptions());
     // The same directory serves a well-formed name.
     EXPECT_EQ(0, Check(runner, Call("R.M", 1, "get")));
 }

@@ -1,0 +1,209 @@
+// The road of a call as a whole: every refusal the dispatcher makes is one
+// log line stamped with the file that decided it; when several faults apply
+// the earlier stage's refusal wins; a call that skips the description check
+// (ProcessLib by itself) runs as its request's description says; the hooks
+// read the attributes of the call on the road.
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "dispatcher/PipeFixture.h"
+#include "support/TestSupport.h"
+#include "webapi/APIError.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
+#include "webapi/APIRunner.h"
+
+namespace {
+
+using VELA::APIRequest;
+using VELA::APIResponse;
+using VELA::APIRunner;
+
+class Road : public PipeFixture {
+protected:
+    struct Outcome {
+        int code = -1;
+        std::vector<std::string> lines;
+    };
+
+    // Runs `request` through Run of a fresh runner (`process`: through
+    // Process, as a sub-request would), capturing the log.
+    static Outcome RunCall(const Json::Value& request, bool process = false)
+    {
+        Outcome out;
+        APIRunner runner;
+        VELA::Test::LogCapture log;
+        if (process) {
+            APIRequest req(request);
+            APIResponse resp(&req);
+            EXPECT_FALSE(runner.Process(&req, &resp)) << request;
+            out.code = resp.GetError();
+        } else {
+            EXPECT_FALSE(runner.Run(request)) << request;
+            out.code = runner.GetResponseObject()->GetError();
+        }
+        out.lines = log.Lines();
+        return out;
+    }
+
+    static Json::Value WithParam(Json::Value request, const char* name, const Json::Value& value)
+    {
+        request["getParam"][name] = value;
+        return request;
+    }
+};
+
+TEST_F(Road, EveryRefusalLogsOnceWhereItIsDecided)
+{
+    WriteJson("VELA.Broken.lib", Json::Value(Json::arrayValue));
+    Json::Value upload = Call("VELA.Pipe.Test", 1, "echo");
+    upload["environ"]["CONTENT_TYPE"] = "multipart/form-data; boundary=x";
+    Json::Value noName(Json::objectValue);
+    noName["getParam"]["version"] = 1;
+    noName["getParam"]["method"] = "echo";
+    const Json::Value relay = WithParam(Call("VELA.Pipe.Test", 1, "echo"), "relay_ds", "other");
+
+    const struct {
+        const char* what;
+        Json::Value request;
+        bool process;
+        int code;
+        const char* source;  // the file that refuses
+        const char* says;
+    } cases[] = {
+        {"null request", Json::Value(), false, WEBAPI_ERR_BAD_REQUEST, "APIRunner", "no request JSON"},
+        {"empty request", Json::Value(Json::objectValue), false, WEBAPI_ERR_BAD_REQUEST, "APIRunner", "empty"},
+        {"no API name", noName, false, WEBAPI_ERR_BAD_REQUEST, "ProcessName", "no API name"},
+        {"no API name (sub-request)", noName, true, WEBAPI_ERR_BAD_REQUEST, "Registry", "no API name"},
+        {"version 0", Call("VELA.Pipe.Test", 0, "echo"), false, WEBAPI_ERR_BAD_REQUEST, "Registry", "VELA.Pipe.Test"},
+        {"no method", Call("VELA.Pipe.Test", 1, ""), false, WEBAPI_ERR_BAD_REQUEST, "Registry", "VELA.Pipe.Test"},
+        {"relay_ds given to Run", relay, false, WEBAPI_ERR_BAD_REQUEST, "APIRunner", "relayed"},
+        {"name refused", Call("../VELA.Pipe.Test", 1, "echo"), false, WEBAPI_ERR_NO_SUCH_API, "Registry",
+         "name refused"},
+        {"no description file", Call("VELA.Nothing.Here", 1, "get"), false, WEBAPI_ERR_NO_SUCH_API, "Registry",
+         "VELA.Nothing.Here is not valid"},
+        {"file not an object", Call("VELA.Broken", 1, "get"), false, WEBAPI_ERR_NO_SUCH_API, "Registry",
+         "file VELA.Broken.lib is not valid"},
+        {"file without the API", Call("VELA.Pipe.Other", 1, "get"), false, WEBAPI_ERR_NO_SUCH_API, "Registry",
+         "VELA.Pipe.Other is not described"},
+        {"version out of range", Call("VELA.Pipe.Test", 3, "echo"), false, WEBAPI_ERR_NOT_SUPPORTED_VERSION,
+         "Registry", "no version 3"},
+        {"method not listed", Call("VELA.Pipe.Test", 1, "nope"), false, WEBAPI_ERR_NO_SUCH_METHOD, "Registry",
+         "no method \"nope\""},
+        {"upload not allowed", upload, false, WEBAPI_ERR_UPLOAD_NOT_ALLOWED, "Registry", "takes no upload"},
+        {"relay_ds reaching Process", relay, true, WEBAPI_ERR_RELAY_FAILED, "APIRunner", "relaying"},
+        {"entry API without compound", Call("VELA.Entry.Request", 1, "request"), false,
+         WEBAPI_ERR_COMPOUND_OR_FORK, "APIRunner", "without \"compound\""},
+        {"compound request", WithParam(Call("VELA.Entry.Request", 1, "request"), "compound", "[]"), false,
+         WEBAPI_ERR_NO_RESPONSE, "APIRunner", "compound requests"},
+        {"library missing", Call("VELA.Pipe.NoLib", 1, "get"), false, WEBAPI_ERR_LOAD_LIBRARY, "LibCache",
+         "cannot open library"},
+        {"no GetAPITable", Call("VELA.Pipe.NoTable", 1, "get"), false, WEBAPI_ERR_LOAD_LIBRARY, "LibCache",
+         "Get API Table Fail: cannot load table"},
+        {"GetAPITable gives null", Call("VELA.Pipe.NullTable", 1, "get"), false, WEBAPI_ERR_LOAD_LIBRARY,
+         "LibCache", "Get API Table Fail: cannot get api table"},
+        {"not in the API table", Call("VELA.Pipe.Test", 2, "v1only"), false, WEBAPI_ERR_METHOD_NOT_IN_TABLE,
+         "LibCache", "not in its library's API table"},
+    };
+    for (const auto& c : cases) {
+        const Outcome out = RunCall(c.request, c.process);
+        EXPECT_EQ(c.code, out.code) << c.what;
+        ASSERT_EQ(1u, out.lines.size()) << c.what << ": " << testing::PrintToString(out.lines);
+        EXPECT_EQ(0u, out.lines[0].rfind(std::string(c.source) + ":", 0)) << c.what << ": " << out.lines[0];
+        EXPECT_NE(std::string::npos, out.lines[0].find(c.says)) << c.what << ": " << out.lines[0];
+    }
+}
+
+// Several faults at once: the stage that comes first on the road answers.
+TEST_F(Road, TheEarlierStageWins)
+{
+    const Json::Value relayUnknown = WithParam(Call("VELA.Nope", 1, "get"), "relay_ds", "other");
+    const struct {
+        const char* what;
+        Json::Value request;
+        bool process;
+        int code;
+        const char* says;
+    } cases[] = {
+        {"bad name and version 0", Call("../x", 0, "get"), false, WEBAPI_ERR_BAD_REQUEST, "without a version"},
+        {"bad name and no method", Call("a/b", 1, ""), true, WEBAPI_ERR_BAD_REQUEST, "without a version"},
+        {"version and method", Call("VELA.Pipe.Test", 9, "nope"), false, WEBAPI_ERR_NOT_SUPPORTED_VERSION,
+         "no version 9"},
+        {"relay of an unknown API, sub-request", relayUnknown, true, WEBAPI_ERR_NO_SUCH_API, "is not valid"},
+        {"relay of an unknown API, Run", relayUnknown, false, WEBAPI_ERR_BAD_REQUEST, "relayed"},
+        {"relay of the entry API", WithParam(Call("VELA.Entry.Request", 1, "request"), "relay_ds", "x"), true,
+         WEBAPI_ERR_RELAY_FAILED, "relaying"},
+    };
+    for (const auto& c : cases) {
+        const Outcome out = RunCall(c.request, c.process);
+        EXPECT_EQ(c.code, out.code) << c.what;
+        ASSERT_EQ(1u, out.lines.size()) << c.what << ": " << testing::PrintToString(out.lines);
+        EXPECT_NE(std::string::npos, out.lines[0].find(c.says)) << c.what << ": " << out.lines[0];
+    }
+
+    // The permission hook is asked before the library is opened.
+    struct Refusing : APIRunner {
+        bool NeedPermission(APIRequest*) override { return true; }
+        bool CheckPermission(APIRequest*, APIResponse* resp) override
+        {
+            resp->SetError(WEBAPI_ERR_NO_PERMISSION);
+            return false;
+        }
+        bool SkipPermission(APIRequest*) override { return false; }
+    } runner;
+    EXPECT_FALSE(runner.Run(Call("VELA.Pipe.NoLib", 1, "get")));
+    EXPECT_EQ(WEBAPI_ERR_NO_PERMISSION, runner.GetResponseObject()->GetError());
+}
+
+// ProcessLib by itself takes the library, identity and priority from the
+// description handed to the request, and the attributes from the registry.
+TEST_F(Road, ProcessLibRunsAsTheRequestsDescriptionSays)
+{
+    APIRunner runner;
+    Json::Value request = Call("VELA.Pipe.Test", 1, "echo");
+    request["reqLib"] = J(R"({"lib": ")" + Lib("pipe_handlers") + R"(", "runAs": ")" + RunAs() + R"("})");
+    APIRequest req(request);
+    APIResponse resp(&req);
+    EXPECT_TRUE(runner.ProcessLib(&req, &resp));
+    EXPECT_EQ(0, resp.GetError());
+    EXPECT_EQ(Json::Value("VELA.Pipe.Test"), resp.GetBody()["data"]["api"]);
+
+    // No description handed over: no library to open.
+    APIRequest bare(Call("VELA.Pipe.Test", 1, "echo"));
+    APIResponse bareResp(&bare);
+    VELA::Test::LogCapture log;
+    EXPECT_FALSE(runner.ProcessLib(&bare, &bareResp));
+    EXPECT_EQ(WEBAPI_ERR_LOAD_LIBRARY, bareResp.GetError());
+    ASSERT_EQ(1u, log.Lines().size());
+    EXPECT_NE(std::string::npos, log.Lines()[0].find("library path empty"));
+}
+
+// The hooks read the method's attributes of the call on the road; for
+// another request they ask the registry.
+TEST_F(Road, HooksReadTheCallsAttributes)
+{
+    struct Asking : APIRunner {
+        Json::Value seen;
+        bool NeedPermission(APIRequest* req) override
+        {
+            seen["upload"] = GetMethodAttr(req, "allowUpload");
+            seen["download"] = GetMethodAttr(req->GetAPIClass(), req->GetAPIVersion(), req->GetAPIMethod(),
+                                             "allowDownload");
+            seen["own"] = GetMethod(req->GetAPIClass(), req->GetAPIVersion(), req->GetAPIMethod());
+            APIRequest other(Call("VELA.Pipe.Test", 1, "upload"));
+            seen["other"] = GetMethodAttr(&other, "allowUpload");
+            return false;
+        }
+    };
+    Asking plain;
+    EXPECT_TRUE(plain.Run(Call("VELA.Pipe.Test", 1, "echo")));
+    EXPECT_EQ(J(R"({"upload": false, "download": false, "own": {"allowDemo": false}, "other": true})"),
+              plain.seen);
+    Asking own;
+    EXPECT_TRUE(own.Run(Call("VELA.Pipe.Test", 1, "upload")));
+    EXPECT_EQ(J(R"({"upload": true, "download": false, "own": {"allowUpload": true}, "other": true})"), own.seen);
+}
+
+}  // namespace
