@@ -18,7 +18,7 @@
 #include <string>
 #include <unistd.h>
 
-#include "platform/FileUtil.h"
+#include "platform/system/FileUtil.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
 #include "webapi/APIRequest.h"

@@ -16,7 +16,7 @@
 #include <unistd.h>
 #include <vector>
 
-#include "platform/FileUtil.h"
+#include "platform/system/FileUtil.h"
 #include "platform/StateRootTest.h"
 #include "support/TestSupport.h"
 #include "vela/httpoutput.h"

@@ -13,7 +13,7 @@
 #include <unistd.h>
 #include <vector>
 
-#include "platform/MultipartReader.h"
+#include "platform/transfer/MultipartReader.h"
 #include "support/TestSupport.h"
 #include "vela/upload.h"
 #include "vela/vlibc.h"

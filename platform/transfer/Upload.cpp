@@ -14,11 +14,11 @@
 #include <unordered_set>
 #include <vector>
 
-#include "CgiContext.h"
-#include "FileUtil.h"
-#include "MultipartReader.h"
-#include "SysInternal.h"
-#include "UploadDir.h"
+#include "cgi/CgiContext.h"
+#include "system/FileUtil.h"
+#include "system/SysInternal.h"
+#include "transfer/MultipartReader.h"
+#include "transfer/UploadDir.h"
 #include "vela/log.h"
 #include "vela/upload.h"
 #include "vela/uploaddir.h"

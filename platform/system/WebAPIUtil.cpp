@@ -9,7 +9,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "FileUtil.h"
+#include "system/FileUtil.h"
 #include "vela/log.h"
 #include "vela/webapiutil.h"
 

@@ -9,7 +9,7 @@
 #include <unistd.h>
 #include <vector>
 
-#include "SessionStore.h"
+#include "session/SessionStore.h"
 #include "vela/log.h"
 #include "vela/token.h"
 #include "vela/vlibc.h"

@@ -5,7 +5,7 @@
 #include <cstring>
 #include <mutex>
 
-#include "SysInternal.h"
+#include "system/SysInternal.h"
 #include "vela/sysfile.h"
 
 namespace {

@@ -9,7 +9,7 @@
 #include <string>
 #include <unordered_map>
 
-#include "FileUtil.h"
+#include "system/FileUtil.h"
 #include "vela/httpoutput.h"
 #include "vela/log.h"
 #include "vela/vlibc.h"

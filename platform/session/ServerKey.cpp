@@ -1,4 +1,4 @@
-#include "ServerKey.h"
+#include "session/ServerKey.h"
 
 #include <cerrno>
 #include <ctime>
@@ -8,7 +8,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "FileUtil.h"
+#include "system/FileUtil.h"
 #include "vela/log.h"
 #include "vela/vlibc.h"
 

@@ -11,8 +11,8 @@
 #include <sys/socket.h>
 #include <vector>
 
-#include "CgiContext.h"
-#include "FileUtil.h"
+#include "cgi/CgiContext.h"
+#include "system/FileUtil.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/vlibc.h"

@@ -12,12 +12,12 @@
 #include <unistd.h>
 #include <vector>
 
-#include "FileUtil.h"
-#include "SysInternal.h"
-#include "vela/vlibc.h"
+#include "system/FileUtil.h"
+#include "system/SysInternal.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/user.h"
+#include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 
 namespace VELA {

@@ -8,7 +8,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include "SysInternal.h"
+#include "system/SysInternal.h"
 #include "vela/sysfile.h"
 
 namespace {

@@ -14,8 +14,8 @@
 #include <unistd.h>
 #include <vector>
 
-#include "FileUtil.h"
-#include "SysInternal.h"
+#include "system/FileUtil.h"
+#include "system/SysInternal.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"

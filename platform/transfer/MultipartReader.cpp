@@ -1,7 +1,7 @@
 // The multipart/form-data parser: RFC 2046 section 5.1.1 body structure,
 // RFC 7578 form-data parts. One fixed buffer; content is handed to a sink
 // in large pieces, the delimiter found with memmem.
-#include "MultipartReader.h"
+#include "transfer/MultipartReader.h"
 
 #include <cerrno>
 #include <cstdlib>

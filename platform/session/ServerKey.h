@@ -26,7 +26,7 @@
 
 #include <string>
 
-#include "LazyCrypto.h"
+#include "session/LazyCrypto.h"
 
 namespace VELA {
 namespace Platform {

@@ -11,8 +11,8 @@
 #include <unistd.h>
 #include <vector>
 
-#include "CgiContext.h"
-#include "SessionStore.h"
+#include "cgi/CgiContext.h"
+#include "session/SessionStore.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/session.h"

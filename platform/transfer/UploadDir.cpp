@@ -21,9 +21,9 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include "FileUtil.h"
-#include "SysInternal.h"
-#include "UploadDir.h"
+#include "system/FileUtil.h"
+#include "system/SysInternal.h"
+#include "transfer/UploadDir.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 

@@ -1,6 +1,6 @@
 // Helpers of the session and access-token stores: clock, random identifiers,
 // state directories and files, the store lock, NSS look-ups.
-#include "SessionStore.h"
+#include "session/SessionStore.h"
 
 #include <arpa/inet.h>
 #include <atomic>
@@ -17,11 +17,11 @@
 #include <unistd.h>
 #include <vector>
 
-#include "FileUtil.h"
-#include "SysInternal.h"
-#include "vela/vlibc.h"
+#include "system/FileUtil.h"
+#include "system/SysInternal.h"
 #include "vela/log.h"
 #include "vela/session.h"
+#include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 
 namespace {

@@ -1,4 +1,4 @@
-#include "LazyCrypto.h"
+#include "session/LazyCrypto.h"
 
 #include <cstring>
 #include <dlfcn.h>

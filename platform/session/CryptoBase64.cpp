@@ -1,6 +1,6 @@
-#include "CryptoBase64.h"
+#include "session/CryptoBase64.h"
 
-#include "LazyCrypto.h"
+#include "session/LazyCrypto.h"
 
 namespace VELA {
 namespace Platform {

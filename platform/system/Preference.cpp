@@ -9,8 +9,8 @@
 #include <sys/types.h>
 #include <unistd.h>
 
-#include "FileUtil.h"
-#include "SysInternal.h"
+#include "system/FileUtil.h"
+#include "system/SysInternal.h"
 #include "vela/log.h"
 #include "vela/vlibc.h"
 

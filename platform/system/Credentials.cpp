@@ -11,7 +11,7 @@
 #include <unistd.h>
 #include <vector>
 
-#include "SysInternal.h"
+#include "system/SysInternal.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/user.h"

@@ -20,8 +20,8 @@
 #include <unistd.h>
 #include <vector>
 
-#include "LazyCrypto.h"
-#include "SessionStore.h"
+#include "session/LazyCrypto.h"
+#include "session/SessionStore.h"
 #include "vela/log.h"
 #include "vela/loginguard.h"
 #include "vela/session.h"

@@ -21,7 +21,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "FileUtil.h"
+#include "system/FileUtil.h"
 #include "vela/httpoutput.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"

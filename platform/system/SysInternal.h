@@ -7,7 +7,7 @@
 #include <sys/types.h>
 #include <vector>
 
-#include "FileUtil.h"
+#include "system/FileUtil.h"
 
 namespace VELA {
 namespace Platform {

@@ -1,4 +1,4 @@
-#include "FileUtil.h"
+#include "system/FileUtil.h"
 
 #include <algorithm>
 #include <cerrno>

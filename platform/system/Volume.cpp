@@ -8,8 +8,8 @@
 #include <sys/statvfs.h>
 #include <vector>
 
-#include "FileUtil.h"
-#include "SysInternal.h"
+#include "system/FileUtil.h"
+#include "system/SysInternal.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 

@@ -29,9 +29,9 @@
 #include <memory>
 #include <string>
 
-#include "CryptoBase64.h"
-#include "LazyCrypto.h"
-#include "ServerKey.h"
+#include "session/CryptoBase64.h"
+#include "session/LazyCrypto.h"
+#include "session/ServerKey.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 
