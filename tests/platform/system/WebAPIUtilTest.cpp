@@ -8,6 +8,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "support/LinearTime.h"
 #include "support/TestSupport.h"
 #include "vela/webapiutil.h"
 
@@ -201,6 +202,36 @@ TEST(WebAPIUtil, URLEncodeRoundTrip)
         all.push_back(static_cast<char>(c));
     }
     EXPECT_EQ(all, URLDecode(URLEncode(all), true));
+}
+
+// Every parser here takes client text: its time is linear in the input
+// (support/LinearTime.h).
+TEST(WebAPIUtil, ParsersTakeLinearTime)
+{
+    using VELA::Test::ExpectLinear;
+    using VELA::Test::LinearParser;
+    const LinearParser form = [](const std::string& text) {
+        Json::Value out;
+        strPairToJsonObj(text, out, true, true);
+    };
+    const LinearParser decode = [](const std::string& text) { URLDecode(text, true); };
+    // "&" alone was the quadratic case: each piece looked for "=" to the
+    // end of the body.
+    for (const char* piece : {"&", "&&=", "=", "a=b&", "%4"}) {
+        ExpectLinear("strPairToJsonObj", form, piece);
+        ExpectLinear("URLDecode", decode, piece);
+    }
+    const LinearParser list = [](const std::string& text) { ParseToArray(text.c_str(), ", "); };
+    const LinearParser json = [](const std::string& text) {
+        Json::Value out;
+        ParseJson(text, out);
+    };
+    for (const char* piece : {", ", ",,  "}) {
+        ExpectLinear("ParseToArray", list, piece, 4u << 20);
+    }
+    for (const char* piece : {"[1,", "\"\\\\", "{\"a\":"}) {
+        ExpectLinear("ParseJson", json, piece);
+    }
 }
 
 }  // namespace

@@ -1,4 +1,4 @@
-// Key=value files, files and directories, locks and the last-error record.
+// Key=value files, files and directories, and locks.
 #include <gtest/gtest.h>
 
 #include <cerrno>
@@ -308,24 +308,6 @@ TEST_F(SysFile, LockedCounterLosesNoUpdate)
     char buf[32];
     ASSERT_EQ(1, VLIBCFileGetKeyValue("/etc/counter", "count", buf, sizeof(buf)));
     EXPECT_EQ(std::to_string(kProcesses * kRounds), buf);
-}
-
-TEST(SysFileError, RecordKeepsStemLineAndErrno)
-{
-    errno = ENOSPC;
-    VLIBCErrSetEx(10496, "/src/transfer/APIUpload.cpp", 77);
-    EXPECT_EQ(ENOSPC, errno);
-    VLIBC_ERR_INFO info;
-    ASSERT_EQ(0, VLIBCErrGetEx(&info));
-    EXPECT_EQ(VLIBC_ERR_NO_SPACE, info.code);
-    EXPECT_STREQ("APIUpload", info.szFile);
-    EXPECT_EQ(77, info.line);
-    EXPECT_EQ(ENOSPC, info.sysErrno);
-    VLIBCErrSetEx(3072, nullptr, 0, std::string(400, 'm').c_str());  // cut to fit
-    ASSERT_EQ(0, VLIBCErrGetEx(&info));
-    EXPECT_EQ(255u, strlen(info.szMessage));
-    VLIBCErrClear();
-    EXPECT_EQ(VLIBC_ERR_NONE, VLIBCErrGet());
 }
 
 }  // namespace

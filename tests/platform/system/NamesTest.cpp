@@ -1,9 +1,8 @@
-// Strings, RFC 1123 names, address types and the system root.
+// RFC 1123 host and domain names and address types.
 #include <gtest/gtest.h>
 
 #include <string>
 
-#include "support/TestSupport.h"
 #include "vela/vlibc.h"
 
 namespace {
@@ -15,14 +14,6 @@ std::string Labels(int count, int each)
         out += (i ? "." : "") + std::string(each, 'a');
     }
     return out;
-}
-
-TEST(Strings, CaseLowerTouchesOnlyAsciiLetters)
-{
-    char text[] = "AbC-Z@[\xC3\x89]09";
-    EXPECT_EQ(text, VLIBCStrCaseLower(text));
-    EXPECT_STREQ("abc-z@[\xC3\x89]09", text);
-    EXPECT_EQ(nullptr, VLIBCStrCaseLower(nullptr));
 }
 
 TEST(Names, HostnameLabelRules)
@@ -70,30 +61,6 @@ TEST(Names, AddressTypes)
         EXPECT_EQ(0, VELANetGetAddrType(bad)) << bad;
     }
     EXPECT_EQ(0, VELANetGetAddrType(nullptr));
-}
-
-TEST(Root, DefaultAndTrailingSlashes)
-{
-    {
-        VELA::Test::ScopedEnv env("VELA_ROOT", nullptr);
-        VELA::VelaRootReset();
-        EXPECT_EQ("/", VELA::VelaRoot());
-        EXPECT_EQ("/etc/velainfo.conf", VELA::VelaPath("/etc/velainfo.conf"));
-    }
-    {
-        VELA::Test::ScopedEnv env("VELA_ROOT", "/tmp/r//");
-        VELA::VelaRootReset();
-        EXPECT_EQ("/tmp/r", VELA::VelaRoot());
-        EXPECT_EQ("/tmp/r/etc/velainfo.conf", VELA::VelaPath("/etc/velainfo.conf"));
-    }
-    {
-        // Cached until reset.
-        VELA::Test::ScopedEnv env("VELA_ROOT", "relative/dir");
-        EXPECT_EQ("/tmp/r", VELA::VelaRoot());
-        VELA::VelaRootReset();
-        EXPECT_EQ("/", VELA::VelaRoot());
-    }
-    VELA::VelaRootReset();
 }
 
 }  // namespace

@@ -1,4 +1,5 @@
-// The checked decimal parser every number from outside goes through.
+// ASCII case, the checked decimal parser every number from outside goes
+// through, CONTENT_LENGTH and the checked names.
 #include <gtest/gtest.h>
 
 #include <climits>
@@ -7,6 +8,14 @@
 #include "vela/vlibc.h"
 
 namespace {
+
+TEST(Strings, CaseLowerTouchesOnlyAsciiLetters)
+{
+    char text[] = "AbC-Z@[\xC3\x89]09";
+    EXPECT_EQ(text, VLIBCStrCaseLower(text));
+    EXPECT_STREQ("abc-z@[\xC3\x89]09", text);
+    EXPECT_EQ(nullptr, VLIBCStrCaseLower(nullptr));
+}
 
 TEST(Strings, ParseDecimal)
 {

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "platform/StateRootTest.h"
+#include "support/LinearTime.h"
 #include "support/TestSupport.h"
 #include "vela/cgi.h"
 #include "vela/webapiutil.h"
@@ -47,6 +48,19 @@ TEST(ParamLine, MalformedLinesRefused)
         EXPECT_FALSE(VelaCgiDetectAndDecryptParamLine(line)) << c.logged;
         EXPECT_EQ(c.line, line);
         EXPECT_TRUE(log.Contains(c.logged)) << c.logged;
+    }
+}
+
+// The line is checked before anything splits it, in time linear in its
+// length (support/LinearTime.h).
+TEST(ParamLine, CheckTakesLinearTime)
+{
+    const VELA::Test::LinearParser line = [](const std::string& text) {
+        std::string copy = text;
+        VelaCgiDetectAndDecryptParamLine(copy);
+    };
+    for (const char* piece : {"&", "%41&", "__cIpHeRtExT=&"}) {
+        VELA::Test::ExpectLinear("VelaCgiDetectAndDecryptParamLine", line, piece);
     }
 }
 

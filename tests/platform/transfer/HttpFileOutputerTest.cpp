@@ -1,4 +1,4 @@
-// HTTP file output: MIME types, whole files through a pipe and a file,
+// HTTP file output: whole files through a pipe and a file,
 // byte ranges, X-Sendfile only for paths nobody else can change, links on
 // the path refused, refusals, the disposition header, a client that goes
 // away.
@@ -16,7 +16,6 @@
 #include <unistd.h>
 #include <vector>
 
-#include "platform/system/FileUtil.h"
 #include "platform/StateRootTest.h"
 #include "support/TestSupport.h"
 #include "vela/httpoutput.h"
@@ -137,27 +136,6 @@ protected:
     std::string files_ = root_.Path() + "/files";
     HTTPFileOutputer out_;
 };
-
-TEST_F(HttpOutput, MimeTypesFromTheSystemFileThenBuiltIn)
-{
-    std::ofstream(root_.Path() + "/etc/mime.types")
-        << "# comment png\n\ntext/x-test\t\ttst TSX\napplication/pdf pdf\n  image/png png\n"
-           "no-slash abc\ntext/second tst\n";
-    EXPECT_EQ("text/x-test", HTTPFileOutputer::GetMimeType("a.tst"));
-    EXPECT_EQ("text/x-test", HTTPFileOutputer::GetMimeType("/x/A.TsX"));
-    EXPECT_EQ("application/pdf", HTTPFileOutputer::GetMimeType("archive.tar.PDF"));
-    EXPECT_EQ("image/png", HTTPFileOutputer::GetMimeType("p.png"));
-    for (const char* unknown : {"x.abc", "noext", "dir.pdf/file", "trailing.", "x.zip"}) {
-        EXPECT_EQ("application/octet-stream", HTTPFileOutputer::GetMimeType(unknown)) << unknown;
-    }
-
-    VELA::Test::TempDir bare;
-    ScopedEnv root("VELA_ROOT", bare.Path().c_str());
-    VELA::VelaRootReset();
-    EXPECT_EQ("application/zip", HTTPFileOutputer::GetMimeType("x.zip"));
-    EXPECT_EQ("text/html", HTTPFileOutputer::GetMimeType("INDEX.HTML"));
-    EXPECT_EQ("application/octet-stream", HTTPFileOutputer::GetMimeType("a.tst"));
-}
 
 TEST_F(HttpOutput, WholeFileThroughPipeFileAndAppendOnlyFile)
 {
@@ -370,8 +348,8 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
 }
 
 // A link anywhere on the path, the last component or a directory on the
-// way, is refused before anything is written, by both ways of resolving;
-// everything else opens alike.
+// way, is refused before anything is written (how the path is opened:
+// FileUtilTest.cpp).
 TEST_F(HttpOutput, SymbolicLinksOnThePathAreRefused)
 {
     const std::string target = Write("target.txt", "secret");
@@ -389,45 +367,6 @@ TEST_F(HttpOutput, SymbolicLinksOnThePathAreRefused)
         EXPECT_EQ("", r.head) << link;
         EXPECT_TRUE(log.Contains("symbolic link")) << link;
     }
-
-    using VELA::Platform::NoSymlinkResolve;
-    struct Case {
-        std::string path;
-        int err;  // 0: opens
-    };
-    const Case cases[] = {
-        {inDir, 0},
-        {files_ + "/dir/../dir/./in.txt", 0},
-        {files_ + "//dir///in.txt", 0},
-        {"files/dir/in.txt", 0},  // relative to the working directory
-        {files_ + "/last", ELOOP},
-        {files_ + "/middle/in.txt", ELOOP},
-        {"files/relative/in.txt", ELOOP},
-        {files_ + "/middle/../target.txt", ELOOP},
-        {files_ + "/dir/in.txt/", ENOTDIR},
-        {target + "/x", ENOTDIR},
-        {files_ + "/missing/x", ENOENT},
-        {"", EINVAL},
-        {std::string(5000, 'a'), ENAMETOOLONG},
-    };
-    char cwd[4096];
-    ASSERT_NE(nullptr, getcwd(cwd, sizeof(cwd)));
-    ASSERT_EQ(0, chdir(root_.Path().c_str()));
-    for (const Case& c : cases) {
-        for (NoSymlinkResolve how : {NoSymlinkResolve::kAuto, NoSymlinkResolve::kWalk}) {
-            errno = 0;
-            const int fd = VELA::Platform::OpenNoSymlinks(c.path, O_RDONLY, how);
-            const int err = fd < 0 ? errno : 0;
-            EXPECT_EQ(c.err, err) << c.path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
-            if (fd >= 0) {
-                char byte = 0;
-                EXPECT_EQ(1, read(fd, &byte, 1));
-                EXPECT_EQ('i', byte);
-                close(fd);
-            }
-        }
-    }
-    EXPECT_EQ(0, chdir(cwd));
 
     // A caller that trusts its links may have them followed.
     out_.SetFollowSymlinks(true);
