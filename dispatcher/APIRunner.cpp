@@ -211,7 +211,7 @@ APIRunner::APIRunner()
     d_ = new APIRunnerPrivate(this);
     setsid();
     Json::Value def;
-    if (WebAPIUtil::ReadJsonFile(VelaPath(kLibDefPath), def) && def.isObject()) {
+    if (WebAPIUtil::ReadJsonFile(VELA::System::Path(kLibDefPath), def) && def.isObject()) {
         libDef_ = def;
     }
 }

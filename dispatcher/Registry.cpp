@@ -47,7 +47,7 @@ const Json::Value& Member(const Json::Value& v, const std::string& key)
 
 
 // An API name from which file names may be built (IsAPIName of vlibc.h).
-bool IsSafeAPIName(const std::string& api) { return IsAPIName(api); }
+bool IsSafeAPIName(const std::string& api) { return System::IsAPIName(api); }
 
 }  // namespace
 

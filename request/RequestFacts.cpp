@@ -59,7 +59,7 @@ long long Integer(const Json::Value& v, long long def)
     const char* begin = nullptr;
     const char* end = nullptr;
     long long value = def;
-    if (v.getString(&begin, &end) && ParseDecimal(begin, static_cast<size_t>(end - begin), LLONG_MIN, LLONG_MAX, value)) {
+    if (v.getString(&begin, &end) && System::ParseDecimal(begin, static_cast<size_t>(end - begin), LLONG_MIN, LLONG_MAX, value)) {
         return value;
     }
     return def;
@@ -75,7 +75,7 @@ long long CheckedInteger(const Json::Value& v, long long min, long long max, lon
     const char* begin = nullptr;
     const char* end = nullptr;
     if (v.isString() && v.getString(&begin, &end) &&
-        ParseDecimal(begin, static_cast<size_t>(end - begin), min, max, value)) {
+        System::ParseDecimal(begin, static_cast<size_t>(end - begin), min, max, value)) {
         return value;
     }
     return def;
@@ -91,7 +91,7 @@ long long ContentLength(const Json::Value& v, long long max)
     if (!v.isString() || !v.getString(&begin, &end)) {
         return -1;
     }
-    return VELA::ContentLength(begin, static_cast<size_t>(end - begin), max);
+    return VELA::System::ContentLength(begin, static_cast<size_t>(end - begin), max);
 }
 
 }  // namespace RequestFacts

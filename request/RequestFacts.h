@@ -20,7 +20,7 @@ long long Integer(const Json::Value& v, long long def);
 // that is exactly a decimal number (ParseDecimal), within [min, max];
 // `def` for everything else (reals, "1e0", " 1", "1\0", junk, overflow).
 long long CheckedInteger(const Json::Value& v, long long min, long long max, long long def);
-// CONTENT_LENGTH of the request's environment (VELA::ContentLength): 0 when
+// CONTENT_LENGTH of the request's environment (VELA::System::ContentLength): 0 when
 // absent or empty, -1 for junk or more than `max`.
 long long ContentLength(const Json::Value& v, long long max);
 

@@ -20,7 +20,7 @@ static_assert(std::is_integral<time_t>::value && std::is_signed<time_t>::value,
 
 bool IsValidName(const std::string& name)
 {
-    return VELA::IsCheckedName(name, VELA::kNameId, name.size());
+    return VELA::System::IsCheckedName(name, VELA::System::kNameId, name.size());
 }
 
 bool HasLineBreak(const std::string& text)
@@ -32,12 +32,12 @@ bool HasLineBreak(const std::string& text)
 // False on any other character or when the number leaves time_t.
 static bool ParseDecimal(const std::string& text, time_t& out)
 {
-    // A leading "+" is allowed here besides the "-" of VELA::ParseDecimal.
+    // A leading "+" is allowed here besides the "-" of VELA::System::ParseDecimal.
     const bool plus = !text.empty() && text[0] == '+';
     long long value = 0;
-    if (!VELA::ParseDecimal(text.data() + (plus ? 1 : 0), text.size() - (plus ? 1 : 0),
-                            plus ? 0 : std::numeric_limits<time_t>::min(), std::numeric_limits<time_t>::max(),
-                            value)) {
+    if (!VELA::System::ParseDecimal(text.data() + (plus ? 1 : 0), text.size() - (plus ? 1 : 0),
+                                    plus ? 0 : std::numeric_limits<time_t>::min(), std::numeric_limits<time_t>::max(),
+                                    value)) {
         return false;
     }
     out = static_cast<time_t>(value);

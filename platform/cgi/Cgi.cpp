@@ -184,10 +184,10 @@ TrustedProxies LoadTrustedProxies()
 {
     TrustedProxies trusted;
     bool configured = false;
-    const std::string path = VELA::VelaPath(kConfPath);
+    const std::string path = VELA::System::Path(kConfPath);
     std::string text;
     int err = 0;
-    if (!VELA::Platform::ReadFileBounded(path, kMaxConfFile, text, err)) {
+    if (!VELA::System::ReadFileBounded(path, kMaxConfFile, text, err)) {
         if (err != ENOENT) {
             VELA_LOG_ERR("cannot read %s: %s", path.c_str(), strerror(err));
         }

@@ -5,19 +5,25 @@
 
 #include "vela/vlibc.h"
 
+namespace VELA {
+namespace Cgi {
+
 // The handle's upload tables (vela/upload.h), freed with the handle.
-struct VelaCgiUploadTables {
+struct UploadTables {
     PVLIBCSZHASH params = nullptr;  // every form field read so far
     PVLIBCSZHASH files = nullptr;   // the file stored by the last load
-    VelaCgiUploadTables() = default;
-    VelaCgiUploadTables(const VelaCgiUploadTables&) = delete;
-    VelaCgiUploadTables& operator=(const VelaCgiUploadTables&) = delete;
-    ~VelaCgiUploadTables()
+    UploadTables() = default;
+    UploadTables(const UploadTables&) = delete;
+    UploadTables& operator=(const UploadTables&) = delete;
+    ~UploadTables()
     {
         VLIBCSzHashFree(params);
         VLIBCSzHashFree(files);
     }
 };
+
+}  // namespace Cgi
+}  // namespace VELA
 
 struct _tag_VELACGI_CTX_ {
     std::string app;
@@ -38,5 +44,5 @@ struct _tag_VELACGI_CTX_ {
     std::string sessionWebAPI;     // option 6
     std::string sessionLang;       // three letters or ""
 
-    VelaCgiUploadTables upload;
+    VELA::Cgi::UploadTables upload;
 };

@@ -14,15 +14,15 @@
 #include "vela/token.h"
 #include "vela/vlibc.h"
 
-using VELA::Platform::ReadResult;
+using VELA::Session::ReadResult;
 
 namespace {
 
 const char kTokenDir[] = "/var/lib/vela/tokens";
 constexpr size_t kIdBytes = 16;
 constexpr size_t kSecretBytes = 32;
-static_assert(VELA::Platform::IdLength(kIdBytes) == VELA_TOKEN_ID_LEN, "token id length");
-static_assert(VELA::Platform::IdLength(kSecretBytes) == VELA_TOKEN_SECRET_LEN, "token secret length");
+static_assert(VELA::Session::IdLength(kIdBytes) == VELA_TOKEN_ID_LEN, "token id length");
+static_assert(VELA::Session::IdLength(kSecretBytes) == VELA_TOKEN_SECRET_LEN, "token secret length");
 constexpr size_t kMaxTokenFile = 16 * 1024;
 constexpr size_t kMaxPattern = 128;
 constexpr long long kMaxTime = 1LL << 40;
@@ -38,7 +38,7 @@ struct Token {
     long long expires = 0;
 };
 
-std::string TokenDir() { return VELA::VelaPath(kTokenDir); }
+std::string TokenDir() { return VELA::System::Path(kTokenDir); }
 
 std::string TokenPath(const std::string& id) { return TokenDir() + "/" + id; }
 
@@ -49,7 +49,7 @@ bool IsName(const char* name)
     if (name == nullptr) {
         return false;
     }
-    return VELA::IsCheckedName(name, strnlen(name, kMaxPattern + 1), VELA::kNameDotted, kMaxPattern);
+    return VELA::System::IsCheckedName(name, strnlen(name, kMaxPattern + 1), VELA::System::kNameDotted, kMaxPattern);
 }
 
 bool IsPattern(const std::string& pattern)
@@ -59,7 +59,7 @@ bool IsPattern(const std::string& pattern)
     }
     const size_t stem = pattern.back() == '*' ? pattern.size() - 1 : pattern.size();
     // "*" alone stands for every name.
-    return stem == 0 || VELA::IsCheckedName(pattern.data(), stem, VELA::kNameDotted, kMaxPattern);
+    return stem == 0 || VELA::System::IsCheckedName(pattern.data(), stem, VELA::System::kNameDotted, kMaxPattern);
 }
 
 bool Matches(const std::string& pattern, const char* name)
@@ -92,7 +92,7 @@ bool GetPatterns(const Json::Value& doc, const char* key, std::vector<std::strin
 
 bool ParseToken(const Json::Value& doc, const std::string& id, Token& t)
 {
-    using namespace VELA::Platform;
+    using namespace VELA::Session;
     long long version = 0;
     return GetInt(doc, "version", 1, 1, version) && GetString(doc, "id", VELA_TOKEN_ID_LEN, t.id) && t.id == id &&
            GetString(doc, "secret", VELA_TOKEN_SECRET_LEN, t.secret) &&
@@ -128,7 +128,7 @@ enum class Load { Ok, NoToken, Error };
 Load LoadToken(const std::string& id, Token& t)
 {
     Json::Value doc;
-    switch (VELA::Platform::ReadStateFile(TokenPath(id), kMaxTokenFile, doc)) {
+    switch (VELA::Session::ReadStateFile(TokenPath(id), kMaxTokenFile, doc)) {
     case ReadResult::Ok:
         break;
     case ReadResult::Missing:
@@ -153,8 +153,8 @@ bool SplitToken(const char* token, std::string& id, std::string& secret)
     }
     id.assign(token, VELA_TOKEN_ID_LEN);
     secret.assign(token + VELA_TOKEN_ID_LEN + 1);
-    return VELA::Platform::IsId(id.c_str(), VELA_TOKEN_ID_LEN) &&
-           VELA::Platform::IsId(secret.c_str(), VELA_TOKEN_SECRET_LEN);
+    return VELA::Session::IsId(id.c_str(), VELA_TOKEN_ID_LEN) &&
+           VELA::Session::IsId(secret.c_str(), VELA_TOKEN_SECRET_LEN);
 }
 
 int Grant(const char* token, const char* api, const char* method, char* user, size_t userSize)
@@ -175,11 +175,11 @@ int Grant(const char* token, const char* api, const char* method, char* user, si
     if (loaded == Load::Error) {
         return -5;
     }
-    if (loaded == Load::NoToken || !VELA::Platform::ConstantTimeEquals(secret, t.secret)) {
+    if (loaded == Load::NoToken || !VELA::Session::ConstantTimeEquals(secret, t.secret)) {
         VELA_LOG(kAuthLog, "access token %s: unknown token, refused", id.c_str());
         return -1;
     }
-    if (VELA::Platform::Now() >= t.expires) {
+    if (VELA::Session::Now() >= t.expires) {
         VELA_LOG(kAuthLog, "access token %s of \"%s\": expired", id.c_str(), t.user.c_str());
         return -2;
     }
@@ -189,7 +189,7 @@ int Grant(const char* token, const char* api, const char* method, char* user, si
         return -3;
     }
     uid_t uid = 0;
-    const int known = VELA::Platform::LookupUser(t.user.c_str(), uid);
+    const int known = VELA::Session::LookupUser(t.user.c_str(), uid);
     if (known < 0) {
         return -5;
     }
@@ -197,7 +197,7 @@ int Grant(const char* token, const char* api, const char* method, char* user, si
         VELA_LOG(kAuthLog, "access token %s: user \"%s\" no longer exists", id.c_str(), t.user.c_str());
         return -4;
     }
-    if (!VELA::Platform::CopyOut(t.user, user, userSize)) {
+    if (!VELA::Session::CopyOut(t.user, user, userSize)) {
         VELA_LOG_ERR("access token %s: user name does not fit a buffer of %zu bytes", id.c_str(), userSize);
         return -5;
     }
@@ -207,10 +207,10 @@ int Grant(const char* token, const char* api, const char* method, char* user, si
 void PurgeExpired()
 {
     std::vector<std::string> ids;
-    if (!VELA::Platform::ListIds(TokenDir(), VELA_TOKEN_ID_LEN, ids)) {
+    if (!VELA::Session::ListIds(TokenDir(), VELA_TOKEN_ID_LEN, ids)) {
         return;
     }
-    const long long now = VELA::Platform::Now();
+    const long long now = VELA::Session::Now();
     for (const std::string& id : ids) {
         Token t;
         if (LoadToken(id, t) == Load::Ok && now >= t.expires) {
@@ -240,7 +240,7 @@ bool CheckPatterns(const std::vector<std::string>& patterns, const char* what)
 int Create(const char* user, const std::vector<std::string>& apis, const std::vector<std::string>& methods,
            long long lifetime, std::string& token, std::string& id)
 {
-    using namespace VELA::Platform;
+    using namespace VELA::Session;
     if (!IsUserName(user)) {
         VELA_LOG_ERR("access token create: invalid user name");
         return -1;
@@ -343,10 +343,10 @@ int VelaAccessTokenList(std::vector<VelaAccessTokenRecord>& out)
     out.clear();
     try {
         std::vector<std::string> ids;
-        if (!VELA::Platform::ListIds(TokenDir(), VELA_TOKEN_ID_LEN, ids)) {
+        if (!VELA::Session::ListIds(TokenDir(), VELA_TOKEN_ID_LEN, ids)) {
             return -1;
         }
-        const long long now = VELA::Platform::Now();
+        const long long now = VELA::Session::Now();
         for (const std::string& id : ids) {
             Token t;
             if (LoadToken(id, t) != Load::Ok) {
@@ -379,7 +379,7 @@ int VelaAccessTokenRevoke(const char* id)
         std::string secret;
         if (SplitToken(id, name, secret)) {
             // A whole token was given: its id part names the file.
-        } else if (VELA::Platform::IsId(id, VELA_TOKEN_ID_LEN)) {
+        } else if (VELA::Session::IsId(id, VELA_TOKEN_ID_LEN)) {
             name = id;
         } else {
             return -2;

@@ -35,11 +35,11 @@
 #include "vela/cgi.h"
 #include "vela/log.h"
 
-using VELA::Platform::CryptoApi;
-using VELA::Platform::LogCryptoError;
-using VELA::Platform::PkeyCtxRef;
-using VELA::Platform::PkeyRef;
-using VELA::Platform::SecretBytes;
+using VELA::Session::CryptoApi;
+using VELA::Session::LogCryptoError;
+using VELA::Session::PkeyCtxRef;
+using VELA::Session::PkeyRef;
+using VELA::Session::SecretBytes;
 
 namespace {
 
@@ -100,16 +100,16 @@ bool RsaOaepDecrypt(const CryptoApi& api, EVP_PKEY* key, const SecretBytes& in, 
 // success `plain` holds the plaintext in its first `plainLen` bytes.
 bool OpenRsaText(const std::string& text, const char* what, std::unique_ptr<SecretBytes>& plain, size_t& plainLen)
 {
-    const long cipherLen = VELA::Platform::DecodedBase64Size(text, kMaxRsaBase64);
+    const long cipherLen = VELA::Session::DecodedBase64Size(text, kMaxRsaBase64);
     if (cipherLen < kMinRsaBytes || cipherLen > kMaxRsaBytes) {
         VELA_LOG_ERR("%s: not base64 of an RSA ciphertext of %ld to %ld bytes", what, kMinRsaBytes, kMaxRsaBytes);
         return false;
     }
-    const CryptoApi* api = VELA::Platform::LazyCrypto();
+    const CryptoApi* api = VELA::Session::LazyCrypto();
     if (api == nullptr) {
         return false;
     }
-    PkeyRef key(*api, VELA::Platform::AcquireServerKey(*api, false));
+    PkeyRef key(*api, VELA::Session::AcquireServerKey(*api, false));
     if (key.get() == nullptr) {
         return false;
     }
@@ -119,7 +119,7 @@ bool OpenRsaText(const std::string& text, const char* what, std::unique_ptr<Secr
         return false;
     }
     SecretBytes cipher(static_cast<size_t>(cipherLen));
-    if (!VELA::Platform::DecodeBase64Strict(text, cipher)) {
+    if (!VELA::Session::DecodeBase64Strict(text, cipher)) {
         return false;
     }
     std::unique_ptr<SecretBytes> out(new SecretBytes(static_cast<size_t>(keySize)));
@@ -207,7 +207,7 @@ bool DecryptAES(const std::string& key, const std::string& cipher, std::string& 
         VELA_LOG_ERR("__tXeTrEhPiC: the key has %zu characters, not %zu", key.size(), kAesKeyLen);
         return false;
     }
-    const long rawLen = VELA::Platform::DecodedBase64Size(cipher, kMaxAesBase64);
+    const long rawLen = VELA::Session::DecodedBase64Size(cipher, kMaxAesBase64);
     if (rawLen < 0) {
         VELA_LOG_ERR("__tXeTrEhPiC: not base64 of at most %zu characters", kMaxAesBase64);
         return false;
@@ -216,12 +216,12 @@ bool DecryptAES(const std::string& key, const std::string& cipher, std::string& 
         VELA_LOG_ERR("__tXeTrEhPiC: %ld bytes, shorter than the IV and the tag", rawLen);
         return false;
     }
-    const CryptoApi* api = VELA::Platform::LazyCrypto();
+    const CryptoApi* api = VELA::Session::LazyCrypto();
     if (api == nullptr) {
         return false;
     }
     SecretBytes raw(static_cast<size_t>(rawLen));
-    if (!VELA::Platform::DecodeBase64Strict(cipher, raw)) {
+    if (!VELA::Session::DecodeBase64Strict(cipher, raw)) {
         return false;
     }
     const size_t bodyLen = raw.size() - kGcmIvLen - kGcmTagLen;
@@ -272,19 +272,19 @@ bool DecryptAES(const std::string& key, const std::string& cipher, std::string& 
 
 int PublicKeyPEM(std::string& pem)
 {
-    const CryptoApi* api = VELA::Platform::LazyCrypto();
+    const CryptoApi* api = VELA::Session::LazyCrypto();
     if (api == nullptr) {
         return -1;
     }
-    PkeyRef key(*api, VELA::Platform::AcquireServerKey(*api, true));
+    PkeyRef key(*api, VELA::Session::AcquireServerKey(*api, true));
     if (key.get() == nullptr) {
         return -1;
     }
     std::string out;
-    if (!VELA::Platform::PublicKeyPEM(*api, key.get(), out)) {
+    if (!VELA::Session::PublicKeyPEM(*api, key.get(), out)) {
         return -1;
     }
-    VELA::Platform::RefreshPublicKeyFile(out);
+    VELA::Session::RefreshPublicKeyFile(out);
     pem.swap(out);
     return 0;
 }

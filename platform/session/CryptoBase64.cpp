@@ -3,7 +3,7 @@
 #include "session/LazyCrypto.h"
 
 namespace VELA {
-namespace Platform {
+namespace Session {
 
 namespace {
 
@@ -86,5 +86,5 @@ bool DecodeBase64Strict(const std::string& text, SecretBytes& out)
     return used == out.size();
 }
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

@@ -5,7 +5,7 @@
 #include <string>
 
 namespace VELA {
-namespace Platform {
+namespace Session {
 
 class SecretBytes;
 
@@ -20,5 +20,5 @@ long DecodedBase64Size(const std::string& text, size_t maxText);
 // size must be exactly the decoded size. False when it is not.
 bool DecodeBase64Strict(const std::string& text, SecretBytes& out);
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

@@ -7,7 +7,7 @@
 #include "vela/log.h"
 
 namespace VELA {
-namespace Platform {
+namespace Session {
 
 namespace {
 
@@ -117,5 +117,5 @@ const char* MemBio::Data(size_t& len) const
     return data;
 }
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

@@ -18,7 +18,7 @@
 #include <openssl/rsa.h>
 
 namespace VELA {
-namespace Platform {
+namespace Session {
 
 // Every libcrypto function the platform calls. Only real symbols belong
 // here: several OpenSSL names are macros (OPENSSL_free, BIO_get_mem_data,
@@ -159,5 +159,5 @@ private:
     bool writable_;
 };
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

@@ -30,7 +30,8 @@
 
 namespace {
 
-using VELA::Platform::Now;
+using VELA::Session::LoginSettings;
+using VELA::Session::Now;
 
 const char kGuardDir[] = "/run/vela/login-guard";
 const char kConfPath[] = "/etc/vela/webapi.conf";
@@ -53,7 +54,7 @@ const int kBlockLog = LOG_AUTHPRIV | LOG_NOTICE;
 bool ParseSetting(const char* text, int min, int max, int& out)
 {
     long long value = 0;
-    if (!VELA::ParseDecimal(text, strlen(text), min, max, value)) {
+    if (!VELA::System::ParseDecimal(text, strlen(text), min, max, value)) {
         return false;
     }
     out = static_cast<int>(value);
@@ -113,7 +114,7 @@ bool AddressKey(const char* clientIP, std::string& key)
     }
     std::string canonical;
     if (strnlen(clientIP, INET6_ADDRSTRLEN) >= INET6_ADDRSTRLEN ||
-        !VELA::Platform::CanonicalAddress(clientIP, canonical)) {
+        !VELA::Session::CanonicalAddress(clientIP, canonical)) {
         return false;
     }
     struct in6_addr v6;
@@ -144,12 +145,12 @@ bool AccountKey(const char* account, std::string& key)
     return true;
 }
 
-std::string GuardDir() { return VELA::VelaPath(kGuardDir); }
+std::string GuardDir() { return VELA::System::Path(kGuardDir); }
 
 // The hex SHA-256 of `key`.
 bool Digest(const std::string& key, std::string& hex)
 {
-    const VELA::Platform::CryptoApi* api = VELA::Platform::LazyCrypto();
+    const VELA::Session::CryptoApi* api = VELA::Session::LazyCrypto();
     if (api == nullptr) {
         return false;
     }
@@ -157,7 +158,7 @@ bool Digest(const std::string& key, std::string& hex)
     unsigned int mdLen = 0;
     if (api->EVP_Digest(key.data(), key.size(), md, &mdLen, api->EVP_sha256(), nullptr) != 1 ||
         mdLen != sizeof(md)) {
-        VELA::Platform::LogCryptoError(*api, "login guard: SHA-256 failed");
+        VELA::Session::LogCryptoError(*api, "login guard: SHA-256 failed");
         return false;
     }
     static const char kHex[] = "0123456789abcdef";
@@ -192,10 +193,10 @@ struct Limits {
 };
 
 // The settings' limits, each forced into its bounds.
-Limits LimitsOf(const VelaLoginSettings* settings)
+Limits LimitsOf(const LoginSettings* settings)
 {
-    const VelaLoginSettings defaults;
-    const VelaLoginSettings& s = settings != nullptr ? *settings : defaults;
+    const LoginSettings defaults;
+    const LoginSettings& s = settings != nullptr ? *settings : defaults;
     auto clamp = [](int v, int max) { return v < 1 ? 1 : (v > max ? max : v); };
     return Limits{clamp(s.maxFailures, VELA_LOGIN_MAX_FAILURES_MAX),
                   60LL * clamp(s.windowMinutes, VELA_LOGIN_MINUTES_MAX),
@@ -208,9 +209,9 @@ Limits LimitsOf(const VelaLoginSettings* settings)
 // cannot be read.
 bool LoadRecord(Record& rec)
 {
-    using VELA::Platform::ReadResult;
+    using VELA::Session::ReadResult;
     Json::Value doc;
-    const ReadResult r = VELA::Platform::ReadStateFile(rec.path, kMaxRecordFile, doc);
+    const ReadResult r = VELA::Session::ReadStateFile(rec.path, kMaxRecordFile, doc);
     if (r == ReadResult::Error) {
         return false;
     }
@@ -221,8 +222,8 @@ bool LoadRecord(Record& rec)
     const Json::Value& attempts = doc["attempts"];
     long long until = 0;
     long long version = 0;
-    if (!attempts.isArray() || !VELA::Platform::GetInt(doc, "version", 2, 2, version) ||
-        !VELA::Platform::GetInt(doc, "blockedUntil", 0, 1LL << 40, until)) {
+    if (!attempts.isArray() || !VELA::Session::GetInt(doc, "version", 2, 2, version) ||
+        !VELA::Session::GetInt(doc, "blockedUntil", 0, 1LL << 40, until)) {
         VELA_LOG_ERR("%s is not a login-guard record, starting afresh", rec.path.c_str());
         return true;
     }
@@ -307,7 +308,7 @@ bool SaveRecord(const Record& rec, const Limits& limits)
         doc["attempts"].append(pair);
     }
     doc["blockedUntil"] = static_cast<Json::Int64>(rec.blockedUntil);
-    if (!VELA::Platform::WriteStateFile(rec.path, doc, false)) {
+    if (!VELA::Session::WriteStateFile(rec.path, doc, false)) {
         return false;
     }
     const struct timespec times[2] = {{static_cast<time_t>(ExpiryOf(rec, limits)), 0},
@@ -405,7 +406,7 @@ public:
     GuardLock()
     {
         const std::string dir = GuardDir();
-        if (!VELA::Platform::EnsureStateDir(dir)) {
+        if (!VELA::Session::EnsureStateDir(dir)) {
             return;
         }
         if (VLIBCFileLockTimeByFile((dir + "/.lock").c_str(), 1, kLockSeconds, &handle_) != 0) {
@@ -481,10 +482,10 @@ bool LoadPair(Pair& pair, long long now, const Limits& limits)
 bool AccountMayExist(const char* account)
 {
     uid_t uid = 0;
-    return VELA::Platform::LookupUser(account, uid) != 0;
+    return VELA::Session::LookupUser(account, uid) != 0;
 }
 
-int Begin(const VelaLoginSettings* settings, const char* account, const char* clientIP, int* waitSeconds)
+int Begin(const LoginSettings* settings, const char* account, const char* clientIP, int* waitSeconds)
 {
     const Limits limits = LimitsOf(settings);
     Pair pair;
@@ -552,7 +553,7 @@ int Begin(const VelaLoginSettings* settings, const char* account, const char* cl
     return VELA_LOGIN_GUARD_ALLOW;
 }
 
-void Failed(const VelaLoginSettings* settings, const char* account, const char* clientIP, const char* reason)
+void Failed(const LoginSettings* settings, const char* account, const char* clientIP, const char* reason)
 {
     const Limits limits = LimitsOf(settings);
     Pair pair;
@@ -592,7 +593,7 @@ void Failed(const VelaLoginSettings* settings, const char* account, const char* 
     Purge(now, store);
 }
 
-int Succeeded(const VelaLoginSettings* settings, const char* account, const char* clientIP)
+int Succeeded(const LoginSettings* settings, const char* account, const char* clientIP)
 {
     const Limits limits = LimitsOf(settings);
     Pair pair;
@@ -618,12 +619,12 @@ int Succeeded(const VelaLoginSettings* settings, const char* account, const char
 
 }  // namespace
 
-void VelaLoginSettingsLoad(VelaLoginSettings* settings)
+void VELA::Session::LoginSettingsLoad(LoginSettings* settings)
 {
     if (settings == nullptr) {
         return;
     }
-    *settings = VelaLoginSettings();
+    *settings = LoginSettings();
     LoadSetting("login_max_failures", 1, VELA_LOGIN_MAX_FAILURES_MAX, settings->maxFailures);
     LoadSetting("login_window_minutes", 1, VELA_LOGIN_MINUTES_MAX, settings->windowMinutes);
     LoadSetting("login_block_minutes", 1, VELA_LOGIN_MINUTES_MAX, settings->blockMinutes);
@@ -632,8 +633,8 @@ void VelaLoginSettingsLoad(VelaLoginSettings* settings)
     LoadSetting("session_lifetime", 1, VELA_SESSION_LIFETIME_MAX, settings->lifetime);
 }
 
-int VelaLoginGuardBegin(const VelaLoginSettings* settings, const char* account, const char* clientIP,
-                        int* waitSeconds)
+int VELA::Session::LoginGuardBegin(const LoginSettings* settings, const char* account, const char* clientIP,
+                                   int* waitSeconds)
 {
     if (waitSeconds != nullptr) {
         *waitSeconds = 0;
@@ -646,8 +647,8 @@ int VelaLoginGuardBegin(const VelaLoginSettings* settings, const char* account, 
     }
 }
 
-void VelaLoginGuardFailed(const VelaLoginSettings* settings, const char* account, const char* clientIP,
-                          const char* reason)
+void VELA::Session::LoginGuardFailed(const LoginSettings* settings, const char* account, const char* clientIP,
+                                     const char* reason)
 {
     try {
         Failed(settings, account, clientIP, reason);
@@ -656,7 +657,7 @@ void VelaLoginGuardFailed(const VelaLoginSettings* settings, const char* account
     }
 }
 
-int VelaLoginGuardSucceeded(const VelaLoginSettings* settings, const char* account, const char* clientIP)
+int VELA::Session::LoginGuardSucceeded(const LoginSettings* settings, const char* account, const char* clientIP)
 {
     try {
         return Succeeded(settings, account, clientIP);

@@ -13,7 +13,12 @@
 #include "vela/vlibc.h"
 
 namespace VELA {
-namespace Platform {
+namespace Session {
+
+using System::FillTempFile;
+using System::MakeDirs;
+using System::ReadFileBounded;
+using System::ScopedFd;
 
 namespace {
 
@@ -63,7 +68,7 @@ long ElapsedMs(const struct timespec& start)
 int OpenKeyDir(const std::string& dir, bool create)
 {
     if (create) {
-        if (!MakeDirs(VELA::VelaPath(kStateParent), 0755)) {
+        if (!MakeDirs(System::Path(kStateParent), 0755)) {
             return -1;
         }
         if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
@@ -334,7 +339,7 @@ EVP_PKEY* LoadOrCreate(const CryptoApi& api, const std::string& dir, bool create
 EVP_PKEY* AcquireServerKey(const CryptoApi& api, bool create)
 {
     std::lock_guard<std::mutex> guard(g_cacheLock);
-    std::string dir = VELA::VelaPath(kKeyDir);
+    std::string dir = System::Path(kKeyDir);
     if (g_cacheKey == nullptr || g_cacheDir != dir || g_cacheApi != &api) {
         EVP_PKEY* key = LoadOrCreate(api, dir, create);
         if (key == nullptr) {
@@ -355,7 +360,7 @@ EVP_PKEY* AcquireServerKey(const CryptoApi& api, bool create)
 
 void RefreshPublicKeyFile(const std::string& pem)
 {
-    const std::string dir = VELA::VelaPath(kKeyDir);
+    const std::string dir = System::Path(kKeyDir);
     std::string onDisk;
     int err = 0;
     if (ReadFileBounded(dir + "/" + kPublicName, kMaxKeyFile, onDisk, err) && onDisk == pem) {
@@ -388,5 +393,5 @@ bool PublicKeyPEM(const CryptoApi& api, EVP_PKEY* key, std::string& pem)
     return true;
 }
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

@@ -29,7 +29,7 @@
 #include "session/LazyCrypto.h"
 
 namespace VELA {
-namespace Platform {
+namespace Session {
 
 // A new reference to the server's private key (free it with
 // api.EVP_PKEY_free), loaded on first use and cached for the process (per
@@ -50,5 +50,5 @@ bool PublicKeyPEM(const CryptoApi& api, EVP_PKEY* key, std::string& pem);
 // file is a copy for people and tools, the private key is what counts.
 void RefreshPublicKeyFile(const std::string& pem);
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

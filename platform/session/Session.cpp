@@ -19,14 +19,14 @@
 #include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 
-using VELA::Platform::ReadResult;
+using VELA::Session::ReadResult;
 
 namespace {
 
 const char kSessionDir[] = "/run/vela/sessions";
 constexpr size_t kIdBytes = 24;  // 192 bits, 32 characters
-static_assert(VELA::Platform::IdLength(kIdBytes) == VELA_SESSION_ID_LEN, "session id length");
-static_assert(VELA::Platform::IdLength(kIdBytes) == VELA_SESSION_TOKEN_LEN, "token length");
+static_assert(VELA::Session::IdLength(kIdBytes) == VELA_SESSION_ID_LEN, "session id length");
+static_assert(VELA::Session::IdLength(kIdBytes) == VELA_SESSION_TOKEN_LEN, "token length");
 constexpr size_t kMaxSessionFile = 16 * 1024;
 constexpr size_t kMaxText = 255;             // app, webapi
 constexpr size_t kMaxTokenHeader = 256;      // a longer X-Vela-Token is not ours
@@ -37,7 +37,7 @@ constexpr long long kMaxTime = 1LL << 40;    // far beyond any real clock
 constexpr long long kPurgeGrace = 3600;      // expired sessions kept this long
 const int kAuthLog = LOG_AUTHPRIV | LOG_NOTICE;
 
-struct Session {
+struct StoredSession {
     std::string id;
     std::string user;
     long long created = 0;
@@ -53,7 +53,7 @@ struct Session {
     std::string token;
 };
 
-std::string SessionDir() { return VELA::VelaPath(kSessionDir); }
+std::string SessionDir() { return VELA::System::Path(kSessionDir); }
 
 std::string SessionPath(const std::string& sid) { return SessionDir() + "/" + sid; }
 
@@ -85,9 +85,9 @@ std::string LogId(const std::string& sid) { return sid.substr(0, 6) + "..."; }
 
 // Reads the members of a session file, each checked for type and range.
 // False when anything is missing or wrong: such a file is no session.
-bool ParseSession(const Json::Value& doc, const std::string& sid, Session& s)
+bool ParseSession(const Json::Value& doc, const std::string& sid, StoredSession& s)
 {
-    using namespace VELA::Platform;
+    using namespace VELA::Session;
     long long version = 0;
     std::string clientIP;
     if (!GetInt(doc, "version", 1, 1, version) || !GetString(doc, "id", VELA_SESSION_ID_LEN, s.id) ||
@@ -111,7 +111,7 @@ bool ParseSession(const Json::Value& doc, const std::string& sid, Session& s)
     return true;
 }
 
-Json::Value SessionToJson(const Session& s)
+Json::Value SessionToJson(const StoredSession& s)
 {
     Json::Value doc(Json::objectValue);
     doc["version"] = 1;
@@ -135,10 +135,10 @@ enum class Load { Ok, NoSession, Error };
 
 // Loads session `sid` (already checked with IsId). `doc` receives the file's
 // document when not null.
-Load LoadSession(const std::string& sid, Session& s, Json::Value* doc = nullptr)
+Load LoadSession(const std::string& sid, StoredSession& s, Json::Value* doc = nullptr)
 {
     Json::Value parsed;
-    switch (VELA::Platform::ReadStateFile(SessionPath(sid), kMaxSessionFile, parsed)) {
+    switch (VELA::Session::ReadStateFile(SessionPath(sid), kMaxSessionFile, parsed)) {
     case ReadResult::Ok:
         break;
     case ReadResult::Missing:
@@ -161,7 +161,7 @@ Load LoadSession(const std::string& sid, Session& s, Json::Value* doc = nullptr)
 // counts as now, so that it can never keep a session alive.
 long long NotAfter(long long t, long long now) { return t > now ? now : t; }
 
-bool Expired(const Session& s, long long now, long long grace)
+bool Expired(const StoredSession& s, long long now, long long grace)
 {
     return now - NotAfter(s.created, now) > s.lifetime + grace ||
            now - NotAfter(s.lastUse, now) > s.idleTimeout + grace;
@@ -206,11 +206,11 @@ bool CarriesToken(const std::string& token)
     bool found = false;
     const char* header = getenv("HTTP_X_VELA_TOKEN");
     if (header != nullptr && strnlen(header, kMaxTokenHeader + 1) <= kMaxTokenHeader) {
-        found = VELA::Platform::ConstantTimeEquals(header, token);
+        found = VELA::Session::ConstantTimeEquals(header, token);
     }
     std::string param;
     if (!found && QueryParameter("VelaToken", param)) {
-        found = VELA::Platform::ConstantTimeEquals(param, token);
+        found = VELA::Session::ConstantTimeEquals(param, token);
     }
     return found;
 }
@@ -230,7 +230,7 @@ void ClearHandle(VELACGI_CTX* ctx)
     ctx->sessionLang.clear();
 }
 
-void FillInfo(const Session& s, bool skip, VELACGI_SESSION_INFO* info)
+void FillInfo(const StoredSession& s, bool skip, VELACGI_SESSION_INFO* info)
 {
     if (info == nullptr) {
         return;
@@ -241,8 +241,8 @@ void FillInfo(const Session& s, bool skip, VELACGI_SESSION_INFO* info)
     info->lifetime = static_cast<int>(s.lifetime);
     info->skipCheckIP = skip ? 1 : 0;
     info->tokenProtect = s.tokenProtect ? 1 : 0;
-    VELA::Platform::CopyOut(s.clientIP, info->clientIP, sizeof(info->clientIP));
-    VELA::Platform::CopyOut(s.lang, info->lang, sizeof(info->lang));
+    VELA::Session::CopyOut(s.clientIP, info->clientIP, sizeof(info->clientIP));
+    VELA::Session::CopyOut(s.lang, info->lang, sizeof(info->lang));
 }
 
 // Writes the new last use of session `sid` under the store lock: `now` when
@@ -253,11 +253,11 @@ void FillInfo(const Session& s, bool skip, VELACGI_SESSION_INFO* info)
 Load WriteLastUse(const std::string& sid, long long now, bool touch)
 {
     const std::string dir = SessionDir();
-    VELA::Platform::StoreLock lock(dir);
+    VELA::Session::StoreLock lock(dir);
     if (!lock.Held()) {
         return Load::Error;
     }
-    Session cur;
+    StoredSession cur;
     Json::Value doc;
     const Load loaded = LoadSession(sid, cur, &doc);
     if (loaded != Load::Ok) {
@@ -271,19 +271,19 @@ Load WriteLastUse(const std::string& sid, long long now, bool touch)
     doc["lastUse"] = static_cast<Json::Int64>(lastUse);
     doc["created"] = static_cast<Json::Int64>(created);
     // Rewritten on nearly every request: no fsync (see WriteStateFile).
-    return VELA::Platform::WriteStateFile(SessionPath(sid), doc, false) ? Load::Ok : Load::Error;
+    return VELA::Session::WriteStateFile(SessionPath(sid), doc, false) ? Load::Ok : Load::Error;
 }
 
 int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize, VELACGI_SESSION_INFO* info,
                  int flags)
 {
-    if (!VELA::Platform::IsId(sid, VELA_SESSION_ID_LEN)) {
+    if (!VELA::Session::IsId(sid, VELA_SESSION_ID_LEN)) {
         VELA_LOG(kAuthLog, "session check: malformed session id (%zu bytes), refused",
                  sid == nullptr ? 0 : strnlen(sid, 1024));
         return AUTH_RESULT_NO_SESSION;
     }
     const std::string id(sid);
-    Session s;
+    StoredSession s;
     const Load loaded = LoadSession(id, s);
     if (loaded != Load::Ok) {
         if (loaded == Load::NoSession) {
@@ -295,7 +295,7 @@ int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
     FillInfo(s, skip, info);
 
     uid_t uid = 0;
-    const int known = VELA::Platform::LookupUser(s.user.c_str(), uid);
+    const int known = VELA::Session::LookupUser(s.user.c_str(), uid);
     if (known < 0) {
         return AUTH_RESULT_REJECTED;
     }
@@ -304,7 +304,7 @@ int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
         return AUTH_RESULT_NO_SESSION;
     }
 
-    const long long now = VELA::Platform::Now();
+    const long long now = VELA::Session::Now();
     if (Expired(s, now, 0)) {
         VELA_LOG(kAuthLog, "session %s of \"%s\": timed out", LogId(id).c_str(), s.user.c_str());
         // Still pull a future time back, so that the next clock step cannot
@@ -318,7 +318,7 @@ int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
         char remote[64] = "";
         std::string client;
         if (VelaCgiGetRemoteIP(remote, sizeof(remote)) != 0 ||
-            !VELA::Platform::CanonicalAddress(remote, client) || client != s.clientIP) {
+            !VELA::Session::CanonicalAddress(remote, client) || client != s.clientIP) {
             VELA_LOG(kAuthLog, "session %s of \"%s\": request from %s, session bound to %s", LogId(id).c_str(),
                      s.user.c_str(), remote[0] != '\0' ? remote : "an unknown address",
                      s.clientIP.empty() ? "no address" : s.clientIP.c_str());
@@ -331,7 +331,7 @@ int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
         return AUTH_RESULT_TOKEN_MISSING;
     }
 
-    if (user != nullptr && !VELA::Platform::CopyOut(s.user, user, userSize)) {
+    if (user != nullptr && !VELA::Session::CopyOut(s.user, user, userSize)) {
         VELA_LOG_ERR("session %s: user name of %zu bytes does not fit a buffer of %zu", LogId(id).c_str(),
                      s.user.size(), userSize);
         return AUTH_RESULT_REJECTED;
@@ -578,11 +578,11 @@ int VelaCgiGetTimeout(VELACGI_CTX* ctx) { return ctx != nullptr && ctx->authoriz
 int VelaCgiIsTokenEnable(VELACGI_CTX* ctx)
 {
     const char* sid = VelaCgiGetCookie(ctx, "id");
-    if (sid == nullptr || !VELA::Platform::IsId(sid, VELA_SESSION_ID_LEN)) {
+    if (sid == nullptr || !VELA::Session::IsId(sid, VELA_SESSION_ID_LEN)) {
         return 0;
     }
     try {
-        Session s;
+        StoredSession s;
         return LoadSession(sid, s) == Load::Ok && s.tokenProtect ? 1 : 0;
     } catch (const std::exception&) {
         return 0;
@@ -591,16 +591,16 @@ int VelaCgiIsTokenEnable(VELACGI_CTX* ctx)
 
 int VelaCgiUIDGet(const char* sid, const char* user)
 {
-    if (!VELA::Platform::IsId(sid, VELA_SESSION_ID_LEN) || !VELA::Platform::IsUserName(user)) {
+    if (!VELA::Session::IsId(sid, VELA_SESSION_ID_LEN) || !VELA::Session::IsUserName(user)) {
         return -1;
     }
     try {
-        Session s;
+        StoredSession s;
         if (LoadSession(sid, s) != Load::Ok || s.user != user) {
             return -1;
         }
         uid_t uid = 0;
-        if (VELA::Platform::LookupUser(user, uid) != 1 || uid > static_cast<uid_t>(INT_MAX)) {
+        if (VELA::Session::LookupUser(user, uid) != 1 || uid > static_cast<uid_t>(INT_MAX)) {
             return -1;
         }
         return static_cast<int>(uid);
@@ -613,10 +613,10 @@ int VelaCgiUIDGet(const char* sid, const char* user)
 
 namespace {
 
-int CreateSession(const char* user, const char* clientIP, const VelaSessionOptions* options, std::string& sid,
+int CreateSession(const char* user, const char* clientIP, const VELA::Session::Options* options, std::string& sid,
                   std::string& token)
 {
-    using namespace VELA::Platform;
+    using namespace VELA::Session;
     if (!IsUserName(user)) {
         VELA_LOG_ERR("session create: invalid user name");
         return -1;
@@ -629,9 +629,9 @@ int CreateSession(const char* user, const char* clientIP, const VelaSessionOptio
         }
         return -1;
     }
-    const VelaSessionOptions defaults;
-    const VelaSessionOptions& opt = options != nullptr ? *options : defaults;
-    Session s;
+    const VELA::Session::Options defaults;
+    const VELA::Session::Options& opt = options != nullptr ? *options : defaults;
+    StoredSession s;
     s.user = user;
     s.idleTimeout = opt.idleTimeout == 0 ? VELA_SESSION_IDLE_DEFAULT : opt.idleTimeout;
     s.lifetime = opt.lifetime == 0 ? VELA_SESSION_LIFETIME_DEFAULT : opt.lifetime;
@@ -661,7 +661,7 @@ int CreateSession(const char* user, const char* clientIP, const VelaSessionOptio
     if (!EnsureStateDir(dir)) {
         return -1;
     }
-    VelaSessionPurge(kPurgeGrace);
+    VELA::Session::Purge(kPurgeGrace);
 
     StoreLock lock(dir);
     if (!lock.Held()) {
@@ -694,8 +694,8 @@ int CreateSession(const char* user, const char* clientIP, const VelaSessionOptio
 
 }  // namespace
 
-int VelaSessionCreate(const char* user, const char* clientIP, const VelaSessionOptions* options,
-                      std::string& sid, std::string& token)
+int VELA::Session::Create(const char* user, const char* clientIP, const VELA::Session::Options* options,
+                          std::string& sid, std::string& token)
 {
     sid.clear();
     token.clear();
@@ -709,9 +709,9 @@ int VelaSessionCreate(const char* user, const char* clientIP, const VelaSessionO
     }
 }
 
-int VelaSessionRemove(const char* sid)
+int VELA::Session::Remove(const char* sid)
 {
-    if (!VELA::Platform::IsId(sid, VELA_SESSION_ID_LEN)) {
+    if (!VELA::Session::IsId(sid, VELA_SESSION_ID_LEN)) {
         return -2;
     }
     try {
@@ -721,7 +721,7 @@ int VelaSessionRemove(const char* sid)
         if (lstat(path.c_str(), &st) != 0) {
             return errno == ENOENT ? -2 : -1;
         }
-        VELA::Platform::StoreLock lock(dir);
+        VELA::Session::StoreLock lock(dir);
         if (!lock.Held()) {
             return -1;
         }
@@ -739,21 +739,21 @@ int VelaSessionRemove(const char* sid)
     }
 }
 
-int VelaSessionList(std::vector<VelaSessionRecord>& out)
+int VELA::Session::List(std::vector<VELA::Session::Record>& out)
 {
     out.clear();
     try {
         std::vector<std::string> ids;
-        if (!VELA::Platform::ListIds(SessionDir(), VELA_SESSION_ID_LEN, ids)) {
+        if (!VELA::Session::ListIds(SessionDir(), VELA_SESSION_ID_LEN, ids)) {
             return -1;
         }
-        const long long now = VELA::Platform::Now();
+        const long long now = VELA::Session::Now();
         for (const std::string& id : ids) {
-            Session s;
+            StoredSession s;
             if (LoadSession(id, s) != Load::Ok) {
                 continue;
             }
-            VelaSessionRecord r;
+            VELA::Session::Record r;
             r.sid = s.id;
             r.user = s.user;
             r.clientIP = s.clientIP;
@@ -769,9 +769,9 @@ int VelaSessionList(std::vector<VelaSessionRecord>& out)
             r.expired = Expired(s, now, 0);
             out.push_back(std::move(r));
         }
-        std::sort(out.begin(), out.end(), [](const VelaSessionRecord& a, const VelaSessionRecord& b) {
-            return a.created != b.created ? a.created < b.created : a.sid < b.sid;
-        });
+        std::sort(out.begin(), out.end(), [](const VELA::Session::Record& a, const VELA::Session::Record& b) {
+                  return a.created != b.created ? a.created < b.created : a.sid < b.sid;
+                  });
         return 0;
     } catch (const std::exception&) {
         out.clear();
@@ -779,29 +779,29 @@ int VelaSessionList(std::vector<VelaSessionRecord>& out)
     }
 }
 
-int VelaSessionPurge(long long graceSeconds)
+int VELA::Session::Purge(long long graceSeconds)
 {
     if (graceSeconds < 0 || graceSeconds > kMaxTime) {
         return -1;
     }
     try {
         std::vector<std::string> ids;
-        if (!VELA::Platform::ListIds(SessionDir(), VELA_SESSION_ID_LEN, ids)) {
+        if (!VELA::Session::ListIds(SessionDir(), VELA_SESSION_ID_LEN, ids)) {
             return -1;
         }
         const std::string dir = SessionDir();
         int removed = 0;
         for (const std::string& id : ids) {
-            Session s;
-            if (LoadSession(id, s) != Load::Ok || !Expired(s, VELA::Platform::Now(), graceSeconds)) {
+            StoredSession s;
+            if (LoadSession(id, s) != Load::Ok || !Expired(s, VELA::Session::Now(), graceSeconds)) {
                 continue;
             }
             // Checked again under the lock: a request may have refreshed it.
-            VELA::Platform::StoreLock lock(dir);
+            VELA::Session::StoreLock lock(dir);
             if (!lock.Held()) {
                 return -1;
             }
-            if (LoadSession(id, s) == Load::Ok && Expired(s, VELA::Platform::Now(), graceSeconds) &&
+            if (LoadSession(id, s) == Load::Ok && Expired(s, VELA::Session::Now(), graceSeconds) &&
                 unlink(SessionPath(id).c_str()) == 0) {
                 ++removed;
             }

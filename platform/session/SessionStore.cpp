@@ -43,10 +43,17 @@ long long MonotonicMs()
 
 }  // namespace
 
-void VelaSetClockForTest(long long (*now)(void)) { g_clock.store(now); }
+void VELA::Session::SetClockForTest(long long (*now)(void)) { g_clock.store(now); }
 
 namespace VELA {
-namespace Platform {
+namespace Session {
+
+using System::DirName;
+using System::FindUserByName;
+using System::MakeDirs;
+using System::ReadFileBounded;
+using System::WriteJsonAtomic;
+using System::kReadNoFollow;
 
 long long Now()
 {
@@ -101,7 +108,7 @@ bool RandomId(size_t bytes, std::string& out)
 
 bool IsId(const char* text, size_t len)
 {
-    return text != nullptr && strnlen(text, len + 1) == len && VELA::IsCheckedName(text, len, VELA::kNameId, len);
+    return text != nullptr && strnlen(text, len + 1) == len && System::IsCheckedName(text, len, System::kNameId, len);
 }
 
 bool ListIds(const std::string& dir, size_t len, std::vector<std::string>& ids)
@@ -378,5 +385,5 @@ bool CopyOut(const std::string& text, char* buf, size_t size)
     return true;
 }
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

@@ -12,10 +12,10 @@
 #include <vector>
 
 namespace VELA {
-namespace Platform {
+namespace Session {
 
 // The current time in seconds: time(2), or the clock a test installed with
-// VelaSetClockForTest.
+// SetClockForTest.
 long long Now();
 
 // `bytes` random bytes from getrandom(2) as base64url text without padding
@@ -103,5 +103,5 @@ bool GetString(const Json::Value& obj, const char* key, size_t maxLen, std::stri
 // `buf` left empty when it has room for that) when it does not fit.
 bool CopyOut(const std::string& text, char* buf, size_t size);
 
-}  // namespace Platform
+}  // namespace Session
 }  // namespace VELA

@@ -18,7 +18,7 @@
 
 namespace {
 
-using namespace VELA::Platform;
+using namespace VELA::System;
 
 constexpr int kMaxGroups = 65536;
 
@@ -33,12 +33,12 @@ const char* ErrorText(int err, char* buf, size_t size)
 void LogSet(int line, bool ok, const char* what, int r, int e, int s, int err)
 {
     if (ok) {
-        VelaLogAt(LOG_AUTHPRIV | LOG_INFO, __FILE__, line, "WARNING: set%s(%d, %d, %d)", what, r, e, s);
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_INFO, __FILE__, line, "WARNING: set%s(%d, %d, %d)", what, r, e, s);
         return;
     }
     char buf[256];
-    VelaLogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, line, "ERROR: set%s(%d, %d, %d) [%s]", what, r, e, s,
-              ErrorText(err, buf, sizeof(buf)));
+    VELA::System::LogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, line, "ERROR: set%s(%d, %d, %d) [%s]", what, r, e, s,
+                        ErrorText(err, buf, sizeof(buf)));
 }
 
 bool SetResUid(int line, uid_t r, uid_t e, uid_t s)
@@ -103,8 +103,8 @@ void Restore(const Identity& old)
     }
     if (setgroups(old.groups.size(), old.groups.data()) != 0) {
         char buf[256];
-        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: setgroups(%zu) [%s]", old.groups.size(),
-                  ErrorText(errno, buf, sizeof(buf)));
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: setgroups(%zu) [%s]", old.groups.size(),
+                            ErrorText(errno, buf, sizeof(buf)));
     }
     SET_RESGID(old.rgid, old.egid, old.sgid);
     SET_RESUID(old.ruid, old.euid, old.suid);
@@ -124,15 +124,15 @@ bool ApplyGroups(const GroupPlan& plan, gid_t gid)
         if (initgroups(plan.initName.c_str(), gid) == 0) {
             return true;
         }
-        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: initgroups(%.255s, %d) [%s]",
-                  plan.initName.c_str(), static_cast<int>(gid), ErrorText(errno, buf, sizeof(buf)));
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: initgroups(%.255s, %d) [%s]",
+                            plan.initName.c_str(), static_cast<int>(gid), ErrorText(errno, buf, sizeof(buf)));
         return false;
     }
     if (setgroups(plan.explicitList.size(), plan.explicitList.data()) == 0) {
         return true;
     }
-    VelaLogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: setgroups(%zu) [%s]", plan.explicitList.size(),
-              ErrorText(errno, buf, sizeof(buf)));
+    VELA::System::LogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: setgroups(%zu) [%s]",
+                        plan.explicitList.size(), ErrorText(errno, buf, sizeof(buf)));
     return false;
 }
 
@@ -175,8 +175,8 @@ bool SwitchTo(uid_t uid, gid_t gid, const GroupPlan& plan, bool grantable)
     if (getresuid(&r, &e, &s) != 0 || getresgid(&rg, &eg, &sg) != 0 || r != uid || e != uid || s != saved ||
         rg != gid || eg != gid || sg != gid) {
         VELA_RECORD_ERROR(VLIBC_ERR_PERMISSION, "ids differ after the switch");
-        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: ids differ after switching to %d/%d",
-                  static_cast<int>(uid), static_cast<int>(gid));
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, __LINE__, "ERROR: ids differ after switching to %d/%d",
+                            static_cast<int>(uid), static_cast<int>(gid));
         Restore(old);
         return false;
     }
@@ -239,7 +239,7 @@ bool ResetForRunAs(const char* runAs, bool grantable)
     if (!ValidSwitchName(runAs)) {
         return false;
     }
-    if (VELARunAsIsSuperuser(runAs) != 1) {
+    if (VELA::System::RunAsIsSuperuser(runAs) != 1) {
         return ResetByName(runAs, grantable);
     }
     if (AlreadyPlainRoot()) {

@@ -85,7 +85,7 @@ void VLIBCErrClear(void)
 }
 
 namespace VELA {
-namespace Platform {
+namespace System {
 
 void RecordError(int code, const char* file, int line, const char* fmt, ...)
 {
@@ -99,5 +99,5 @@ void RecordError(int code, const char* file, int line, const char* fmt, ...)
     errno = saved;
 }
 
-}  // namespace Platform
+}  // namespace System
 }  // namespace VELA

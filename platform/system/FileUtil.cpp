@@ -17,7 +17,7 @@
 #include "vela/log.h"
 
 namespace VELA {
-namespace Platform {
+namespace System {
 
 void ScopedFd::Reset(int fd)
 {
@@ -312,5 +312,5 @@ std::string BaseName(const std::string& path)
     return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
-}  // namespace Platform
+}  // namespace System
 }  // namespace VELA

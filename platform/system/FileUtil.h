@@ -8,7 +8,7 @@
 #include <sys/types.h>
 
 namespace VELA {
-namespace Platform {
+namespace System {
 
 // A file descriptor closed at the end of the scope.
 class ScopedFd {
@@ -113,5 +113,5 @@ bool MakeDirs(const std::string& path, mode_t mode);
 std::string DirName(const std::string& path);
 std::string BaseName(const std::string& path);
 
-}  // namespace Platform
+}  // namespace System
 }  // namespace VELA

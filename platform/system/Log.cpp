@@ -10,7 +10,7 @@
 namespace {
 
 std::mutex g_sinkLock;
-VelaLogSinkFn g_sink = nullptr;
+VELA::System::LogSinkFn g_sink = nullptr;
 void* g_sinkArg = nullptr;
 
 bool StderrWanted()
@@ -52,7 +52,7 @@ void DeliverV(int priority, const char* prefix, const char* fmt, va_list ap)
 
 }  // namespace
 
-extern "C" void VelaLog(int priority, const char* fmt, ...)
+void VELA::System::Log(int priority, const char* fmt, ...)
 {
     int saved = errno;
     va_list ap;
@@ -63,14 +63,14 @@ extern "C" void VelaLog(int priority, const char* fmt, ...)
     errno = saved;
 }
 
-extern "C" void VelaLogSetSink(VelaLogSinkFn sink, void* arg)
+void VELA::System::LogSetSink(LogSinkFn sink, void* arg)
 {
     std::lock_guard<std::mutex> guard(g_sinkLock);
     g_sink = sink;
     g_sinkArg = arg;
 }
 
-extern "C" void VelaLogAt(int priority, const char* file, int line, const char* fmt, ...)
+void VELA::System::LogAt(int priority, const char* file, int line, const char* fmt, ...)
 {
     int saved = errno;
     const char* base = file ? strrchr(file, '/') : nullptr;

@@ -51,9 +51,9 @@ int LookupOwner(Kind kind, const char* name, uid_t& uid, gid_t& gid)
     int found = -1;
     try {
         if (kind == Kind::User) {
-            found = VELA::Platform::FindUserByName(name, uid, gid, nullptr);
+            found = VELA::System::FindUserByName(name, uid, gid, nullptr);
         } else {
-            found = VELA::Platform::FindGroupByName(name, gid);
+            found = VELA::System::FindGroupByName(name, gid);
             if (found == 1) {
                 uid = static_cast<uid_t>(-1);  // the owner stays root
             }
@@ -77,14 +77,14 @@ int PreferenceDirGet(Kind kind, const char* name, char* buf, size_t size)
     if (buf == nullptr || size == 0) {
         return -1;
     }
-    const std::string parent = VELA::VelaPath(std::string(kPreferenceBase) + what);
+    const std::string parent = VELA::System::Path(std::string(kPreferenceBase) + what);
     const std::string path = parent + "/" + name;
     // Check the room first so a failure leaves nothing behind.
     if (path.size() + 1 > size) {
         VELA_LOG_ERR("buffer of %zu bytes too small for %s", size, path.c_str());
         return -1;
     }
-    if (!VELA::Platform::MakeDirs(parent, 0755)) {
+    if (!VELA::System::MakeDirs(parent, 0755)) {
         return -1;
     }
     int parentFd = open(parent.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);

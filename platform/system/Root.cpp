@@ -8,6 +8,7 @@
 #include "vela/vlibc.h"
 
 namespace VELA {
+namespace System {
 namespace {
 
 std::mutex g_rootLock;
@@ -16,7 +17,7 @@ bool g_rootLoaded = false;
 
 // VELA_ROOT, read with secure_getenv so a set-user-id process ignores it.
 // Only an absolute path is accepted; trailing slashes are dropped so that
-// VelaPath() can append an absolute path without doubling the separator.
+// Path() can append an absolute path without doubling the separator.
 std::string LoadRoot()
 {
     const char* env = secure_getenv("VELA_ROOT");
@@ -36,7 +37,7 @@ std::string LoadRoot()
 
 }  // namespace
 
-const std::string& VelaRoot()
+const std::string& Root()
 {
     std::lock_guard<std::mutex> guard(g_rootLock);
     if (!g_rootLoaded) {
@@ -46,9 +47,9 @@ const std::string& VelaRoot()
     return g_root;
 }
 
-std::string VelaPath(const std::string& absolute)
+std::string Path(const std::string& absolute)
 {
-    const std::string& root = VelaRoot();
+    const std::string& root = Root();
     if (root == "/") {
         if (!absolute.empty() && absolute[0] == '/') {
             return absolute;
@@ -61,11 +62,12 @@ std::string VelaPath(const std::string& absolute)
     return root + "/" + absolute;
 }
 
-void VelaRootReset()
+void RootReset()
 {
     std::lock_guard<std::mutex> guard(g_rootLock);
     g_root.clear();
     g_rootLoaded = false;
 }
 
+}  // namespace System
 }  // namespace VELA

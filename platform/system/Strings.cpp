@@ -19,7 +19,7 @@ char* VLIBCStrCaseLower(char* sz)
     return sz;
 }
 
-bool VELA::ParseDecimal(const char* text, size_t len, long long min, long long max, long long& out)
+bool VELA::System::ParseDecimal(const char* text, size_t len, long long min, long long max, long long& out)
 {
     if (text == nullptr || len == 0 || min > max) {
         return false;
@@ -63,7 +63,7 @@ bool VELA::ParseDecimal(const char* text, size_t len, long long min, long long m
     return true;
 }
 
-long long VELA::ContentLength(const char* text, size_t len, long long max)
+long long VELA::System::ContentLength(const char* text, size_t len, long long max)
 {
     if (text == nullptr || len == 0) {
         return 0;
@@ -72,7 +72,7 @@ long long VELA::ContentLength(const char* text, size_t len, long long max)
     return ParseDecimal(text, len, 0, max, value) ? value : -1;
 }
 
-bool VELA::IsCheckedName(const char* name, size_t len, const char* punctuation, size_t maxLen)
+bool VELA::System::IsCheckedName(const char* name, size_t len, const char* punctuation, size_t maxLen)
 {
     if (name == nullptr || len == 0 || len > maxLen) {
         return false;
@@ -88,7 +88,7 @@ bool VELA::IsCheckedName(const char* name, size_t len, const char* punctuation, 
     return true;
 }
 
-bool VELA::IsAPIName(const std::string& api)
+bool VELA::System::IsAPIName(const std::string& api)
 {
     return IsCheckedName(api, kNameDotted, kMaxAPIName) && api[0] != '.' && api.find("..") == std::string::npos;
 }

@@ -21,7 +21,7 @@
 #include "vela/vlibc.h"
 
 namespace VELA {
-namespace Platform {
+namespace System {
 
 namespace {
 
@@ -387,14 +387,14 @@ std::string ResolvePath(const char* path)
     if (p[0] != '/') {
         return p;
     }
-    const std::string& root = VelaRoot();
+    const std::string& root = Root();
     if (root == "/") {
         return p;
     }
     if (p.size() > root.size() && p.compare(0, root.size(), root) == 0 && p[root.size()] == '/') {
         return p;  // already inside the root
     }
-    std::string resolved = VelaPath(p);
+    std::string resolved = Path(p);
     if (resolved.size() >= PATH_MAX) {
         return std::string();
     }
@@ -406,7 +406,7 @@ bool ValidKey(const char* key)
     if (key == nullptr) {
         return false;
     }
-    return VELA::IsCheckedName(key, strnlen(key, kMaxKey + 1), VELA::kNameDotted, kMaxKey);
+    return IsCheckedName(key, strnlen(key, kMaxKey + 1), kNameDotted, kMaxKey);
 }
 
 bool ValidValue(const char* value)
@@ -492,10 +492,10 @@ int ReadKeyValue(const std::string& path, const std::string& key, std::string& v
     return 1;
 }
 
-}  // namespace Platform
+}  // namespace System
 }  // namespace VELA
 
-using namespace VELA::Platform;
+using namespace VELA::System;
 
 int VLIBCFileCheckKeyValue(const char* path, const char* key, const char* value, int flags)
 {
@@ -533,7 +533,7 @@ int VLIBCFileGetKeyValue(const char* path, const char* key, char* buf, size_t si
     }
 }
 
-int VELA::ReadKeyValueFile(const char* rawPath, std::vector<std::pair<std::string, std::string>>& out)
+int VELA::System::ReadKeyValueFile(const char* rawPath, std::vector<std::pair<std::string, std::string>>& out)
 {
     out.clear();
     try {

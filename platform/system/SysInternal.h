@@ -10,7 +10,7 @@
 #include "system/FileUtil.h"
 
 namespace VELA {
-namespace Platform {
+namespace System {
 
 // `path` resolved as the public headers describe: an absolute path under
 // the system root unless it already lies inside it; a relative path as it
@@ -23,7 +23,7 @@ std::string ResolvePath(const char* path);
 void RecordError(int code, const char* file, int line, const char* fmt, ...)
     __attribute__((format(printf, 4, 5)));
 #define VELA_RECORD_ERROR(code, fmt, ...) \
-    ::VELA::Platform::RecordError((code), __FILE__, __LINE__, fmt, ##__VA_ARGS__)
+    ::VELA::System::RecordError((code), __FILE__, __LINE__, fmt, ##__VA_ARGS__)
 
 // ---- Key=value text (format in vela/sysfile.h) ----
 
@@ -66,5 +66,5 @@ int LookupGroupByName(const char* name, gid_t& gid);
 // Every group of `user` (getgrouplist with `base` included). False on error.
 bool GroupListOf(const std::string& user, gid_t base, std::vector<gid_t>& groups);
 
-}  // namespace Platform
+}  // namespace System
 }  // namespace VELA

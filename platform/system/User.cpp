@@ -21,7 +21,7 @@
 #include "vela/webapiutil.h"
 
 namespace VELA {
-namespace Platform {
+namespace System {
 
 namespace {
 
@@ -147,7 +147,7 @@ bool ValidPrivilege(const char* priv)
     if (priv == nullptr) {
         return false;
     }
-    return VELA::IsCheckedName(priv, strnlen(priv, 129), "_-.:", 128);
+    return IsCheckedName(priv, strnlen(priv, 129), "_-.:", 128);
 }
 
 struct Address {
@@ -190,7 +190,7 @@ bool AddressMatches(const Address& client, const std::string& rule)
     int bits = maxBits;
     if (slash != std::string::npos) {
         long long prefix = 0;
-        if (!VELA::ParseDecimal(rule.substr(slash + 1), 0, 128, prefix)) {
+        if (!ParseDecimal(rule.substr(slash + 1), 0, 128, prefix)) {
             return false;
         }
         bits = static_cast<int>(prefix);
@@ -493,10 +493,10 @@ bool GroupListOf(const std::string& user, gid_t base, std::vector<gid_t>& groups
     }
 }
 
-}  // namespace Platform
+}  // namespace System
 }  // namespace VELA
 
-using namespace VELA::Platform;
+using namespace VELA::System;
 
 int VELAUserNameIsValid(const char* name) { return ValidAccountName(name) ? 1 : 0; }
 
@@ -579,14 +579,14 @@ int VELAUserGetUGID(const char* name, uid_t* uid, gid_t* gid)
     }
 }
 
-int VELARunAsIsSuperuser(const char* runAs)
+int VELA::System::RunAsIsSuperuser(const char* runAs)
 {
     return runAs != nullptr && strcmp(runAs, VELA_RUNAS_SUPERUSER) == 0 ? 1 : 0;
 }
 
-int VELARunAsGetUGID(const char* runAs, uid_t* uid, gid_t* gid)
+int VELA::System::RunAsGetUGID(const char* runAs, uid_t* uid, gid_t* gid)
 {
-    if (uid != nullptr && gid != nullptr && VELARunAsIsSuperuser(runAs)) {
+    if (uid != nullptr && gid != nullptr && VELA::System::RunAsIsSuperuser(runAs)) {
         *uid = 0;
         *gid = 0;
         return 0;

@@ -15,7 +15,7 @@
 
 namespace {
 
-using namespace VELA::Platform;
+using namespace VELA::System;
 
 constexpr size_t kMaxConfFile = 64 * 1024;
 constexpr size_t kMaxEntries = 64;

@@ -116,7 +116,7 @@ bool ReadJsonFile(const std::string& path, Json::Value& out)
 {
     std::string text;
     int err = 0;
-    if (!Platform::ReadFileBounded(path, kMaxJsonFile, text, err)) {
+    if (!System::ReadFileBounded(path, kMaxJsonFile, text, err)) {
         if (err == EFBIG) {
             VELA_LOG_ERR("%s is larger than %zu bytes", path.c_str(), kMaxJsonFile);
         } else if (err != ENOENT) {
@@ -133,7 +133,7 @@ bool ReadJsonFile(const std::string& path, Json::Value& out)
 
 bool WriteJsonFileAtomic(const std::string& path, const Json::Value& value, unsigned mode)
 {
-    return Platform::WriteJsonAtomic(path, value, static_cast<mode_t>(mode & 07777), true);
+    return System::WriteJsonAtomic(path, value, static_cast<mode_t>(mode & 07777), true);
 }
 
 bool strPairToJsonObj(const std::string& text, Json::Value& out, bool urlDecode, bool overwrite)
@@ -277,7 +277,7 @@ Json::Value SzHashToJsonObj(PVLIBCSZHASH hash)
 
 }  // namespace WebAPIUtil
 
-bool Platform::WriteJsonAtomic(const std::string& path, const Json::Value& value, mode_t mode, bool durable)
+bool System::WriteJsonAtomic(const std::string& path, const Json::Value& value, mode_t mode, bool durable)
 {
     if (path.empty() || path.back() == '/') {
         VELA_LOG_ERR("invalid JSON file path \"%s\"", path.c_str());

@@ -17,8 +17,8 @@
 
 namespace {
 
-using VELA::Platform::ReadFileBounded;
-using VELA::Platform::ScopedFd;
+using VELA::System::ReadFileBounded;
+using VELA::System::ScopedFd;
 
 const char kConfPath[] = "/etc/vela/webapi.conf";
 const char kDefaultName[] = "lighttpd";
@@ -47,7 +47,7 @@ const char* SignalText(int number)
 
 bool ValidName(const std::string& name)
 {
-    return VELA::IsCheckedName(name, VELA::kNameDotted, kMaxName);
+    return VELA::System::IsCheckedName(name, VELA::System::kNameDotted, kMaxName);
 }
 
 // An absolute path without "." or ".." components.
@@ -95,7 +95,7 @@ bool ParsePid(const std::string& text, pid_t& pid)
         --end;
     }
     long long value = 0;
-    if (!VELA::ParseDecimal(text.data(), end, 2, INT_MAX, value)) {
+    if (!VELA::System::ParseDecimal(text.data(), end, 2, INT_MAX, value)) {
         return false;
     }
     pid = static_cast<pid_t>(value);
@@ -136,7 +136,7 @@ Engine::Engine() : valid_(false), restartSignal_(SIGUSR1)
             return;
         }
         name_ = name;
-        pidFile_ = VELA::VelaPath(pidFile);
+        pidFile_ = VELA::System::Path(pidFile);
         restartSignal_ = number;
         valid_ = true;
     } catch (const std::exception&) {
@@ -158,7 +158,7 @@ bool TARN::RestartService()
         std::string text;
         int err = 0;
         struct stat st;
-        if (!ReadFileBounded(pidFile, kMaxPidFile, text, err, VELA::Platform::kReadNoFollow, &st)) {
+        if (!ReadFileBounded(pidFile, kMaxPidFile, text, err, VELA::System::kReadNoFollow, &st)) {
             VELA_LOG_ERR("web server not restarted: cannot read pid file %s: %s", pidFile.c_str(), strerror(err));
             return false;
         }

@@ -29,7 +29,7 @@
 
 namespace {
 
-using VELA::Platform::ScopedFd;
+using VELA::System::ScopedFd;
 
 const char kConfPath[] = "/etc/vela/webapi.conf";
 const char kFastOutputKey[] = "xsendfile";
@@ -426,8 +426,9 @@ bool ParseDigits(const std::string& text, size_t& pos, uint64_t& value)
     }
     // The run holds digits only: ParseDecimal refuses it only on overflow.
     long long parsed = 0;
-    value = VELA::ParseDecimal(text.data() + start, pos - start, 0, LLONG_MAX, parsed) ? static_cast<uint64_t>(parsed)
-                                                                                       : UINT64_MAX;
+    value = VELA::System::ParseDecimal(text.data() + start, pos - start, 0, LLONG_MAX, parsed)
+                ? static_cast<uint64_t>(parsed)
+                : UINT64_MAX;
     return true;
 }
 
@@ -714,7 +715,7 @@ int HTTPFileOutputer::OpenForOutput(const std::string& path, bool followSymlinks
         }
         // O_NONBLOCK: opening a FIFO must not wait; it is refused below.
         const int flags = O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK;
-        ScopedFd fd(followSymlinks ? open(path.c_str(), flags) : VELA::Platform::OpenNoSymlinks(path, flags));
+        ScopedFd fd(followSymlinks ? open(path.c_str(), flags) : VELA::System::OpenNoSymlinks(path, flags));
         struct stat st;
         if (fd.Get() < 0 || fstat(fd.Get(), &st) != 0) {
             return -1;
@@ -744,7 +745,7 @@ bool HTTPFileOutputer::Output(const std::string& path, const std::string& mimeTy
             }
             return false;
         }
-        return SendDescriptor(fd.Get(), VELA::Platform::BaseName(path), mimeType, true);
+        return SendDescriptor(fd.Get(), VELA::System::BaseName(path), mimeType, true);
     } catch (const std::exception&) {
         VELA_LOG_ERR("out of memory while sending %s", path.c_str());
         return false;
@@ -811,7 +812,7 @@ bool FileOutputerHelper::IsFastOutputEnabled()
         if (state.switchedOff) {
             return false;
         }
-        const std::string path = VelaPath(kConfPath);
+        const std::string path = System::Path(kConfPath);
         if (!state.loaded || path != state.confPath) {
             state.configured = ReadFastOutputConfig();
             state.confPath = path;

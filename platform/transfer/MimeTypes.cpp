@@ -144,7 +144,7 @@ public:
     std::string Lookup(const std::string& ext)
     {
         std::lock_guard<std::mutex> guard(lock_);
-        const std::string path = VELA::VelaPath(kMimeTypesPath);
+        const std::string path = VELA::System::Path(kMimeTypesPath);
         if (!loaded_ || path != path_) {
             Load(path);
         }
@@ -158,7 +158,7 @@ private:
         MimeTable table;
         std::string text;
         int err = 0;
-        if (VELA::Platform::ReadFileBounded(path, kMaxMimeTypesFile, text, err)) {
+        if (VELA::System::ReadFileBounded(path, kMaxMimeTypesFile, text, err)) {
             ParseMimeTypes(text, table);
         } else {
             if (err != ENOENT) {

@@ -16,7 +16,7 @@
 #include "vela/log.h"
 
 namespace VELA {
-namespace Platform {
+namespace Transfer {
 
 namespace {
 
@@ -654,5 +654,5 @@ int MultipartReader::ReadContent(MultipartSink* sink)
     return 1;
 }
 
-}  // namespace Platform
+}  // namespace Transfer
 }  // namespace VELA

@@ -13,7 +13,7 @@
 #include "vela/upload.h"
 
 namespace VELA {
-namespace Platform {
+namespace Transfer {
 
 // Size of the one buffer a reader owns: the body goes through it in pieces
 // this large, and stored files are written in pieces of nearly this size.
@@ -75,7 +75,7 @@ public:
     int Failure() const { return failure_; }
     bool AtEnd() const { return state_ == kDone; }
 
-    void SetProgress(VelaUploadProgressFn progress) { progress_ = progress; }
+    void SetProgress(UploadProgressFn progress) { progress_ = progress; }
     uint64_t Consumed() const { return consumed_; }
     uint64_t Length() const { return length_; }
 
@@ -106,8 +106,8 @@ private:
     uint64_t partBytes_ = 0;  // content of the current part handed on so far
     State state_ = kStart;
     int failure_ = 0;
-    VelaUploadProgressFn progress_ = nullptr;
+    UploadProgressFn progress_ = nullptr;
 };
 
-}  // namespace Platform
+}  // namespace Transfer
 }  // namespace VELA

@@ -24,10 +24,12 @@
 #include "vela/uploaddir.h"
 #include "vela/vlibc.h"
 
-using VELA::Platform::MultipartPart;
-using VELA::Platform::MultipartReader;
-using VELA::Platform::MultipartSink;
-using VELA::Platform::ScopedFd;
+using VELA::System::ScopedFd;
+using VELA::Transfer::MultipartPart;
+using VELA::Transfer::MultipartReader;
+using VELA::Transfer::MultipartSink;
+using VELA::Transfer::UploadProgressFn;
+using VELA::Transfer::UploadReader;
 
 namespace {
 
@@ -48,7 +50,7 @@ struct StoredFile {
 
 }  // namespace
 
-struct _tag_VELA_UPLOAD_READER_ {
+struct VELA::Transfer::UploadReader {
     MultipartReader mp;
     bool pending = false;       // a file part's headers are read, its content not
     std::string pendingField;
@@ -60,10 +62,10 @@ struct _tag_VELA_UPLOAD_READER_ {
     std::unordered_set<std::string> fileKeys;
     std::unordered_map<std::string, int> nextSuffix;
 
-    _tag_VELA_UPLOAD_READER_() = default;
-    _tag_VELA_UPLOAD_READER_(const _tag_VELA_UPLOAD_READER_&) = delete;
-    _tag_VELA_UPLOAD_READER_& operator=(const _tag_VELA_UPLOAD_READER_&) = delete;
-    ~_tag_VELA_UPLOAD_READER_() { VLIBCSzHashFree(fields); }
+    UploadReader() = default;
+    UploadReader(const UploadReader&) = delete;
+    UploadReader& operator=(const UploadReader&) = delete;
+    ~UploadReader() { VLIBCSzHashFree(fields); }
 };
 
 namespace {
@@ -129,7 +131,7 @@ public:
     FileSink(int fd, const std::string& path) : fd_(fd), path_(path) {}
     int Write(const char* data, size_t len) override
     {
-        if (!VELA::Platform::WriteAll(fd_, data, len)) {
+        if (!VELA::System::WriteAll(fd_, data, len)) {
             VELA_LOG_ERR("upload failed: writing %s: %m", path_.c_str());
             return VELA_UPLOAD_ERR_WRITE;
         }
@@ -197,7 +199,7 @@ int OpenUploadDir(const char* dir, UploadDir& out)
     }
     // The process's private upload directory is used through the descriptor
     // it was made with; any other directory is opened by its path.
-    out.fd.Reset(VELA::Platform::DupUploadDir(out.path));
+    out.fd.Reset(VELA::Transfer::DupUploadDir(out.path));
     if (out.fd.Get() < 0) {
         out.fd.Reset(open(out.path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     }
@@ -246,7 +248,7 @@ int CreateStoredFile(const UploadDir& dir, std::string& name)
 
 // Reads form fields until a file part waits or the body ends. 1, or a
 // negative code (final for the reader).
-int ReadFieldsInternal(VELA_UPLOAD_READER* r)
+int ReadFieldsInternal(UploadReader* r)
 {
     MultipartReader& mp = r->mp;
     if (mp.Failure() != 0) {
@@ -313,7 +315,7 @@ int ReadFieldsInternal(VELA_UPLOAD_READER* r)
 
 // The key of a stored file: its field name, or "<name>_<n>" (n = 2, 3, ...)
 // when that key is taken already.
-std::string UniqueFileKey(VELA_UPLOAD_READER* r, const std::string& name)
+std::string UniqueFileKey(UploadReader* r, const std::string& name)
 {
     std::string key = name;
     if (r->fileKeys.count(key) != 0) {
@@ -332,7 +334,7 @@ std::string UniqueFileKey(VELA_UPLOAD_READER* r, const std::string& name)
 // Stores the waiting file part. 1 with `out` filled and the file listed in
 // `created`, or a negative code (final for the reader, except
 // VELA_UPLOAD_ERR_STATE when no file waits).
-int StoreFile(VELA_UPLOAD_READER* r, const UploadDir& dir, CreatedFiles& created, StoredFile& out)
+int StoreFile(UploadReader* r, const UploadDir& dir, CreatedFiles& created, StoredFile& out)
 {
     if (!r->pending) {
         return VELA_UPLOAD_ERR_STATE;
@@ -387,7 +389,7 @@ int ListFile(const StoredFile& file, PVLIBCSZHASH files, PVLIBCSZHASH names)
     return 1;
 }
 
-int ReadAllInternal(VELA_UPLOAD_READER* r, PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir)
+int ReadAllInternal(UploadReader* r, PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir)
 {
     if (r->mp.Failure() != 0) {
         return r->mp.Failure();
@@ -430,7 +432,7 @@ int ReadAllInternal(VELA_UPLOAD_READER* r, PVLIBCSZHASH fields, PVLIBCSZHASH fil
 struct ProcessUpload {
     bool opened = false;
     int openResult = 0;
-    VELA_UPLOAD_READER* reader = nullptr;
+    UploadReader* reader = nullptr;
 };
 
 ProcessUpload& Process()
@@ -439,20 +441,21 @@ ProcessUpload& Process()
     return process;
 }
 
-int ProcessReader(VELA_UPLOAD_READER** reader)
+int ProcessReader(UploadReader** reader)
 {
     ProcessUpload& process = Process();
     if (!process.opened) {
         process.opened = true;
         const char* lengthText = getenv("CONTENT_LENGTH");
         const long long length =
-            VELA::ContentLength(lengthText, lengthText != nullptr ? strlen(lengthText) : 0, LLONG_MAX);
+            VELA::System::ContentLength(lengthText, lengthText != nullptr ? strlen(lengthText) : 0, LLONG_MAX);
         if (length <= 0) {
             VELA_LOG_ERR("upload refused: CONTENT_LENGTH \"%.32s\" is not a length",
                          lengthText != nullptr ? lengthText : "(none)");
             process.openResult = VELA_UPLOAD_ERR_NO_BODY;
         } else {
-            process.openResult = VelaUploadReaderOpen(STDIN_FILENO, static_cast<unsigned long long>(length), getenv("CONTENT_TYPE"), &process.reader);
+            process.openResult = VELA::Transfer::UploadReaderOpen(STDIN_FILENO, static_cast<unsigned long long>(length),
+                                                                  getenv("CONTENT_TYPE"), &process.reader);
         }
     }
     *reader = process.reader;
@@ -461,7 +464,7 @@ int ProcessReader(VELA_UPLOAD_READER** reader)
 
 // Writes the waiting file part's names into the caller's buffers ("" when
 // none waits). VELA_UPLOAD_ERR_LIMIT when they do not fit (buffers "").
-int FillPending(VELA_UPLOAD_READER* r, char* fileName, size_t fileNameSize, char* fieldName, size_t fieldNameSize,
+int FillPending(UploadReader* r, char* fileName, size_t fileNameSize, char* fieldName, size_t fieldNameSize,
                 char* fieldValue, size_t fieldValueSize)
 {
     fileName[0] = fieldName[0] = fieldValue[0] = '\0';
@@ -501,8 +504,8 @@ PVLIBCSZHASH& EnsureTable(PVLIBCSZHASH& table)
 
 // ---- Reader over a file descriptor ----
 
-int VelaUploadReaderOpen(int fd, unsigned long long contentLength, const char* contentType,
-                         VELA_UPLOAD_READER** reader)
+int VELA::Transfer::UploadReaderOpen(int fd, unsigned long long contentLength, const char* contentType,
+                                     UploadReader** reader)
 {
     if (reader == nullptr) {
         return VELA_UPLOAD_ERR_ARGUMENT;
@@ -516,10 +519,10 @@ int VelaUploadReaderOpen(int fd, unsigned long long contentLength, const char* c
         return VELA_UPLOAD_ERR_NO_BODY;
     }
     std::string boundary;
-    if (!VELA::Platform::ParseMultipartContentType(contentType, boundary)) {
+    if (!VELA::Transfer::ParseMultipartContentType(contentType, boundary)) {
         return VELA_UPLOAD_ERR_CONTENT_TYPE;
     }
-    VELA_UPLOAD_READER* r = new (std::nothrow) VELA_UPLOAD_READER();
+    UploadReader* r = new (std::nothrow) VELA::Transfer::UploadReader();
     if (r == nullptr) {
         return VELA_UPLOAD_ERR_MEMORY;
     }
@@ -532,9 +535,9 @@ int VelaUploadReaderOpen(int fd, unsigned long long contentLength, const char* c
     return 1;
 }
 
-void VelaUploadReaderFree(VELA_UPLOAD_READER* reader) { delete reader; }
+void VELA::Transfer::UploadReaderFree(UploadReader* reader) { delete reader; }
 
-int VelaUploadReadFields(VELA_UPLOAD_READER* reader, PVLIBCSZHASH fields, VelaUploadProgressFn progress)
+int VELA::Transfer::UploadReadFields(UploadReader* reader, PVLIBCSZHASH fields, UploadProgressFn progress)
 {
     if (reader == nullptr) {
         return VELA_UPLOAD_ERR_ARGUMENT;
@@ -553,18 +556,18 @@ int VelaUploadReadFields(VELA_UPLOAD_READER* reader, PVLIBCSZHASH fields, VelaUp
     }
 }
 
-const char* VelaUploadPendingField(VELA_UPLOAD_READER* reader)
+const char* VELA::Transfer::UploadPendingField(UploadReader* reader)
 {
     return reader != nullptr && reader->pending ? reader->pendingField.c_str() : nullptr;
 }
 
-const char* VelaUploadPendingFileName(VELA_UPLOAD_READER* reader)
+const char* VELA::Transfer::UploadPendingFileName(UploadReader* reader)
 {
     return reader != nullptr && reader->pending ? reader->pendingName.c_str() : nullptr;
 }
 
-int VelaUploadReadFile(VELA_UPLOAD_READER* reader, const char* dir, char* path, size_t pathSize,
-                       PVLIBCSZHASH fileTable, VelaUploadProgressFn progress)
+int VELA::Transfer::UploadReadFile(UploadReader* reader, const char* dir, char* path, size_t pathSize,
+                                   PVLIBCSZHASH fileTable, UploadProgressFn progress)
 {
     if (reader == nullptr || path == nullptr || pathSize == 0 || dir == nullptr) {
         return VELA_UPLOAD_ERR_ARGUMENT;
@@ -606,8 +609,8 @@ int VelaUploadReadFile(VELA_UPLOAD_READER* reader, const char* dir, char* path, 
     }
 }
 
-int VelaUploadReadAll(VELA_UPLOAD_READER* reader, PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir,
-                      int flags, VelaUploadProgressFn progress)
+int VELA::Transfer::UploadReadAll(UploadReader* reader, PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir,
+                                  int flags, UploadProgressFn progress)
 {
     if (reader == nullptr || fields == nullptr || files == nullptr || dir == nullptr || flags != 0) {
         return VELA_UPLOAD_ERR_ARGUMENT;
@@ -623,19 +626,19 @@ int VelaUploadReadAll(VELA_UPLOAD_READER* reader, PVLIBCSZHASH fields, PVLIBCSZH
     }
 }
 
-unsigned long long VelaUploadConsumed(VELA_UPLOAD_READER* reader)
+unsigned long long VELA::Transfer::UploadConsumed(UploadReader* reader)
 {
     return reader != nullptr ? reader->mp.Consumed() : 0;
 }
 
-unsigned long long VelaUploadContentLength(VELA_UPLOAD_READER* reader)
+unsigned long long VELA::Transfer::UploadContentLength(UploadReader* reader)
 {
     return reader != nullptr ? reader->mp.Length() : 0;
 }
 
 // ---- CGI library ----
 
-int VelaCgiLoadUploadParams(VELACGI_CTX* ctx, VelaUploadProgressFn progress, unsigned long long* contentLength,
+int VelaCgiLoadUploadParams(VELACGI_CTX* ctx, UploadProgressFn progress, unsigned long long* contentLength,
                             char* fileName, size_t fileNameSize, char* fieldName, size_t fieldNameSize,
                             char* fieldValue, size_t fieldValueSize)
 {
@@ -646,10 +649,10 @@ int VelaCgiLoadUploadParams(VELACGI_CTX* ctx, VelaUploadProgressFn progress, uns
         return VELA_UPLOAD_ERR_ARGUMENT;
     }
     fileName[0] = fieldName[0] = fieldValue[0] = '\0';
-    VELA_UPLOAD_READER* reader = nullptr;
+    UploadReader* reader = nullptr;
     int rc = ProcessReader(&reader);
     if (contentLength != nullptr) {
-        *contentLength = VelaUploadContentLength(reader);
+        *contentLength = VELA::Transfer::UploadContentLength(reader);
     }
     if (rc != 1) {
         return rc;
@@ -657,26 +660,26 @@ int VelaCgiLoadUploadParams(VELACGI_CTX* ctx, VelaUploadProgressFn progress, uns
     if (EnsureTable(ctx->upload.params) == nullptr) {
         return VELA_UPLOAD_ERR_MEMORY;
     }
-    if ((rc = VelaUploadReadFields(reader, ctx->upload.params, progress)) < 0) {
+    if ((rc = VELA::Transfer::UploadReadFields(reader, ctx->upload.params, progress)) < 0) {
         return rc;
     }
     return FillPending(reader, fileName, fileNameSize, fieldName, fieldNameSize, fieldValue, fieldValueSize);
 }
 
-int VelaCgiLoadUploadFileToDir(VELACGI_CTX* ctx, const char* dir, VelaUploadProgressFn progress,
+int VelaCgiLoadUploadFileToDir(VELACGI_CTX* ctx, const char* dir, UploadProgressFn progress,
                                char* fileName, size_t fileNameSize, char* fieldName, size_t fieldNameSize,
                                char* fieldValue, size_t fieldValueSize)
 {
     if (ctx == nullptr || !ValidBuffers(fileName, fileNameSize, fieldName, fieldNameSize, fieldValue, fieldValueSize)) {
         return VELA_UPLOAD_ERR_ARGUMENT;
     }
-    VELA_UPLOAD_READER* r = nullptr;
+    UploadReader* r = nullptr;
     int rc = ProcessReader(&r);
     if (rc != 1) {
         return rc;
     }
     try {
-        const std::string resolved = VELA::Platform::ResolvePath(dir);
+        const std::string resolved = VELA::System::ResolvePath(dir);
         if (resolved.empty()) {
             return VELA_UPLOAD_ERR_ARGUMENT;
         }
@@ -728,26 +731,26 @@ int VelaCgiLoadUploadFileToDir(VELACGI_CTX* ctx, const char* dir, VelaUploadProg
 }
 
 int VelaCgiLoadUploadAll(PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir, int flags,
-                         VelaUploadProgressFn progress)
+                         UploadProgressFn progress)
 {
     if (fields == nullptr || files == nullptr || flags != 0) {
         return VELA_UPLOAD_ERR_ARGUMENT;
     }
-    VELA_UPLOAD_READER* reader = nullptr;
+    UploadReader* reader = nullptr;
     const int rc = ProcessReader(&reader);
     if (rc != 1) {
         return rc;
     }
     std::string resolved;
     try {
-        resolved = VELA::Platform::ResolvePath(dir);
+        resolved = VELA::System::ResolvePath(dir);
     } catch (const std::exception&) {
         return VELA_UPLOAD_ERR_MEMORY;
     }
     if (resolved.empty()) {
         return VELA_UPLOAD_ERR_ARGUMENT;
     }
-    return VelaUploadReadAll(reader, fields, files, resolved.c_str(), flags, progress);
+    return VELA::Transfer::UploadReadAll(reader, fields, files, resolved.c_str(), flags, progress);
 }
 
 PVLIBCSZHASH VelaCgiGetUploadParams(VELACGI_CTX* ctx) { return ctx != nullptr ? ctx->upload.params : nullptr; }
@@ -757,7 +760,7 @@ PVLIBCSZHASH VelaCgiGetUploadFiles(VELACGI_CTX* ctx) { return ctx != nullptr ? c
 void VelaCgiUploadReset(void)
 {
     ProcessUpload& process = Process();
-    VelaUploadReaderFree(process.reader);
+    VELA::Transfer::UploadReaderFree(process.reader);
     process = ProcessUpload();
-    VelaUploadDirRemove();
+    VELA::Transfer::UploadDirRemove();
 }

@@ -27,7 +27,7 @@
 #include "vela/log.h"
 #include "vela/sysfile.h"
 
-using VELA::Platform::ScopedFd;
+using VELA::System::ScopedFd;
 
 namespace {
 
@@ -56,7 +56,7 @@ struct PrivateDir {
     char path[PATH_MAX];
 };
 PrivateDir g_dir;
-// The write end of the pipe a reaper (VelaUploadDirReaper) waits on; -1
+// The write end of the pipe a reaper (VELA::Transfer::UploadDirReaper) waits on; -1
 // without one.
 int g_reaperFd = -1;
 
@@ -194,7 +194,7 @@ std::string Trimmed(const char* base)
 }
 
 // Opens the base directory `dir` (never through a symbolic link) and checks
-// it as VelaUploadBaseUsable describes. The descriptor, or -1 (logged and
+// it as VELA::Transfer::UploadBaseUsable describes. The descriptor, or -1 (logged and
 // recorded).
 int OpenBase(const std::string& dir)
 {
@@ -313,7 +313,7 @@ bool MakePrivateDir(int baseFd, char (&name)[kNameLength + 1])
 }  // namespace
 
 namespace VELA {
-namespace Platform {
+namespace Transfer {
 
 int DupUploadDir(const std::string& path)
 {
@@ -323,10 +323,10 @@ int DupUploadDir(const std::string& path)
     return fcntl(g_dir.dirFd, F_DUPFD_CLOEXEC, 0);
 }
 
-}  // namespace Platform
+}  // namespace Transfer
 }  // namespace VELA
 
-int VelaUploadBaseUsable(const char* base)
+int VELA::Transfer::UploadBaseUsable(const char* base)
 {
     if (base == nullptr || base[0] == '\0') {
         VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "no upload directory");
@@ -345,7 +345,7 @@ int VelaUploadBaseUsable(const char* base)
     }
 }
 
-int VelaUploadDirGet(const char* base, char* path, size_t pathSize)
+int VELA::Transfer::UploadDirGet(const char* base, char* path, size_t pathSize)
 {
     if (path == nullptr || pathSize == 0) {
         VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "no buffer");
@@ -411,7 +411,7 @@ int VelaUploadDirGet(const char* base, char* path, size_t pathSize)
     }
 }
 
-int VelaUploadDirRemove(void)
+int VELA::Transfer::UploadDirRemove(void)
 {
     if (!g_dir.active) {
         return 0;
@@ -433,7 +433,7 @@ int VelaUploadDirRemove(void)
     return removed ? 0 : -1;
 }
 
-int VelaUploadDirReaper(void)
+int VELA::Transfer::UploadDirReaper(void)
 {
     if (!g_dir.active || g_dir.uid != 0 || geteuid() != 0 || g_reaperFd >= 0) {
         return 0;
@@ -481,9 +481,9 @@ int VelaUploadDirReaper(void)
     return 1;
 }
 
-const char* VelaUploadDirPath(void) { return g_dir.active ? g_dir.path : ""; }
+const char* VELA::Transfer::UploadDirPath(void) { return g_dir.active ? g_dir.path : ""; }
 
-int VelaUploadCleanupOnExit(void)
+int VELA::Transfer::UploadCleanupOnExit(void)
 {
     static bool registered = false;
     int rc = 0;
@@ -519,7 +519,7 @@ int VelaUploadCleanupOnExit(void)
     return rc;
 }
 
-int VelaUploadSweep(const char* base, unsigned minAgeSeconds)
+int VELA::Transfer::UploadSweep(const char* base, unsigned minAgeSeconds)
 {
     if (base == nullptr || base[0] == '\0') {
         return -1;

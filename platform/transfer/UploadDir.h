@@ -5,12 +5,12 @@
 #include <string>
 
 namespace VELA {
-namespace Platform {
+namespace Transfer {
 
 // A new close-on-exec descriptor of the process's private upload directory
-// when `path` is its path exactly as VelaUploadDirGet gave it; -1 otherwise.
+// when `path` is its path exactly as UploadDirGet gave it; -1 otherwise.
 // The loaders store files through it, so the path is not looked up again.
 int DupUploadDir(const std::string& path);
 
-}  // namespace Platform
+}  // namespace Transfer
 }  // namespace VELA

@@ -70,17 +70,17 @@ Json::Value Desc(const std::string& apiLevel = "")
 
 class PermissionTest : public StateRootTest {
 protected:
-    std::string Login(const char* user, VelaSessionOptions options = VelaSessionOptions())
+    std::string Login(const char* user, VELA::Session::Options options = VELA::Session::Options())
     {
         std::string sid, token;
-        EXPECT_EQ(0, VelaSessionCreate(user, kClient, &options, sid, token));
+        EXPECT_EQ(0, VELA::Session::Create(user, kClient, &options, sid, token));
         return sid;
     }
     long long LastUse(const std::string& sid)
     {
-        std::vector<VelaSessionRecord> all;
-        EXPECT_EQ(0, VelaSessionList(all));
-        for (const VelaSessionRecord& r : all) {
+        std::vector<VELA::Session::Record> all;
+        EXPECT_EQ(0, VELA::Session::List(all));
+        for (const VELA::Session::Record& r : all) {
             if (r.sid == sid) {
                 return r.lastUse;
             }
@@ -139,7 +139,7 @@ TEST_F(PermissionTest, ASessionIdCutByANulByteNamesNoSession)
 
 TEST_F(PermissionTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 600;
     options.app = "VELA.App";
     options.webapi = "full";
@@ -169,7 +169,7 @@ TEST_F(PermissionTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
 
     // The session goes away: the slot already computed is reused, the other
     // one asks the platform and learns that there is no session.
-    ASSERT_EQ(0, VelaSessionRemove(sid.c_str()));
+    ASSERT_EQ(0, VELA::Session::Remove(sid.c_str()));
     EXPECT_EQ(0, e.CheckPermission(false));
     EXPECT_EQ(105, e.CheckPermission(true));
     EXPECT_EQ(J("[-2, 1]"), e.Slots());
@@ -177,7 +177,7 @@ TEST_F(PermissionTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
 
 TEST_F(PermissionTest, TimeoutAddressAndTokenProtectionRefusals)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 60;
     const std::string sid = Login("root", options);
     {

@@ -208,7 +208,7 @@ TEST(RequestPreferenceDir, UnderTheRootOrTmp)
 {
     VELA::Test::TempDir root;
     VELA::Test::ScopedEnv env("VELA_ROOT", root.Path().c_str());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
     APIRequest r(J(R"({"session": {"username": "alice"}})"));
     const std::string dir = r.GetPreferenceDir();
     EXPECT_EQ(0u, dir.find(root.Path() + "/"));
@@ -220,7 +220,7 @@ TEST(RequestPreferenceDir, UnderTheRootOrTmp)
     EXPECT_EQ("/tmp", r.GetGroupPreferenceDir(""));
     EXPECT_EQ("/tmp", APIRequest(J(R"({"session": {"username": "a/b"}})")).GetPreferenceDir());
     EXPECT_EQ("/tmp", APIRequest().GetPreferenceDir());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
 }
 
 TEST(RequestToken, AccessTokenComesFromTheProcessEnvironment)

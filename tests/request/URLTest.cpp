@@ -54,7 +54,7 @@ TEST(RequestURL, ForwardedSchemeOnlyFromATrustedProxy)
 {
     VELA::Test::TempDir root;
     VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
     const auto proto = [](const char* remote) {
         Json::Value env = J(R"({"HTTPS": "off", "HTTP_X_FORWARDED_PROTO": "HTTPS"})");
         env["REMOTE_ADDR"] = remote;
@@ -68,7 +68,7 @@ TEST(RequestURL, ForwardedSchemeOnlyFromATrustedProxy)
     EXPECT_EQ("http", proto("192.0.2.11"));
     EXPECT_EQ("http", proto("127.0.0.1"));
     EXPECT_EQ("http", WithEnv(J(R"({"HTTP_X_FORWARDED_PROTO": "https"})")).GetURLProto("x"));  // no peer
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
 }
 
 TEST(RequestURL, HostAndPort)

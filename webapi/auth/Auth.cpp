@@ -167,11 +167,11 @@ void Login(APIRequest* req, APIResponse* resp)
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
         return;
     }
-    VelaLoginSettings settings;
-    VelaLoginSettingsLoad(&settings);
+    VELA::Session::LoginSettings settings;
+    VELA::Session::LoginSettingsLoad(&settings);
 
     int wait = 0;
-    const int verdict = VelaLoginGuardBegin(&settings, account.c_str(), clientIP.c_str(), &wait);
+    const int verdict = VELA::Session::LoginGuardBegin(&settings, account.c_str(), clientIP.c_str(), &wait);
     if (verdict == VELA_LOGIN_GUARD_BLOCKED) {
         Json::Value details(Json::objectValue);
         details["waitSeconds"] = wait;
@@ -189,17 +189,17 @@ void Login(APIRequest* req, APIResponse* resp)
     // a wrong password, and counted as one, without asking PAM. A name PAM
     // settles on is held to the same rule.
     VelaAuth::PamResult checked = VelaAuth::PamResult::Denied;
-    if (VELARunAsIsSuperuser(account.c_str())) {
+    if (VELA::System::RunAsIsSuperuser(account.c_str())) {
         reason = kReservedName;
     } else {
         checked = VelaAuth::CheckPassword(account, password, passwordLen, clientIP, user, reason);
-        if (checked != VelaAuth::PamResult::Error && VELARunAsIsSuperuser(user.c_str())) {
+        if (checked != VelaAuth::PamResult::Error && VELA::System::RunAsIsSuperuser(user.c_str())) {
             checked = VelaAuth::PamResult::Denied;
             reason = kReservedName;
         }
     }
     if (checked == VelaAuth::PamResult::Denied) {
-        VelaLoginGuardFailed(&settings, account.c_str(), clientIP.c_str(), reason.c_str());
+        VELA::Session::LoginGuardFailed(&settings, account.c_str(), clientIP.c_str(), reason.c_str());
         resp->SetError(kErrWrongPassword);
         return;
     }
@@ -207,7 +207,7 @@ void Login(APIRequest* req, APIResponse* resp)
         resp->SetError(kErrServer);
         return;
     }
-    VelaLoginGuardSucceeded(&settings, account.c_str(), clientIP.c_str());
+    VELA::Session::LoginGuardSucceeded(&settings, account.c_str(), clientIP.c_str());
     if (checked == VelaAuth::PamResult::Expired) {
         VELA_LOG(LOG_AUTHPRIV | LOG_NOTICE, "login of \"%s\" refused: the password has expired", user.c_str());
         resp->SetError(kErrPasswordExpired);
@@ -217,9 +217,9 @@ void Login(APIRequest* req, APIResponse* resp)
     // A new login ends the session the caller came with.
     const std::string oldSid = req->GetSessionID();
     if (IsSessionId(oldSid)) {
-        VelaSessionRemove(oldSid.c_str());
+        VELA::Session::Remove(oldSid.c_str());
     }
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = settings.idleTimeout;
     options.lifetime = settings.lifetime;
     options.tokenProtect = true;
@@ -229,7 +229,7 @@ void Login(APIRequest* req, APIResponse* resp)
     }
     std::string sid;
     std::string token;
-    if (VelaSessionCreate(user.c_str(), clientIP.empty() ? nullptr : clientIP.c_str(), &options, sid, token) != 0) {
+    if (VELA::Session::Create(user.c_str(), clientIP.empty() ? nullptr : clientIP.c_str(), &options, sid, token) != 0) {
         resp->SetError(kErrServer);
         return;
     }
@@ -237,7 +237,7 @@ void Login(APIRequest* req, APIResponse* resp)
     // along with requests of other sites, out of reach of scripts, and
     // marked Secure when the login came over HTTPS.
     if (!resp->AddCookie(kCookie, sid, "/", 0, "", OverHttps(req), true, "Strict")) {
-        VelaSessionRemove(sid.c_str());
+        VELA::Session::Remove(sid.c_str());
         resp->SetError(kErrServer);
         return;
     }
@@ -252,7 +252,7 @@ void Login(APIRequest* req, APIResponse* resp)
 void Logout(APIRequest* req, APIResponse* resp)
 {
     const std::string sid = req->GetSessionID();
-    if (IsSessionId(sid) && VelaSessionRemove(sid.c_str()) == -1) {
+    if (IsSessionId(sid) && VELA::Session::Remove(sid.c_str()) == -1) {
         VELA_LOG_ERR("logout: the session could not be removed");
         resp->SetError(kErrServer);
         return;

@@ -70,8 +70,8 @@ TEST(Cgi, CookieBounds)
 
 class RemoteIP : public ::testing::Test {
 protected:
-    RemoteIP() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::VelaRootReset(); }
-    ~RemoteIP() override { VELA::VelaRootReset(); }
+    RemoteIP() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::System::RootReset(); }
+    ~RemoteIP() override { VELA::System::RootReset(); }
 
     void Conf(const std::string& text)
     {

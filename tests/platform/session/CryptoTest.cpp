@@ -151,8 +151,8 @@ protected:
         return key;
     }
 
-    Crypto() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::VelaRootReset(); }
-    ~Crypto() override { VELA::VelaRootReset(); }
+    Crypto() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::System::RootReset(); }
+    ~Crypto() override { VELA::System::RootReset(); }
 
     void SetUp() override
     {

@@ -39,23 +39,23 @@ protected:
     // Begin, then the password check fails. The result of Begin.
     int Fail(const char* account, const char* ip)
     {
-        const int verdict = VelaLoginGuardBegin(&settings_, account, ip, nullptr);
+        const int verdict = VELA::Session::LoginGuardBegin(&settings_, account, ip, nullptr);
         if (verdict == VELA_LOGIN_GUARD_ALLOW) {
-            VelaLoginGuardFailed(&settings_, account, ip, "Authentication failure");
+            VELA::Session::LoginGuardFailed(&settings_, account, ip, "Authentication failure");
         }
         return verdict;
     }
     // Begin alone; `wait` receives the seconds to wait.
     int Try(const char* account, const char* ip, int* wait = nullptr)
     {
-        return VelaLoginGuardBegin(&settings_, account, ip, wait);
+        return VELA::Session::LoginGuardBegin(&settings_, account, ip, wait);
     }
     // Begin and Succeeded: a login with the right password.
     int Succeed(const char* account, const char* ip)
     {
-        const int verdict = VelaLoginGuardBegin(&settings_, account, ip, nullptr);
+        const int verdict = VELA::Session::LoginGuardBegin(&settings_, account, ip, nullptr);
         if (verdict == VELA_LOGIN_GUARD_ALLOW) {
-            EXPECT_EQ(0, VelaLoginGuardSucceeded(&settings_, account, ip));
+            EXPECT_EQ(0, VELA::Session::LoginGuardSucceeded(&settings_, account, ip));
         }
         return verdict;
     }
@@ -70,7 +70,7 @@ protected:
         return n;
     }
 
-    VelaLoginSettings settings_;
+    VELA::Session::LoginSettings settings_;
 };
 
 // Strangers' failures never lock the owner out: the addresses that failed
@@ -336,9 +336,9 @@ TEST(LoginSettings, ReadFromWebapiConf)
 {
     VELA::Test::TempDir root;
     VELA::Test::ScopedEnv env("VELA_ROOT", root.Path().c_str());
-    VELA::VelaRootReset();
-    VelaLoginSettings s;
-    VelaLoginSettingsLoad(&s);  // no file: the defaults
+    VELA::System::RootReset();
+    VELA::Session::LoginSettings s;
+    VELA::Session::LoginSettingsLoad(&s);  // no file: the defaults
     EXPECT_EQ(5, s.maxFailures);
     EXPECT_EQ(10, s.windowMinutes);
     EXPECT_EQ(15, s.blockMinutes);
@@ -354,7 +354,7 @@ TEST(LoginSettings, ReadFromWebapiConf)
                                                            "session_idle_timeout=\"600\"\n"
                                                            "session_lifetime=\"12h\"\n";
     VELA::Test::LogCapture log;
-    VelaLoginSettingsLoad(&s);
+    VELA::Session::LoginSettingsLoad(&s);
     EXPECT_EQ(7, s.maxFailures);
     EXPECT_EQ(10, s.windowMinutes);
     EXPECT_EQ(15, s.blockMinutes);
@@ -363,7 +363,7 @@ TEST(LoginSettings, ReadFromWebapiConf)
     EXPECT_EQ(0, s.lifetime);
     EXPECT_TRUE(log.Contains("login_window_minutes=\"0\" is not a number from 1 to 10080"));
     EXPECT_TRUE(log.Contains("session_lifetime=\"12h\""));
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
 }
 
 }  // namespace

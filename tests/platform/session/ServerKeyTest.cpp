@@ -24,8 +24,8 @@ using namespace VELA::Test;
 
 class ServerKey : public ::testing::Test {
 protected:
-    ServerKey() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::VelaRootReset(); }
-    ~ServerKey() override { VELA::VelaRootReset(); }
+    ServerKey() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::System::RootReset(); }
+    ~ServerKey() override { VELA::System::RootReset(); }
     std::string KeyDir() const { return root_.Path() + "/var/lib/vela/keys"; }
     std::set<std::string> KeyDirEntries() const
     {

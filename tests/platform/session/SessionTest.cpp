@@ -74,12 +74,12 @@ protected:
     std::string Dir() const { return root_.Path() + "/run/vela/sessions"; }
     std::string File(const std::string& sid) const { return Dir() + "/" + sid; }
 
-    std::string Create(const VelaSessionOptions& options = VelaSessionOptions(), const char* user = "root",
+    std::string Create(const VELA::Session::Options& options = VELA::Session::Options(), const char* user = "root",
                        const char* ip = kClient, std::string* token = nullptr)
     {
         std::string sid;
         std::string tok;
-        EXPECT_EQ(0, VelaSessionCreate(user, ip, &options, sid, tok));
+        EXPECT_EQ(0, VELA::Session::Create(user, ip, &options, sid, tok));
         EXPECT_EQ(32u, sid.size());
         EXPECT_EQ(32u, tok.size());
         if (token != nullptr) {
@@ -126,35 +126,35 @@ TEST_F(SessionTest, CreateRefusesBadInput)
 {
     std::string sid = "stale";
     std::string token = "stale";
-    EXPECT_EQ(-1, VelaSessionCreate("vela-no-such-user", kClient, nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("vela-no-such-user", kClient, nullptr, sid, token));
     EXPECT_TRUE(sid.empty());
     EXPECT_TRUE(token.empty());
     EXPECT_TRUE(log_.Contains("no user \"vela-no-such-user\""));
-    EXPECT_EQ(-1, VelaSessionCreate(nullptr, kClient, nullptr, sid, token));
-    EXPECT_EQ(-1, VelaSessionCreate("", kClient, nullptr, sid, token));
-    EXPECT_EQ(-1, VelaSessionCreate("../root", kClient, nullptr, sid, token));
-    EXPECT_EQ(-1, VelaSessionCreate("root", "999.1.1.1", nullptr, sid, token));
-    EXPECT_EQ(-1, VelaSessionCreate("root", "192.0.2.7\n", nullptr, sid, token));
-    VelaSessionOptions options;
+    EXPECT_EQ(-1, VELA::Session::Create(nullptr, kClient, nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("", kClient, nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("../root", kClient, nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("root", "999.1.1.1", nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("root", "192.0.2.7\n", nullptr, sid, token));
+    VELA::Session::Options options;
     options.lang = "EN";
-    EXPECT_EQ(-1, VelaSessionCreate("root", kClient, &options, sid, token));
-    options = VelaSessionOptions();
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    options = VELA::Session::Options();
     options.idleTimeout = VELA_SESSION_IDLE_MAX + 1;
-    EXPECT_EQ(-1, VelaSessionCreate("root", kClient, &options, sid, token));
-    options = VelaSessionOptions();
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    options = VELA::Session::Options();
     options.lifetime = -5;
-    EXPECT_EQ(-1, VelaSessionCreate("root", kClient, &options, sid, token));
-    options = VelaSessionOptions();
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    options = VELA::Session::Options();
     options.app = "a\nb";
-    EXPECT_EQ(-1, VelaSessionCreate("root", kClient, &options, sid, token));
-    std::vector<VelaSessionRecord> list;
-    ASSERT_EQ(0, VelaSessionList(list));
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    std::vector<VELA::Session::Record> list;
+    ASSERT_EQ(0, VELA::Session::List(list));
     EXPECT_TRUE(list.empty());
 }
 
 TEST_F(SessionTest, CreateAndCheckValidSession)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 600;
     options.app = "VELA.Demo";
     options.webapi = "demo";
@@ -225,7 +225,7 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
 
 TEST_F(SessionTest, IdleTimeoutAndLifetime)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 100;
     options.lifetime = 250;
     const std::string sid = Create(options);
@@ -255,7 +255,7 @@ TEST_F(SessionTest, IdleTimeoutAndLifetime)
 
 TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 100;
     const std::string polled = Create(options);
     const std::string used = Create(options);
@@ -275,7 +275,7 @@ TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
 
 TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 100;
     const std::string sid = Create(options);
     Edit(sid, "lastUse", Json::Int64(kStart + 1000000));  // the clock went back
@@ -296,7 +296,7 @@ TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
 
 TEST_F(SessionTest, CreationInTheFutureStartsTheLifetimeNow)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 100;
     options.lifetime = 200;
     const std::string sid = Create(options);
@@ -335,13 +335,13 @@ TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
     };
     for (const std::string& id : hostile) {
         EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(id)) << id;
-        EXPECT_EQ(-2, VelaSessionRemove(id.c_str())) << id;
+        EXPECT_EQ(-2, VELA::Session::Remove(id.c_str())) << id;
         EXPECT_EQ(-1, VelaCgiUIDGet(id.c_str(), "root")) << id;
     }
     char user[493];
     EXPECT_EQ(AUTH_RESULT_NO_SESSION, VelaCgiIsAuthorizedEx(nullptr, nul, user, sizeof(user), nullptr, 0));
     EXPECT_EQ(AUTH_RESULT_NO_SESSION, VelaCgiIsAuthorizedEx(nullptr, nullptr, user, sizeof(user), nullptr, 0));
-    EXPECT_EQ(-2, VelaSessionRemove(nullptr));
+    EXPECT_EQ(-2, VELA::Session::Remove(nullptr));
     EXPECT_TRUE(log_.Contains("malformed session id"));
 
     std::map<std::string, std::string> after;
@@ -461,10 +461,10 @@ TEST_F(SessionTest, ClientAddressMustMatch)
         EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
     }
 
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.skipIP = true;
     const std::string roaming = Create(options);
-    const std::string unbound = Create(VelaSessionOptions(), "root", "");
+    const std::string unbound = Create(VELA::Session::Options(), "root", "");
     ScopedEnv other("REMOTE_ADDR", "2001:db8::1");
     Handle h;
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(roaming, 0, h.ctx));
@@ -477,7 +477,7 @@ TEST_F(SessionTest, ClientAddressMustMatch)
 
 TEST_F(SessionTest, AntiForgeryToken)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.tokenProtect = true;
     std::string token;
     const std::string sid = Create(options, "root", kClient, &token);
@@ -555,7 +555,7 @@ TEST_F(SessionTest, UserOfTheSession)
 
     struct passwd* nobody = getpwnam("nobody");
     ASSERT_NE(nullptr, nobody);
-    const std::string nsid = Create(VelaSessionOptions(), "nobody");
+    const std::string nsid = Create(VELA::Session::Options(), "nobody");
     EXPECT_EQ(static_cast<int>(nobody->pw_uid), VelaCgiUIDGet(nsid.c_str(), "nobody"));
 
     // A session whose user has gone away is no session.
@@ -567,19 +567,19 @@ TEST_F(SessionTest, UserOfTheSession)
 
 TEST_F(SessionTest, ListRemovePurge)
 {
-    VelaSessionOptions shortIdle;
+    VELA::Session::Options shortIdle;
     shortIdle.idleTimeout = 60;
     const std::string a = Create(shortIdle);
     Now() += 1;
-    const std::string b = Create(VelaSessionOptions(), "nobody", "2001:db8::1");
+    const std::string b = Create(VELA::Session::Options(), "nobody", "2001:db8::1");
     Now() += 1;
-    VelaSessionOptions longIdle;
+    VELA::Session::Options longIdle;
     longIdle.idleTimeout = 7200;
     const std::string c = Create(longIdle);
     std::ofstream(Dir() + "/not-a-session") << "x";
 
-    std::vector<VelaSessionRecord> list;
-    ASSERT_EQ(0, VelaSessionList(list));
+    std::vector<VELA::Session::Record> list;
+    ASSERT_EQ(0, VELA::Session::List(list));
     ASSERT_EQ(3u, list.size());
     EXPECT_EQ(a, list[0].sid);
     EXPECT_EQ(b, list[1].sid);
@@ -588,22 +588,22 @@ TEST_F(SessionTest, ListRemovePurge)
     EXPECT_EQ(c, list[2].sid);
     EXPECT_FALSE(list[0].expired);
 
-    EXPECT_EQ(0, VelaSessionRemove(b.c_str()));
-    EXPECT_EQ(-2, VelaSessionRemove(b.c_str()));
+    EXPECT_EQ(0, VELA::Session::Remove(b.c_str()));
+    EXPECT_EQ(-2, VELA::Session::Remove(b.c_str()));
     EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(b));
 
     Now() += 61;
-    ASSERT_EQ(0, VelaSessionList(list));
+    ASSERT_EQ(0, VELA::Session::List(list));
     ASSERT_EQ(2u, list.size());
     EXPECT_TRUE(list[0].expired);
     EXPECT_FALSE(list[1].expired);
-    EXPECT_EQ(0, VelaSessionPurge(3600));  // within the grace period
+    EXPECT_EQ(0, VELA::Session::Purge(3600));  // within the grace period
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(a));
     Now() += 3600;
-    EXPECT_EQ(1, VelaSessionPurge(3600));
+    EXPECT_EQ(1, VELA::Session::Purge(3600));
     EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(a));
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(c));
-    EXPECT_EQ(-1, VelaSessionPurge(-1));
+    EXPECT_EQ(-1, VELA::Session::Purge(-1));
 }
 
 TEST_F(SessionTest, LanguageFromSessionOrHeader)
@@ -634,7 +634,7 @@ TEST_F(SessionTest, LanguageFromSessionOrHeader)
     EXPECT_EQ("enu", lang(";;;,,,=q;"));
     EXPECT_EQ("enu", lang(("de," + std::string(5000, 'a')).c_str()));
 
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.lang = "fra";
     ASSERT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create(options), 0, h.ctx));
     EXPECT_EQ("fra", lang("de"));
@@ -726,7 +726,7 @@ TEST_F(SessionTest, RemovalWinsOverConcurrentRefresh)
         for (int i = 0; i < 2000 && Read(sid)["lastUse"].asInt64() == kStart; ++i) {
             usleep(1000);
         }
-        EXPECT_EQ(0, VelaSessionRemove(sid.c_str()));
+        EXPECT_EQ(0, VELA::Session::Remove(sid.c_str()));
         for (pid_t pid : children) {
             int status = 0;
             ASSERT_EQ(pid, waitpid(pid, &status, 0));

@@ -129,14 +129,14 @@ TEST_F(Credentials, LogsEverySwitch)
     const VELA::Test::TestAccount& a = account_;
     const std::string lines = InChild([&] {
         std::string out;
-        VelaLogSetSink([](int prio, const char* line, void* arg) {
-            *static_cast<std::string*>(arg) += std::to_string(prio) + "|" + line + "\n";
-        }, &out);
+        VELA::System::LogSetSink([](int prio, const char* line, void* arg) {
+                                 *static_cast<std::string*>(arg) += std::to_string(prio) + "|" + line + "\n";
+                                 }, &out);
         ResetCredentialsByName(a.user.c_str(), false);
         if (ResetCredentialsForRunAs("system", true)) {
             out += "regained root\n";
         }
-        VelaLogSetSink(nullptr, nullptr);
+        VELA::System::LogSetSink(nullptr, nullptr);
         return out;
     });
     const std::string info = std::to_string(LOG_AUTHPRIV | LOG_INFO) + "\\|Credentials:\\d+ WARNING: ";
@@ -161,7 +161,8 @@ TEST_F(Credentials, SystemFromPlainRootIsAlreadyDone)
         const gid_t zero = 0;
         Check(errors, setgroups(1, &zero) == 0 && setresgid(0, 0, 0) == 0, "cannot become plain root");
         std::string lines;
-        VelaLogSetSink([](int, const char* line, void* arg) { *static_cast<std::string*>(arg) += line; }, &lines);
+        VELA::System::LogSetSink([](int, const char* line, void* arg) { *static_cast<std::string*>(arg) += line; },
+                                 &lines);
         Check(errors, ResetCredentialsForRunAs("system", false), "plain root refused");
         Check(errors, lines.empty(), "logged: " + lines);
         const gid_t extra[] = {0, a.suppGid};
@@ -169,7 +170,7 @@ TEST_F(Credentials, SystemFromPlainRootIsAlreadyDone)
         Check(errors, ResetCredentialsForRunAs("system", false), "root with a group refused");
         Check(errors, !Has(Groups(), a.suppGid), "extra group kept");
         Check(errors, lines.find("WARNING: setresgid(0, 0, 0)") != std::string::npos, "no switch logged: " + lines);
-        VelaLogSetSink(nullptr, nullptr);
+        VELA::System::LogSetSink(nullptr, nullptr);
         return errors;
     }));
 }
@@ -195,7 +196,7 @@ TEST_F(Credentials, ExecutableOwnerAndGroup)
 {
     VELA::Test::TempDir root;
     VELA::Test::ScopedEnv env("VELA_ROOT", root.Path().c_str());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
     const std::string lib = root.Path() + "/check.so";
     FILE* f = fopen(lib.c_str(), "w");
     ASSERT_NE(nullptr, f);
@@ -216,7 +217,7 @@ TEST_F(Credentials, ExecutableOwnerAndGroup)
         Check(errors, setresuid(0, 0, 0) == 0, "cannot return to root");
         return errors;
     }));
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
 }
 
 }  // namespace

@@ -30,7 +30,7 @@ TEST(FileUtil, OpenNoSymlinksRefusesEveryLinkOnThePath)
     ASSERT_EQ(0, symlink((files + "/dir").c_str(), (files + "/middle").c_str()));
     ASSERT_EQ(0, symlink("dir", (files + "/relative").c_str()));
 
-    using VELA::Platform::NoSymlinkResolve;
+    using VELA::System::NoSymlinkResolve;
     struct Case {
         std::string path;
         int err;  // 0: opens
@@ -56,7 +56,7 @@ TEST(FileUtil, OpenNoSymlinksRefusesEveryLinkOnThePath)
     for (const Case& c : cases) {
         for (NoSymlinkResolve how : {NoSymlinkResolve::kAuto, NoSymlinkResolve::kWalk}) {
             errno = 0;
-            const int fd = VELA::Platform::OpenNoSymlinks(c.path, O_RDONLY, how);
+            const int fd = VELA::System::OpenNoSymlinks(c.path, O_RDONLY, how);
             const int err = fd < 0 ? errno : 0;
             EXPECT_EQ(c.err, err) << c.path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
             if (fd >= 0) {

@@ -14,8 +14,8 @@ namespace {
 
 class Preference : public ::testing::Test {
 protected:
-    Preference() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::VelaRootReset(); }
-    ~Preference() override { VELA::VelaRootReset(); }
+    Preference() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::System::RootReset(); }
+    ~Preference() override { VELA::System::RootReset(); }
 
     bool Exists(const std::string& relative)
     {

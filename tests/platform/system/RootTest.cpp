@@ -12,24 +12,24 @@ TEST(Root, DefaultAndTrailingSlashes)
 {
     {
         VELA::Test::ScopedEnv env("VELA_ROOT", nullptr);
-        VELA::VelaRootReset();
-        EXPECT_EQ("/", VELA::VelaRoot());
-        EXPECT_EQ("/etc/velainfo.conf", VELA::VelaPath("/etc/velainfo.conf"));
+        VELA::System::RootReset();
+        EXPECT_EQ("/", VELA::System::Root());
+        EXPECT_EQ("/etc/velainfo.conf", VELA::System::Path("/etc/velainfo.conf"));
     }
     {
         VELA::Test::ScopedEnv env("VELA_ROOT", "/tmp/r//");
-        VELA::VelaRootReset();
-        EXPECT_EQ("/tmp/r", VELA::VelaRoot());
-        EXPECT_EQ("/tmp/r/etc/velainfo.conf", VELA::VelaPath("/etc/velainfo.conf"));
+        VELA::System::RootReset();
+        EXPECT_EQ("/tmp/r", VELA::System::Root());
+        EXPECT_EQ("/tmp/r/etc/velainfo.conf", VELA::System::Path("/etc/velainfo.conf"));
     }
     {
         // Cached until reset.
         VELA::Test::ScopedEnv env("VELA_ROOT", "relative/dir");
-        EXPECT_EQ("/tmp/r", VELA::VelaRoot());
-        VELA::VelaRootReset();
-        EXPECT_EQ("/", VELA::VelaRoot());
+        EXPECT_EQ("/tmp/r", VELA::System::Root());
+        VELA::System::RootReset();
+        EXPECT_EQ("/", VELA::System::Root());
     }
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
 }
 
 }  // namespace

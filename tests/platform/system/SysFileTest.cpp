@@ -57,10 +57,10 @@ class SysFile : public ::testing::Test {
 protected:
     SysFile() : env_("VELA_ROOT", root_.Path().c_str())
     {
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         mkdir((root_.Path() + "/etc").c_str(), 0755);
     }
-    ~SysFile() override { VELA::VelaRootReset(); }
+    ~SysFile() override { VELA::System::RootReset(); }
 
     std::string In(const std::string& relative) const { return root_.Path() + relative; }
 

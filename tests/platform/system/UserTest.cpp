@@ -28,11 +28,11 @@ class UserRoot : public ::testing::Test {
 protected:
     UserRoot() : env_("VELA_ROOT", root_.Path().c_str())
     {
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         mkdir((root_.Path() + "/etc").c_str(), 0755);
         mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
     }
-    ~UserRoot() override { VELA::VelaRootReset(); }
+    ~UserRoot() override { VELA::System::RootReset(); }
 
     void Conf(const std::string& name, const std::string& text) { WriteFile(root_.Path() + "/etc/vela/" + name, text); }
 
@@ -78,13 +78,13 @@ TEST(UserLookup, SystemIsTheSuperuserOnlyAsRunAsName)
 {
     uid_t uid = 1;
     gid_t gid = 1;
-    ASSERT_EQ(0, VELARunAsGetUGID(VELA_RUNAS_SUPERUSER, &uid, &gid));
+    ASSERT_EQ(0, VELA::System::RunAsGetUGID(VELA_RUNAS_SUPERUSER, &uid, &gid));
     EXPECT_EQ(0u, uid + gid);
-    EXPECT_EQ(1, VELARunAsIsSuperuser("system"));
+    EXPECT_EQ(1, VELA::System::RunAsIsSuperuser("system"));
     for (const char* other : {"System", "system ", "root", "", static_cast<const char*>(nullptr)}) {
-        EXPECT_EQ(0, VELARunAsIsSuperuser(other)) << (other ? other : "null");
+        EXPECT_EQ(0, VELA::System::RunAsIsSuperuser(other)) << (other ? other : "null");
     }
-    ASSERT_EQ(0, VELARunAsGetUGID("root", &uid, &gid));  // any other run-as name is an account
+    ASSERT_EQ(0, VELA::System::RunAsGetUGID("root", &uid, &gid));  // any other run-as name is an account
     EXPECT_EQ(0u, uid);
 
     uid = 0;

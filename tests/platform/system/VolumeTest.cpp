@@ -18,7 +18,7 @@ class Volume : public ::testing::Test {
 protected:
     Volume() : env_("VELA_ROOT", root_.Path().c_str())
     {
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         for (const char* dir : {"/etc", "/etc/vela", "/volume1", "/volume2"}) {
             mkdir((root_.Path() + dir).c_str(), 0755);
         }
@@ -28,7 +28,7 @@ protected:
         if (!mounted_.empty()) {
             umount2(mounted_.c_str(), MNT_DETACH);
         }
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
     }
 
     void Conf(const std::string& text)

@@ -256,10 +256,10 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     VELA::Test::TempDir other;  // another root: the configuration is read again
     {
         ScopedEnv root("VELA_ROOT", other.Path().c_str());
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         EXPECT_FALSE(FileOutputerHelper::IsFastOutputEnabled());
     }
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
     ASSERT_TRUE(FileOutputerHelper::IsFastOutputEnabled());
     std::string expected = RealPath(dir);
     ASSERT_NE("", expected);

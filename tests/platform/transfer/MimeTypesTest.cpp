@@ -36,7 +36,7 @@ TEST_F(MimeTypes, FromTheSystemFileThenBuiltIn)
 
     VELA::Test::TempDir bare;
     VELA::Test::ScopedEnv root("VELA_ROOT", bare.Path().c_str());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
     EXPECT_EQ("application/zip", HTTPFileOutputer::GetMimeType("x.zip"));
     EXPECT_EQ("text/html", HTTPFileOutputer::GetMimeType("INDEX.HTML"));
     EXPECT_EQ("application/octet-stream", HTTPFileOutputer::GetMimeType("a.tst"));

@@ -94,16 +94,16 @@ struct Result {
     }
 };
 
-// Runs VelaUploadReadAll over `fd`.
+// Runs Transfer::UploadReadAll over `fd`.
 inline void ReadAll(int fd, unsigned long long length, const std::string& type, const std::string& dir, Result& out,
-             VelaUploadProgressFn progress = nullptr)
+             Transfer::UploadProgressFn progress = nullptr)
 {
-    VELA_UPLOAD_READER* reader = nullptr;
-    out.rc = VelaUploadReaderOpen(fd, length, type.c_str(), &reader);
+    Transfer::UploadReader* reader = nullptr;
+    out.rc = Transfer::UploadReaderOpen(fd, length, type.c_str(), &reader);
     if (out.rc == 1) {
-        out.rc = VelaUploadReadAll(reader, out.fields, out.files, dir.c_str(), 0, progress);
+        out.rc = Transfer::UploadReadAll(reader, out.fields, out.files, dir.c_str(), 0, progress);
     }
-    VelaUploadReaderFree(reader);
+    Transfer::UploadReaderFree(reader);
 }
 
 inline void ReadAllText(const std::string& body, const std::string& dir, Result& out, long long lengthDelta = 0)

@@ -14,6 +14,7 @@
 namespace {
 
 using namespace VELA::Test;
+using namespace VELA::Transfer;
 
 // The delimiter that ends a file lands on every position across the edge of
 // the reader's buffer.
@@ -22,7 +23,7 @@ TEST(MultipartReader, DelimiterAcrossBufferEdges)
     TempDir dir;
     const std::string head = std::string("--") + kBoundary + "\r\n" + PartHead({"f", "", "a.bin", true});
     const size_t dlen = strlen(kBoundary) + 4;
-    const size_t edge = VELA::Platform::kMultipartBufferSize - head.size();
+    const size_t edge = kMultipartBufferSize - head.size();
     for (size_t size = edge - dlen - 2; size <= edge + 2; ++size) {
         std::string content(size, '\r');
         for (size_t i = 0; i < size; i += 7) {
@@ -58,12 +59,12 @@ TEST(MultipartReader, ContentTypeAndBoundary)
     for (const auto& c : cases) {
         SCOPED_TRACE(c.type);
         std::string boundary;
-        EXPECT_EQ(!c.boundary.empty(), VELA::Platform::ParseMultipartContentType(c.type.c_str(), boundary));
+        EXPECT_EQ(!c.boundary.empty(), ParseMultipartContentType(c.type.c_str(), boundary));
         EXPECT_EQ(c.boundary, boundary);
     }
-    VELA_UPLOAD_READER* reader = nullptr;
-    EXPECT_EQ(VELA_UPLOAD_ERR_CONTENT_TYPE, VelaUploadReaderOpen(0, 10, "text/plain", &reader));
-    EXPECT_EQ(VELA_UPLOAD_ERR_NO_BODY, VelaUploadReaderOpen(0, 0, kType.c_str(), &reader));
+    UploadReader* reader = nullptr;
+    EXPECT_EQ(VELA_UPLOAD_ERR_CONTENT_TYPE, UploadReaderOpen(0, 10, "text/plain", &reader));
+    EXPECT_EQ(VELA_UPLOAD_ERR_NO_BODY, UploadReaderOpen(0, 0, kType.c_str(), &reader));
     EXPECT_EQ(nullptr, reader);
 
     // A quoted boundary with blanks works end to end, padding after it too.

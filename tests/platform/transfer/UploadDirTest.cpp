@@ -27,6 +27,8 @@
 
 namespace {
 
+using namespace VELA::Transfer;
+
 using VELA::Test::DirEntries;
 using VELA::Test::LogCapture;
 using VELA::Test::ReadText;
@@ -74,15 +76,15 @@ std::string Store(const std::string& dir, const std::string& content)
     const int fd = memfd_create("body", MFD_CLOEXEC);
     EXPECT_EQ(static_cast<ssize_t>(body.size()), write(fd, body.data(), body.size()));
     lseek(fd, 0, SEEK_SET);
-    VELA_UPLOAD_READER* reader = nullptr;
+    UploadReader* reader = nullptr;
     PVLIBCSZHASH fields = VLIBCSzHashAlloc(4);
     PVLIBCSZHASH files = VLIBCSzHashAlloc(4);
     std::string stored;
-    if (VelaUploadReaderOpen(fd, body.size(), kType, &reader) == 1 &&
-        VelaUploadReadAll(reader, fields, files, dir.c_str(), 0, nullptr) == 1) {
+    if (UploadReaderOpen(fd, body.size(), kType, &reader) == 1 &&
+        UploadReadAll(reader, fields, files, dir.c_str(), 0, nullptr) == 1) {
         stored = VLIBCSzHashGetValue(files, "f");
     }
-    VelaUploadReaderFree(reader);
+    UploadReaderFree(reader);
     VLIBCSzHashFree(fields);
     VLIBCSzHashFree(files);
     close(fd);
@@ -97,8 +99,8 @@ TEST(UploadDir, MadeOncePrivateAndRemovedWithItsFiles)
     MakeAged(base.Path(), "vela-upload-aaaaaaaaaaaa", 2 * VELA_UPLOAD_SWEEP_AGE);  // of a dead process
     char path[PATH_MAX];
     char tiny[8];
-    EXPECT_EQ(-1, VelaUploadDirGet(base.Path().c_str(), tiny, sizeof(tiny)));
-    ASSERT_EQ(2, VelaUploadDirGet((base.Path() + "/").c_str(), path, sizeof(path)));
+    EXPECT_EQ(-1, UploadDirGet(base.Path().c_str(), tiny, sizeof(tiny)));
+    ASSERT_EQ(2, UploadDirGet((base.Path() + "/").c_str(), path, sizeof(path)));
     const std::string dir = path;
     EXPECT_EQ(base.Path() + "/" VELA_UPLOAD_DIR_PREFIX, dir.substr(0, base.Path().size() + 13));
     EXPECT_EQ(std::vector<std::string>{dir.substr(base.Path().size() + 1)}, DirEntries(base.Path()));
@@ -106,7 +108,7 @@ TEST(UploadDir, MadeOncePrivateAndRemovedWithItsFiles)
 
     // Later calls, whatever base they name, get the same directory.
     TempDir other;
-    ASSERT_EQ(1, VelaUploadDirGet(other.Path().c_str(), path, sizeof(path)));
+    ASSERT_EQ(1, UploadDirGet(other.Path().c_str(), path, sizeof(path)));
     EXPECT_EQ(dir, path);
     EXPECT_TRUE(DirEntries(other.Path()).empty());
 
@@ -116,7 +118,7 @@ TEST(UploadDir, MadeOncePrivateAndRemovedWithItsFiles)
 
     // A child that inherited the handlers dies of the signal without
     // touching its parent's directory.
-    ASSERT_EQ(0, VelaUploadCleanupOnExit());
+    ASSERT_EQ(0, UploadCleanupOnExit());
     const pid_t child = fork();
     if (child == 0) {
         raise(SIGTERM);
@@ -127,9 +129,9 @@ TEST(UploadDir, MadeOncePrivateAndRemovedWithItsFiles)
     EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGTERM) << status;
     EXPECT_EQ("data", ReadText(stored));
 
-    EXPECT_EQ(0, VelaUploadDirRemove());
+    EXPECT_EQ(0, UploadDirRemove());
     EXPECT_TRUE(DirEntries(base.Path()).empty());
-    EXPECT_EQ(0, VelaUploadDirRemove());
+    EXPECT_EQ(0, UploadDirRemove());
 }
 
 TEST(UploadDir, OnlyTrustedBasesAreUsed)
@@ -141,7 +143,7 @@ TEST(UploadDir, OnlyTrustedBasesAreUsed)
     ASSERT_EQ(0, chmod(shared.c_str(), 0777));  // as an earlier version made "@tmp"
     {
         LogCapture log;
-        EXPECT_EQ(1, VelaUploadBaseUsable(shared.c_str()));
+        EXPECT_EQ(1, UploadBaseUsable(shared.c_str()));
         EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 01777), ModeOf(shared));
         EXPECT_EQ(LOG_WARNING, log.PriorityOf({shared, "sticky bit"}));
     }
@@ -151,8 +153,8 @@ TEST(UploadDir, OnlyTrustedBasesAreUsed)
     ASSERT_EQ(0, symlink(shared.c_str(), link.c_str()));
     char path[PATH_MAX];
     for (const std::string& bad : {file, link, top.Path() + "/missing"}) {
-        EXPECT_EQ(0, VelaUploadBaseUsable(bad.c_str())) << bad;
-        EXPECT_EQ(-1, VelaUploadDirGet(bad.c_str(), path, sizeof(path))) << bad;
+        EXPECT_EQ(0, UploadBaseUsable(bad.c_str())) << bad;
+        EXPECT_EQ(-1, UploadDirGet(bad.c_str(), path, sizeof(path))) << bad;
         EXPECT_EQ(VLIBC_ERR_MKDIR, VLIBCErrGet()) << bad;
     }
     if (geteuid() != 0) {
@@ -162,12 +164,12 @@ TEST(UploadDir, OnlyTrustedBasesAreUsed)
     // sticky bit or not. Writable by others without the sticky bit and not
     // ours to repair: refused as well.
     ASSERT_EQ(0, chown(shared.c_str(), 65534, 65534));
-    EXPECT_EQ(0, VelaUploadBaseUsable(shared.c_str()));
+    EXPECT_EQ(0, UploadBaseUsable(shared.c_str()));
     ASSERT_EQ(0, chown(shared.c_str(), 0, 0));
     ASSERT_EQ(0, chmod(shared.c_str(), 0777));
     const pid_t child = fork();
     if (child == 0) {
-        _exit(setresuid(65534, 65534, 65534) == 0 && VelaUploadBaseUsable(shared.c_str()) == 0 ? 0 : 1);
+        _exit(setresuid(65534, 65534, 65534) == 0 && UploadBaseUsable(shared.c_str()) == 0 ? 0 : 1);
     }
     int status = 0;
     ASSERT_EQ(child, waitpid(child, &status, 0));
@@ -198,15 +200,15 @@ TEST(UploadDir, SignalsAndExitRemoveAPartialUpload)
                 signal(c.ignored, SIG_IGN);
             }
             char path[PATH_MAX];
-            VELA_UPLOAD_READER* reader = nullptr;
+            UploadReader* reader = nullptr;
             PVLIBCSZHASH fields = VLIBCSzHashAlloc(4);
             PVLIBCSZHASH files = VLIBCSzHashAlloc(4);
-            if (VelaUploadCleanupOnExit() != 0 || VelaUploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 ||
-                VelaUploadReaderOpen(in[0], 1ULL << 30, kType, &reader) != 1) {
+            if (UploadCleanupOnExit() != 0 || UploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 ||
+                UploadReaderOpen(in[0], 1ULL << 30, kType, &reader) != 1) {
                 _exit(2);
             }
-            VelaUploadReadAll(reader, fields, files, path, 0, nullptr);  // waits for the rest of the body
-            VelaUploadReaderFree(reader);
+            UploadReadAll(reader, fields, files, path, 0, nullptr);  // waits for the rest of the body
+            UploadReaderFree(reader);
             VLIBCSzHashFree(fields);
             VLIBCSzHashFree(files);
             exit(3);
@@ -260,13 +262,13 @@ TEST(UploadDir, ReaperRemovesWhatRootStoredAfterTheDrop)
         const pid_t child = fork();
         if (child == 0) {
             char path[PATH_MAX];
-            if (VelaUploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 || Store(path, "root's").empty() ||
-                VelaUploadDirReaper() != 1 || setresgid(65534, 65534, 65534) != 0 ||
+            if (UploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 || Store(path, "root's").empty() ||
+                UploadDirReaper() != 1 || setresgid(65534, 65534, 65534) != 0 ||
                 setresuid(65534, 65534, 65534) != 0) {
                 _exit(2);
             }
             if (!killed) {
-                _exit(VelaUploadDirRemove());
+                _exit(UploadDirRemove());
             }
             (void)!write(ready[1], "r", 1);
             pause();
@@ -312,21 +314,21 @@ TEST(UploadDir, SweepTakesOnlyStaleUnlockedDirectoriesOfOurs)
     const int live = open((b + "/vela-upload-livelivelive").c_str(), O_RDONLY | O_DIRECTORY);
     ASSERT_EQ(0, flock(live, LOCK_EX));
 
-    EXPECT_EQ(1, VelaUploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_EQ(1, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
     EXPECT_FALSE(Exists(b + "/vela-upload-stalestale22"));
     EXPECT_EQ("keep", ReadText(elsewhere.Path() + "/precious"));
     EXPECT_TRUE(Exists(elsewhere.Path() + "/target/upload-abcdefghijklmnop"));
     EXPECT_EQ(geteuid() == 0 ? 7u : 6u, DirEntries(b).size());
 
     close(live);  // the request is gone
-    EXPECT_EQ(1, VelaUploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_EQ(1, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
     EXPECT_FALSE(Exists(b + "/vela-upload-livelivelive"));
 
     // Bounded work: eight directories per call.
     for (int i = 0; i < 10; ++i) {
         MakeAged(b, "vela-upload-bulkbulk22" + std::string(1, 'a' + i) + "a", old);
     }
-    EXPECT_EQ(8, VelaUploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
-    EXPECT_EQ(2, VelaUploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
-    EXPECT_EQ(0, VelaUploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_EQ(8, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_EQ(2, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_EQ(0, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
 }

@@ -21,6 +21,7 @@
 namespace {
 
 using namespace VELA::Test;
+using namespace VELA::Transfer;
 
 TEST(UploadRead, FieldsAndFilesFromOneForm)
 {
@@ -248,39 +249,39 @@ TEST(UploadRead, StepByStep)
     TempDir dir;
     const std::string body = Body({{"api", "A"}, {"doc", "content", "d.txt", true}, {"after", "B"}});
     const int fd = MemFd(body);
-    VELA_UPLOAD_READER* reader = nullptr;
-    ASSERT_EQ(1, VelaUploadReaderOpen(fd, body.size(), kType.c_str(), &reader));
+    UploadReader* reader = nullptr;
+    ASSERT_EQ(1, UploadReaderOpen(fd, body.size(), kType.c_str(), &reader));
     char path[4096];
-    EXPECT_EQ(VELA_UPLOAD_ERR_STATE, VelaUploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), nullptr,
-                                                         nullptr));
+    EXPECT_EQ(VELA_UPLOAD_ERR_STATE, UploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), nullptr,
+                                                    nullptr));
     Result r;
-    ASSERT_EQ(1, VelaUploadReadFields(reader, r.fields, nullptr));
+    ASSERT_EQ(1, UploadReadFields(reader, r.fields, nullptr));
     EXPECT_EQ("A", r.Field("api"));
-    EXPECT_STREQ("doc", VelaUploadPendingField(reader));
-    EXPECT_STREQ("d.txt", VelaUploadPendingFileName(reader));
-    EXPECT_EQ(VELA_UPLOAD_ERR_ARGUMENT, VelaUploadReadFile(reader, dir.Path().c_str(), path, 8, nullptr, nullptr));
-    ASSERT_EQ(1, VelaUploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), r.files, nullptr));
+    EXPECT_STREQ("doc", UploadPendingField(reader));
+    EXPECT_STREQ("d.txt", UploadPendingFileName(reader));
+    EXPECT_EQ(VELA_UPLOAD_ERR_ARGUMENT, UploadReadFile(reader, dir.Path().c_str(), path, 8, nullptr, nullptr));
+    ASSERT_EQ(1, UploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), r.files, nullptr));
     EXPECT_EQ("content", ReadText(path));
     EXPECT_EQ(path, r.File("doc"));
-    EXPECT_EQ(nullptr, VelaUploadPendingField(reader));
+    EXPECT_EQ(nullptr, UploadPendingField(reader));
     // ReadAll picks up the rest and reports the whole body.
     Result all;
-    ASSERT_EQ(1, VelaUploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 0, nullptr));
+    ASSERT_EQ(1, UploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 0, nullptr));
     EXPECT_EQ("A", all.Field("api"));
     EXPECT_EQ("B", all.Field("after"));
     EXPECT_EQ(path, all.File("doc"));
-    EXPECT_EQ(body.size(), VelaUploadConsumed(reader));
-    VelaUploadReaderFree(reader);
+    EXPECT_EQ(body.size(), UploadConsumed(reader));
+    UploadReaderFree(reader);
     close(fd);
 
     // After a failure every call repeats it.
     const std::string bad = std::string("--") + kBoundary + "\r\nX: y\r\n\r\n";
     const int badFd = MemFd(bad);
-    ASSERT_EQ(1, VelaUploadReaderOpen(badFd, bad.size(), kType.c_str(), &reader));
-    EXPECT_EQ(VELA_UPLOAD_ERR_HEADER, VelaUploadReadFields(reader, nullptr, nullptr));
-    EXPECT_EQ(VELA_UPLOAD_ERR_HEADER, VelaUploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 0, nullptr));
-    EXPECT_EQ(VELA_UPLOAD_ERR_ARGUMENT, VelaUploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 1, nullptr));
-    VelaUploadReaderFree(reader);
+    ASSERT_EQ(1, UploadReaderOpen(badFd, bad.size(), kType.c_str(), &reader));
+    EXPECT_EQ(VELA_UPLOAD_ERR_HEADER, UploadReadFields(reader, nullptr, nullptr));
+    EXPECT_EQ(VELA_UPLOAD_ERR_HEADER, UploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 0, nullptr));
+    EXPECT_EQ(VELA_UPLOAD_ERR_ARGUMENT, UploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 1, nullptr));
+    UploadReaderFree(reader);
     close(badFd);
 }
 
