@@ -105,6 +105,48 @@ int OpenNoSymlinks(const std::string& path, int flags, NoSymlinkResolve how)
     }
 }
 
+namespace {
+
+// Reads `fd` to its end into `data`, sized for the `expected` bytes fstat
+// gave and grown, up to `limit`, for a file that grows meanwhile. False with
+// `err` set: EFBIG beyond `limit`, else the errno of the failed read. Can
+// throw std::bad_alloc.
+bool ReadToEnd(int fd, size_t expected, size_t limit, std::string& data, int& err)
+{
+    data.resize(expected + 1);
+    size_t used = 0;
+    for (;;) {
+        if (used == data.size()) {
+            // The file grew after fstat: allow it up to the limit.
+            if (data.size() > limit) {
+                err = EFBIG;
+                return false;
+            }
+            data.resize(data.size() + 4096 > limit + 1 ? limit + 1 : data.size() + 4096);
+        }
+        ssize_t got = read(fd, &data[used], data.size() - used);
+        if (got < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            err = errno;
+            return false;
+        }
+        if (got == 0) {
+            break;
+        }
+        used += static_cast<size_t>(got);
+    }
+    if (used > limit) {
+        err = EFBIG;
+        return false;
+    }
+    data.resize(used);
+    return true;
+}
+
+}  // namespace
+
 bool ReadFileBounded(const std::string& path, size_t limit, std::string& out, int& err, unsigned flags,
                      struct stat* st)
 {
@@ -135,35 +177,9 @@ bool ReadFileBounded(const std::string& path, size_t limit, std::string& out, in
     }
     std::string data;
     try {
-        data.resize(static_cast<size_t>(info.st_size) + 1);
-        size_t used = 0;
-        for (;;) {
-            if (used == data.size()) {
-                // The file grew after fstat: allow it up to the limit.
-                if (data.size() > limit) {
-                    err = EFBIG;
-                    return false;
-                }
-                data.resize(data.size() + 4096 > limit + 1 ? limit + 1 : data.size() + 4096);
-            }
-            ssize_t got = read(fd.Get(), &data[used], data.size() - used);
-            if (got < 0) {
-                if (errno == EINTR) {
-                    continue;
-                }
-                err = errno;
-                return false;
-            }
-            if (got == 0) {
-                break;
-            }
-            used += static_cast<size_t>(got);
-        }
-        if (used > limit) {
-            err = EFBIG;
+        if (!ReadToEnd(fd.Get(), static_cast<size_t>(info.st_size), limit, data, err)) {
             return false;
         }
-        data.resize(used);
     } catch (const std::exception&) {
         err = ENOMEM;
         return false;

@@ -115,6 +115,32 @@ bool ReplaceFileAtomic(const std::string& path, const std::string& text, mode_t 
     return false;
 }
 
+// The text of `lines` with the first line of `key` replaced by `entry` and
+// its later lines dropped (a later duplicate would override the new value);
+// `entry` is appended when the key has no line.
+std::string WithKeyLine(const std::vector<KeyValueLine>& lines, const char* key, const std::string& entry)
+{
+    std::string out;
+    bool replaced = false;
+    for (const KeyValueLine& line : lines) {
+        if (line.key == key) {
+            if (replaced) {
+                continue;
+            }
+            out += entry;
+            replaced = true;
+        } else {
+            out += line.text;
+        }
+        out += '\n';
+    }
+    if (!replaced) {
+        out += entry;
+        out += '\n';
+    }
+    return out;
+}
+
 int SetKeyValue(const char* rawPath, const char* key, const char* value)
 {
     if (!ValidKey(key) || !ValidValue(value)) {
@@ -151,25 +177,7 @@ int SetKeyValue(const char* rawPath, const char* key, const char* value)
         VELA_LOG_ERR("%s is corrupt, not rewriting it", path.c_str());
         return -1;
     }
-    const std::string entry = std::string(key) + "=\"" + value + "\"";
-    std::string out;
-    bool replaced = false;
-    for (const KeyValueLine& line : lines) {
-        if (line.key == key) {
-            if (replaced) {
-                continue;  // a later duplicate would override the new value
-            }
-            out += entry;
-            replaced = true;
-        } else {
-            out += line.text;
-        }
-        out += '\n';
-    }
-    if (!replaced) {
-        out += entry;
-        out += '\n';
-    }
+    const std::string out = WithKeyLine(lines, key, std::string(key) + "=\"" + value + "\"");
     if (out.size() > kMaxKeyValueFile) {
         VELA_RECORD_ERROR(VLIBC_ERR_BAD_PARAMETER, "%.200s would exceed its size limit", path.c_str());
         VELA_LOG_ERR("%s would grow beyond %zu bytes", path.c_str(), kMaxKeyValueFile);
@@ -207,10 +215,62 @@ int GetKeyValue(const char* rawPath, const char* key, char* buf, size_t size)
     return 1;
 }
 
+// Makes the directory `prefix` (mode 0700 until its mode is set) unless a
+// directory is there. 1 when this call made it, 0 when it existed, -1
+// (recorded and logged) when it is missing and cannot be made, or is no
+// directory.
+int MakeOneDir(const std::string& prefix)
+{
+    if (mkdir(prefix.c_str(), 0700) == 0) {
+        return 1;
+    }
+    // EEXIST, or EROFS / EACCES for a directory that exists on a read-only
+    // or foreign parent: only the result matters.
+    const int mkdirErr = errno;
+    struct stat st;
+    if (stat(prefix.c_str(), &st) != 0) {
+        errno = mkdirErr == EEXIST ? errno : mkdirErr;
+        VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "mkdir %.200s: %m", prefix.c_str());
+        VELA_LOG_ERR("mkdir(%s): %m", prefix.c_str());
+        return -1;
+    }
+    if (!S_ISDIR(st.st_mode)) {
+        errno = ENOTDIR;
+        VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "%.200s is not a directory", prefix.c_str());
+        VELA_LOG_ERR("%s exists and is not a directory", prefix.c_str());
+        return -1;
+    }
+    return 0;
+}
+
+// Gives the directory `prefix` the owner `uid`/`gid` (unless both are -1),
+// then `mode`, through a descriptor of the directory itself, never through
+// a symbolic link put in its place. False (recorded and logged) on failure.
+bool SetDirOwnerAndMode(const std::string& prefix, uid_t uid, gid_t gid, mode_t mode)
+{
+    const bool chownWanted = uid != static_cast<uid_t>(-1) || gid != static_cast<gid_t>(-1);
+    ScopedFd fd(open(prefix.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (fd.Get() < 0) {
+        VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "open %.200s: %m", prefix.c_str());
+        VELA_LOG_ERR("open(%s): %m", prefix.c_str());
+        return false;
+    }
+    if (chownWanted && fchown(fd.Get(), uid, gid) != 0) {
+        VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "chown %.200s: %m", prefix.c_str());
+        VELA_LOG_ERR("chown(%s): %m", prefix.c_str());
+        return false;
+    }
+    if (fchmod(fd.Get(), mode) != 0) {  // after chown, which may clear set-id bits
+        VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "chmod %.200s: %m", prefix.c_str());
+        VELA_LOG_ERR("chmod(%s): %m", prefix.c_str());
+        return false;
+    }
+    return true;
+}
+
 // mkdir -p of the resolved `path`; see VELAFSMkdirP.
 int MkdirP(const std::string& path, bool allWithMode, bool resetExisting, uid_t uid, gid_t gid, mode_t mode)
 {
-    const bool chownWanted = uid != static_cast<uid_t>(-1) || gid != static_cast<gid_t>(-1);
     // Component by component; ".." is refused so the result stays where the
     // path says.
     size_t pos = 0;
@@ -245,46 +305,14 @@ int MkdirP(const std::string& path, bool allWithMode, bool resetExisting, uid_t 
             ++rest;
         }
         const bool last = rest >= path.size();
-        const mode_t want = last || allWithMode ? mode : 0755;
-
-        struct stat st;
-        const bool created = mkdir(prefix.c_str(), 0700) == 0;
-        if (!created) {
-            // EEXIST, or EROFS / EACCES for a directory that exists on a
-            // read-only or foreign parent: only the result matters.
-            const int mkdirErr = errno;
-            if (stat(prefix.c_str(), &st) != 0) {
-                errno = mkdirErr == EEXIST ? errno : mkdirErr;
-                VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "mkdir %.200s: %m", prefix.c_str());
-                VELA_LOG_ERR("mkdir(%s): %m", prefix.c_str());
-                return -1;
-            }
-            if (!S_ISDIR(st.st_mode)) {
-                errno = ENOTDIR;
-                VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "%.200s is not a directory", prefix.c_str());
-                VELA_LOG_ERR("%s exists and is not a directory", prefix.c_str());
-                return -1;
-            }
-            if (!(last && resetExisting)) {
-                continue;
-            }
-        }
-        // Set mode and owner through a descriptor of the directory itself,
-        // never through a symbolic link put in its place.
-        ScopedFd fd(open(prefix.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-        if (fd.Get() < 0) {
-            VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "open %.200s: %m", prefix.c_str());
-            VELA_LOG_ERR("open(%s): %m", prefix.c_str());
+        const int made = MakeOneDir(prefix);
+        if (made < 0) {
             return -1;
         }
-        if (chownWanted && fchown(fd.Get(), uid, gid) != 0) {
-            VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "chown %.200s: %m", prefix.c_str());
-            VELA_LOG_ERR("chown(%s): %m", prefix.c_str());
-            return -1;
+        if (made == 0 && !(last && resetExisting)) {
+            continue;
         }
-        if (fchmod(fd.Get(), want) != 0) {  // after chown, which may clear set-id bits
-            VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "chmod %.200s: %m", prefix.c_str());
-            VELA_LOG_ERR("chmod(%s): %m", prefix.c_str());
+        if (!SetDirOwnerAndMode(prefix, uid, gid, last || allWithMode ? mode : 0755)) {
             return -1;
         }
     }

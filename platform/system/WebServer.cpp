@@ -102,6 +102,52 @@ bool ParsePid(const std::string& text, pid_t& pid)
     return true;
 }
 
+// The pid in the pid file `pidFile`: a regular file, not a symbolic link,
+// owned by root or by this process's user and writable by nobody else.
+// False (logged) otherwise.
+bool ReadServerPid(const std::string& pidFile, pid_t& pid)
+{
+    std::string text;
+    int err = 0;
+    struct stat st;
+    if (!ReadFileBounded(pidFile, kMaxPidFile, text, err, VELA::System::kReadNoFollow, &st)) {
+        VELA_LOG_ERR("web server not restarted: cannot read pid file %s: %s", pidFile.c_str(), strerror(err));
+        return false;
+    }
+    if ((st.st_uid != 0 && st.st_uid != geteuid()) || (st.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
+        VELA_LOG_ERR("web server not restarted: pid file %s is writable by others or has a foreign owner",
+                     pidFile.c_str());
+        return false;
+    }
+    if (!ParsePid(text, pid)) {
+        VELA_LOG_ERR("web server not restarted: pid file %s does not hold a process id", pidFile.c_str());
+        return false;
+    }
+    return true;
+}
+
+// True when process `pid` (named in `pidFile`) exists and the kernel shows
+// it under `name`; false (logged) otherwise.
+bool CarriesName(pid_t pid, const std::string& name, const std::string& pidFile)
+{
+    std::string comm;
+    int err = 0;
+    const std::string commPath = "/proc/" + std::to_string(pid) + "/comm";
+    if (!ReadFileBounded(commPath, kMaxComm, comm, err)) {
+        VELA_LOG_ERR("web server not restarted: no process %d (%s)", static_cast<int>(pid), strerror(err));
+        return false;
+    }
+    if (!comm.empty() && comm.back() == '\n') {
+        comm.pop_back();
+    }
+    if (comm != name) {
+        VELA_LOG_ERR("web server not restarted: process %d named in %s is \"%.16s\", not %s",
+                     static_cast<int>(pid), pidFile.c_str(), comm.c_str(), name.c_str());
+        return false;
+    }
+    return true;
+}
+
 }  // namespace
 
 namespace velaw3 {
@@ -155,21 +201,8 @@ bool TARN::RestartService()
             return false;
         }
         const std::string& pidFile = engine_.GetPidFile();
-        std::string text;
-        int err = 0;
-        struct stat st;
-        if (!ReadFileBounded(pidFile, kMaxPidFile, text, err, VELA::System::kReadNoFollow, &st)) {
-            VELA_LOG_ERR("web server not restarted: cannot read pid file %s: %s", pidFile.c_str(), strerror(err));
-            return false;
-        }
-        if ((st.st_uid != 0 && st.st_uid != geteuid()) || (st.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
-            VELA_LOG_ERR("web server not restarted: pid file %s is writable by others or has a foreign owner",
-                         pidFile.c_str());
-            return false;
-        }
         pid_t pid = 0;
-        if (!ParsePid(text, pid)) {
-            VELA_LOG_ERR("web server not restarted: pid file %s does not hold a process id", pidFile.c_str());
+        if (!ReadServerPid(pidFile, pid)) {
             return false;
         }
         // The pidfd pins the process: if it exits and its pid is reused
@@ -180,18 +213,7 @@ bool TARN::RestartService()
             VELA_LOG_ERR("web server not restarted: process %d of %s: %m", static_cast<int>(pid), pidFile.c_str());
             return false;
         }
-        std::string comm;
-        const std::string commPath = "/proc/" + std::to_string(pid) + "/comm";
-        if (!ReadFileBounded(commPath, kMaxComm, comm, err)) {
-            VELA_LOG_ERR("web server not restarted: no process %d (%s)", static_cast<int>(pid), strerror(err));
-            return false;
-        }
-        if (!comm.empty() && comm.back() == '\n') {
-            comm.pop_back();
-        }
-        if (comm != engine_.GetName()) {
-            VELA_LOG_ERR("web server not restarted: process %d named in %s is \"%.16s\", not %s",
-                         static_cast<int>(pid), pidFile.c_str(), comm.c_str(), engine_.GetName().c_str());
+        if (!CarriesName(pid, engine_.GetName(), pidFile)) {
             return false;
         }
         const int sig = engine_.GetRestartSignal();
