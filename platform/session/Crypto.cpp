@@ -201,6 +201,46 @@ int GenerateToken(const char* token, char* key, size_t size)
     return 0;
 }
 
+// AES-256-GCM decryption of the `bodyLen` bytes at `body` under the 32
+// bytes of `key`, with the kGcmIvLen bytes at `iv` and the tag `tag`, into
+// `out` (bodyLen + 1 bytes). False (logged) when libcrypto fails or the tag
+// does not authenticate key, IV and body: nothing of the plaintext is kept
+// then.
+bool OpenGcm(const CryptoApi& api, const std::string& key, const unsigned char* iv, const unsigned char* body,
+             size_t bodyLen, unsigned char* tag, SecretBytes& out)
+{
+    SecretBytes aesKey(kAesKeyLen);
+    memcpy(aesKey.data(), key.data(), kAesKeyLen);
+    CipherCtx ctx(api);
+    int outLen = 0;
+    int finalLen = 0;
+    if (ctx.get() == nullptr ||
+        api.EVP_DecryptInit_ex(ctx.get(), api.EVP_aes_256_gcm(), nullptr, nullptr, nullptr) != 1 ||
+        api.EVP_CIPHER_CTX_ctrl(ctx.get(), EVP_CTRL_GCM_SET_IVLEN, static_cast<int>(kGcmIvLen), nullptr) != 1 ||
+        api.EVP_DecryptInit_ex(ctx.get(), nullptr, nullptr, aesKey.data(), iv) != 1 ||
+        api.EVP_CIPHER_CTX_ctrl(ctx.get(), EVP_CTRL_GCM_SET_TAG, static_cast<int>(kGcmTagLen), tag) != 1) {
+        LogCryptoError(api, "cannot set up AES-GCM decryption");
+        return false;
+    }
+    aesKey.Wipe();
+    // bodyLen is below 1 MiB (the base64 bound), so it fits an int.
+    if (bodyLen > 0 &&
+        (api.EVP_DecryptUpdate(ctx.get(), out.data(), &outLen, body, static_cast<int>(bodyLen)) != 1 ||
+         outLen < 0 || static_cast<size_t>(outLen) > bodyLen)) {
+        out.Wipe();
+        LogCryptoError(api, "AES-GCM decryption failed");
+        return false;
+    }
+    if (api.EVP_DecryptFinal_ex(ctx.get(), out.data() + outLen, &finalLen) != 1 || finalLen != 0 ||
+        static_cast<size_t>(outLen) != bodyLen) {
+        // A wrong key, IV, body or tag.
+        out.Wipe();
+        LogCryptoError(api, "__tXeTrEhPiC: authentication failed");
+        return false;
+    }
+    return true;
+}
+
 bool DecryptAES(const std::string& key, const std::string& cipher, std::string& plain)
 {
     if (key.size() != kAesKeyLen) {
@@ -230,35 +270,10 @@ bool DecryptAES(const std::string& key, const std::string& cipher, std::string& 
     unsigned char tag[kGcmTagLen];
     memcpy(tag, body + bodyLen, kGcmTagLen);
 
-    SecretBytes aesKey(kAesKeyLen);
-    memcpy(aesKey.data(), key.data(), kAesKeyLen);
     // One spare byte: the buffer is never empty, so its pointer is valid
     // even for an empty plaintext.
     SecretBytes out(bodyLen + 1);
-    CipherCtx ctx(*api);
-    int outLen = 0;
-    int finalLen = 0;
-    if (ctx.get() == nullptr || api->EVP_DecryptInit_ex(ctx.get(), api->EVP_aes_256_gcm(), nullptr, nullptr, nullptr) != 1 ||
-        api->EVP_CIPHER_CTX_ctrl(ctx.get(), EVP_CTRL_GCM_SET_IVLEN, static_cast<int>(kGcmIvLen), nullptr) != 1 ||
-        api->EVP_DecryptInit_ex(ctx.get(), nullptr, nullptr, aesKey.data(), iv) != 1 ||
-        api->EVP_CIPHER_CTX_ctrl(ctx.get(), EVP_CTRL_GCM_SET_TAG, static_cast<int>(kGcmTagLen), tag) != 1) {
-        LogCryptoError(*api, "cannot set up AES-GCM decryption");
-        return false;
-    }
-    aesKey.Wipe();
-    // bodyLen is below 1 MiB (the base64 bound), so it fits an int.
-    if (bodyLen > 0 &&
-        (api->EVP_DecryptUpdate(ctx.get(), out.data(), &outLen, body, static_cast<int>(bodyLen)) != 1 ||
-         outLen < 0 || static_cast<size_t>(outLen) > bodyLen)) {
-        out.Wipe();
-        LogCryptoError(*api, "AES-GCM decryption failed");
-        return false;
-    }
-    if (api->EVP_DecryptFinal_ex(ctx.get(), out.data() + outLen, &finalLen) != 1 || finalLen != 0 ||
-        static_cast<size_t>(outLen) != bodyLen) {
-        // A wrong key, IV, body or tag: nothing of the plaintext is kept.
-        out.Wipe();
-        LogCryptoError(*api, "__tXeTrEhPiC: authentication failed");
+    if (!OpenGcm(*api, key, iv, body, bodyLen, tag, out)) {
         return false;
     }
     if (HasNul(out.data(), bodyLen)) {

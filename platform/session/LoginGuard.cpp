@@ -485,6 +485,43 @@ bool AccountMayExist(const char* account)
     return VELA::Session::LookupUser(account, uid) != 0;
 }
 
+// Logs an attempt that Begin refuses for `wait` seconds: by the block of its
+// address, or, when the address has no record (`byAddress` false), because
+// the store is full.
+void LogRefusal(const Pair& pair, const StoreState& store, bool byAddress, long long wait)
+{
+    if (!byAddress) {
+        VELA_LOG(kBlockLog,
+                 "login guard: %d address records, the most login_guard_max_records allows: account \"%s\" from "
+                 "%s refused without a password check for %lld seconds",
+                 store.addressRecords, pair.loggedAccount.c_str(), pair.loggedAddress.c_str(), wait);
+    } else {
+        VELA_LOG(kBlockLog,
+                 "login refused without a password check: account \"%s\" from %s, blocked for %lld more seconds",
+                 pair.loggedAccount.c_str(), pair.loggedAddress.c_str(), wait);
+    }
+}
+
+// Counts the attempt let through at `now` in the records that count it,
+// each tagged with the other side of the pair. False when a record could
+// not be written.
+bool CountAttempt(Pair& pair, long long now, const Limits& limits, bool byAddress, bool byAccount)
+{
+    if (byAddress) {
+        AddAttempt(pair.address, now, pair.account.tag);
+        if (!SaveRecord(pair.address, limits)) {
+            return false;
+        }
+    }
+    if (byAccount) {
+        AddAttempt(pair.account, now, pair.address.tag);
+        if (!SaveRecord(pair.account, limits)) {
+            return false;
+        }
+    }
+    return true;
+}
+
 int Begin(const LoginSettings* settings, const char* account, const char* clientIP, int* waitSeconds)
 {
     const Limits limits = LimitsOf(settings);
@@ -526,31 +563,10 @@ int Begin(const LoginSettings* settings, const char* account, const char* client
         if (waitSeconds != nullptr) {
             *waitSeconds = static_cast<int>(wait);
         }
-        if (!byAddress) {
-            VELA_LOG(kBlockLog,
-                     "login guard: %d address records, the most login_guard_max_records allows: account \"%s\" from "
-                     "%s refused without a password check for %lld seconds",
-                     store.addressRecords, pair.loggedAccount.c_str(), pair.loggedAddress.c_str(), wait);
-        } else {
-            VELA_LOG(kBlockLog,
-                     "login refused without a password check: account \"%s\" from %s, blocked for %lld more seconds",
-                     pair.loggedAccount.c_str(), pair.loggedAddress.c_str(), wait);
-        }
+        LogRefusal(pair, store, byAddress, wait);
         return VELA_LOGIN_GUARD_BLOCKED;
     }
-    if (byAddress) {
-        AddAttempt(pair.address, now, pair.account.tag);
-        if (!SaveRecord(pair.address, limits)) {
-            return VELA_LOGIN_GUARD_ERROR;
-        }
-    }
-    if (byAccount) {
-        AddAttempt(pair.account, now, pair.address.tag);
-        if (!SaveRecord(pair.account, limits)) {
-            return VELA_LOGIN_GUARD_ERROR;
-        }
-    }
-    return VELA_LOGIN_GUARD_ALLOW;
+    return CountAttempt(pair, now, limits, byAddress, byAccount) ? VELA_LOGIN_GUARD_ALLOW : VELA_LOGIN_GUARD_ERROR;
 }
 
 void Failed(const LoginSettings* settings, const char* account, const char* clientIP, const char* reason)

@@ -103,6 +103,55 @@ int OpenKeyDir(const std::string& dir, bool create)
 
 enum class KeyFile { Loaded, Missing, Unusable };
 
+// Fills `pem` (sized from fstat) from the key file `fd` (`path` for the log
+// lines). False (logged) when reading fails or the file shrank meanwhile.
+bool ReadKeyText(int fd, const std::string& path, SecretBytes& pem)
+{
+    size_t used = 0;
+    while (used < pem.size()) {
+        ssize_t got = read(fd, pem.data() + used, pem.size() - used);
+        if (got < 0 && errno == EINTR) {
+            continue;
+        }
+        if (got < 0) {
+            VELA_LOG_ERR("read(%s): %m", path.c_str());
+            return false;
+        }
+        if (got == 0) {
+            VELA_LOG_ERR("%s shrank while being read", path.c_str());
+            return false;
+        }
+        used += static_cast<size_t>(got);
+    }
+    return true;
+}
+
+// The private key in the PEM text `pem` of `path`, which is wiped: an
+// unencrypted RSA key of kMinKeyBits to kMaxKeyBits bits. Null (logged)
+// otherwise.
+EVP_PKEY* ParsePrivateKey(const CryptoApi& api, const std::string& path, SecretBytes& pem)
+{
+    EVP_PKEY* key = nullptr;
+    {
+        MemBio bio(api, pem.data(), static_cast<int>(pem.size()));
+        if (bio.get() != nullptr) {
+            key = api.PEM_read_bio_PrivateKey(bio.get(), nullptr, NoPassphrase, nullptr);
+        }
+    }
+    pem.Wipe();
+    if (key == nullptr) {
+        LogCryptoError(api, ("cannot read the private key in " + path).c_str());
+        return nullptr;
+    }
+    const int bits = api.EVP_PKEY_get_bits(key);
+    if (api.EVP_PKEY_is_a(key, "RSA") != 1 || bits < kMinKeyBits || bits > kMaxKeyBits) {
+        VELA_LOG_ERR("%s is not an RSA key of %d to %d bits", path.c_str(), kMinKeyBits, kMaxKeyBits);
+        api.EVP_PKEY_free(key);
+        return nullptr;
+    }
+    return key;
+}
+
 KeyFile ReadPrivateKey(const CryptoApi& api, int dirFd, const std::string& dir, EVP_PKEY*& out)
 {
     out = nullptr;
@@ -130,42 +179,11 @@ KeyFile ReadPrivateKey(const CryptoApi& api, int dirFd, const std::string& dir, 
         return KeyFile::Unusable;
     }
     SecretBytes pem(static_cast<size_t>(st.st_size));
-    size_t used = 0;
-    while (used < pem.size()) {
-        ssize_t got = read(fd.Get(), pem.data() + used, pem.size() - used);
-        if (got < 0 && errno == EINTR) {
-            continue;
-        }
-        if (got < 0) {
-            VELA_LOG_ERR("read(%s): %m", path.c_str());
-            return KeyFile::Unusable;
-        }
-        if (got == 0) {
-            VELA_LOG_ERR("%s shrank while being read", path.c_str());
-            return KeyFile::Unusable;
-        }
-        used += static_cast<size_t>(got);
-    }
-    EVP_PKEY* key = nullptr;
-    {
-        MemBio bio(api, pem.data(), static_cast<int>(pem.size()));
-        if (bio.get() != nullptr) {
-            key = api.PEM_read_bio_PrivateKey(bio.get(), nullptr, NoPassphrase, nullptr);
-        }
-    }
-    pem.Wipe();
-    if (key == nullptr) {
-        LogCryptoError(api, ("cannot read the private key in " + path).c_str());
+    if (!ReadKeyText(fd.Get(), path, pem)) {
         return KeyFile::Unusable;
     }
-    const int bits = api.EVP_PKEY_get_bits(key);
-    if (api.EVP_PKEY_is_a(key, "RSA") != 1 || bits < kMinKeyBits || bits > kMaxKeyBits) {
-        VELA_LOG_ERR("%s is not an RSA key of %d to %d bits", path.c_str(), kMinKeyBits, kMaxKeyBits);
-        api.EVP_PKEY_free(key);
-        return KeyFile::Unusable;
-    }
-    out = key;
-    return KeyFile::Loaded;
+    out = ParsePrivateKey(api, path, pem);
+    return out != nullptr ? KeyFile::Loaded : KeyFile::Unusable;
 }
 
 EVP_PKEY* GenerateKey(const CryptoApi& api)

@@ -274,6 +274,74 @@ Load WriteLastUse(const std::string& sid, long long now, bool touch)
     return VELA::Session::WriteStateFile(SessionPath(sid), doc, false) ? Load::Ok : Load::Error;
 }
 
+// The verdict on the account of session `id`: 0 when it exists,
+// AUTH_RESULT_NO_SESSION when it no longer does, AUTH_RESULT_REJECTED when
+// the look-up failed.
+int CheckUser(const StoredSession& s, const std::string& id)
+{
+    uid_t uid = 0;
+    const int known = VELA::Session::LookupUser(s.user.c_str(), uid);
+    if (known < 0) {
+        return AUTH_RESULT_REJECTED;
+    }
+    if (known == 0) {
+        VELA_LOG(kAuthLog, "session %s: user \"%s\" no longer exists", LogId(id).c_str(), s.user.c_str());
+        return AUTH_RESULT_NO_SESSION;
+    }
+    return 0;
+}
+
+// True when the request comes from the address session `id` is bound to
+// (VelaCgiGetRemoteIP, canonical form); the mismatch is logged.
+bool FromSessionAddress(const StoredSession& s, const std::string& id)
+{
+    char remote[64] = "";
+    std::string client;
+    if (VelaCgiGetRemoteIP(remote, sizeof(remote)) != 0 || !VELA::Session::CanonicalAddress(remote, client) ||
+        client != s.clientIP) {
+        VELA_LOG(kAuthLog, "session %s of \"%s\": request from %s, session bound to %s", LogId(id).c_str(),
+                 s.user.c_str(), remote[0] != '\0' ? remote : "an unknown address",
+                 s.clientIP.empty() ? "no address" : s.clientIP.c_str());
+        return false;
+    }
+    return true;
+}
+
+// Writes the use of the valid session `id` at `now` when there is anything
+// to write: the last use when `touch`, a time in the future pulled back in
+// any case. False when the session was removed meanwhile (logged). A failed
+// write leaves the session as valid as it was read; the error is logged and
+// the request goes on.
+bool RecordUse(const StoredSession& s, const std::string& id, long long now, bool touch)
+{
+    if ((touch && s.lastUse != now) || s.lastUse > now || s.created > now) {
+        if (WriteLastUse(id, now, touch) == Load::NoSession) {
+            VELA_LOG(kAuthLog, "session %s: removed during the check", LogId(id).c_str());
+            return false;
+        }
+    }
+    return true;
+}
+
+// Fills the handle (may be null) from the valid session `id`.
+void AuthorizeHandle(VELACGI_CTX* ctx, const StoredSession& s, const std::string& id)
+{
+    if (ctx == nullptr) {
+        return;
+    }
+    ctx->authorized = true;
+    ctx->sessionFile = SessionPath(id);
+    ctx->timeout = static_cast<int>(s.idleTimeout);
+    ctx->timeoutText = std::to_string(s.idleTimeout);
+    ctx->sessionSkipIP = s.skipIP;
+    ctx->sessionApp = s.app;
+    ctx->sessionWebAPI = s.webapi;
+    ctx->sessionLang = s.lang;
+    if (s.skipIP) {
+        ctx->skipCheckIP = 1;
+    }
+}
+
 int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize, VELACGI_SESSION_INFO* info,
                  int flags)
 {
@@ -293,15 +361,8 @@ int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
     }
     const bool skip = s.skipIP || (ctx != nullptr && ctx->skipCheckIP != 0);
     FillInfo(s, skip, info);
-
-    uid_t uid = 0;
-    const int known = VELA::Session::LookupUser(s.user.c_str(), uid);
-    if (known < 0) {
-        return AUTH_RESULT_REJECTED;
-    }
-    if (known == 0) {
-        VELA_LOG(kAuthLog, "session %s: user \"%s\" no longer exists", LogId(id).c_str(), s.user.c_str());
-        return AUTH_RESULT_NO_SESSION;
+    if (const int verdict = CheckUser(s, id)) {
+        return verdict;
     }
 
     const long long now = VELA::Session::Now();
@@ -314,16 +375,8 @@ int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
         }
         return AUTH_RESULT_TIMEOUT;
     }
-    if (!skip) {
-        char remote[64] = "";
-        std::string client;
-        if (VelaCgiGetRemoteIP(remote, sizeof(remote)) != 0 ||
-            !VELA::Session::CanonicalAddress(remote, client) || client != s.clientIP) {
-            VELA_LOG(kAuthLog, "session %s of \"%s\": request from %s, session bound to %s", LogId(id).c_str(),
-                     s.user.c_str(), remote[0] != '\0' ? remote : "an unknown address",
-                     s.clientIP.empty() ? "no address" : s.clientIP.c_str());
-            return AUTH_RESULT_IP_MISMATCH;
-        }
+    if (!skip && !FromSessionAddress(s, id)) {
+        return AUTH_RESULT_IP_MISMATCH;
     }
     if (s.tokenProtect && !CarriesToken(s.token)) {
         VELA_LOG(kAuthLog, "session %s of \"%s\": anti-forgery token missing or wrong", LogId(id).c_str(),
@@ -336,29 +389,10 @@ int CheckSession(VELACGI_CTX* ctx, const char* sid, char* user, size_t userSize,
                      s.user.size(), userSize);
         return AUTH_RESULT_REJECTED;
     }
-    const bool touch = (flags & VELACGI_AUTH_NO_REFRESH) == 0;
-    if ((touch && s.lastUse != now) || s.lastUse > now || s.created > now) {
-        const Load written = WriteLastUse(id, now, touch);
-        if (written == Load::NoSession) {
-            VELA_LOG(kAuthLog, "session %s: removed during the check", LogId(id).c_str());
-            return AUTH_RESULT_NO_SESSION;
-        }
-        // A failed write leaves the session as valid as it was read; the
-        // error is logged and the request goes on.
+    if (!RecordUse(s, id, now, (flags & VELACGI_AUTH_NO_REFRESH) == 0)) {
+        return AUTH_RESULT_NO_SESSION;
     }
-    if (ctx != nullptr) {
-        ctx->authorized = true;
-        ctx->sessionFile = SessionPath(id);
-        ctx->timeout = static_cast<int>(s.idleTimeout);
-        ctx->timeoutText = std::to_string(s.idleTimeout);
-        ctx->sessionSkipIP = s.skipIP;
-        ctx->sessionApp = s.app;
-        ctx->sessionWebAPI = s.webapi;
-        ctx->sessionLang = s.lang;
-        if (s.skipIP) {
-            ctx->skipCheckIP = 1;
-        }
-    }
+    AuthorizeHandle(ctx, s, id);
     return AUTH_RESULT_AUTHORIZED;
 }
 
@@ -613,6 +647,56 @@ int VelaCgiUIDGet(const char* sid, const char* user)
 
 namespace {
 
+// Fills the new session `s` for `user` (already checked) from `clientIP`
+// and the options. False (logged) when a limit or a text is out of range or
+// `clientIP` is not an address.
+bool FillNewSession(const char* user, const char* clientIP, const VELA::Session::Options& opt, StoredSession& s)
+{
+    s.user = user;
+    s.idleTimeout = opt.idleTimeout == 0 ? VELA_SESSION_IDLE_DEFAULT : opt.idleTimeout;
+    s.lifetime = opt.lifetime == 0 ? VELA_SESSION_LIFETIME_DEFAULT : opt.lifetime;
+    if (s.idleTimeout < 1 || s.idleTimeout > VELA_SESSION_IDLE_MAX || s.lifetime < 1 ||
+        s.lifetime > VELA_SESSION_LIFETIME_MAX) {
+        VELA_LOG_ERR("session create: idle timeout %lld or lifetime %lld out of range", s.idleTimeout,
+                     s.lifetime);
+        return false;
+    }
+    s.skipIP = opt.skipIP;
+    if (clientIP == nullptr || clientIP[0] == '\0') {
+        s.skipIP = true;
+    } else if (strnlen(clientIP, 64) >= 64 || !VELA::Session::CanonicalAddress(clientIP, s.clientIP)) {
+        VELA_LOG_ERR("session create: \"%.64s\" is not an IP address", clientIP);
+        return false;
+    }
+    if (!IsPrintable(opt.app, kMaxText) || !IsPrintable(opt.webapi, kMaxText) || !IsLang(opt.lang)) {
+        VELA_LOG_ERR("session create: invalid application, web-API privilege or language");
+        return false;
+    }
+    s.app = opt.app;
+    s.webapi = opt.webapi;
+    s.lang = opt.lang;
+    s.tokenProtect = opt.tokenProtect;
+    return true;
+}
+
+// Draws the id and the anti-forgery token of `s`, the id one that no file
+// of the store has (three tries). Called under the store lock. False
+// (logged) when getrandom fails or no free id was drawn.
+bool DrawFreeId(StoredSession& s)
+{
+    for (int attempt = 0; attempt < 3; ++attempt) {
+        if (!VELA::Session::RandomId(kIdBytes, s.id) || !VELA::Session::RandomId(kIdBytes, s.token)) {
+            return false;
+        }
+        struct stat st;
+        if (lstat(SessionPath(s.id).c_str(), &st) != 0 && errno == ENOENT) {
+            return true;
+        }
+    }
+    VELA_LOG_ERR("session create: no free session id");
+    return false;
+}
+
 int CreateSession(const char* user, const char* clientIP, const VELA::Session::Options* options, std::string& sid,
                   std::string& token)
 {
@@ -630,32 +714,10 @@ int CreateSession(const char* user, const char* clientIP, const VELA::Session::O
         return -1;
     }
     const VELA::Session::Options defaults;
-    const VELA::Session::Options& opt = options != nullptr ? *options : defaults;
     StoredSession s;
-    s.user = user;
-    s.idleTimeout = opt.idleTimeout == 0 ? VELA_SESSION_IDLE_DEFAULT : opt.idleTimeout;
-    s.lifetime = opt.lifetime == 0 ? VELA_SESSION_LIFETIME_DEFAULT : opt.lifetime;
-    if (s.idleTimeout < 1 || s.idleTimeout > VELA_SESSION_IDLE_MAX || s.lifetime < 1 ||
-        s.lifetime > VELA_SESSION_LIFETIME_MAX) {
-        VELA_LOG_ERR("session create: idle timeout %lld or lifetime %lld out of range", s.idleTimeout,
-                     s.lifetime);
+    if (!FillNewSession(user, clientIP, options != nullptr ? *options : defaults, s)) {
         return -1;
     }
-    s.skipIP = opt.skipIP;
-    if (clientIP == nullptr || clientIP[0] == '\0') {
-        s.skipIP = true;
-    } else if (strnlen(clientIP, 64) >= 64 || !CanonicalAddress(clientIP, s.clientIP)) {
-        VELA_LOG_ERR("session create: \"%.64s\" is not an IP address", clientIP);
-        return -1;
-    }
-    if (!IsPrintable(opt.app, kMaxText) || !IsPrintable(opt.webapi, kMaxText) || !IsLang(opt.lang)) {
-        VELA_LOG_ERR("session create: invalid application, web-API privilege or language");
-        return -1;
-    }
-    s.app = opt.app;
-    s.webapi = opt.webapi;
-    s.lang = opt.lang;
-    s.tokenProtect = opt.tokenProtect;
 
     const std::string dir = SessionDir();
     if (!EnsureStateDir(dir)) {
@@ -664,21 +726,8 @@ int CreateSession(const char* user, const char* clientIP, const VELA::Session::O
     VELA::Session::Purge(kPurgeGrace);
 
     StoreLock lock(dir);
-    if (!lock.Held()) {
+    if (!lock.Held() || !DrawFreeId(s)) {
         return -1;
-    }
-    for (int attempt = 0;; ++attempt) {
-        if (attempt == 3) {
-            VELA_LOG_ERR("session create: no free session id");
-            return -1;
-        }
-        if (!RandomId(kIdBytes, s.id) || !RandomId(kIdBytes, s.token)) {
-            return -1;
-        }
-        struct stat st;
-        if (lstat(SessionPath(s.id).c_str(), &st) != 0 && errno == ENOENT) {
-            break;
-        }
     }
     s.created = Now();
     s.lastUse = s.created;
