@@ -164,6 +164,40 @@ void LogWriteFailure(int err)
     }
 }
 
+// One sendfile(2) of what is left of a body: `offset` and `length` move on
+// by what was sent; `useSendfile` becomes false for an output sendfile
+// cannot write to (an O_APPEND file, ...). False (logged) when writing
+// fails or the file ends early (it shrank).
+bool SendfileStep(int out, int in, off_t& offset, uint64_t& length, bool& useSendfile)
+{
+    const size_t want = length < kSendfileChunk ? static_cast<size_t>(length) : kSendfileChunk;
+    const ssize_t n = sendfile(out, in, &offset, want);
+    if (n > 0) {
+        length -= static_cast<uint64_t>(n);
+        return true;
+    }
+    if (n == 0) {
+        VELA_LOG_ERR("download cut short: the file shrank while it was sent");
+        return false;
+    }
+    if (errno == EINTR) {
+        return true;
+    }
+    if (errno == EAGAIN || errno == EWOULDBLOCK) {
+        if (!WaitWritable(out)) {
+            LogWriteFailure(errno);
+            return false;
+        }
+        return true;
+    }
+    if (errno == EINVAL || errno == ENOSYS || errno == EOPNOTSUPP) {
+        useSendfile = false;
+        return true;
+    }
+    LogWriteFailure(errno);
+    return false;
+}
+
 // Sends `length` bytes of `in` from `offset` to `out`: sendfile while the
 // output takes it, else pread and write through a large buffer. False when
 // writing fails or the file ends early (it shrank).
@@ -173,32 +207,10 @@ bool SendBody(int out, int in, off_t offset, uint64_t length)
     std::unique_ptr<char[]> buffer;
     while (length > 0) {
         if (useSendfile) {
-            const size_t want = length < kSendfileChunk ? static_cast<size_t>(length) : kSendfileChunk;
-            const ssize_t n = sendfile(out, in, &offset, want);
-            if (n > 0) {
-                length -= static_cast<uint64_t>(n);
-                continue;
-            }
-            if (n == 0) {
-                VELA_LOG_ERR("download cut short: the file shrank while it was sent");
+            if (!SendfileStep(out, in, offset, length, useSendfile)) {
                 return false;
             }
-            if (errno == EINTR) {
-                continue;
-            }
-            if (errno == EAGAIN || errno == EWOULDBLOCK) {
-                if (!WaitWritable(out)) {
-                    LogWriteFailure(errno);
-                    return false;
-                }
-                continue;
-            }
-            if (errno == EINVAL || errno == ENOSYS || errno == EOPNOTSUPP) {
-                useSendfile = false;  // an output sendfile cannot write to (O_APPEND file, ...)
-                continue;
-            }
-            LogWriteFailure(errno);
-            return false;
+            continue;
         }
         if (!buffer) {
             buffer.reset(new (std::nothrow) char[kCopyBuffer]);
@@ -432,43 +444,35 @@ bool ParseDigits(const std::string& text, size_t& pos, uint64_t& value)
     return true;
 }
 
-// Reads the Range header `header` against a file of `size` bytes. One
-// byte range ("a-b", "a-") or suffix range ("-n") gives kPartial with
-// the inclusive [first, last], or kUnsatisfiable when it selects no byte of
-// the file; no header, several ranges or bad syntax give kWhole (the header
-// is ignored, RFC 9110 section 14.2).
-RangeKind ParseRange(const char* header, uint64_t size, uint64_t& first, uint64_t& last)
+// The Range header `header` without the blanks around it. False when there
+// is none, or when it is over-long (logged): the whole file answers then.
+bool TrimmedRange(const char* header, std::string& text)
 {
     if (header == nullptr) {
-        return RangeKind::kWhole;
+        return false;
     }
     const size_t headerLen = strnlen(header, kMaxRangeHeader + 1);
     if (headerLen > kMaxRangeHeader) {
         VELA_LOG(LOG_NOTICE, "Range header over %zu bytes ignored", kMaxRangeHeader);
-        return RangeKind::kWhole;
+        return false;
     }
-    std::string text(header, headerLen);
     size_t begin = 0;
-    size_t end = text.size();
-    while (begin < end && IsOws(text[begin])) {
+    size_t end = headerLen;
+    while (begin < end && IsOws(header[begin])) {
         ++begin;
     }
-    while (end > begin && IsOws(text[end - 1])) {
+    while (end > begin && IsOws(header[end - 1])) {
         --end;
     }
-    text = text.substr(begin, end - begin);
-    static const char kUnit[] = "bytes=";
-    if (text.size() < sizeof(kUnit) - 1 || strncasecmp(text.c_str(), kUnit, sizeof(kUnit) - 1) != 0) {
-        VELA_LOG(LOG_NOTICE, "Range \"%s\" ignored: not a byte range", text.c_str());
-        return RangeKind::kWhole;
-    }
-    if (text.find(',') != std::string::npos) {
-        return RangeKind::kWhole;  // several ranges: the whole file answers them all
-    }
-    size_t pos = sizeof(kUnit) - 1;
-    while (pos < text.size() && IsOws(text[pos])) {
-        ++pos;
-    }
+    text.assign(header + begin, end - begin);
+    return true;
+}
+
+// The one byte-range-spec at `pos` of the Range text `text` ("a-b", "a-",
+// or the suffix range "-n") against a file of `size` bytes, as ParseRange
+// answers.
+RangeKind ParseRangeSpec(const std::string& text, size_t pos, uint64_t size, uint64_t& first, uint64_t& last)
+{
     if (pos < text.size() && text[pos] == '-') {
         ++pos;
         uint64_t suffix = 0;
@@ -504,6 +508,32 @@ RangeKind ParseRange(const char* header, uint64_t size, uint64_t& first, uint64_
     first = a;
     last = b >= size ? size - 1 : b;
     return RangeKind::kPartial;
+}
+
+// Reads the Range header `header` against a file of `size` bytes. One
+// byte range ("a-b", "a-") or suffix range ("-n") gives kPartial with
+// the inclusive [first, last], or kUnsatisfiable when it selects no byte of
+// the file; no header, several ranges or bad syntax give kWhole (the header
+// is ignored, RFC 9110 section 14.2).
+RangeKind ParseRange(const char* header, uint64_t size, uint64_t& first, uint64_t& last)
+{
+    std::string text;
+    if (!TrimmedRange(header, text)) {
+        return RangeKind::kWhole;
+    }
+    static const char kUnit[] = "bytes=";
+    if (text.size() < sizeof(kUnit) - 1 || strncasecmp(text.c_str(), kUnit, sizeof(kUnit) - 1) != 0) {
+        VELA_LOG(LOG_NOTICE, "Range \"%s\" ignored: not a byte range", text.c_str());
+        return RangeKind::kWhole;
+    }
+    if (text.find(',') != std::string::npos) {
+        return RangeKind::kWhole;  // several ranges: the whole file answers them all
+    }
+    size_t pos = sizeof(kUnit) - 1;
+    while (pos < text.size() && IsOws(text[pos])) {
+        ++pos;
+    }
+    return ParseRangeSpec(text, pos, size, first, last);
 }
 
 bool IsHeadRequest()

@@ -68,73 +68,80 @@ bool HasControlByte(const std::string& s)
     return false;
 }
 
+size_t SkipBlanks(const std::string& text, size_t pos)
+{
+    while (pos < text.size() && IsBlank(text[pos])) {
+        ++pos;
+    }
+    return pos;
+}
+
+// The token (RFC 7230 tchars) at `pos` of `text` into `out`, `pos` moved
+// past it. False when there is none.
+bool ReadToken(const std::string& text, size_t& pos, std::string& out)
+{
+    const size_t start = pos;
+    while (pos < text.size() && IsTokenChar(static_cast<unsigned char>(text[pos]))) {
+        ++pos;
+    }
+    if (pos == start) {
+        return false;
+    }
+    out = text.substr(start, pos - start);
+    return true;
+}
+
+// One parameter name "=" ( token / quoted-string ) at `pos` of `text`,
+// `pos` moved past it; `name` lower-cased. A quoted string runs to the next
+// double quote. False on a syntax error.
+bool ReadParameter(const std::string& text, size_t& pos, std::string& name, std::string& value)
+{
+    if (!ReadToken(text, pos, name)) {
+        return false;
+    }
+    for (char& c : name) {
+        c = Lower(c);
+    }
+    pos = SkipBlanks(text, pos);
+    if (pos >= text.size() || text[pos] != '=') {
+        return false;
+    }
+    pos = SkipBlanks(text, pos + 1);
+    if (pos < text.size() && text[pos] == '"') {
+        const size_t close = text.find('"', pos + 1);
+        if (close == std::string::npos) {
+            return false;
+        }
+        value = text.substr(pos + 1, close - pos - 1);
+        pos = close + 1;
+        return true;
+    }
+    return ReadToken(text, pos, value);
+}
+
 // A header-field parameter list (RFC 7231 section 3.1.1.1 / RFC 6266
 // section 4.1): *( OWS ";" OWS name "=" ( token / quoted-string ) ),
 // starting at `pos` of `text`. Calls `take(name, value)` for each, `name`
-// lower-cased; `take` returns false to refuse the header. A quoted string
-// runs to the next double quote. An empty parameter after a trailing ";" is
-// tolerated. False on a syntax error.
+// lower-cased; `take` returns false to refuse the header. An empty
+// parameter after a trailing ";" is tolerated. False on a syntax error.
 template <typename Take>
 bool ForEachParameter(const std::string& text, size_t pos, Take take)
 {
-    const size_t n = text.size();
     for (;;) {
-        while (pos < n && IsBlank(text[pos])) {
-            ++pos;
-        }
-        if (pos >= n) {
+        pos = SkipBlanks(text, pos);
+        if (pos >= text.size()) {
             return true;
         }
         if (text[pos] != ';') {
             return false;
         }
-        ++pos;
-        while (pos < n && IsBlank(text[pos])) {
-            ++pos;
-        }
-        if (pos >= n) {
+        pos = SkipBlanks(text, pos + 1);
+        if (pos >= text.size()) {
             return true;
         }
-        const size_t nameStart = pos;
-        while (pos < n && IsTokenChar(static_cast<unsigned char>(text[pos]))) {
-            ++pos;
-        }
-        if (pos == nameStart) {
-            return false;
-        }
-        std::string name = text.substr(nameStart, pos - nameStart);
-        for (char& c : name) {
-            c = Lower(c);
-        }
-        while (pos < n && IsBlank(text[pos])) {
-            ++pos;
-        }
-        if (pos >= n || text[pos] != '=') {
-            return false;
-        }
-        ++pos;
-        while (pos < n && IsBlank(text[pos])) {
-            ++pos;
-        }
+        std::string name;
         std::string value;
-        if (pos < n && text[pos] == '"') {
-            const size_t close = text.find('"', pos + 1);
-            if (close == std::string::npos) {
-                return false;
-            }
-            value = text.substr(pos + 1, close - pos - 1);
-            pos = close + 1;
-        } else {
-            const size_t valueStart = pos;
-            while (pos < n && IsTokenChar(static_cast<unsigned char>(text[pos]))) {
-                ++pos;
-            }
-            if (pos == valueStart) {
-                return false;
-            }
-            value = text.substr(valueStart, pos - valueStart);
-        }
-        if (!take(name, value)) {
+        if (!ReadParameter(text, pos, name, value) || !take(name, value)) {
             return false;
         }
     }
@@ -184,6 +191,45 @@ int ParseDisposition(const std::string& value, MultipartPart& part)
         return VELA_UPLOAD_ERR_HEADER;
     }
     return 1;
+}
+
+// One header line of a part (not the empty one that ends them): its field
+// name checked, and a Content-Disposition parsed into `part`; every other
+// field is ignored (Content-Type and the rest say nothing we use).
+// `haveDisposition` tells whether an earlier line was one. 1, or a negative
+// code (logged).
+int TakeHeaderLine(const std::string& line, bool& haveDisposition, MultipartPart& part)
+{
+    const size_t colon = line.find(':');
+    bool validName = colon != std::string::npos && colon > 0;
+    for (size_t i = 0; validName && i < colon; ++i) {
+        validName = IsTokenChar(static_cast<unsigned char>(line[i]));
+    }
+    if (!validName) {
+        VELA_LOG_ERR("upload refused: malformed part header line \"%.64s\"", line.c_str());
+        return VELA_UPLOAD_ERR_HEADER;
+    }
+    if (!EqualsNoCase(line.substr(0, colon), "content-disposition")) {
+        return 1;
+    }
+    if (haveDisposition) {
+        VELA_LOG_ERR("upload refused: a part has two Content-Disposition headers");
+        return VELA_UPLOAD_ERR_HEADER;
+    }
+    haveDisposition = true;
+    size_t start = colon + 1;
+    while (start < line.size() && IsBlank(line[start])) {
+        ++start;
+    }
+    size_t stop = line.size();
+    while (stop > start && IsBlank(line[stop - 1])) {
+        --stop;
+    }
+    try {
+        return ParseDisposition(line.substr(start, stop - start), part);
+    } catch (const std::exception&) {
+        return VELA_UPLOAD_ERR_MEMORY;
+    }
 }
 
 }  // namespace
@@ -507,13 +553,10 @@ int MultipartReader::Drain()
     }
 }
 
-// Part header fields up to the empty line (RFC 7230 section 3.2 syntax,
-// CR LF line ends, no obsolete folding). 1, or a negative code.
-int MultipartReader::ReadHeaders(MultipartPart& part)
+// One header line of a part, without its CR LF, at most
+// kMaxPartHeaderLine bytes. 1, or a negative code (the reader has failed).
+int MultipartReader::ReadHeaderLine(std::string& line)
 {
-    part = MultipartPart();
-    bool haveDisposition = false;
-    int lines = 0;
     for (;;) {
         const size_t avail = Available();
         const size_t window = avail < kMaxPartHeaderLine + 2 ? avail : kMaxPartHeaderLine + 2;
@@ -539,13 +582,29 @@ int MultipartReader::ReadHeaders(MultipartPart& part)
             VELA_LOG_ERR("upload refused: part header line longer than %zu bytes", kMaxPartHeaderLine);
             return Fail(VELA_UPLOAD_ERR_HEADER);
         }
-        std::string line;
         try {
             line.assign(data, len);
         } catch (const std::exception&) {
             return Fail(VELA_UPLOAD_ERR_MEMORY);
         }
         begin_ += len + 2;
+        return 1;
+    }
+}
+
+// Part header fields up to the empty line (RFC 7230 section 3.2 syntax,
+// CR LF line ends, no obsolete folding). 1, or a negative code.
+int MultipartReader::ReadHeaders(MultipartPart& part)
+{
+    part = MultipartPart();
+    bool haveDisposition = false;
+    int lines = 0;
+    for (;;) {
+        std::string line;
+        const int rc = ReadHeaderLine(line);
+        if (rc < 0) {
+            return rc;
+        }
         if (line.empty()) {
             break;
         }
@@ -553,39 +612,9 @@ int MultipartReader::ReadHeaders(MultipartPart& part)
             VELA_LOG_ERR("upload refused: a part has more than %d header lines", kMaxPartHeaderLines);
             return Fail(VELA_UPLOAD_ERR_HEADER);
         }
-        const size_t colon = line.find(':');
-        bool validName = colon != std::string::npos && colon > 0;
-        for (size_t i = 0; validName && i < colon; ++i) {
-            validName = IsTokenChar(static_cast<unsigned char>(line[i]));
-        }
-        if (!validName) {
-            VELA_LOG_ERR("upload refused: malformed part header line \"%.64s\"", line.c_str());
-            return Fail(VELA_UPLOAD_ERR_HEADER);
-        }
-        if (!EqualsNoCase(line.substr(0, colon), "content-disposition")) {
-            continue;  // Content-Type and the rest say nothing we use
-        }
-        if (haveDisposition) {
-            VELA_LOG_ERR("upload refused: a part has two Content-Disposition headers");
-            return Fail(VELA_UPLOAD_ERR_HEADER);
-        }
-        haveDisposition = true;
-        size_t start = colon + 1;
-        while (start < line.size() && IsBlank(line[start])) {
-            ++start;
-        }
-        size_t stop = line.size();
-        while (stop > start && IsBlank(line[stop - 1])) {
-            --stop;
-        }
-        int rc;
-        try {
-            rc = ParseDisposition(line.substr(start, stop - start), part);
-        } catch (const std::exception&) {
-            rc = VELA_UPLOAD_ERR_MEMORY;
-        }
-        if (rc < 0) {
-            return Fail(rc);
+        const int taken = TakeHeaderLine(line, haveDisposition, part);
+        if (taken < 0) {
+            return Fail(taken);
         }
     }
     if (!haveDisposition) {

@@ -87,6 +87,7 @@ private:
     const char* FindDelimiter(const char* data, size_t len) const;
     int ScanToDelimiter(MultipartSink* sink);
     int ReadDelimiterLine();
+    int ReadHeaderLine(std::string& line);
     int ReadHeaders(MultipartPart& part);
     int Drain();
     size_t Available() const { return end_ - begin_; }

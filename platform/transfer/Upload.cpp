@@ -246,6 +246,65 @@ int CreateStoredFile(const UploadDir& dir, std::string& name)
     return -1;
 }
 
+// A file part whose headers were just read: one with an empty file name is
+// a file input left empty, skipped (0) unless it carries content; any other
+// waits to be stored (1), the client's file name reduced to its base name.
+// A negative code (final for the reader) when it is refused.
+int TakeFilePart(UploadReader* r, MultipartPart& part)
+{
+    MultipartReader& mp = r->mp;
+    if (part.fileName.empty()) {
+        CountSink count;
+        const int rc = mp.ReadContent(&count);
+        if (rc < 0) {
+            return rc;
+        }
+        if (count.Bytes() > 0) {
+            VELA_LOG_ERR("upload refused: file part \"%.64s\" has %llu bytes but no file name", part.name.c_str(),
+                         count.Bytes());
+            return mp.Fail(VELA_UPLOAD_ERR_FILENAME);
+        }
+        return 0;
+    }
+    std::string base;
+    if (!ClientBaseName(part.fileName, base)) {
+        VELA_LOG_ERR("upload refused: file name \"%.64s\" of field \"%.64s\"", part.fileName.c_str(),
+                     part.name.c_str());
+        return mp.Fail(VELA_UPLOAD_ERR_FILENAME);
+    }
+    r->pendingField.swap(part.name);
+    r->pendingName.swap(base);
+    r->pending = true;
+    return 1;
+}
+
+// The content of the field part `part` into the reader's field table,
+// within the bounds of one field and of all fields. 1, or a negative code
+// (final for the reader).
+int TakeField(UploadReader* r, const MultipartPart& part)
+{
+    MultipartReader& mp = r->mp;
+    FieldSink sink(part.name);
+    const int rc = mp.ReadContent(&sink);
+    if (rc < 0) {
+        return rc;
+    }
+    const std::string& value = sink.Value();
+    if (memchr(value.data(), '\0', value.size()) != nullptr) {
+        VELA_LOG_ERR("upload refused: field \"%.64s\" holds a NUL byte", part.name.c_str());
+        return mp.Fail(VELA_UPLOAD_ERR_FIELD);
+    }
+    r->fieldBytes += part.name.size() + value.size();
+    if (r->fieldBytes > kMaxFieldBytes) {
+        VELA_LOG_ERR("upload refused: form fields longer than %zu bytes in all", kMaxFieldBytes);
+        return mp.Fail(VELA_UPLOAD_ERR_LIMIT);
+    }
+    if (VLIBCSzHashSetValue(r->fields, part.name.c_str(), value.c_str()) != 0) {
+        return mp.Fail(VELA_UPLOAD_ERR_MEMORY);
+    }
+    return 1;
+}
+
 // Reads form fields until a file part waits or the body ends. 1, or a
 // negative code (final for the reader).
 int ReadFieldsInternal(UploadReader* r)
@@ -267,47 +326,9 @@ int ReadFieldsInternal(UploadReader* r)
             VELA_LOG_ERR("upload refused: more than %d parts", kMaxParts);
             return mp.Fail(VELA_UPLOAD_ERR_LIMIT);
         }
-        if (part.hasFileName) {
-            if (part.fileName.empty()) {
-                // A file input left empty: skipped, unless it carries content.
-                CountSink count;
-                if ((rc = mp.ReadContent(&count)) < 0) {
-                    return rc;
-                }
-                if (count.Bytes() > 0) {
-                    VELA_LOG_ERR("upload refused: file part \"%.64s\" has %llu bytes but no file name",
-                                 part.name.c_str(), count.Bytes());
-                    return mp.Fail(VELA_UPLOAD_ERR_FILENAME);
-                }
-                continue;
-            }
-            std::string base;
-            if (!ClientBaseName(part.fileName, base)) {
-                VELA_LOG_ERR("upload refused: file name \"%.64s\" of field \"%.64s\"", part.fileName.c_str(),
-                             part.name.c_str());
-                return mp.Fail(VELA_UPLOAD_ERR_FILENAME);
-            }
-            r->pendingField.swap(part.name);
-            r->pendingName.swap(base);
-            r->pending = true;
-            break;
-        }
-        FieldSink sink(part.name);
-        if ((rc = mp.ReadContent(&sink)) < 0) {
+        rc = part.hasFileName ? TakeFilePart(r, part) : TakeField(r, part);
+        if (rc < 0) {
             return rc;
-        }
-        const std::string& value = sink.Value();
-        if (memchr(value.data(), '\0', value.size()) != nullptr) {
-            VELA_LOG_ERR("upload refused: field \"%.64s\" holds a NUL byte", part.name.c_str());
-            return mp.Fail(VELA_UPLOAD_ERR_FIELD);
-        }
-        r->fieldBytes += part.name.size() + value.size();
-        if (r->fieldBytes > kMaxFieldBytes) {
-            VELA_LOG_ERR("upload refused: form fields longer than %zu bytes in all", kMaxFieldBytes);
-            return mp.Fail(VELA_UPLOAD_ERR_LIMIT);
-        }
-        if (VLIBCSzHashSetValue(r->fields, part.name.c_str(), value.c_str()) != 0) {
-            return mp.Fail(VELA_UPLOAD_ERR_MEMORY);
         }
     }
     return 1;
@@ -500,6 +521,25 @@ PVLIBCSZHASH& EnsureTable(PVLIBCSZHASH& table)
     return table;
 }
 
+// Opens in `upload` the directory (a path of the system) that the file
+// part waiting in `r` is to be stored in. 1, or a negative code:
+// VELA_UPLOAD_ERR_ARGUMENT for an invalid `dir`, the reader's failure, or
+// VELA_UPLOAD_ERR_STATE when no file part waits. Can throw std::bad_alloc.
+int OpenDirForWaitingFile(UploadReader* r, const char* dir, UploadDir& upload)
+{
+    const std::string resolved = VELA::System::ResolvePath(dir);
+    if (resolved.empty()) {
+        return VELA_UPLOAD_ERR_ARGUMENT;
+    }
+    if (r->mp.Failure() != 0) {
+        return r->mp.Failure();
+    }
+    if (!r->pending) {
+        return VELA_UPLOAD_ERR_STATE;
+    }
+    return OpenUploadDir(resolved.c_str(), upload);
+}
+
 }  // namespace
 
 // ---- Reader over a file descriptor ----
@@ -679,18 +719,8 @@ int VelaCgiLoadUploadFileToDir(VELACGI_CTX* ctx, const char* dir, UploadProgress
         return rc;
     }
     try {
-        const std::string resolved = VELA::System::ResolvePath(dir);
-        if (resolved.empty()) {
-            return VELA_UPLOAD_ERR_ARGUMENT;
-        }
-        if (r->mp.Failure() != 0) {
-            return r->mp.Failure();
-        }
-        if (!r->pending) {
-            return VELA_UPLOAD_ERR_STATE;
-        }
         UploadDir upload;
-        if ((rc = OpenUploadDir(resolved.c_str(), upload)) < 0) {
+        if ((rc = OpenDirForWaitingFile(r, dir, upload)) < 0) {
             return rc;
         }
         PVLIBCSZHASH table = VLIBCSzHashAlloc(2);

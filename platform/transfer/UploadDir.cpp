@@ -56,8 +56,8 @@ struct PrivateDir {
     char path[PATH_MAX];
 };
 PrivateDir g_dir;
-// The write end of the pipe a reaper (VELA::Transfer::UploadDirReaper) waits on; -1
-// without one.
+// The write end of the pipe a reaper (VELA::Transfer::UploadDirReaper)
+// waits on; -1 without one.
 int g_reaperFd = -1;
 
 // The cleanup signals blocked for the scope.
@@ -310,6 +310,42 @@ bool MakePrivateDir(int baseFd, char (&name)[kNameLength + 1])
     return false;
 }
 
+// Makes the private directory in the base `dir` (open as `baseFd`, which
+// the record takes over on success; `parent` is `dir`, "" for "/"), takes
+// its lock and records it in g_dir, the cleanup signals blocked meanwhile.
+// Its path goes to `path`, which the caller made large enough. False
+// (recorded and logged, nothing left behind) on failure. Can throw
+// std::bad_alloc.
+bool MakeAndRecord(ScopedFd& baseFd, const std::string& dir, const std::string& parent, char* path)
+{
+    SignalBlock block;
+    char name[kNameLength + 1];
+    if (!MakePrivateDir(baseFd.Get(), name)) {
+        VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "mkdir in %.200s: %m", dir.c_str());
+        VELA_LOG_ERR("cannot make a private upload directory in %s: %m", dir.c_str());
+        return false;
+    }
+    ScopedFd dirFd(openat(baseFd.Get(), name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    struct stat st;
+    if (dirFd.Get() < 0 || fstat(dirFd.Get(), &st) != 0 || st.st_uid != geteuid() ||
+        fchmod(dirFd.Get(), 0700) != 0 || flock(dirFd.Get(), LOCK_EX | LOCK_NB) != 0) {
+        VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "open %.200s/%s: %m", dir.c_str(), name);
+        VELA_LOG_ERR("cannot take the private upload directory %s/%s: %m", dir.c_str(), name);
+        unlinkat(baseFd.Get(), name, AT_REMOVEDIR);
+        return false;
+    }
+    const std::string made = parent + "/" + name;
+    g_dir.owner = getpid();
+    g_dir.uid = st.st_uid;
+    g_dir.baseFd = baseFd.Release();
+    g_dir.dirFd = dirFd.Release();
+    memcpy(g_dir.name, name, sizeof(name));
+    memcpy(g_dir.path, made.c_str(), made.size() + 1);
+    g_dir.active = 1;
+    memcpy(path, made.c_str(), made.size() + 1);
+    return true;
+}
+
 }  // namespace
 
 namespace VELA {
@@ -379,32 +415,7 @@ int VELA::Transfer::UploadDirGet(const char* base, char* path, size_t pathSize)
         }
         Sweep(baseFd.Get(), dir, VELA_UPLOAD_SWEEP_AGE);
 
-        SignalBlock block;
-        char name[kNameLength + 1];
-        if (!MakePrivateDir(baseFd.Get(), name)) {
-            VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "mkdir in %.200s: %m", dir.c_str());
-            VELA_LOG_ERR("cannot make a private upload directory in %s: %m", dir.c_str());
-            return -1;
-        }
-        ScopedFd dirFd(openat(baseFd.Get(), name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-        struct stat st;
-        if (dirFd.Get() < 0 || fstat(dirFd.Get(), &st) != 0 || st.st_uid != geteuid() ||
-            fchmod(dirFd.Get(), 0700) != 0 || flock(dirFd.Get(), LOCK_EX | LOCK_NB) != 0) {
-            VELA_RECORD_ERROR(VLIBC_ERR_MKDIR, "open %.200s/%s: %m", dir.c_str(), name);
-            VELA_LOG_ERR("cannot take the private upload directory %s/%s: %m", dir.c_str(), name);
-            unlinkat(baseFd.Get(), name, AT_REMOVEDIR);
-            return -1;
-        }
-        const std::string made = parent + "/" + name;
-        g_dir.owner = getpid();
-        g_dir.uid = st.st_uid;
-        g_dir.baseFd = baseFd.Release();
-        g_dir.dirFd = dirFd.Release();
-        memcpy(g_dir.name, name, sizeof(name));
-        memcpy(g_dir.path, made.c_str(), made.size() + 1);
-        g_dir.active = 1;
-        memcpy(path, made.c_str(), made.size() + 1);
-        return 2;
+        return MakeAndRecord(baseFd, dir, parent, path) ? 2 : -1;
     } catch (const std::exception&) {
         VELA_RECORD_ERROR(VLIBC_ERR_MEMORY, "out of memory");
         return -1;
