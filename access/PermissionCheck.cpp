@@ -111,7 +111,7 @@ std::string UserClass(bool isAdmin, const std::string& user)
 int DecimalOption(const char* text)
 {
     long long value = 0;
-    if (text == nullptr || !ParseDecimal(text, strlen(text), 0, INT_MAX, value)) {
+    if (text == nullptr || !System::ParseDecimal(text, strlen(text), 0, INT_MAX, value)) {
         return 0;
     }
     return static_cast<int>(value);

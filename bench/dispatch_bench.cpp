@@ -70,7 +70,7 @@ BENCHMARK(BM_JsonOnlyEcho);
 int main(int argc, char** argv)
 {
     setenv("VELA_ROOT", VELA_BENCH_STAGE_ROOT, 0);
-    const std::string dir = VELA::VelaPath("/usr/vela/velaman/webapi");
+    const std::string dir = VELA::System::Path("/usr/vela/velaman/webapi");
     if (chdir(dir.c_str()) != 0) {
         perror(dir.c_str());
         return 1;

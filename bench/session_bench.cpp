@@ -92,12 +92,12 @@ int main(int argc, char** argv)
     }
     setenv("VELA_ROOT", dir, 1);
     setenv("REMOTE_ADDR", "192.0.2.7", 1);
-    VelaSetClockForTest(BenchClock);
-    VelaSessionOptions options;
+    VELA::Session::SetClockForTest(BenchClock);
+    VELA::Session::Options options;
     options.idleTimeout = 3600;
     options.lifetime = 30 * 86400;  // outlasts the clock's steps
     options.tokenProtect = true;
-    if (VelaSessionCreate("root", "192.0.2.7", &options, g_sid, g_token) != 0) {
+    if (VELA::Session::Create("root", "192.0.2.7", &options, g_sid, g_token) != 0) {
         fprintf(stderr, "cannot create a session under %s\n", dir);
         return 1;
     }

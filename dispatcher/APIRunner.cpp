@@ -50,7 +50,7 @@ APIRunner::APIRunner() : request_(new APIRequest()), response_(nullptr), d_(null
     response_ = new APIResponse(request_);
     d_ = new APIRunnerPrivate(this);
     setsid();
-    d_->registry.LoadDefaults(VelaPath(kLibDefPath));
+    d_->registry.LoadDefaults(VELA::System::Path(kLibDefPath));
 }
 
 APIRunner::~APIRunner()

@@ -41,10 +41,10 @@ void LogSet(int line, bool ok, const char* what, int r, int e, int s, int err)
 {
     const int saved = errno;
     if (ok) {
-        VelaLogAt(LOG_AUTHPRIV | LOG_INFO, __FILE__, line, "WARNING: set%s(%d, %d, %d)", what, r, e, s);
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_INFO, __FILE__, line, "WARNING: set%s(%d, %d, %d)", what, r, e, s);
     } else {
         char buf[256];
-        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, line, "ERROR: set%s(%d, %d, %d) [%s]", what, r, e, s,
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_ERR, __FILE__, line, "ERROR: set%s(%d, %d, %d) [%s]", what, r, e, s,
                   strerror_r(err, buf, sizeof(buf)));
     }
     errno = saved;
@@ -105,22 +105,22 @@ bool SwitchTo(Whom whom, const std::string& name, bool grantable)
                                    : ResetCredentialsByName(name.c_str(), grantable);
     };
     if (SetResUid(__LINE__, kKeepUid, 0, kKeepUid)) {
-        if (!grantable && VelaUploadDirPath()[0] != '\0') {
+        if (!grantable && VELA::Transfer::UploadDirPath()[0] != '\0') {
             uid_t uid = 0;
             gid_t gid = 0;
-            const int found = whom == Whom::RunAs ? VELARunAsGetUGID(name.c_str(), &uid, &gid)
+            const int found = whom == Whom::RunAs ? VELA::System::RunAsGetUGID(name.c_str(), &uid, &gid)
                                                   : VELAUserGetUGID(name.c_str(), &uid, &gid);
             if (found == 0 && uid != 0) {
                 // Root for good no more: what root's upload stored is
                 // removed by a reaper that keeps root.
-                VelaUploadDirReaper();
+                VELA::Transfer::UploadDirReaper();
             }
         }
         return reset();
     }
     uid_t uid = 0;
     gid_t gid = 0;
-    const int known = whom == Whom::RunAs ? VELARunAsGetUGID(name.c_str(), &uid, &gid)
+    const int known = whom == Whom::RunAs ? VELA::System::RunAsGetUGID(name.c_str(), &uid, &gid)
                                           : VELAUserGetUGID(name.c_str(), &uid, &gid);
     if (known == 0 && geteuid() == uid && getegid() == gid) {
         return true;
@@ -343,7 +343,7 @@ RunAsRootGuard::RunAsRootGuard(const char* file, int line, const char* label)
         ok_ = setresgid(kKeepGid, 0, kKeepGid) == 0 && setresuid(kKeepUid, 0, kKeepUid) == 0;
     }
     if (!ok_) {
-        VelaLogAt(LOG_AUTHPRIV | LOG_ERR, file_, line_, "ERROR: %s(%d, %d)", label_, 0, 0);
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_ERR, file_, line_, "ERROR: %s(%d, %d)", label_, 0, 0);
     }
 }
 
@@ -365,7 +365,7 @@ RunAsRootGuard::~RunAsRootGuard()
         ok = setresuid(kKeepUid, uid_, kKeepUid) == 0;
     }
     if (!ok) {
-        VelaLogAt(LOG_AUTHPRIV | LOG_CRIT, file_, line_, "ERROR: ~%s(%d, %d)", label_, static_cast<int>(uid_),
+        VELA::System::LogAt(LOG_AUTHPRIV | LOG_CRIT, file_, line_, "ERROR: ~%s(%d, %d)", label_, static_cast<int>(uid_),
                   static_cast<int>(gid_));
     }
 }

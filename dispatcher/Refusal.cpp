@@ -28,7 +28,7 @@ void RefuseAt(APIResponse* resp, int code, const char* file, int line, const cha
     va_start(args, fmt);
     vsnprintf(message, sizeof(message), fmt, args);
     va_end(args);
-    VelaLogAt(LOG_ERR, file, line, "%s", message);
+    VELA::System::LogAt(LOG_ERR, file, line, "%s", message);
 }
 
 std::string LogSafe(const std::string& text)

@@ -65,7 +65,7 @@ const Json::Value& JsonMember(const Json::Value& v, const std::string& key)
 
 bool APIName::Check(const std::string& text, APIName& out)
 {
-    if (!IsAPIName(text)) {
+    if (!System::IsAPIName(text)) {
         return false;
     }
     out.text_ = text;

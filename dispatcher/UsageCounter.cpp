@@ -20,7 +20,7 @@
 
 #include "dispatcher/ResolvedCall.h"
 #include "dispatcher/Road.h"
-#include "platform/FileUtil.h"
+#include "platform/system/FileUtil.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
@@ -44,11 +44,11 @@ bool WriteCounters(const std::string& file, const Json::Value& value)
     const std::string text = JsonToString(value) + "\n";
     const size_t slash = file.rfind('/');
     std::string tmp = file.substr(0, slash + 1) + "." + file.substr(slash + 1) + ".XXXXXX";
-    Platform::ScopedFd fd(mkostemp(&tmp[0], O_CLOEXEC));
+    System::ScopedFd fd(mkostemp(&tmp[0], O_CLOEXEC));
     if (fd.Get() < 0) {
         return false;
     }
-    const bool ok = Platform::WriteAll(fd.Get(), text.data(), text.size()) && close(fd.Release()) == 0 &&
+    const bool ok = System::WriteAll(fd.Get(), text.data(), text.size()) && close(fd.Release()) == 0 &&
                     rename(tmp.c_str(), file.c_str()) == 0;
     if (!ok) {
         unlink(tmp.c_str());
@@ -74,7 +74,7 @@ bool CollectEnabled()
     CounterState& state = State();
     std::lock_guard<std::mutex> guard(state.lock);
     if (state.enabled < 0) {
-        const std::string path = VelaPath(kInfoFile);
+        const std::string path = VELA::System::Path(kInfoFile);
         state.enabled = VLIBCFileCheckKeyValue(path.c_str(), "enable_data_collect", "yes", 0) != 0 ? 1 : 0;
     }
     return state.enabled == 1;
@@ -110,7 +110,7 @@ std::string FileStem(const std::string& api)
         from = cut + 1;
     }
     const std::string stem = api.substr(0, cut);
-    if (stem == "." || stem == ".." || !IsCheckedName(stem, kNameDotted, kMaxStem)) {
+    if (stem == "." || stem == ".." || !System::IsCheckedName(stem, System::kNameDotted, kMaxStem)) {
         return "";
     }
     return stem;
@@ -169,7 +169,7 @@ static void CountCall(const std::string& api, int version, const std::string& me
     if (!CollectEnabled()) {
         return;
     }
-    const std::string dir = VelaPath(kCounterDir);
+    const std::string dir = VELA::System::Path(kCounterDir);
     if (!CounterDirReady(dir)) {
         return;
     }

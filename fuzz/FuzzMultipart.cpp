@@ -1,7 +1,7 @@
 // Fuzz target: any bytes as a multipart/form-data upload. An input that
 // starts with "multipart" gives its first line as the Content-Type and the
 // rest as the body; any other input is the body under the boundary "XyZ".
-// The body is read twice, whole (VelaUploadReadAll) and step by step
+// The body is read twice, whole (VELA::Transfer::UploadReadAll) and step by step
 // (fields, then each file). Whatever the bytes: no crash, and a call that
 // fails leaves no file of its own behind; a whole read that succeeds lists
 // every file it stored.
@@ -83,13 +83,13 @@ int BodyFd(const char* body, size_t size)
 
 void ReadWhole(const std::string& type, const char* body, size_t size)
 {
-    VELA_UPLOAD_READER* reader = nullptr;
-    if (VelaUploadReaderOpen(BodyFd(body, size), size, type.c_str(), &reader) != 1) {
+    VELA::Transfer::UploadReader* reader = nullptr;
+    if (VELA::Transfer::UploadReaderOpen(BodyFd(body, size), size, type.c_str(), &reader) != 1) {
         return;
     }
     PVLIBCSZHASH fields = VLIBCSzHashAlloc(8);
     PVLIBCSZHASH files = VLIBCSzHashAlloc(8);
-    const int rc = VelaUploadReadAll(reader, fields, files, WorkDir().c_str(), 0, nullptr);
+    const int rc = VELA::Transfer::UploadReadAll(reader, fields, files, WorkDir().c_str(), 0, nullptr);
     if (rc == 1) {
         Check(CountFiles(false) == VLIBCSzHashCount(files), "a stored file is missing from the table");
         for (int i = 0; i < VLIBCSzHashCount(files); ++i) {
@@ -101,33 +101,33 @@ void ReadWhole(const std::string& type, const char* body, size_t size)
     }
     VLIBCSzHashFree(fields);
     VLIBCSzHashFree(files);
-    VelaUploadReaderFree(reader);
+    VELA::Transfer::UploadReaderFree(reader);
     CountFiles(true);
 }
 
 void ReadInSteps(const std::string& type, const char* body, size_t size)
 {
-    VELA_UPLOAD_READER* reader = nullptr;
-    if (VelaUploadReaderOpen(BodyFd(body, size), size, type.c_str(), &reader) != 1) {
+    VELA::Transfer::UploadReader* reader = nullptr;
+    if (VELA::Transfer::UploadReaderOpen(BodyFd(body, size), size, type.c_str(), &reader) != 1) {
         return;
     }
     char path[4096];
     for (int stored = 0;;) {
-        if (VelaUploadReadFields(reader, nullptr, nullptr) != 1) {
+        if (VELA::Transfer::UploadReadFields(reader, nullptr, nullptr) != 1) {
             Check(CountFiles(false) == stored, "a failed field read changed the directory");
             break;
         }
-        if (VelaUploadPendingField(reader) == nullptr) {
+        if (VELA::Transfer::UploadPendingField(reader) == nullptr) {
             break;
         }
-        if (VelaUploadReadFile(reader, WorkDir().c_str(), path, sizeof(path), nullptr, nullptr) != 1) {
+        if (VELA::Transfer::UploadReadFile(reader, WorkDir().c_str(), path, sizeof(path), nullptr, nullptr) != 1) {
             Check(CountFiles(false) == stored, "a failed file read left its file");
             break;
         }
         ++stored;
         Check(CountFiles(false) == stored, "a stored file is missing");
     }
-    VelaUploadReaderFree(reader);
+    VELA::Transfer::UploadReaderFree(reader);
     CountFiles(true);
 }
 
@@ -135,7 +135,7 @@ void ReadInSteps(const std::string& type, const char* body, size_t size)
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
-    VelaLogSetSink(&Quiet, nullptr);
+    VELA::System::LogSetSink(&Quiet, nullptr);
     const char* bytes = reinterpret_cast<const char*>(data);
     std::string type = "multipart/form-data; boundary=XyZ";
     const char* body = bytes;

@@ -84,7 +84,7 @@ bool APIValidatorPrivate::GetRegex(char const* pattern, regex_t** out)
         return false;
     }
     if (regcomp(compiled, pattern, REG_EXTENDED | REG_NOSUB) != 0) {
-        VelaLog(LOG_ERR, "%s:%d Invalid pattern", "APIValidator", 57);
+        VELA::System::Log(LOG_ERR, "%s:%d Invalid pattern", "APIValidator", 57);
         free(compiled);
         return false;
     }

@@ -54,7 +54,7 @@ long long CheckedInteger(const Json::Value& v, long long min, long long max, lon
         const char* begin = nullptr;
         const char* end = nullptr;
         if (v.getString(&begin, &end) &&
-            ParseNumberText(begin, static_cast<size_t>(end - begin), min, max, value)) {
+            System::ParseNumberText(begin, static_cast<size_t>(end - begin), min, max, value)) {
             return value;
         }
         return def;
@@ -74,7 +74,7 @@ long long ExactInteger(const Json::Value& v, long long min, long long max, long 
     const char* begin = nullptr;
     const char* end = nullptr;
     if (v.isString() && v.getString(&begin, &end) &&
-        ParseDecimal(begin, static_cast<size_t>(end - begin), min, max, value)) {
+        System::ParseDecimal(begin, static_cast<size_t>(end - begin), min, max, value)) {
         return value;
     }
     return def;
@@ -95,7 +95,7 @@ long long ContentLength(const Json::Value& v, long long max)
     if (!v.isString() || !v.getString(&begin, &end)) {
         return -1;
     }
-    return VELA::ContentLength(begin, static_cast<size_t>(end - begin), max);
+    return VELA::System::ContentLength(begin, static_cast<size_t>(end - begin), max);
 }
 
 }  // namespace RequestFacts

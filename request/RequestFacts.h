@@ -27,7 +27,7 @@ long long CheckedInteger(const Json::Value& v, long long min, long long max, lon
 long long ExactInteger(const Json::Value& v, long long min, long long max, long long def);
 // CheckedInteger over the whole range of long long, for stored values.
 long long Integer(const Json::Value& v, long long def);
-// CONTENT_LENGTH of the request's environment (VELA::ContentLength): 0 when
+// CONTENT_LENGTH of the request's environment (VELA::System::ContentLength): 0 when
 // absent or empty, -1 for junk or more than `max`.
 long long ContentLength(const Json::Value& v, long long max);
 

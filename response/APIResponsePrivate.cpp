@@ -177,8 +177,8 @@ bool APIResponsePrivate::AddCookie(const std::string& name, const std::string& v
         return false;
     }
     if (!Cookie::IsValidName(name)) {
-        VelaLog(LOG_ERR, "%s(%d)%s: key[%s] contains invalid character", "APIResponse", 84,
-                "AddCookie", name.c_str());
+        VELA::System::Log(LOG_ERR, "%s(%d)%s: key[%s] contains invalid character", "APIResponse", 84,
+                          "AddCookie", name.c_str());
         return false;
     }
     // The value is URL-encoded ("a\nb" goes out as "a%0Ab"), but path and

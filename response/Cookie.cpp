@@ -21,7 +21,7 @@ static_assert(std::is_integral<time_t>::value && std::is_signed<time_t>::value,
 
 bool IsValidName(const std::string& name)
 {
-    return VELA::IsCheckedName(name, VELA::kNameId, name.size());
+    return VELA::System::IsCheckedName(name, VELA::System::kNameId, name.size());
 }
 
 bool HasLineBreak(const std::string& text)

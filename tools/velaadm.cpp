@@ -83,7 +83,7 @@ int Fail(const std::string& message)
 // (signs, blanks, trailing text, overflow).
 bool ParseSeconds(const char* text, long long max, long long& out)
 {
-    return text != nullptr && VELA::ParseDecimal(text, strlen(text), 1, max, out);
+    return text != nullptr && VELA::System::ParseDecimal(text, strlen(text), 1, max, out);
 }
 
 std::string FormatTime(long long t)
@@ -165,7 +165,7 @@ int SessionCreate(int argc, char** argv)
     }
     const std::string& user = args.positional[0];
     std::string ip;
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     for (const auto& opt : args.options) {
         long long seconds = 0;
         if (opt.first == "--ip") {
@@ -191,7 +191,7 @@ int SessionCreate(int argc, char** argv)
     }
     std::string sid;
     std::string token;
-    if (VelaSessionCreate(user.c_str(), ip.c_str(), &options, sid, token) != 0) {
+    if (VELA::Session::Create(user.c_str(), ip.c_str(), &options, sid, token) != 0) {
         return Fail("cannot create a session for \"" + user + "\"");
     }
     printf("sid=%s\ntoken=%s\n", sid.c_str(), token.c_str());
@@ -203,13 +203,13 @@ int SessionList(int argc, char** argv)
     if (argc != 3) {
         return Usage("session list takes no arguments");
     }
-    std::vector<VelaSessionRecord> sessions;
-    if (VelaSessionList(sessions) != 0) {
+    std::vector<VELA::Session::Record> sessions;
+    if (VELA::Session::List(sessions) != 0) {
         return Fail("cannot list the sessions");
     }
     printf("%-32s  %-16s  %-15s  %-20s  %-20s  %7s  %8s  %s\n", "SID", "USER", "ADDRESS", "CREATED", "LAST USE",
            "IDLE", "LIFETIME", "FLAGS");
-    for (const VelaSessionRecord& s : sessions) {
+    for (const VELA::Session::Record& s : sessions) {
         std::string flags;
         flags += s.skipIP ? "skip-ip " : "";
         flags += s.tokenProtect ? "token " : "";
@@ -226,7 +226,7 @@ int SessionRevoke(int argc, char** argv)
     if (argc != 4) {
         return Usage("session revoke needs exactly one session id");
     }
-    const int rc = VelaSessionRemove(argv[3]);
+    const int rc = VELA::Session::Remove(argv[3]);
     if (rc == -2) {
         return Fail("no session with that id");
     }
@@ -381,7 +381,7 @@ int Run(int argc, char** argv)
 int main(int argc, char** argv)
 {
     openlog("velaadm", LOG_PID, LOG_AUTHPRIV);
-    VelaLogSetSink(LogSink, nullptr);
+    VELA::System::LogSetSink(LogSink, nullptr);
     umask(077);
     int rc = kExitFailure;
     try {

@@ -110,7 +110,7 @@ int main(int argc, char** argv)
         return kExitUsage;
     }
     if (dir.empty()) {
-        dir = VELA::VelaPath("/usr/vela/velaman/webapi");
+        dir = VELA::System::Path("/usr/vela/velaman/webapi");
     }
     if (chdir(dir.c_str()) != 0) {
         fprintf(stderr, "velarun: cannot enter %s: %s\n", dir.c_str(), strerror(errno));

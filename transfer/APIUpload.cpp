@@ -93,7 +93,7 @@ unsigned long long APIUploadPrivate::ContentLength() const
 
 bool APIUploadPrivate::CanUploadtoTmp(std::string& dir, unsigned long long size)
 {
-    const std::string tmp = VelaPath(kUploadTmpDir);
+    const std::string tmp = VELA::System::Path(kUploadTmpDir);
     struct statvfs st;
     if (statvfs(tmp.c_str(), &st) != 0) {
         return false;
@@ -109,12 +109,12 @@ bool APIUploadPrivate::CanUploadtoTmp(std::string& dir, unsigned long long size)
 bool APIUploadPrivate::CanUploadtoRoot(std::string& dir, unsigned long long size)
 {
     struct statvfs st;
-    if (statvfs(VelaRoot().c_str(), &st) != 0) {
+    if (statvfs(VELA::System::Root().c_str(), &st) != 0) {
         return false;
     }
     unsigned long long need = 0;
     if (!__builtin_add_overflow(size, kUploadRootReserve, &need) && need <= FreeBytes(st)) {
-        const std::string varTmp = VelaPath(kUploadVarTmpDir);
+        const std::string varTmp = VELA::System::Path(kUploadVarTmpDir);
         if (VELAFSMkdirP(varTmp.c_str(), 0, 0, static_cast<uid_t>(-1), static_cast<gid_t>(-1), 0700) != 0) {
             VLIBCErrSetEx(VLIBC_ERR_MKDIR, __FILE__, __LINE__);
             return false;
@@ -137,20 +137,20 @@ bool APIUploadPrivate::FindUploadTmpDir(std::string& dir, unsigned long long siz
             // here; the sticky bit keeps each one's entries its own.
             (void)VELAFSMkdirP(dir.c_str(), 0, 0, static_cast<uid_t>(-1), static_cast<gid_t>(-1),
                                kUploadVolumeTmpMode);
-            if (VelaUploadBaseUsable(dir.c_str()) == 1) {
+            if (VELA::Transfer::UploadBaseUsable(dir.c_str()) == 1) {
                 return true;
             }
         }
     }
-    if (CanUploadtoTmp(dir, size) && VelaUploadBaseUsable(dir.c_str()) == 1) {
+    if (CanUploadtoTmp(dir, size) && VELA::Transfer::UploadBaseUsable(dir.c_str()) == 1) {
         return true;
     }
-    return CanUploadtoRoot(dir, size) && VelaUploadBaseUsable(dir.c_str()) == 1;
+    return CanUploadtoRoot(dir, size) && VELA::Transfer::UploadBaseUsable(dir.c_str()) == 1;
 }
 
 int APIUploadPrivate::PrivateDir(unsigned long long size, std::string& dir)
 {
-    dir = VelaUploadDirPath();
+    dir = VELA::Transfer::UploadDirPath();
     if (!dir.empty()) {
         return 1;  // chosen and made by an earlier call of this request
     }
@@ -159,7 +159,7 @@ int APIUploadPrivate::PrivateDir(unsigned long long size, std::string& dir)
         return -1;
     }
     char path[PATH_MAX];
-    const int rc = VelaUploadDirGet(dir.c_str(), path, sizeof(path));
+    const int rc = VELA::Transfer::UploadDirGet(dir.c_str(), path, sizeof(path));
     if (rc < 0) {
         return -1;
     }
@@ -185,7 +185,7 @@ int APIUploadPrivate::GetUploadAll(Json::Value& params, Json::Value* files)
     }
     const int rc = VelaCgiLoadUploadAll(tables.fields, tables.files, dir.c_str(), 0, progress_);
     if (rc != 1 && made == 2) {
-        VelaUploadDirRemove();  // a failed load removed its files; nothing else is in there
+        VELA::Transfer::UploadDirRemove();  // a failed load removed its files; nothing else is in there
     }
     if (files != nullptr) {
         const int count = VLIBCSzHashCount(tables.files);
@@ -258,7 +258,7 @@ int APIUploadPrivate::GetUploadFile(Json::Value& result)
     const int rc = VelaCgiLoadUploadFileToDir(cgi_, dir.c_str(), progress_, fileName_, sizeof(fileName_),
                                               fieldName_, sizeof(fieldName_), fieldValue_, sizeof(fieldValue_));
     if (rc < 1 && made == 2) {
-        VelaUploadDirRemove();
+        VELA::Transfer::UploadDirRemove();
     }
     if (rc < 1) {
         lastError_ = rc;  // the loader's own code, passed through

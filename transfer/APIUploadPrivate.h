@@ -39,7 +39,7 @@ public:
     // The directory for `size` bytes (the margin included already): a data
     // volume's "@tmp" (created 01777; not on "mintbox" systems), else
     // CanUploadtoTmp, else CanUploadtoRoot. Paths are resolved under the
-    // system root. A directory that VelaUploadBaseUsable refuses (another
+    // system root. A directory that VELA::Transfer::UploadBaseUsable refuses (another
     // user's, or writable by others without the sticky bit and not ours to
     // repair) is passed over for the next one.
     bool FindUploadTmpDir(std::string& dir, unsigned long long size);

@@ -52,7 +52,7 @@ void Setting(const Settings& settings, const char* key, long long min, long long
     if (text == nullptr) {
         return;
     }
-    if (!ParseDecimal(*text, min, max, parsed)) {
+    if (!System::ParseDecimal(*text, min, max, parsed)) {
         VELA_LOG_ERR("%s: %s=\"%.32s\" is not a number from %lld to %lld, keeping %lld", kConfPath, key,
                      text->c_str(), min, max, static_cast<long long>(value));
         return;
@@ -107,7 +107,7 @@ bool ReadKey(int fd, unsigned char* key)
 // so no process ever reads a file without its whole key.
 int OpenSlotFile(unsigned char* key)
 {
-    const std::string path = VelaPath(kSlotFile);
+    const std::string path = VELA::System::Path(kSlotFile);
     for (int attempt = 0; attempt < 2; ++attempt) {
         const int fd = open(path.c_str(), O_RDWR | O_NOFOLLOW | O_CLOEXEC);
         if (fd >= 0) {
@@ -123,7 +123,7 @@ int OpenSlotFile(unsigned char* key)
             VELA_LOG_ERR("cannot open %s[%m]", path.c_str());
             return -1;
         }
-        const std::string dir = VelaPath(kSlotDir);
+        const std::string dir = VELA::System::Path(kSlotDir);
         if (VELAFSMkdirP(dir.c_str(), 0, 0, static_cast<uid_t>(-1), static_cast<gid_t>(-1), 0755) != 0) {
             VELA_LOG_ERR("cannot create %s", dir.c_str());
             return -1;
@@ -160,7 +160,7 @@ RequestLimits LoadRequestLimits()
 {
     RequestLimits limits;
     Settings settings;
-    if (ReadKeyValueFile(kConfPath, settings) <= 0) {
+    if (System::ReadKeyValueFile(kConfPath, settings) <= 0) {
         return limits;  // missing (defaults) or unreadable (logged)
     }
     Setting(settings, "request_cpu_seconds", 1, 86400, limits.cpuSeconds);

@@ -265,7 +265,7 @@ bool WebEntry::Run(const Json::Value& /*unused*/)
 {
     // A request the web server ends (the client went away) or a time limit
     // kills still removes what its upload stored.
-    VelaUploadCleanupOnExit();
+    VELA::Transfer::UploadCleanupOnExit();
     bool served = false;
     try {
         if (Initialize(Json::Value()) && SetProcessName(request_, response_)) {
@@ -464,7 +464,7 @@ bool WebEntry::HandleUpload(APIRequest* req, APIResponse* resp)
 // alike).
 void WebEntry::RemoveUploadedFiles()
 {
-    VelaUploadDirRemove();  // logs what it cannot remove
+    VELA::Transfer::UploadDirRemove();  // logs what it cannot remove
     uploadedFiles_ = Json::Value(Json::arrayValue);
 }
 

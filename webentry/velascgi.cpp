@@ -60,7 +60,7 @@ bool LimitRequest()
 {
     const VELA::RequestLimits limits = VELA::LoadRequestLimits();
     const char* text = getenv("CONTENT_LENGTH");
-    long long length = VELA::ContentLength(text, text != nullptr ? strlen(text) : 0, LLONG_MAX);
+    long long length = VELA::System::ContentLength(text, text != nullptr ? strlen(text) : 0, LLONG_MAX);
     if (length < 0) {
         length = 0;  // the front end refuses it later, with the request's own answer
     }
@@ -83,7 +83,7 @@ bool LimitRequest()
 int main(int argc, char** argv)
 {
     try {
-        const std::string dir = VELA::VelaPath("/usr/vela/velaman/webapi");
+        const std::string dir = VELA::System::Path("/usr/vela/velaman/webapi");
         if (chdir(dir.c_str()) != 0) {
             VELA_LOG_ERR("cannot enter the web-API directory %s[%m]", dir.c_str());
             ReplySetupFailed();

@@ -1,8 +1,8 @@
 // Logging for the framework and the platform layer.
 //
 // Every line goes to syslog. Two switches exist beside it:
-//  - a sink installed with VelaLogSetSink() receives each formatted line
-//    instead of syslog (tests use it to read what was logged);
+//  - a sink installed with VELA::System::LogSetSink() receives each
+//    formatted line instead of syslog (tests use it to read what was logged);
 //  - when the environment variable VELA_LOG_STDERR is set (read with
 //    secure_getenv), each line is also written to standard error, for people
 //    running the server by hand.
@@ -10,28 +10,25 @@
 
 #include <syslog.h>
 
-#ifdef __cplusplus
-extern "C" {
-#endif
+namespace VELA {
+namespace System {
 
-typedef void (*VelaLogSinkFn)(int priority, const char* line, void* arg);
+typedef void (*LogSinkFn)(int priority, const char* line, void* arg);
 
 // Formats like printf (glibc's %m included) and delivers the line.
 // `priority` may carry a facility (LOG_AUTHPRIV | LOG_INFO).
-void VelaLog(int priority, const char* fmt, ...) __attribute__((format(printf, 2, 3)));
+void Log(int priority, const char* fmt, ...) __attribute__((format(printf, 2, 3)));
 
 // Installs (or, with a null sink, removes) the process-wide sink.
-void VelaLogSetSink(VelaLogSinkFn sink, void* arg);
+void LogSetSink(LogSinkFn sink, void* arg);
 
 // "%s:%d <message>": the usual line of the framework, where %s is the source
 // file name of `file` without directory and extension ("APIRunner") and %d
 // is `line`.
-void VelaLogAt(int priority, const char* file, int line, const char* fmt, ...)
-    __attribute__((format(printf, 4, 5)));
+void LogAt(int priority, const char* file, int line, const char* fmt, ...) __attribute__((format(printf, 4, 5)));
 
-#ifdef __cplusplus
-}
-#endif
+}  // namespace System
+}  // namespace VELA
 
-#define VELA_LOG(priority, fmt, ...) VelaLogAt((priority), __FILE__, __LINE__, fmt, ##__VA_ARGS__)
+#define VELA_LOG(priority, fmt, ...) ::VELA::System::LogAt((priority), __FILE__, __LINE__, fmt, ##__VA_ARGS__)
 #define VELA_LOG_ERR(fmt, ...) VELA_LOG(LOG_ERR, fmt, ##__VA_ARGS__)

@@ -33,8 +33,8 @@
 // (VLIBCFileLockTimeByFile on ".lock"). Accounts are compared ignoring
 // ASCII case.
 //
-// An attempt counts as a failure from the moment VelaLoginGuardBegin lets
-// it through until VelaLoginGuardSucceeded clears it, so parallel attempts
+// An attempt counts as a failure from the moment VELA::Session::LoginGuardBegin lets
+// it through until VELA::Session::LoginGuardSucceeded clears it, so parallel attempts
 // cannot get more password checks than the limit allows, and an attempt
 // whose process dies half-way still counts.
 //
@@ -42,7 +42,7 @@
 // priority, every block, every attempt refused by a block and an account
 // reaching the limit at notice priority, with the account (non-printable
 // bytes escaped, cut to 64 bytes) and the client address. Times come from
-// the session store's clock (VelaSetClockForTest in vela/session.h).
+// the session store's clock (VELA::Session::SetClockForTest in vela/session.h).
 #pragma once
 
 // Defaults and bounds of the settings.
@@ -57,6 +57,9 @@
 // Longest account and address text the guard takes.
 #define VELA_LOGIN_ACCOUNT_MAX 255
 
+namespace VELA {
+namespace Session {
+
 // The login settings of <root>/etc/vela/webapi.conf (key="value" lines):
 //   login_max_failures     1 .. 1000
 //   login_window_minutes   1 .. 10080
@@ -66,7 +69,7 @@
 //   session_lifetime       seconds, 1 .. VELA_SESSION_LIFETIME_MAX
 // A missing file or key keeps the default; a value that is not a decimal
 // number in range is logged and the default kept.
-struct VelaLoginSettings {
+struct LoginSettings {
     int maxFailures = VELA_LOGIN_MAX_FAILURES_DEFAULT;
     int windowMinutes = VELA_LOGIN_WINDOW_DEFAULT;
     int blockMinutes = VELA_LOGIN_BLOCK_DEFAULT;
@@ -76,9 +79,9 @@ struct VelaLoginSettings {
 };
 
 // Fills `settings` (null is ignored). Never fails.
-void VelaLoginSettingsLoad(VelaLoginSettings* settings);
+void LoginSettingsLoad(LoginSettings* settings);
 
-// Results of VelaLoginGuardBegin.
+// Results of LoginGuardBegin.
 #define VELA_LOGIN_GUARD_ERROR (-1)   // the records could not be read or written
 #define VELA_LOGIN_GUARD_ALLOW 0      // check the password
 #define VELA_LOGIN_GUARD_BLOCKED 1    // refuse without checking it
@@ -93,18 +96,21 @@ void VelaLoginSettingsLoad(VelaLoginSettings* settings);
 // ERROR on invalid arguments or a store that cannot be used (logged):
 // refuse the login then. `settings` null means the defaults; `waitSeconds`
 // may be null.
-int VelaLoginGuardBegin(const VelaLoginSettings* settings, const char* account, const char* clientIP,
-                        int* waitSeconds);
+int LoginGuardBegin(const LoginSettings* settings, const char* account, const char* clientIP,
+                    int* waitSeconds);
 
 // After the password check of an attempt let through by Begin failed: logs
 // the failure (with `reason`, which may be null), starts the block of the
 // address when its counted attempts have reached the limit (logged; they
 // are then forgotten, so the block is the whole penalty), logs an account
 // whose count reaches the limit, and purges expired records.
-void VelaLoginGuardFailed(const VelaLoginSettings* settings, const char* account, const char* clientIP,
-                          const char* reason);
+void LoginGuardFailed(const LoginSettings* settings, const char* account, const char* clientIP,
+                      const char* reason);
 
 // After a successful password check: removes the attempts of this
 // (account, address) pair, and no others, from both records. 0, or -1 when
 // the records could not be updated (logged).
-int VelaLoginGuardSucceeded(const VelaLoginSettings* settings, const char* account, const char* clientIP);
+int LoginGuardSucceeded(const LoginSettings* settings, const char* account, const char* clientIP);
+
+}  // namespace Session
+}  // namespace VELA

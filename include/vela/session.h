@@ -32,9 +32,12 @@
 #define VELA_SESSION_LIFETIME_DEFAULT 86400    // 24 hours after the login
 #define VELA_SESSION_LIFETIME_MAX (366 * 86400)
 
+namespace VELA {
+namespace Session {
+
 // What a new session holds besides its user and client address. Zero-filled
-// (VelaSessionOptions{}) it gives the defaults.
-struct VelaSessionOptions {
+// (Options{}) it gives the defaults.
+struct Options {
     int idleTimeout = 0;        // 0: VELA_SESSION_IDLE_DEFAULT; else 1 .. VELA_SESSION_IDLE_MAX
     int lifetime = 0;           // 0: VELA_SESSION_LIFETIME_DEFAULT; else 1 .. VELA_SESSION_LIFETIME_MAX
     bool skipIP = false;        // do not compare the client address on later requests
@@ -44,8 +47,8 @@ struct VelaSessionOptions {
     std::string lang;           // three lower-case letters ("enu"), or "" for none
 };
 
-// A session as VelaSessionList reports it (the anti-forgery token is left out).
-struct VelaSessionRecord {
+// A session as List reports it (the anti-forgery token is left out).
+struct Record {
     std::string sid;
     std::string user;
     std::string clientIP;  // "" when the session is bound to no address
@@ -67,22 +70,25 @@ struct VelaSessionRecord {
 // may be null for the defaults. Returns 0 and fills `sid` and `token` (the
 // anti-forgery token); -1 on any failure (logged), the outputs then empty.
 // Expired sessions of the store are removed on the way.
-int VelaSessionCreate(const char* user, const char* clientIP, const VelaSessionOptions* options,
-                      std::string& sid, std::string& token);
+int Create(const char* user, const char* clientIP, const Options* options,
+           std::string& sid, std::string& token);
 
 // Removes session `sid`. 0 removed, -2 no such session (or a malformed id),
 // -1 on failure.
-int VelaSessionRemove(const char* sid);
+int Remove(const char* sid);
 
 // Every session of the store, oldest first, expired ones included; files that
 // are not valid sessions are skipped. 0 / -1 (`out` then empty).
-int VelaSessionList(std::vector<VelaSessionRecord>& out);
+int List(std::vector<Record>& out);
 
 // Removes the sessions that expired more than `graceSeconds` ago (so that for
 // a while a late request still learns "timed out" rather than "no session").
 // Returns how many were removed, or -1.
-int VelaSessionPurge(long long graceSeconds);
+int Purge(long long graceSeconds);
 
 // Tests only: replaces time(2) for sessions and access tokens with `now`;
 // null restores time(2).
-void VelaSetClockForTest(long long (*now)(void));
+void SetClockForTest(long long (*now)(void));
+
+}  // namespace Session
+}  // namespace VELA

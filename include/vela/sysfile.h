@@ -2,10 +2,10 @@
 // directories, process creation, data volumes and the last-error record.
 //
 // Paths. A path that starts with "/" is a path of the system and is resolved
-// under the system root (VELA::VelaPath, VELA_ROOT), except when it already
-// lies inside the root (it starts with VelaRoot() + "/"): such a path came
-// from VelaPath or from another platform call (VolumeAvailGet) and is used
-// as it is, so a path is never resolved twice. A relative path is relative
+// under the system root (VELA::System::Path, VELA_ROOT), except when it
+// already lies inside the root (it starts with VELA::System::Root() + "/"):
+// such a path came from VELA::System::Path or from another platform call
+// (VolumeAvailGet) and is used as it is, so a path is never resolved twice. A relative path is relative
 // to the working directory. With the default root "/" every path is used as
 // it is.
 //
@@ -85,10 +85,12 @@ int VLIBCFileCheckKeyValue(const char* path, const char* key, const char* value,
 int VLIBCFileGetKeyValue(const char* path, const char* key, char* buf, size_t size);
 
 namespace VELA {
+namespace System {
 // Every key="value" line of the file at `path` in one read, in file order
 // (a later line of a key follows its earlier ones). 1 when read, 0 when the
 // file is missing (`out` empty), -1 when it is corrupt or unreadable.
 int ReadKeyValueFile(const char* path, std::vector<std::pair<std::string, std::string>>& out);
+}  // namespace System
 }  // namespace VELA
 
 // Sets `key` to `value` in the file at `path`, creating it (mode 0644) when

@@ -45,10 +45,14 @@
 #include "vela/cgi.h"
 #include "vela/vlibc.h"
 
+namespace VELA {
+namespace Transfer {
 // Progress of a read: `done` bytes of the body consumed out of `total`
 // (CONTENT_LENGTH). Called after each piece read from the input (at most
 // once per buffer fill, never per byte), the last time with done == total.
-typedef void (*VelaUploadProgressFn)(unsigned long long done, unsigned long long total);
+typedef void (*UploadProgressFn)(unsigned long long done, unsigned long long total);
+}  // namespace Transfer
+}  // namespace VELA
 
 // ---- Results ------------------------------------------------------------------
 #define VELA_UPLOAD_OK 1
@@ -81,47 +85,53 @@ typedef void (*VelaUploadProgressFn)(unsigned long long done, unsigned long long
 // descriptor. Directories given here are used as they are (not resolved
 // under the system root).
 
-typedef struct _tag_VELA_UPLOAD_READER_ VELA_UPLOAD_READER;
+namespace VELA {
+namespace Transfer {
+
+struct UploadReader;
 
 // A reader of a body of `contentLength` bytes on `fd` (not closed by the
 // reader), `contentType` being the value of the Content-Type header. 1 with
 // `*reader` set; VELA_UPLOAD_ERR_NO_BODY for a length of 0,
 // VELA_UPLOAD_ERR_CONTENT_TYPE, VELA_UPLOAD_ERR_ARGUMENT or
 // VELA_UPLOAD_ERR_MEMORY with `*reader` null. Nothing is read yet.
-int VelaUploadReaderOpen(int fd, unsigned long long contentLength, const char* contentType,
-                         VELA_UPLOAD_READER** reader);
+int UploadReaderOpen(int fd, unsigned long long contentLength, const char* contentType,
+                     UploadReader** reader);
 // Frees the reader (null is ignored). Stored files stay.
-void VelaUploadReaderFree(VELA_UPLOAD_READER* reader);
+void UploadReaderFree(UploadReader* reader);
 
 // Reads form fields up to the next file part (its headers read, its content
 // not) or the end of the body. `fields` (may be null) receives every field
 // read so far by this reader, the earlier calls' included. 1 on success.
-int VelaUploadReadFields(VELA_UPLOAD_READER* reader, PVLIBCSZHASH fields, VelaUploadProgressFn progress);
+int UploadReadFields(UploadReader* reader, PVLIBCSZHASH fields, UploadProgressFn progress);
 
 // The field name and the client's base name of the file part waiting after
-// VelaUploadReadFields; null when none waits.
-const char* VelaUploadPendingField(VELA_UPLOAD_READER* reader);
-const char* VelaUploadPendingFileName(VELA_UPLOAD_READER* reader);
+// UploadReadFields; null when none waits.
+const char* UploadPendingField(UploadReader* reader);
+const char* UploadPendingFileName(UploadReader* reader);
 
 // Stores the waiting file part in `dir`. 1 on success with the stored path in
 // `path` (`pathSize` bytes; VELA_UPLOAD_ERR_ARGUMENT before anything is read
 // when `dir` + "/upload-XXXXXXXXXXXXXXXX" does not fit) and, when
 // `fileTable` is given, "<key>" -> path and "<key>_name" -> client's name
 // set in it; VELA_UPLOAD_ERR_STATE when no file part waits.
-int VelaUploadReadFile(VELA_UPLOAD_READER* reader, const char* dir, char* path, size_t pathSize,
-                       PVLIBCSZHASH fileTable, VelaUploadProgressFn progress);
+int UploadReadFile(UploadReader* reader, const char* dir, char* path, size_t pathSize,
+                   PVLIBCSZHASH fileTable, UploadProgressFn progress);
 
 // Reads the whole rest of the body, storing files in `dir`. On success (1)
 // `fields` and `files` receive every field and file of the body (those of
 // earlier calls on this reader included) as described at the top. On failure
 // the tables are left unchanged and the files this call created are removed.
 // `flags` must be 0.
-int VelaUploadReadAll(VELA_UPLOAD_READER* reader, PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir,
-                      int flags, VelaUploadProgressFn progress);
+int UploadReadAll(UploadReader* reader, PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir,
+                  int flags, UploadProgressFn progress);
 
 // Bytes of the body consumed so far, and CONTENT_LENGTH.
-unsigned long long VelaUploadConsumed(VELA_UPLOAD_READER* reader);
-unsigned long long VelaUploadContentLength(VELA_UPLOAD_READER* reader);
+unsigned long long UploadConsumed(UploadReader* reader);
+unsigned long long UploadContentLength(UploadReader* reader);
+
+}  // namespace Transfer
+}  // namespace VELA
 
 // ---- CGI library ------------------------------------------------------------------
 // One reader per process over standard input, created by the first of these
@@ -139,9 +149,9 @@ unsigned long long VelaUploadContentLength(VELA_UPLOAD_READER* reader);
 // base name of the file; otherwise the three are "". VELA_UPLOAD_ERR_LIMIT
 // when a name does not fit its buffer (the part is left waiting).
 // 1 on success.
-int VelaCgiLoadUploadParams(VELACGI_CTX* ctx, VelaUploadProgressFn progress, unsigned long long* contentLength,
-                            char* fileName, size_t fileNameSize, char* fieldName, size_t fieldNameSize,
-                            char* fieldValue, size_t fieldValueSize);
+int VelaCgiLoadUploadParams(VELACGI_CTX* ctx, VELA::Transfer::UploadProgressFn progress,
+                            unsigned long long* contentLength, char* fileName, size_t fileNameSize, char* fieldName,
+                            size_t fieldNameSize, char* fieldValue, size_t fieldValueSize);
 
 // Stores the waiting file part in `dir`, then reads the fields that follow
 // it up to the next file part, as VelaCgiLoadUploadParams does (buffers and
@@ -149,15 +159,15 @@ int VelaCgiLoadUploadParams(VELACGI_CTX* ctx, VelaUploadProgressFn progress, uns
 // (VelaCgiGetUploadFiles) then holds this file only: "<key>" -> stored path,
 // "<key>_name" -> client's base name. VELA_UPLOAD_ERR_STATE when no file part
 // waits. On failure the stored file is removed. 1 on success.
-int VelaCgiLoadUploadFileToDir(VELACGI_CTX* ctx, const char* dir, VelaUploadProgressFn progress,
+int VelaCgiLoadUploadFileToDir(VELACGI_CTX* ctx, const char* dir, VELA::Transfer::UploadProgressFn progress,
                                char* fileName, size_t fileNameSize, char* fieldName, size_t fieldNameSize,
                                char* fieldValue, size_t fieldValueSize);
 
-// VelaUploadReadAll on the process's reader: the rest of the body, files in
-// `dir`, the whole body's fields and files into the two tables. `flags`
-// must be 0. 1 on success.
+// VELA::Transfer::UploadReadAll on the process's reader: the rest of the
+// body, files in `dir`, the whole body's fields and files into the two
+// tables. `flags` must be 0. 1 on success.
 int VelaCgiLoadUploadAll(PVLIBCSZHASH fields, PVLIBCSZHASH files, const char* dir, int flags,
-                         VelaUploadProgressFn progress = nullptr);
+                         VELA::Transfer::UploadProgressFn progress = nullptr);
 
 // The handle's upload tables (owned by the handle, null before the first
 // load), valid until the next load or VelaCgiFree.

@@ -11,10 +11,10 @@
 //
 // "system" is the dispatcher's run-as name of the superuser (an API's
 // "runAs" attribute, its default), never an account's: only the run-as
-// calls (VELARunAsGetUGID, ResetCredentialsForRunAs) map it to uid 0. Every
-// other call here takes a name as an account, so a login name, a session's
-// or an access token's user "system" is whatever the account of that name
-// is, and no account is ever taken for root by its name.
+// calls (VELA::System::RunAsGetUGID, ResetCredentialsForRunAs) map it to
+// uid 0. Every other call here takes a name as an account, so a login name,
+// a session's or an access token's user "system" is whatever the account of
+// that name is, and no account is ever taken for root by its name.
 //
 // No call throws; every configuration file is read with a size bound.
 #pragma once
@@ -53,11 +53,15 @@ int VELAUserGetUGID(const char* name, uid_t* uid, gid_t* gid);
 
 #define VELA_RUNAS_SUPERUSER "system"
 
+namespace VELA {
+namespace System {
 // 1 when `runAs` is exactly VELA_RUNAS_SUPERUSER, else 0 (null included).
-int VELARunAsIsSuperuser(const char* runAs);
+int RunAsIsSuperuser(const char* runAs);
 // As VELAUserGetUGID, but VELA_RUNAS_SUPERUSER gives 0 and 0 without a
 // lookup.
-int VELARunAsGetUGID(const char* runAs, uid_t* uid, gid_t* gid);
+int RunAsGetUGID(const char* runAs, uid_t* uid, gid_t* gid);
+}  // namespace System
+}  // namespace VELA
 
 // ---- Administrators ----------------------------------------------------------------
 // The administrators group is "administrators" unless /etc/vela/webapi.conf

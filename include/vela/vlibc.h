@@ -8,17 +8,19 @@
 // ---- System root -----------------------------------------------------------
 
 namespace VELA {
+namespace System {
 // The directory under which every absolute path of the system is resolved:
 // "/" by default, or the value of VELA_ROOT read with secure_getenv (so a
 // set-user-id process ignores it). Read once per process; never ends in "/"
 // except when it is "/" itself.
-const std::string& VelaRoot();
-// `absolute` (which starts with "/") resolved under VelaRoot():
-// VelaPath("/etc/velainfo.conf") is "/etc/velainfo.conf" with the default
-// root and "/tmp/r/etc/velainfo.conf" with VELA_ROOT=/tmp/r.
-std::string VelaPath(const std::string& absolute);
+const std::string& Root();
+// `absolute` (which starts with "/") resolved under Root():
+// Path("/etc/velainfo.conf") is "/etc/velainfo.conf" with the default root
+// and "/tmp/r/etc/velainfo.conf" with VELA_ROOT=/tmp/r.
+std::string Path(const std::string& absolute);
 // Forgets the cached root so the next call reads VELA_ROOT again (tests).
-void VelaRootReset();
+void RootReset();
+}  // namespace System
 }  // namespace VELA
 
 // ---- Strings -----------------------------------------------------------------
@@ -28,6 +30,7 @@ void VelaRootReset();
 char* VLIBCStrCaseLower(char* sz);
 
 namespace VELA {
+namespace System {
 // The one parser of decimal numbers that come from outside (parameters,
 // CGI variables, configuration keys). The whole of `text` must be digits,
 // with a leading "-" only when `min` is negative: no blanks, no "+", no
@@ -116,6 +119,7 @@ constexpr size_t kMaxAPIName = 128;
 // kNameDotted characters, not starting with "." and without "..". No "/"
 // and no NUL can therefore reach a path.
 bool IsAPIName(const std::string& api);
+}  // namespace System
 }  // namespace VELA
 
 // ---- String table ------------------------------------------------------------

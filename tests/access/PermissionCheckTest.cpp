@@ -118,17 +118,17 @@ protected:
         file[kApi] = desc;
         ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + kApi + ".lib", file, 0644));
     }
-    std::string Login(const char* user, VelaSessionOptions options = VelaSessionOptions())
+    std::string Login(const char* user, VELA::Session::Options options = VELA::Session::Options())
     {
         std::string sid, token;
-        EXPECT_EQ(0, VelaSessionCreate(user, kClient, &options, sid, token));
+        EXPECT_EQ(0, VELA::Session::Create(user, kClient, &options, sid, token));
         return sid;
     }
     long long LastUse(const std::string& sid)
     {
-        std::vector<VelaSessionRecord> all;
-        EXPECT_EQ(0, VelaSessionList(all));
-        for (const VelaSessionRecord& r : all) {
+        std::vector<VELA::Session::Record> all;
+        EXPECT_EQ(0, VELA::Session::List(all));
+        for (const VELA::Session::Record& r : all) {
             if (r.sid == sid) {
                 return r.lastUse;
             }
@@ -206,7 +206,7 @@ TEST_F(PermissionCheckTest, ASessionIdCutByANulByteNamesNoSession)
 
 TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 600;
     options.app = "VELA.App";
     options.webapi = "full";
@@ -235,7 +235,7 @@ TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlo
 
     // The session goes away: the slot already computed is reused, the other
     // one asks the platform and learns that there is no session.
-    ASSERT_EQ(0, VelaSessionRemove(sid.c_str()));
+    ASSERT_EQ(0, VELA::Session::Remove(sid.c_str()));
     EXPECT_EQ(0, c.check.CheckPermission(false, nullptr));
     EXPECT_EQ(105, c.check.CheckPermission(true, nullptr));
     EXPECT_EQ(J("[-2, 1]"), c.Slots());
@@ -243,7 +243,7 @@ TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlo
 
 TEST_F(PermissionCheckTest, TimeoutAddressAndTokenProtectionRefusals)
 {
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = 60;
     const std::string sid = Login("root", options);
     {
@@ -407,7 +407,7 @@ TEST_F(PermissionCheckTest, WebEntryHooksCheckTheSessionOfItsRequest)
     ASSERT_TRUE(entry.CheckPermission(req, resp));
     EXPECT_EQ("root", req->GetLoginUserName());
     EXPECT_EQ(root_.Path() + "/run/vela/sessions/" + sid, req->GetSessionFilePath());
-    ASSERT_EQ(0, VelaSessionRemove(sid.c_str()));
+    ASSERT_EQ(0, VELA::Session::Remove(sid.c_str()));
     EXPECT_EQ(0, entry.CheckPermission(false));
     EXPECT_EQ(105, entry.CheckPermission(true));
 

@@ -127,7 +127,7 @@ protected:
     {
         const std::string text = InChild([&] {
             std::string log;
-            VelaLogSetSink(Collect, &log);
+            VELA::System::LogSetSink(Collect, &log);
             if (before) {
                 before();
             }
@@ -138,7 +138,7 @@ protected:
                 report["answer"] = runner.GetResponse();
             }
             report["after"] = Ids();
-            VelaLogSetSink(nullptr, nullptr);
+            VELA::System::LogSetSink(nullptr, nullptr);
             report["log"] = log;
             return VELA::JsonToString(report);
         });
@@ -264,7 +264,7 @@ TEST_F(Identity, UploadFieldsCannotChangeTheCheckedMethod)
         setenv("QUERY_STRING", "api=VELA.Pipe.Ids&version=1&method=upload", 1);
         setenv("CONTENT_TYPE", "multipart/form-data; boundary=XyZ", 1);
         setenv("CONTENT_LENGTH", std::to_string(body.size()).c_str(), 1);
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         VELA::WebEntry entry;
         entry.Run(Json::Value());
     });
@@ -305,7 +305,7 @@ TEST_F(Identity, RootGuardAndSetVelaInfo)
     const std::string checks = InChild([&] {
         std::string errors;
         std::string log;
-        VelaLogSetSink(Collect, &log);
+        VELA::System::LogSetSink(Collect, &log);
         // As root the guard changes nothing and logs nothing.
         {
             const Json::Value before = Ids();
@@ -348,7 +348,7 @@ TEST_F(Identity, RootGuardAndSetVelaInfo)
         if (VELA::APIUtils::SetVelaInfo("pipe_test_key", "refused")) {
             errors += "SetVelaInfo succeeded without rights; ";
         }
-        VelaLogSetSink(nullptr, nullptr);
+        VELA::System::LogSetSink(nullptr, nullptr);
         return errors;
     });
     EXPECT_EQ("", checks);

@@ -19,14 +19,14 @@ protected:
 
     void SetUp() override
     {
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         Now() = kStart;
-        VelaSetClockForTest(&FakeNow);
+        VELA::Session::SetClockForTest(&FakeNow);
     }
     void TearDown() override
     {
-        VelaSetClockForTest(nullptr);
-        VELA::VelaRootReset();
+        VELA::Session::SetClockForTest(nullptr);
+        VELA::System::RootReset();
     }
 
     VELA::Test::TempDir root_;

@@ -194,7 +194,7 @@ TEST(RequestPreferenceDir, UnderTheRootOrTmp)
 {
     VELA::Test::TempDir root;
     VELA::Test::ScopedEnv env("VELA_ROOT", root.Path().c_str());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
     APIRequest r(J(R"({"session": {"username": "alice"}})"));
     const std::string dir = r.GetPreferenceDir();
     EXPECT_EQ(0u, dir.find(root.Path() + "/"));
@@ -206,7 +206,7 @@ TEST(RequestPreferenceDir, UnderTheRootOrTmp)
     EXPECT_EQ("/tmp", r.GetGroupPreferenceDir(""));
     EXPECT_EQ("/tmp", APIRequest(J(R"({"session": {"username": "a/b"}})")).GetPreferenceDir());
     EXPECT_EQ("/tmp", APIRequest().GetPreferenceDir());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
 }
 
 TEST(RequestToken, AccessTokenComesFromTheProcessEnvironment)
@@ -370,7 +370,7 @@ TEST(RequestURL, ForwardedSchemeOnlyFromATrustedProxy)
 {
     VELA::Test::TempDir root;
     VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
     const auto proto = [](const char* remote) {
         Json::Value env = J(R"({"HTTPS": "off", "HTTP_X_FORWARDED_PROTO": "HTTPS"})");
         env["REMOTE_ADDR"] = remote;
@@ -384,7 +384,7 @@ TEST(RequestURL, ForwardedSchemeOnlyFromATrustedProxy)
     EXPECT_EQ("http", proto("192.0.2.11"));
     EXPECT_EQ("http", proto("127.0.0.1"));
     EXPECT_EQ("http", WithEnv(J(R"({"HTTP_X_FORWARDED_PROTO": "https"})")).GetURLProto("x"));  // no peer
-    VELA::VelaRootReset();
+    VELA::System::RootReset();
 }
 
 TEST(RequestURL, HostAndPort)

@@ -13,9 +13,9 @@
 namespace VELA {
 namespace Test {
 
-LogCapture::LogCapture() { VelaLogSetSink(&LogCapture::Sink, this); }
+LogCapture::LogCapture() { VELA::System::LogSetSink(&LogCapture::Sink, this); }
 
-LogCapture::~LogCapture() { VelaLogSetSink(nullptr, nullptr); }
+LogCapture::~LogCapture() { VELA::System::LogSetSink(nullptr, nullptr); }
 
 void LogCapture::Sink(int priority, const char* line, void* arg)
 {

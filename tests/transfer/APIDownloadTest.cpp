@@ -27,14 +27,14 @@ class Download : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         VELA::HTTP::FileOutputerHelper::SetFastOutputEnabled(true);
         mkdir((root_.Path() + "/etc").c_str(), 0755);
         std::ofstream(root_.Path() + "/etc/mime.types") << "text/plain txt\ntext/csv csv\n";
         file_ = root_.Path() + "/notes.txt";
         std::ofstream(file_) << "hello";
     }
-    void TearDown() override { VELA::VelaRootReset(); }
+    void TearDown() override { VELA::System::RootReset(); }
 
     // What `fn` writes to standard output; `ok` receives its result.
     std::string Capture(const std::function<bool()>& fn, bool& ok)

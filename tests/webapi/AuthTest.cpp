@@ -149,9 +149,9 @@ TEST_F(Auth, LoginOpensASessionAndSetsTheCookie)
     EXPECT_EQ(user_, first.body["data"]["account"].asString());
     {
         VELA::Test::ScopedEnv env("VELA_ROOT", root_.Path().c_str());
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         EXPECT_EQ(VLIBGroupIsAdminGroupMem(user_.c_str(), 0) == 1, first.body["data"]["isAdmin"].asBool());
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
     }
     EXPECT_EQ(std::vector<std::string>{"id=" + sid + "; path=/; httponly; SameSite=Strict"}, first.cookies);
     Json::Value session;

@@ -53,7 +53,7 @@ protected:
     Json::Value InitializeWithBody(const std::string& body, bool upload = false)
     {
         return J(RunChild(body, [upload] {
-            VELA::VelaRootReset();
+            VELA::System::RootReset();
             Json::Value r;
             {
                 VELA::WebEntry entry;

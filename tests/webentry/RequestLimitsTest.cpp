@@ -21,14 +21,14 @@ protected:
     void SetUp() override
     {
         env_.reset(new VELA::Test::ScopedEnv("VELA_ROOT", dir_.Path().c_str()));
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
         mkdir((dir_.Path() + "/etc").c_str(), 0755);
         mkdir((dir_.Path() + "/etc/vela").c_str(), 0755);
     }
     void TearDown() override
     {
         env_.reset();
-        VELA::VelaRootReset();
+        VELA::System::RootReset();
     }
     void Conf(const std::string& text) { std::ofstream(dir_.Path() + "/etc/vela/webapi.conf") << text; }
 

@@ -186,13 +186,13 @@ bool ReadCredentials(const APIRequest* req, APIResponse* resp, const std::string
 VelaAuth::PamResult CheckPassword(const Credentials& creds, const std::string& clientIP, std::string& user,
                                   std::string& reason)
 {
-    if (VELARunAsIsSuperuser(creds.account.c_str())) {
+    if (VELA::System::RunAsIsSuperuser(creds.account.c_str())) {
         reason = kReservedName;
         return VelaAuth::PamResult::Denied;
     }
     VelaAuth::PamResult checked =
         VelaAuth::CheckPassword(creds.account, creds.password, creds.passwordLen, clientIP, user, reason);
-    if (checked != VelaAuth::PamResult::Error && VELARunAsIsSuperuser(user.c_str())) {
+    if (checked != VelaAuth::PamResult::Error && VELA::System::RunAsIsSuperuser(user.c_str())) {
         checked = VelaAuth::PamResult::Denied;
         reason = kReservedName;
     }
@@ -201,11 +201,11 @@ VelaAuth::PamResult CheckPassword(const Credentials& creds, const std::string& c
 
 // The password check behind the brute-force guard. True when the login may
 // go on as `user`; otherwise the error is set.
-bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VelaLoginSettings& settings,
+bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VELA::Session::LoginSettings& settings,
                   APIResponse* resp, std::string& user)
 {
     int wait = 0;
-    const int verdict = VelaLoginGuardBegin(&settings, creds.account.c_str(), clientIP.c_str(), &wait);
+    const int verdict = VELA::Session::LoginGuardBegin(&settings, creds.account.c_str(), clientIP.c_str(), &wait);
     if (verdict == VELA_LOGIN_GUARD_BLOCKED) {
         Json::Value details(Json::objectValue);
         details["waitSeconds"] = wait;
@@ -219,7 +219,7 @@ bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VelaLog
     std::string reason;
     const VelaAuth::PamResult checked = CheckPassword(creds, clientIP, user, reason);
     if (checked == VelaAuth::PamResult::Denied) {
-        VelaLoginGuardFailed(&settings, creds.account.c_str(), clientIP.c_str(), reason.c_str());
+        VELA::Session::LoginGuardFailed(&settings, creds.account.c_str(), clientIP.c_str(), reason.c_str());
         resp->SetError(kErrWrongPassword);
         return false;
     }
@@ -227,7 +227,7 @@ bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VelaLog
         resp->SetError(kErrServer);
         return false;
     }
-    VelaLoginGuardSucceeded(&settings, creds.account.c_str(), clientIP.c_str());
+    VELA::Session::LoginGuardSucceeded(&settings, creds.account.c_str(), clientIP.c_str());
     if (checked == VelaAuth::PamResult::Expired) {
         VELA_LOG(LOG_AUTHPRIV | LOG_NOTICE, "login of \"%s\" refused: the password has expired", user.c_str());
         resp->SetError(kErrPasswordExpired);
@@ -239,13 +239,13 @@ bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VelaLog
 // Replaces the caller's session with a new one of `user` and sets its
 // cookie; answers the session's facts.
 void OpenSession(APIRequest* req, APIResponse* resp, const std::string& user, const std::string& clientIP,
-                 const VelaLoginSettings& settings)
+                 const VELA::Session::LoginSettings& settings)
 {
     const std::string oldSid = req->GetSessionID();
     if (IsSessionId(oldSid)) {
-        VelaSessionRemove(oldSid.c_str());
+        VELA::Session::Remove(oldSid.c_str());
     }
-    VelaSessionOptions options;
+    VELA::Session::Options options;
     options.idleTimeout = settings.idleTimeout;
     options.lifetime = settings.lifetime;
     options.tokenProtect = true;
@@ -255,7 +255,7 @@ void OpenSession(APIRequest* req, APIResponse* resp, const std::string& user, co
     }
     std::string sid;
     std::string token;
-    if (VelaSessionCreate(user.c_str(), clientIP.empty() ? nullptr : clientIP.c_str(), &options, sid, token) != 0) {
+    if (VELA::Session::Create(user.c_str(), clientIP.empty() ? nullptr : clientIP.c_str(), &options, sid, token) != 0) {
         resp->SetError(kErrServer);
         return;
     }
@@ -263,7 +263,7 @@ void OpenSession(APIRequest* req, APIResponse* resp, const std::string& user, co
     // along with requests of other sites, out of reach of scripts, and
     // marked Secure when the login came over HTTPS.
     if (!resp->AddCookie(kCookie, sid, "/", 0, "", OverHttps(req), true, "Strict")) {
-        VelaSessionRemove(sid.c_str());
+        VELA::Session::Remove(sid.c_str());
         resp->SetError(kErrServer);
         return;
     }
@@ -282,8 +282,8 @@ void Login(APIRequest* req, APIResponse* resp)
     if (!ReadCredentials(req, resp, clientIP, creds)) {
         return;
     }
-    VelaLoginSettings settings;
-    VelaLoginSettingsLoad(&settings);
+    VELA::Session::LoginSettings settings;
+    VELA::Session::LoginSettingsLoad(&settings);
     std::string user;
     if (GuardedCheck(creds, clientIP, settings, resp, user)) {
         // A new login ends the session the caller came with.
@@ -294,7 +294,7 @@ void Login(APIRequest* req, APIResponse* resp)
 void Logout(APIRequest* req, APIResponse* resp)
 {
     const std::string sid = req->GetSessionID();
-    if (IsSessionId(sid) && VelaSessionRemove(sid.c_str()) == -1) {
+    if (IsSessionId(sid) && VELA::Session::Remove(sid.c_str()) == -1) {
         VELA_LOG_ERR("logout: the session could not be removed");
         resp->SetError(kErrServer);
         return;

@@ -74,7 +74,7 @@ PamResult CheckPassword(const std::string& account, const char* password, size_t
 {
     Secret secret{password, passwordLen};
     const struct pam_conv conv = {Converse, &secret};
-    const std::string confdir = VELA::VelaPath("/etc/pam.d");
+    const std::string confdir = VELA::System::Path("/etc/pam.d");
     pam_handle_t* pamh = nullptr;
     int rc = pam_start_confdir(kService, account.c_str(), &conv, confdir.c_str(), &pamh);
     if (rc != PAM_SUCCESS) {

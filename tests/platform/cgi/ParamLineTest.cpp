@@ -1,0 +1,107 @@
+// VelaCgiDetectAndDecryptParamLine: plain lines pass unchanged, malformed
+// ones are refused, a line encrypted as a whole is decrypted.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <string>
+
+#include "platform/StateRootTest.h"
+#include "support/LinearTime.h"
+#include "support/TestSupport.h"
+#include "vela/cgi.h"
+#include "vela/webapiutil.h"
+
+using VELA::Test::LogCapture;
+using VELA::Test::ReadText;
+
+TEST(ParamLine, PlainLinesUnchanged)
+{
+    for (std::string line : {"", "a=1&b=%41%4a+c", "&&==&x", "n=\xc3\xa9t\xc3\xa9", "k=%00",
+                             "__cIpHeRtExT", "x=1&__cIpHeRtExT=QUJD"}) {
+        const std::string before = line;
+        EXPECT_TRUE(VelaCgiDetectAndDecryptParamLine(line)) << before;
+        EXPECT_EQ(before, line);
+    }
+    std::string longest(VELACGI_MAX_PARAM_LINE, 'a');
+    EXPECT_TRUE(VelaCgiDetectAndDecryptParamLine(longest));
+}
+
+TEST(ParamLine, MalformedLinesRefused)
+{
+    const struct {
+        std::string line;
+        const char* logged;
+    } cases[] = {
+        {"a=%", "percent-encoding at offset 2"},
+        {"a=%4", "percent-encoding"},
+        {"a=%4g&b=1", "percent-encoding"},
+        {"a=%g4", "percent-encoding"},
+        {"a=1\n", "control byte 0x0a at offset 3"},
+        {std::string("a\0b", 3), "control byte 0x00"},
+        {"a=\x7f", "control byte 0x7f"},
+        {std::string(VELACGI_MAX_PARAM_LINE + 1, 'a'), "more than"},
+        {"__cIpHeRtExT=not-base64", "does not decrypt"},
+    };
+    for (const auto& c : cases) {
+        LogCapture log;
+        std::string line = c.line;
+        EXPECT_FALSE(VelaCgiDetectAndDecryptParamLine(line)) << c.logged;
+        EXPECT_EQ(c.line, line);
+        EXPECT_TRUE(log.Contains(c.logged)) << c.logged;
+    }
+}
+
+// The line is checked before anything splits it, in time linear in its
+// length (support/LinearTime.h).
+TEST(ParamLine, CheckTakesLinearTime)
+{
+    const VELA::Test::LinearParser line = [](const std::string& text) {
+        std::string copy = text;
+        VelaCgiDetectAndDecryptParamLine(copy);
+    };
+    for (const char* piece : {"&", "%41&", "__cIpHeRtExT=&"}) {
+        VELA::Test::ExpectLinear("VelaCgiDetectAndDecryptParamLine", line, piece);
+    }
+}
+
+class ParamLineCipher : public StateRootTest {
+protected:
+    // base64 of `plain` encrypted to the server key by the openssl tool.
+    std::string Encrypt(const std::string& plain)
+    {
+        const std::string dir = root_.Path();
+        std::string pem;
+        EXPECT_EQ(0, VelaCgiPublicKeyPEM(pem));
+        FILE* f = fopen((dir + "/pub.pem").c_str(), "w");
+        fputs(pem.c_str(), f);
+        fclose(f);
+        f = fopen((dir + "/plain").c_str(), "w");
+        fwrite(plain.data(), 1, plain.size(), f);
+        fclose(f);
+        const std::string cmd = "openssl pkeyutl -encrypt -pubin -inkey " + dir + "/pub.pem -in " + dir +
+                                "/plain -pkeyopt rsa_padding_mode:oaep -pkeyopt rsa_oaep_md:sha256 "
+                                "-pkeyopt rsa_mgf1_md:sha256 | base64 -w0 > " + dir + "/ct";
+        EXPECT_EQ(0, system(cmd.c_str()));
+        return ReadText(dir + "/ct");
+    }
+};
+
+TEST_F(ParamLineCipher, WholeLineDecryptedAndChecked)
+{
+    const std::string plain = "api=VELA.Sample&name=a%20b";
+    const std::string b64 = Encrypt(plain);
+    ASSERT_FALSE(b64.empty());
+
+    for (const std::string& value : {b64, VELA::WebAPIUtil::URLEncode(b64)}) {
+        std::string line = "__cIpHeRtExT=" + value;
+        EXPECT_TRUE(VelaCgiDetectAndDecryptParamLine(line));
+        EXPECT_EQ(plain, line);
+    }
+
+    std::string broken = "__cIpHeRtExT=" + Encrypt("name=%zz");
+    const std::string before = broken;
+    LogCapture log;
+    EXPECT_FALSE(VelaCgiDetectAndDecryptParamLine(broken));
+    EXPECT_EQ(before, broken);
+    EXPECT_TRUE(log.Contains("decrypted parameter line refused"));
+}

@@ -1,0 +1,740 @@
+// Login sessions against real files under a temporary VELA_ROOT: every
+// verdict of VelaCgiIsAuthorizedEx, hostile ids, corrupt files, clock steps,
+// concurrent processes, and the calls that read the same session.
+#include <gtest/gtest.h>
+
+#include "platform/StateRootTest.h"
+
+#include <cerrno>
+#include <cstring>
+#include <dirent.h>
+#include <fstream>
+#include <map>
+#include <pwd.h>
+#include <sstream>
+#include <string>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <vector>
+
+#include "support/TestSupport.h"
+#include "vela/cgi.h"
+#include "vela/session.h"
+#include "vela/vlibc.h"
+#include "vela/webapiutil.h"
+
+namespace {
+
+using VELA::Test::LogCapture;
+using VELA::Test::ReadText;
+using VELA::Test::ScopedEnv;
+using VELA::Test::TempDir;
+
+
+const char kClient[] = "192.0.2.7";
+
+// Every path under `dir` with its type, size and modification time, so a test
+// can tell that a call touched nothing.
+void Snapshot(const std::string& dir, std::map<std::string, std::string>& out)
+{
+    DIR* d = opendir(dir.c_str());
+    if (d == nullptr) {
+        return;
+    }
+    while (struct dirent* ent = readdir(d)) {
+        const std::string name = ent->d_name;
+        if (name == "." || name == "..") {
+            continue;
+        }
+        const std::string path = dir + "/" + name;
+        struct stat st;
+        if (lstat(path.c_str(), &st) != 0) {
+            continue;
+        }
+        std::ostringstream facts;
+        facts << std::oct << st.st_mode << std::dec << " " << st.st_size << " " << st.st_mtim.tv_sec << "."
+              << st.st_mtim.tv_nsec;
+        out[path] = facts.str();
+        if (S_ISDIR(st.st_mode)) {
+            Snapshot(path, out);
+        }
+    }
+    closedir(d);
+}
+
+struct Handle {
+    Handle() { EXPECT_EQ(0, VelaCgiInit("test", &ctx)); }
+    ~Handle() { VelaCgiFree(ctx); }
+    VELACGI_CTX* ctx = nullptr;
+};
+
+class SessionTest : public StateRootTest {
+protected:
+    std::string Dir() const { return root_.Path() + "/run/vela/sessions"; }
+    std::string File(const std::string& sid) const { return Dir() + "/" + sid; }
+
+    std::string Create(const VELA::Session::Options& options = VELA::Session::Options(), const char* user = "root",
+                       const char* ip = kClient, std::string* token = nullptr)
+    {
+        std::string sid;
+        std::string tok;
+        EXPECT_EQ(0, VELA::Session::Create(user, ip, &options, sid, tok));
+        EXPECT_EQ(32u, sid.size());
+        EXPECT_EQ(32u, tok.size());
+        if (token != nullptr) {
+            *token = tok;
+        }
+        return sid;
+    }
+
+    int Check(const std::string& sid, int flags = 0, VELACGI_CTX* ctx = nullptr)
+    {
+        char user[493];
+        return VelaCgiIsAuthorizedEx(ctx, sid.c_str(), user, sizeof(user), nullptr, flags);
+    }
+
+    Json::Value Read(const std::string& sid)
+    {
+        Json::Value doc;
+        EXPECT_TRUE(VELA::WebAPIUtil::ReadJsonFile(File(sid), doc)) << sid;
+        return doc;
+    }
+
+    void Write(const std::string& sid, const Json::Value& doc)
+    {
+        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(File(sid), doc, 0600));
+    }
+
+    void Edit(const std::string& sid, const char* key, const Json::Value& value)
+    {
+        Json::Value doc = Read(sid);
+        doc[key] = value;
+        Write(sid, doc);
+    }
+
+    ScopedEnv remote_{"REMOTE_ADDR", kClient};
+    ScopedEnv forwarded_{"HTTP_X_FORWARDED_FOR", nullptr};
+    ScopedEnv header_{"HTTP_X_VELA_TOKEN", nullptr};
+    ScopedEnv query_{"QUERY_STRING", nullptr};
+    ScopedEnv lang_{"HTTP_ACCEPT_LANGUAGE", nullptr};
+    ScopedEnv cookie_{"HTTP_COOKIE", nullptr};
+    LogCapture log_;
+};
+
+TEST_F(SessionTest, CreateRefusesBadInput)
+{
+    std::string sid = "stale";
+    std::string token = "stale";
+    EXPECT_EQ(-1, VELA::Session::Create("vela-no-such-user", kClient, nullptr, sid, token));
+    EXPECT_TRUE(sid.empty());
+    EXPECT_TRUE(token.empty());
+    EXPECT_TRUE(log_.Contains("no user \"vela-no-such-user\""));
+    EXPECT_EQ(-1, VELA::Session::Create(nullptr, kClient, nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("", kClient, nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("../root", kClient, nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("root", "999.1.1.1", nullptr, sid, token));
+    EXPECT_EQ(-1, VELA::Session::Create("root", "192.0.2.7\n", nullptr, sid, token));
+    VELA::Session::Options options;
+    options.lang = "EN";
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    options = VELA::Session::Options();
+    options.idleTimeout = VELA_SESSION_IDLE_MAX + 1;
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    options = VELA::Session::Options();
+    options.lifetime = -5;
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    options = VELA::Session::Options();
+    options.app = "a\nb";
+    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    std::vector<VELA::Session::Record> list;
+    ASSERT_EQ(0, VELA::Session::List(list));
+    EXPECT_TRUE(list.empty());
+}
+
+TEST_F(SessionTest, CreateAndCheckValidSession)
+{
+    VELA::Session::Options options;
+    options.idleTimeout = 600;
+    options.app = "VELA.Demo";
+    options.webapi = "demo";
+    options.lang = "ger";
+    const std::string sid = Create(options);
+    for (char c : sid) {
+        EXPECT_TRUE(isalnum(static_cast<unsigned char>(c)) || c == '-' || c == '_') << sid;
+    }
+    struct stat st;
+    ASSERT_EQ(0, stat(Dir().c_str(), &st));
+    EXPECT_EQ(0700u, st.st_mode & 0777);
+    ASSERT_EQ(0, stat(File(sid).c_str(), &st));
+    EXPECT_EQ(0600u, st.st_mode & 0777);
+
+    const Json::Value doc = Read(sid);
+    EXPECT_EQ("root", doc["user"].asString());
+    EXPECT_EQ(sid, doc["id"].asString());
+    EXPECT_EQ(kStart, doc["created"].asInt64());
+    EXPECT_EQ(kStart, doc["lastUse"].asInt64());
+    EXPECT_EQ(600, doc["idleTimeout"].asInt());
+    EXPECT_EQ(VELA_SESSION_LIFETIME_DEFAULT, doc["lifetime"].asInt());
+    EXPECT_EQ(kClient, doc["clientIP"].asString());
+    EXPECT_FALSE(doc["skipIP"].asBool());
+    EXPECT_EQ("ger", doc["lang"].asString());
+    EXPECT_EQ(32u, doc["token"].asString().size());
+
+    EXPECT_NE(sid, Create());
+
+    Handle h;
+    EXPECT_STREQ("fallback", VelaCgiGetOption(h.ctx, VELACGI_OPT_TIMEOUT, "fallback"));
+    EXPECT_EQ(nullptr, VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));
+    EXPECT_STREQ("", VelaCgiGetSessionFile(h.ctx));
+
+    char user[493];
+    VELACGI_SESSION_INFO info;
+    ASSERT_EQ(AUTH_RESULT_AUTHORIZED, VelaCgiIsAuthorizedEx(h.ctx, sid.c_str(), user, sizeof(user), &info, 0));
+    EXPECT_STREQ("root", user);
+    EXPECT_EQ(File(sid), VelaCgiGetSessionFile(h.ctx));
+    EXPECT_EQ(600, VelaCgiGetTimeout(h.ctx));
+    EXPECT_EQ(0, VelaCgiGetSkipCheckIP(h.ctx));
+    EXPECT_STREQ("600", VelaCgiGetOption(h.ctx, VELACGI_OPT_TIMEOUT, "0"));
+    EXPECT_STREQ("0", VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));
+    EXPECT_STREQ("VELA.Demo", VelaCgiGetOption(h.ctx, VELACGI_OPT_APP, ""));
+    EXPECT_STREQ("demo", VelaCgiGetOption(h.ctx, VELACGI_OPT_WEBAPI, ""));
+    EXPECT_STREQ("x", VelaCgiGetOption(h.ctx, 99, "x"));
+    char lang[4];
+    ASSERT_EQ(0, VelaCgiGetLang(h.ctx, lang, sizeof(lang)));
+    EXPECT_STREQ("ger", lang);
+    EXPECT_EQ(kStart, info.created);
+    EXPECT_EQ(600, info.idleTimeout);
+    EXPECT_STREQ(kClient, info.clientIP);
+    EXPECT_STREQ("ger", info.lang);
+
+    // A refusal on the same handle clears what the valid check filled.
+    ASSERT_EQ(AUTH_RESULT_NO_SESSION,
+              VelaCgiIsAuthorizedEx(h.ctx, "AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA", user, sizeof(user), &info, 0));
+    EXPECT_STREQ("", user);
+    EXPECT_STREQ("", VelaCgiGetSessionFile(h.ctx));
+    EXPECT_EQ(0, VelaCgiGetTimeout(h.ctx));
+    EXPECT_STREQ("0", VelaCgiGetOption(h.ctx, VELACGI_OPT_TIMEOUT, "0"));
+    EXPECT_EQ(0, info.created);
+
+    // The user name must fit the caller's buffer.
+    char small[4];
+    EXPECT_EQ(AUTH_RESULT_REJECTED, VelaCgiIsAuthorizedEx(h.ctx, sid.c_str(), small, sizeof(small), nullptr, 0));
+    EXPECT_STREQ("", small);
+}
+
+TEST_F(SessionTest, IdleTimeoutAndLifetime)
+{
+    VELA::Session::Options options;
+    options.idleTimeout = 100;
+    options.lifetime = 250;
+    const std::string sid = Create(options);
+
+    Now() += 100;  // exactly the idle timeout: still valid, and refreshed
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    EXPECT_EQ(Now(), Read(sid)["lastUse"].asInt64());
+    Now() += 100;
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    Now() += 51;  // 251 seconds after the login: the lifetime has passed
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
+
+    const std::string idle = Create(options);
+    Now() += 101;
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(idle));
+    EXPECT_EQ(Now() - 101, Read(idle)["lastUse"].asInt64());  // a timed-out check refreshes nothing
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(idle));
+
+    // Times far in the past.
+    const std::string unused = Create();
+    Edit(unused, "lastUse", Json::Int64(0));
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(unused));
+    const std::string old = Create();
+    Edit(old, "created", Json::Int64(0));
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(old));
+}
+
+TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
+{
+    VELA::Session::Options options;
+    options.idleTimeout = 100;
+    const std::string polled = Create(options);
+    const std::string used = Create(options);
+
+    for (int i = 0; i < 3; ++i) {
+        Now() += 60;
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(used));
+        if (i == 0) {
+            EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(polled, VELACGI_AUTH_NO_REFRESH));
+            EXPECT_EQ(kStart, Read(polled)["lastUse"].asInt64());
+        } else {
+            EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(polled, VELACGI_AUTH_NO_REFRESH));
+        }
+    }
+    EXPECT_EQ(Now(), Read(used)["lastUse"].asInt64());
+}
+
+TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
+{
+    VELA::Session::Options options;
+    options.idleTimeout = 100;
+    const std::string sid = Create(options);
+    Edit(sid, "lastUse", Json::Int64(kStart + 1000000));  // the clock went back
+
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
+    Now() += 101;
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
+
+    // A check without refresh still pulls the future back to now.
+    const std::string polled = Create(options);
+    Edit(polled, "lastUse", Json::Int64(Now() + 1000000));
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(polled, VELACGI_AUTH_NO_REFRESH));
+    EXPECT_EQ(Now(), Read(polled)["lastUse"].asInt64());
+    Now() += 101;
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(polled, VELACGI_AUTH_NO_REFRESH));
+}
+
+TEST_F(SessionTest, CreationInTheFutureStartsTheLifetimeNow)
+{
+    VELA::Session::Options options;
+    options.idleTimeout = 100;
+    options.lifetime = 200;
+    const std::string sid = Create(options);
+    Edit(sid, "created", Json::Int64(kStart + 1000000));
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    EXPECT_EQ(kStart, Read(sid)["created"].asInt64());
+    for (int i = 0; i < 2; ++i) {
+        Now() += 90;
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    }
+    Now() += 90;
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
+}
+
+TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
+{
+    const std::string absent = "AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA";
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(absent));  // no directory yet
+    const std::string sid = Create();
+    // Files a path traversal could reach, inside and outside the state tree.
+    std::ofstream(root_.Path() + "/x") << "outside";
+    std::ofstream(root_.Path() + "/run/vela/x") << "outside";
+    std::map<std::string, std::string> before;
+    Snapshot(root_.Path(), before);
+
+    char nul[33];
+    memcpy(nul, sid.c_str(), 33);
+    nul[10] = '\0';
+    std::string binary(32, '\xff');
+    std::string slashes = "../../../../../../../../../../../x";
+    slashes.resize(32, 'a');
+    const std::vector<std::string> hostile = {
+        absent, "", ".", "..", "../x", "../../x", "/etc/passwd", ".lock", std::string(10000, 'A'), sid + "A",
+        sid.substr(0, 31), binary, slashes, sid.substr(0, 31) + "/", sid.substr(0, 31) + ".",
+        std::string(31, 'A') + "=", "A%2e%2eAAAAAAAAAAAAAAAAAAAAAAAAAA", std::string(32, ' '),
+    };
+    for (const std::string& id : hostile) {
+        EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(id)) << id;
+        EXPECT_EQ(-2, VELA::Session::Remove(id.c_str())) << id;
+        EXPECT_EQ(-1, VelaCgiUIDGet(id.c_str(), "root")) << id;
+    }
+    char user[493];
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, VelaCgiIsAuthorizedEx(nullptr, nul, user, sizeof(user), nullptr, 0));
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, VelaCgiIsAuthorizedEx(nullptr, nullptr, user, sizeof(user), nullptr, 0));
+    EXPECT_EQ(-2, VELA::Session::Remove(nullptr));
+    EXPECT_TRUE(log_.Contains("malformed session id"));
+
+    std::map<std::string, std::string> after;
+    Snapshot(root_.Path(), after);
+    EXPECT_EQ(before, after);
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid, VELACGI_AUTH_NO_REFRESH));
+}
+
+TEST_F(SessionTest, CorruptFilesAreNoSessionAndStayAsTheyAre)
+{
+    const std::string sid = Create();
+    const std::string good = ReadText(File(sid));
+    ASSERT_GT(good.size(), 100u);
+    const Json::Value doc = Read(sid);
+
+    std::vector<std::string> bad;
+    for (size_t len = 0; len < good.size() - 1; len += 5) {
+        bad.push_back(good.substr(0, len));  // truncated
+    }
+    bad.push_back("garbage");
+    bad.push_back("[]");
+    bad.push_back("null");
+    bad.push_back(good + "trailing");
+    bad.push_back(std::string(20000, ' ') + good);  // larger than a session file may be
+    auto mutate = [&](const char* key, const Json::Value& value) {
+        Json::Value changed = doc;
+        if (value.isNull()) {
+            changed.removeMember(key);
+        } else {
+            changed[key] = value;
+        }
+        Json::StreamWriterBuilder builder;
+        bad.push_back(Json::writeString(builder, changed));
+    };
+    for (const char* key : {"version", "id", "user", "created", "lastUse", "idleTimeout", "lifetime", "clientIP",
+                            "skipIP", "app", "webapi", "lang", "tokenProtect", "token"}) {
+        mutate(key, Json::Value());  // missing
+    }
+    mutate("version", 2);
+    mutate("id", "BBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBB");
+    mutate("user", 5);
+    mutate("user", "");
+    mutate("user", std::string("ro\0ot", 5));
+    mutate("created", "1700000000");
+    mutate("created", -1);
+    mutate("lastUse", 1.5);
+    mutate("idleTimeout", 0);
+    mutate("idleTimeout", Json::Int64(VELA_SESSION_IDLE_MAX) + 1);
+    mutate("lifetime", -3);
+    mutate("clientIP", "not an address");
+    mutate("skipIP", 1);
+    mutate("lang", "english");
+    mutate("tokenProtect", "true");
+    mutate("token", "short");
+    mutate("app", std::string(300, 'a'));
+
+    for (const std::string& text : bad) {
+        {
+            std::ofstream out(File(sid), std::ios::binary | std::ios::trunc);
+            out << text;
+        }
+        EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(sid)) << text;
+        EXPECT_EQ(-1, VelaCgiUIDGet(sid.c_str(), "root")) << text;
+        EXPECT_EQ(text, ReadText(File(sid))) << "the file was rewritten";
+    }
+
+    // A valid session file under another session's name is no session.
+    const std::string other = Create();
+    ASSERT_EQ(0, rename(File(other).c_str(), File(sid).c_str()));
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(sid));
+}
+
+TEST_F(SessionTest, OnlyRegularFilesOfOursAreRead)
+{
+    const std::string target = Create();
+    const std::string link = Create();
+    ASSERT_EQ(0, unlink(File(link).c_str()));
+    ASSERT_EQ(0, symlink(File(target).c_str(), File(link).c_str()));
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(link));
+
+    const std::string fifo = Create();
+    ASSERT_EQ(0, unlink(File(fifo).c_str()));
+    ASSERT_EQ(0, mkfifo(File(fifo).c_str(), 0600));
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(fifo));  // and does not block
+
+    if (geteuid() == 0) {
+        const std::string foreign = Create();
+        ASSERT_EQ(0, chown(File(foreign).c_str(), 65534, 65534));
+        EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(foreign));
+    }
+}
+
+TEST_F(SessionTest, ClientAddressMustMatch)
+{
+    const std::string sid = Create();
+    {
+        ScopedEnv other("REMOTE_ADDR", "198.51.100.1");
+        EXPECT_EQ(AUTH_RESULT_IP_MISMATCH, Check(sid));
+        EXPECT_TRUE(log_.Contains("request from 198.51.100.1"));
+        EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
+        Now() += 10;
+        EXPECT_EQ(AUTH_RESULT_IP_MISMATCH, Check(sid));
+        EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());  // a refused check keeps nothing alive
+
+        // The method may exempt itself from the address check.
+        Handle h;
+        ASSERT_EQ(0, VelaCgiSetSkipCheckIP(h.ctx, 1));
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid, 0, h.ctx));
+        EXPECT_STREQ("0", VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));  // the session's own flag
+    }
+    {
+        ScopedEnv none("REMOTE_ADDR", nullptr);
+        EXPECT_EQ(AUTH_RESULT_IP_MISMATCH, Check(sid));
+    }
+    {
+        ScopedEnv mapped("REMOTE_ADDR", "::ffff:192.0.2.7");
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    }
+
+    VELA::Session::Options options;
+    options.skipIP = true;
+    const std::string roaming = Create(options);
+    const std::string unbound = Create(VELA::Session::Options(), "root", "");
+    ScopedEnv other("REMOTE_ADDR", "2001:db8::1");
+    Handle h;
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(roaming, 0, h.ctx));
+    EXPECT_EQ(1, VelaCgiGetSkipCheckIP(h.ctx));
+    EXPECT_STREQ("1", VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(unbound));
+    EXPECT_TRUE(Read(unbound)["skipIP"].asBool());
+    EXPECT_EQ(AUTH_RESULT_IP_MISMATCH, Check(sid));
+}
+
+TEST_F(SessionTest, AntiForgeryToken)
+{
+    VELA::Session::Options options;
+    options.tokenProtect = true;
+    std::string token;
+    const std::string sid = Create(options, "root", kClient, &token);
+    std::string otherToken;
+    const std::string other = Create(options, "root", kClient, &otherToken);
+
+    EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
+    EXPECT_TRUE(log_.Contains("anti-forgery token missing or wrong"));
+    {
+        ScopedEnv wrong("HTTP_X_VELA_TOKEN", otherToken.c_str());
+        Now() += 5;
+        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
+        EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
+    }
+    {
+        ScopedEnv prefix("HTTP_X_VELA_TOKEN", token.substr(0, 31).c_str());
+        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
+    }
+    {
+        ScopedEnv longer("HTTP_X_VELA_TOKEN", (token + "x").c_str());
+        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
+    }
+    {
+        ScopedEnv right("HTTP_X_VELA_TOKEN", token.c_str());
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(other));
+    }
+    {
+        ScopedEnv query("QUERY_STRING", ("api=VELA.Demo&VelaToken=" + token + "&method=get").c_str());
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    }
+    {
+        std::string encoded;
+        for (char c : token) {
+            char hex[4];
+            snprintf(hex, sizeof(hex), "%%%02X", static_cast<unsigned char>(c));
+            encoded += hex;
+        }
+        ScopedEnv query("QUERY_STRING", ("Vela%54oken=" + encoded).c_str());
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    }
+    {
+        ScopedEnv query("QUERY_STRING", ("XVelaToken=" + token + "&VelaTokenX=" + token).c_str());
+        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
+    }
+
+    // Token protection is a property of the session.
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create()));
+    Handle h;
+    {
+        ScopedEnv cookie("HTTP_COOKIE", ("id=" + sid).c_str());
+        ASSERT_EQ(0, VelaCgiLoadInCookies(h.ctx));
+        EXPECT_EQ(1, VelaCgiIsTokenEnable(h.ctx));
+    }
+    {
+        ScopedEnv cookie("HTTP_COOKIE", ("id=" + Create()).c_str());
+        ASSERT_EQ(0, VelaCgiLoadInCookies(h.ctx));
+        EXPECT_EQ(0, VelaCgiIsTokenEnable(h.ctx));
+    }
+    {
+        ScopedEnv cookie("HTTP_COOKIE", "id=../x");
+        ASSERT_EQ(0, VelaCgiLoadInCookies(h.ctx));
+        EXPECT_EQ(0, VelaCgiIsTokenEnable(h.ctx));
+    }
+    EXPECT_EQ(0, VelaCgiIsTokenEnable(nullptr));
+}
+
+TEST_F(SessionTest, UserOfTheSession)
+{
+    const std::string sid = Create();
+    EXPECT_EQ(0, VelaCgiUIDGet(sid.c_str(), "root"));
+    EXPECT_EQ(-1, VelaCgiUIDGet(sid.c_str(), "nobody"));
+    EXPECT_EQ(-1, VelaCgiUIDGet(sid.c_str(), nullptr));
+    EXPECT_EQ(-1, VelaCgiUIDGet(nullptr, "root"));
+
+    struct passwd* nobody = getpwnam("nobody");
+    ASSERT_NE(nullptr, nobody);
+    const std::string nsid = Create(VELA::Session::Options(), "nobody");
+    EXPECT_EQ(static_cast<int>(nobody->pw_uid), VelaCgiUIDGet(nsid.c_str(), "nobody"));
+
+    // A session whose user has gone away is no session.
+    Edit(nsid, "user", "vela-no-such-user");
+    EXPECT_EQ(-1, VelaCgiUIDGet(nsid.c_str(), "vela-no-such-user"));
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(nsid));
+    EXPECT_TRUE(log_.Contains("no longer exists"));
+}
+
+TEST_F(SessionTest, ListRemovePurge)
+{
+    VELA::Session::Options shortIdle;
+    shortIdle.idleTimeout = 60;
+    const std::string a = Create(shortIdle);
+    Now() += 1;
+    const std::string b = Create(VELA::Session::Options(), "nobody", "2001:db8::1");
+    Now() += 1;
+    VELA::Session::Options longIdle;
+    longIdle.idleTimeout = 7200;
+    const std::string c = Create(longIdle);
+    std::ofstream(Dir() + "/not-a-session") << "x";
+
+    std::vector<VELA::Session::Record> list;
+    ASSERT_EQ(0, VELA::Session::List(list));
+    ASSERT_EQ(3u, list.size());
+    EXPECT_EQ(a, list[0].sid);
+    EXPECT_EQ(b, list[1].sid);
+    EXPECT_EQ("nobody", list[1].user);
+    EXPECT_EQ("2001:db8::1", list[1].clientIP);
+    EXPECT_EQ(c, list[2].sid);
+    EXPECT_FALSE(list[0].expired);
+
+    EXPECT_EQ(0, VELA::Session::Remove(b.c_str()));
+    EXPECT_EQ(-2, VELA::Session::Remove(b.c_str()));
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(b));
+
+    Now() += 61;
+    ASSERT_EQ(0, VELA::Session::List(list));
+    ASSERT_EQ(2u, list.size());
+    EXPECT_TRUE(list[0].expired);
+    EXPECT_FALSE(list[1].expired);
+    EXPECT_EQ(0, VELA::Session::Purge(3600));  // within the grace period
+    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(a));
+    Now() += 3600;
+    EXPECT_EQ(1, VELA::Session::Purge(3600));
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(a));
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(c));
+    EXPECT_EQ(-1, VELA::Session::Purge(-1));
+}
+
+TEST_F(SessionTest, LanguageFromSessionOrHeader)
+{
+    Handle h;
+    char buf[4];
+    auto lang = [&](const char* header) {
+        ScopedEnv env("HTTP_ACCEPT_LANGUAGE", header);
+        EXPECT_EQ(0, VelaCgiGetLang(h.ctx, buf, sizeof(buf)));
+        return std::string(buf);
+    };
+    EXPECT_EQ("enu", lang(nullptr));
+    EXPECT_EQ("enu", lang(""));
+    EXPECT_EQ("ger", lang("de-DE,de;q=0.9,en;q=0.8"));
+    EXPECT_EQ("jpn", lang("fr;q=0.5, ja;q=0.9"));
+    EXPECT_EQ("fra", lang("fr;q=0.5, ja;q=0.5"));  // a tie goes to the first
+    EXPECT_EQ("cht", lang("zh-TW"));
+    EXPECT_EQ("cht", lang("zh-Hant-HK"));
+    EXPECT_EQ("chs", lang("zh-CN"));
+    EXPECT_EQ("chs", lang("zh"));
+    EXPECT_EQ("ptb", lang("pt-BR"));
+    EXPECT_EQ("ptg", lang("pt-PT"));
+    EXPECT_EQ("enu", lang("en-GB"));
+    EXPECT_EQ("ger", lang("xx-YY, *;q=0.9, de;q=0.1"));
+    EXPECT_EQ("ger", lang("en;q=0, de"));
+    EXPECT_EQ("enu", lang("de;q=1.5"));
+    EXPECT_EQ("enu", lang("de;level=1"));
+    EXPECT_EQ("enu", lang(";;;,,,=q;"));
+    EXPECT_EQ("enu", lang(("de," + std::string(5000, 'a')).c_str()));
+
+    VELA::Session::Options options;
+    options.lang = "fra";
+    ASSERT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create(options), 0, h.ctx));
+    EXPECT_EQ("fra", lang("de"));
+    ASSERT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create(), 0, h.ctx));  // no language in the session
+    EXPECT_EQ("ger", lang("de"));
+
+    char small[3] = "xx";
+    EXPECT_EQ(-1, VelaCgiGetLang(h.ctx, small, sizeof(small)));
+    EXPECT_STREQ("", small);
+    EXPECT_EQ(-1, VelaCgiGetLang(h.ctx, nullptr, 4));
+    EXPECT_EQ(0, VelaCgiGetLang(nullptr, buf, sizeof(buf)));
+}
+
+// Many processes refresh one session at once: every check must pass and the
+// file must stay a valid session.
+TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
+{
+    const std::string sid = Create();
+    const int kProcesses = 8;
+    const int kChecks = 50;
+    std::vector<pid_t> children;
+    for (int p = 0; p < kProcesses; ++p) {
+        const pid_t pid = fork();
+        ASSERT_GE(pid, 0);
+        if (pid == 0) {
+            int failures = 0;
+            for (int i = 0; i < kChecks; ++i) {
+                Now() = kStart + i;  // every check has a new time to write
+                char user[493];
+                if (VelaCgiIsAuthorizedEx(nullptr, sid.c_str(), user, sizeof(user), nullptr, 0) !=
+                        AUTH_RESULT_AUTHORIZED ||
+                    strcmp(user, "root") != 0) {
+                    ++failures;
+                }
+            }
+            _exit(failures > 100 ? 100 : failures);
+        }
+        children.push_back(pid);
+    }
+    for (pid_t pid : children) {
+        int status = 0;
+        ASSERT_EQ(pid, waitpid(pid, &status, 0));
+        ASSERT_TRUE(WIFEXITED(status));
+        EXPECT_EQ(0, WEXITSTATUS(status)) << "failed checks in process " << pid;
+    }
+    const Json::Value doc = Read(sid);
+    EXPECT_EQ(sid, doc["id"].asString());
+    EXPECT_GE(doc["lastUse"].asInt64(), kStart);
+    EXPECT_LT(doc["lastUse"].asInt64(), kStart + kChecks);
+    Now() = kStart + kChecks;
+    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+
+    // No temporary file is left behind.
+    std::map<std::string, std::string> files;
+    Snapshot(Dir(), files);
+    for (const auto& entry : files) {
+        const std::string name = entry.first.substr(Dir().size() + 1);
+        EXPECT_TRUE(name == sid || name == ".lock") << name;
+    }
+}
+
+// A session removed while other processes refresh it stays removed: no
+// process may write it back, and no check after the removal passes.
+TEST_F(SessionTest, RemovalWinsOverConcurrentRefresh)
+{
+    for (int round = 0; round < 5; ++round) {
+        const std::string sid = Create();
+        std::vector<pid_t> children;
+        for (int p = 0; p < 4; ++p) {
+            const pid_t pid = fork();
+            ASSERT_GE(pid, 0);
+            if (pid == 0) {
+                bool removed = false;
+                for (int i = 1; i <= 200; ++i) {
+                    Now() = kStart + i;
+                    const int verdict = Check(sid);
+                    if (verdict == AUTH_RESULT_NO_SESSION) {
+                        removed = true;
+                    } else if (verdict != AUTH_RESULT_AUTHORIZED || removed) {
+                        _exit(1);
+                    }
+                }
+                _exit(0);
+            }
+            children.push_back(pid);
+        }
+        // Remove once the children are refreshing (bounded wait, not a timing
+        // assertion: removing earlier only makes the round less interesting).
+        for (int i = 0; i < 2000 && Read(sid)["lastUse"].asInt64() == kStart; ++i) {
+            usleep(1000);
+        }
+        EXPECT_EQ(0, VELA::Session::Remove(sid.c_str()));
+        for (pid_t pid : children) {
+            int status = 0;
+            ASSERT_EQ(pid, waitpid(pid, &status, 0));
+            EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "a check passed after the removal";
+        }
+        struct stat st;
+        EXPECT_NE(0, lstat(File(sid).c_str(), &st)) << "the session came back";
+    }
+}
+
+}  // namespace

@@ -1,0 +1,73 @@
+// File helpers of the platform: opening a path without following any
+// symbolic link on it.
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <fcntl.h>
+#include <fstream>
+#include <string>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "platform/system/FileUtil.h"
+#include "support/TestSupport.h"
+
+namespace {
+
+// A link anywhere on the path, the last component or a directory on the
+// way, is refused by both ways of resolving; everything else opens alike.
+TEST(FileUtil, OpenNoSymlinksRefusesEveryLinkOnThePath)
+{
+    VELA::Test::TempDir root;
+    const std::string files = root.Path() + "/files";
+    ASSERT_EQ(0, mkdir(files.c_str(), 0755));
+    const std::string target = files + "/target.txt";
+    std::ofstream(target) << "secret";
+    ASSERT_EQ(0, mkdir((files + "/dir").c_str(), 0755));
+    const std::string inDir = files + "/dir/in.txt";
+    std::ofstream(inDir) << "in";
+    ASSERT_EQ(0, symlink(target.c_str(), (files + "/last").c_str()));
+    ASSERT_EQ(0, symlink((files + "/dir").c_str(), (files + "/middle").c_str()));
+    ASSERT_EQ(0, symlink("dir", (files + "/relative").c_str()));
+
+    using VELA::System::NoSymlinkResolve;
+    struct Case {
+        std::string path;
+        int err;  // 0: opens
+    };
+    const Case cases[] = {
+        {inDir, 0},
+        {files + "/dir/../dir/./in.txt", 0},
+        {files + "//dir///in.txt", 0},
+        {"files/dir/in.txt", 0},  // relative to the working directory
+        {files + "/last", ELOOP},
+        {files + "/middle/in.txt", ELOOP},
+        {"files/relative/in.txt", ELOOP},
+        {files + "/middle/../target.txt", ELOOP},
+        {files + "/dir/in.txt/", ENOTDIR},
+        {target + "/x", ENOTDIR},
+        {files + "/missing/x", ENOENT},
+        {"", EINVAL},
+        {std::string(5000, 'a'), ENAMETOOLONG},
+    };
+    char cwd[4096];
+    ASSERT_NE(nullptr, getcwd(cwd, sizeof(cwd)));
+    ASSERT_EQ(0, chdir(root.Path().c_str()));
+    for (const Case& c : cases) {
+        for (NoSymlinkResolve how : {NoSymlinkResolve::kAuto, NoSymlinkResolve::kWalk}) {
+            errno = 0;
+            const int fd = VELA::System::OpenNoSymlinks(c.path, O_RDONLY, how);
+            const int err = fd < 0 ? errno : 0;
+            EXPECT_EQ(c.err, err) << c.path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
+            if (fd >= 0) {
+                char byte = 0;
+                EXPECT_EQ(1, read(fd, &byte, 1));
+                EXPECT_EQ('i', byte);
+                close(fd);
+            }
+        }
+    }
+    EXPECT_EQ(0, chdir(cwd));
+}
+
+}  // namespace

@@ -1,0 +1,35 @@
+// The system root: VELA_ROOT, read once, and the paths resolved under it.
+#include <gtest/gtest.h>
+
+#include <string>
+
+#include "support/TestSupport.h"
+#include "vela/vlibc.h"
+
+namespace {
+
+TEST(Root, DefaultAndTrailingSlashes)
+{
+    {
+        VELA::Test::ScopedEnv env("VELA_ROOT", nullptr);
+        VELA::System::RootReset();
+        EXPECT_EQ("/", VELA::System::Root());
+        EXPECT_EQ("/etc/velainfo.conf", VELA::System::Path("/etc/velainfo.conf"));
+    }
+    {
+        VELA::Test::ScopedEnv env("VELA_ROOT", "/tmp/r//");
+        VELA::System::RootReset();
+        EXPECT_EQ("/tmp/r", VELA::System::Root());
+        EXPECT_EQ("/tmp/r/etc/velainfo.conf", VELA::System::Path("/etc/velainfo.conf"));
+    }
+    {
+        // Cached until reset.
+        VELA::Test::ScopedEnv env("VELA_ROOT", "relative/dir");
+        EXPECT_EQ("/tmp/r", VELA::System::Root());
+        VELA::System::RootReset();
+        EXPECT_EQ("/", VELA::System::Root());
+    }
+    VELA::System::RootReset();
+}
+
+}  // namespace

@@ -1,0 +1,213 @@
+// Users, administrators and application privileges.
+#include <gtest/gtest.h>
+
+#include <cstdio>
+#include <grp.h>
+#include <pwd.h>
+#include <string>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "platform/IdentityTestUtil.h"
+#include "support/TestSupport.h"
+#include "vela/user.h"
+#include "vela/vlibc.h"
+
+namespace {
+
+void WriteFile(const std::string& path, const std::string& text)
+{
+    FILE* f = fopen(path.c_str(), "w");
+    ASSERT_NE(nullptr, f) << path;
+    fwrite(text.data(), 1, text.size(), f);
+    fclose(f);
+}
+
+// A system root with etc/vela/ for the configuration files.
+class UserRoot : public ::testing::Test {
+protected:
+    UserRoot() : env_("VELA_ROOT", root_.Path().c_str())
+    {
+        VELA::System::RootReset();
+        mkdir((root_.Path() + "/etc").c_str(), 0755);
+        mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
+    }
+    ~UserRoot() override { VELA::System::RootReset(); }
+
+    void Conf(const std::string& name, const std::string& text) { WriteFile(root_.Path() + "/etc/vela/" + name, text); }
+
+    VELA::Test::TempDir root_;
+    VELA::Test::ScopedEnv env_;
+};
+
+TEST(UserLookup, HostileNamesAreRefused)
+{
+    uid_t uid = 1;
+    gid_t gid = 1;
+    const std::string longName(256, 'a');
+    for (const char* name : {"", "a/b", "a:b", "a\nb", "del\x7f", ".", "..", longName.c_str()}) {
+        EXPECT_EQ(-1, VELAUserGetUGID(name, &uid, &gid)) << name;
+        EXPECT_EQ(-1, VLIBGroupIsAdminGroupMem(name, 0)) << name;
+        EXPECT_EQ(0, VLIBAppPrivUserHas(name, "VELA.App", "127.0.0.1")) << name;
+        EXPECT_EQ(0, VELAUserNameIsValid(name)) << name;
+    }
+    EXPECT_EQ(-1, VELAUserGetUGID(nullptr, &uid, &gid));
+    EXPECT_EQ(-1, VELAUserGetUGID("root", nullptr, &gid));
+    EXPECT_EQ(-1, VLIBGroupIsAdminGroupMem("root", 1));  // unknown flags
+    EXPECT_EQ(1, VELAUserNameIsValid("CORP\\bob"));
+    EXPECT_EQ(1, VELAUserNameIsValid("bob@realm"));
+}
+
+TEST(UserLookup, RecordsComeFromNss)
+{
+    PVELAUSER user = nullptr;
+    ASSERT_EQ(0, VELAUserGetByUID(0, &user));
+    EXPECT_STREQ(getpwuid(0)->pw_name, user->szName);
+    VELAUserFree(user);
+    uid_t uid = 1;
+    gid_t gid = 1;
+    EXPECT_EQ(-1, VELAUserGetUGID("vela-no-such-user-x", &uid, &gid));
+    EXPECT_EQ(-1, VELAUserGetByName("vela-no-such-user-x", &user));
+    EXPECT_EQ(nullptr, user);
+}
+
+// "system" is the superuser as a run-as name only; as a user name it is
+// looked up like any other, so it is root only if an account of that name
+// has uid 0 (no machine of the tests has one).
+TEST(UserLookup, SystemIsTheSuperuserOnlyAsRunAsName)
+{
+    uid_t uid = 1;
+    gid_t gid = 1;
+    ASSERT_EQ(0, VELA::System::RunAsGetUGID(VELA_RUNAS_SUPERUSER, &uid, &gid));
+    EXPECT_EQ(0u, uid + gid);
+    EXPECT_EQ(1, VELA::System::RunAsIsSuperuser("system"));
+    for (const char* other : {"System", "system ", "root", "", static_cast<const char*>(nullptr)}) {
+        EXPECT_EQ(0, VELA::System::RunAsIsSuperuser(other)) << (other ? other : "null");
+    }
+    ASSERT_EQ(0, VELA::System::RunAsGetUGID("root", &uid, &gid));  // any other run-as name is an account
+    EXPECT_EQ(0u, uid);
+
+    uid = 0;
+    const bool found = VELAUserGetUGID("system", &uid, &gid) == 0;
+    EXPECT_FALSE(found && uid == 0) << "the name \"system\" was taken for root";
+    PVELAUSER user = nullptr;
+    if (VELAUserGetByName("system", &user) == 0) {
+        EXPECT_NE(0u, user->uid);
+        EXPECT_STREQ("system", user->szName);
+    }
+    VELAUserFree(user);
+    EXPECT_NE(1, VLIBGroupIsAdminGroupMem("system", 0));
+}
+
+// Privileges of an ordinary existing account ("nobody", primary group
+// "nogroup" on Debian); no root needed.
+class UserAppPriv : public UserRoot {
+protected:
+    void SetUp() override
+    {
+        const struct passwd* pw = getpwnam("nobody");
+        const struct group* gr = getgrnam("nogroup");
+        if (pw == nullptr || gr == nullptr || pw->pw_gid != gr->gr_gid) {
+            GTEST_SKIP() << "needs the account nobody with primary group nogroup";
+        }
+    }
+};
+
+TEST_F(UserAppPriv, MissingOrCorruptFileLeavesAdministratorsOnly)
+{
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Photo", "10.0.0.1"));
+    EXPECT_EQ(1, VLIBAppPrivUserHas("root", "VELA.Photo", "10.0.0.1"));
+    Conf("app_privileges.json", R"({"applications": {"VELA.Photo": {"users": ["nobody"]})");  // cut short
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Photo", "10.0.0.1"));
+    EXPECT_EQ(1, VLIBAppPrivUserHas("root", "VELA.Photo", nullptr));
+}
+
+TEST_F(UserAppPriv, UsersGroupsAndAddresses)
+{
+    Conf("app_privileges.json", R"({"applications": {
+        "VELA.Users": {"users": ["nobody"]},
+        "VELA.Groups": {"groups": ["vela-no-such-group", "nogroup"]},
+        "VELA.Lan": {"users": ["nobody"], "allow_from": ["192.168.1.0/24", "fd00::/8", "10.0.0.7"]},
+        "VELA.Nowhere": {"users": ["nobody"], "allow_from": []},
+        "VELA.Odd": {"users": "nobody", "groups": [7], "allow_from": "10.0.0.0/8"},
+        "VELA.Others": {"users": ["root2", "nobodyx"], "groups": ["root"]}
+    }})");
+    EXPECT_EQ(1, VLIBAppPrivUserHas("nobody", "VELA.Users", nullptr));
+    EXPECT_EQ(1, VLIBAppPrivUserHas("nobody", "VELA.Groups", ""));
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Others", "10.0.0.7"));
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Unlisted", "10.0.0.7"));
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Odd", "10.0.0.7"));  // wrong types grant nothing
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Nowhere", "10.0.0.7"));
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA/Users", nullptr));
+
+    for (const char* ip : {"192.168.1.200", "::ffff:192.168.1.5", "fd12::1", "10.0.0.7"}) {
+        EXPECT_EQ(1, VLIBAppPrivUserHas("nobody", "VELA.Lan", ip)) << ip;
+    }
+    for (const char* ip : {"192.168.2.1", "fe80::1", "10.0.0.8", "", "192.168.1.1/24", "junk"}) {
+        EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Lan", ip)) << ip;
+    }
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Lan", nullptr));
+    EXPECT_EQ(1, VLIBAppPrivUserHas("root", "VELA.Lan", "203.0.113.9"));  // administrators: everywhere
+}
+
+// Membership of the administrators group on a real account. Needs root.
+class UserAdminGroup : public UserRoot {
+protected:
+    void SetUp() override
+    {
+        if (geteuid() != 0) {
+            GTEST_SKIP() << "creating test accounts needs root";
+        }
+        ASSERT_TRUE(account_.Create()) << "useradd/groupadd failed";
+        ASSERT_TRUE(VELA::Test::RunProgram({"/usr/sbin/groupadd", "--system", admins_}));
+    }
+    void TearDown() override
+    {
+        if (geteuid() == 0) {
+            account_.Remove();
+            VELA::Test::RunProgram({"/usr/sbin/groupdel", admins_});
+        }
+    }
+
+    VELA::Test::TestAccount account_;
+    std::string admins_ = "vela-ta-" + std::to_string(getpid());
+};
+
+TEST_F(UserAdminGroup, MembershipFollowsTheConfiguredGroup)
+{
+    const char* user = account_.user.c_str();
+    Conf("webapi.conf", "# test\ntrusted_proxies=\"127.0.0.1\"\nadmin_group=\"" + admins_ + "\"\n");
+    EXPECT_EQ(0, VLIBGroupIsAdminGroupMem(user, 0));
+    EXPECT_EQ(1, VLIBGroupIsAdminGroupMem("root", 0));
+    EXPECT_NE(1, VLIBGroupIsAdminGroupMem("system", 0));  // a name, not the run-as superuser
+    EXPECT_EQ(0, VLIBAppPrivUserHas("system", "VELA.Any", "10.0.0.1"));
+    EXPECT_EQ(0, VLIBAppPrivUserHas(user, "VELA.Any", "10.0.0.1"));
+
+    ASSERT_TRUE(VELA::Test::RunProgram({"/usr/sbin/usermod", "--append", "--groups", admins_, user}));
+    EXPECT_EQ(1, VLIBGroupIsAdminGroupMem(user, 0));  // supplementary
+    EXPECT_EQ(1, VLIBAppPrivUserHas(user, "VELA.Any", "10.0.0.1"));
+
+    Conf("webapi.conf", "admin_group=\"" + account_.user + "\"\n");
+    EXPECT_EQ(1, VLIBGroupIsAdminGroupMem(user, 0));  // primary
+    Conf("webapi.conf", "admin_group=\"" + account_.supp + "\"\n");
+    EXPECT_EQ(1, VLIBGroupIsAdminGroupMem(user, 0));
+    Conf("webapi.conf", "admin_group=\"vela-no-such-group\"\n");
+    EXPECT_EQ(0, VLIBGroupIsAdminGroupMem(user, 0));
+
+    // A configuration that cannot be trusted fails closed; root stays root.
+    for (const char* bad : {"admin_group=\"a/b\"\n", "admin_group=\"" "cut\n", "not a line\n"}) {
+        Conf("webapi.conf", bad);
+        EXPECT_EQ(-1, VLIBGroupIsAdminGroupMem(user, 0)) << bad;
+        EXPECT_EQ(0, VLIBAppPrivUserHas(user, "VELA.Any", "10.0.0.1")) << bad;
+        EXPECT_EQ(1, VLIBGroupIsAdminGroupMem("root", 0)) << bad;
+    }
+}
+
+TEST_F(UserAdminGroup, SupplementaryGroupGrantsApplication)
+{
+    Conf("app_privileges.json", "{\"applications\": {\"VELA.Team\": {\"groups\": [\"" + account_.supp + "\"]}}}");
+    EXPECT_EQ(1, VLIBAppPrivUserHas(account_.user.c_str(), "VELA.Team", "10.0.0.1"));
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Team", "10.0.0.1"));
+}
+
+}  // namespace

@@ -1,0 +1,237 @@
+// JSON text and files, query strings, URL coding.
+#include <gtest/gtest.h>
+
+#include <dirent.h>
+#include <fstream>
+#include <string>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <vector>
+
+#include "support/LinearTime.h"
+#include "support/TestSupport.h"
+#include "vela/webapiutil.h"
+
+namespace {
+
+using namespace VELA::WebAPIUtil;
+
+std::string Nested(int depth, const std::string& inner)
+{
+    return std::string(depth, '[') + inner + std::string(depth, ']');
+}
+
+using VELA::Test::DirEntries;
+
+void WriteText(const std::string& path, const std::string& text)
+{
+    std::ofstream(path, std::ios::binary) << text;
+}
+
+TEST(WebAPIUtil, ParseJsonStrictness)
+{
+    Json::Value out("keep");
+    for (const char* bad : {"", " ", "{} x", "{\"a\":1,}", "[1,]", "// c\n{}", "{'a':1}", "NaN", "{\"a\":1,\"a\":2}",
+                            "\xEF\xBB\xBF{}", "[1", "{\"a\"}", "\"\\u12\""}) {
+        EXPECT_FALSE(ParseJson(bad, out)) << bad;
+        EXPECT_EQ("keep", out.asString()) << bad;
+    }
+    ASSERT_TRUE(ParseJson(" {\"a\":[1,\"x\"]}\n", out));
+    EXPECT_EQ("x", out["a"][1].asString());
+    ASSERT_TRUE(ParseJson("42", out));  // any value may be the root
+    EXPECT_EQ(42, out.asInt());
+    ASSERT_TRUE(ParseJson(std::string("\"a\\u0000b\""), out));
+    EXPECT_EQ(3u, out.asString().size());
+}
+
+TEST(WebAPIUtil, ParseJsonDepthLimitNeverThrows)
+{
+    Json::Value out;
+    EXPECT_TRUE(ParseJson(Nested(256, "1"), out));
+    EXPECT_TRUE(ParseJson(Nested(255, "{}"), out));
+    EXPECT_TRUE(ParseJson(Nested(256, ""), out));
+    EXPECT_FALSE(ParseJson(Nested(257, "1"), out));
+    EXPECT_FALSE(ParseJson(Nested(257, ""), out));
+    EXPECT_FALSE(ParseJson(std::string(100000, '['), out));
+    // Brackets inside strings do not count as nesting.
+    EXPECT_TRUE(ParseJson("[\"" + std::string(1000, '[') + "\\\"\"]", out));
+}
+
+TEST(WebAPIUtil, ReadJsonFileLimits)
+{
+    VELA::Test::TempDir dir;
+    const std::string path = dir.Path() + "/doc.json";
+    Json::Value out("keep");
+    EXPECT_FALSE(ReadJsonFile(path, out));  // missing
+    EXPECT_FALSE(ReadJsonFile(dir.Path(), out));  // a directory
+    WriteText(path, "{\"a\":1} trailing");
+    EXPECT_FALSE(ReadJsonFile(path, out));
+    EXPECT_EQ("keep", out.asString());
+
+    // Exactly 16 MiB of valid JSON is read; one byte more is refused.
+    std::string big = "\"" + std::string(16 * 1024 * 1024 - 2, 'x') + "\"";
+    WriteText(path, big);
+    ASSERT_TRUE(ReadJsonFile(path, out));
+    EXPECT_EQ(big.size() - 2, out.asString().size());
+    WriteText(path, big + " ");
+    VELA::Test::LogCapture log;
+    EXPECT_FALSE(ReadJsonFile(path, out));
+    EXPECT_TRUE(log.Contains("larger than"));
+
+    const std::string fifo = dir.Path() + "/fifo";
+    ASSERT_EQ(0, mkfifo(fifo.c_str(), 0600));
+    EXPECT_FALSE(ReadJsonFile(fifo, out));  // refused, not blocked on
+}
+
+TEST(WebAPIUtil, WriteJsonFileAtomicReplacesWithMode)
+{
+    VELA::Test::TempDir dir;
+    const std::string path = dir.Path() + "/conf.json";
+    WriteText(path, "old");
+    Json::Value value;
+    value["k"] = "v\xC3\xA9";
+    ASSERT_TRUE(WriteJsonFileAtomic(path, value, 0640));
+    std::ifstream in(path);
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    EXPECT_EQ("{\"k\":\"v\xC3\xA9\"}\n", text);
+    struct stat st;
+    ASSERT_EQ(0, stat(path.c_str(), &st));
+    EXPECT_EQ(0640u, st.st_mode & 07777);
+    EXPECT_EQ(std::vector<std::string>{"conf.json"}, DirEntries(dir.Path()));
+
+    // The temporary name must stay within NAME_MAX for a 255-byte name.
+    const std::string longName(255, 'n');
+    EXPECT_TRUE(WriteJsonFileAtomic(dir.Path() + "/" + longName, value, 0600));
+    EXPECT_EQ(2u, DirEntries(dir.Path()).size());
+}
+
+TEST(WebAPIUtil, WriteJsonFileAtomicLeavesNoTemporaryOnFailure)
+{
+    VELA::Test::TempDir dir;
+    // The rename fails: the target is a non-empty directory.
+    const std::string target = dir.Path() + "/busy";
+    ASSERT_EQ(0, mkdir(target.c_str(), 0700));
+    WriteText(target + "/inside", "x");
+    VELA::Test::LogCapture log;
+    EXPECT_FALSE(WriteJsonFileAtomic(target, Json::Value(1), 0600));
+    EXPECT_TRUE(log.Contains("rename"));
+    EXPECT_EQ(std::vector<std::string>{"busy"}, DirEntries(dir.Path()));
+    EXPECT_EQ(std::vector<std::string>{"inside"}, DirEntries(target));
+
+    EXPECT_FALSE(WriteJsonFileAtomic(dir.Path() + "/missing/x.json", Json::Value(1), 0600));
+    EXPECT_FALSE(WriteJsonFileAtomic("", Json::Value(1), 0600));
+    EXPECT_FALSE(WriteJsonFileAtomic(dir.Path() + "/", Json::Value(1), 0600));
+}
+
+TEST(WebAPIUtil, WriteJsonFileAtomicUnwritableDirectory)
+{
+    if (geteuid() == 0) {
+        GTEST_SKIP() << "root writes into a read-only directory";
+    }
+    VELA::Test::TempDir dir;
+    const std::string sub = dir.Path() + "/ro";
+    ASSERT_EQ(0, mkdir(sub.c_str(), 0500));
+    EXPECT_FALSE(WriteJsonFileAtomic(sub + "/x.json", Json::Value(1), 0600));
+    EXPECT_TRUE(DirEntries(sub).empty());
+    chmod(sub.c_str(), 0700);
+}
+
+TEST(WebAPIUtil, QueryStringPairs)
+{
+    Json::Value out;
+    ASSERT_TRUE(strPairToJsonObj("a=1&b=x%20y+z&flag&=skip&&c=%zz&d=k=v", out, true, true));
+    EXPECT_EQ("1", out["a"].asString());
+    EXPECT_EQ("x y z", out["b"].asString());
+    EXPECT_EQ("", out["flag"].asString());
+    EXPECT_EQ("%zz", out["c"].asString());
+    EXPECT_EQ("k=v", out["d"].asString());
+    EXPECT_EQ(5u, out.size());
+
+    ASSERT_TRUE(strPairToJsonObj("a=2&e=%41&a=3", out, false, false));
+    EXPECT_EQ("1", out["a"].asString());
+    EXPECT_EQ("%41", out["e"].asString());
+    ASSERT_TRUE(strPairToJsonObj("a=2&a=3", out, false, true));
+    EXPECT_EQ("3", out["a"].asString());
+
+    Json::Value array(Json::arrayValue);
+    EXPECT_FALSE(strPairToJsonObj("a=1", array, true, true));
+    Json::Value empty;
+    ASSERT_TRUE(strPairToJsonObj("", empty, true, true));
+    EXPECT_TRUE(empty.isObject());
+}
+
+TEST(WebAPIUtil, ParseToArraySplitsCookieHeaders)
+{
+    Json::Value parts = ParseToArray("id=abc; lang=en%20US;broken;\t;k=a=b;", ";");
+    ASSERT_EQ(6u, parts.size());
+    EXPECT_EQ("id=abc", parts[0].asString());
+    EXPECT_EQ("lang=en%20US", parts[1].asString());
+    EXPECT_EQ("broken", parts[2].asString());
+    EXPECT_EQ("", parts[3].asString());
+    EXPECT_EQ("k=a=b", parts[4].asString());
+    EXPECT_EQ("", parts[5].asString());
+
+    parts = ParseToArray(" a, b", ", ");  // multi-byte separator; leading blank kept
+    ASSERT_EQ(2u, parts.size());
+    EXPECT_EQ(" a", parts[0].asString());
+    EXPECT_EQ(0u, ParseToArray(nullptr, ";").size());
+    EXPECT_EQ("x;y", ParseToArray("x;y", "")[0].asString());
+    EXPECT_EQ(1u, ParseToArray("x;y", nullptr).size());
+}
+
+TEST(WebAPIUtil, URLDecodeMalformedSequences)
+{
+    EXPECT_EQ("%", URLDecode("%", false));
+    EXPECT_EQ("%4", URLDecode("%4", false));
+    EXPECT_EQ("a%", URLDecode("a%", false));
+    EXPECT_EQ("%zz", URLDecode("%zz", false));
+    EXPECT_EQ("%4g", URLDecode("%4g", false));
+    EXPECT_EQ(std::string("\0", 1), URLDecode("%00", false));
+    EXPECT_EQ("%A", URLDecode("%25A", false));  // decoded once only
+    EXPECT_EQ("\xff", URLDecode("%fF", false));
+    EXPECT_EQ("a b+", URLDecode("a+b%2B", true));
+    EXPECT_EQ("a+b", URLDecode("a+b", false));
+}
+
+TEST(WebAPIUtil, URLEncodeRoundTrip)
+{
+    EXPECT_EQ("aZ09-._~", URLEncode("aZ09-._~"));
+    EXPECT_EQ("a%20b%2B%2F%3F%25%C3%A9%00", URLEncode(std::string("a b+/?%\xC3\xA9\0", 10)));
+    std::string all;
+    for (int c = 0; c < 256; ++c) {
+        all.push_back(static_cast<char>(c));
+    }
+    EXPECT_EQ(all, URLDecode(URLEncode(all), true));
+}
+
+// Every parser here takes client text: its time is linear in the input
+// (support/LinearTime.h).
+TEST(WebAPIUtil, ParsersTakeLinearTime)
+{
+    using VELA::Test::ExpectLinear;
+    using VELA::Test::LinearParser;
+    const LinearParser form = [](const std::string& text) {
+        Json::Value out;
+        strPairToJsonObj(text, out, true, true);
+    };
+    const LinearParser decode = [](const std::string& text) { URLDecode(text, true); };
+    // "&" alone was the quadratic case: each piece looked for "=" to the
+    // end of the body.
+    for (const char* piece : {"&", "&&=", "=", "a=b&", "%4"}) {
+        ExpectLinear("strPairToJsonObj", form, piece);
+        ExpectLinear("URLDecode", decode, piece);
+    }
+    const LinearParser list = [](const std::string& text) { ParseToArray(text.c_str(), ", "); };
+    const LinearParser json = [](const std::string& text) {
+        Json::Value out;
+        ParseJson(text, out);
+    };
+    for (const char* piece : {", ", ",,  "}) {
+        ExpectLinear("ParseToArray", list, piece, 4u << 20);
+    }
+    for (const char* piece : {"[1,", "\"\\\\", "{\"a\":"}) {
+        ExpectLinear("ParseJson", json, piece);
+    }
+}
+
+}  // namespace

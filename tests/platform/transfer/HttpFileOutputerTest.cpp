@@ -1,0 +1,486 @@
+// HTTP file output: whole files through a pipe and a file,
+// byte ranges, X-Sendfile only for paths nobody else can change, links on
+// the path refused, refusals, the disposition header, a client that goes
+// away.
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <cstdio>
+#include <fcntl.h>
+#include <fstream>
+#include <functional>
+#include <iostream>
+#include <string>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <vector>
+
+#include "platform/StateRootTest.h"
+#include "support/TestSupport.h"
+#include "vela/httpoutput.h"
+
+namespace {
+
+using VELA::HTTP::FileOutputerHelper;
+using VELA::Test::ScopedEnv;
+
+struct Reply {
+    bool ok = false;
+    std::string head;  // the header block without its empty line
+    std::string body;
+    bool complete = false;  // the empty line was there
+
+    // The value of header `name`, "" when absent.
+    std::string Header(const std::string& name) const
+    {
+        const std::string key = name + ": ";
+        size_t pos = 0;
+        while (pos < head.size()) {
+            size_t end = head.find("\r\n", pos);
+            end = end == std::string::npos ? head.size() : end;
+            if (head.compare(pos, key.size(), key) == 0) {
+                return head.substr(pos + key.size(), end - pos - key.size());
+            }
+            pos = end + 2;
+        }
+        return "";
+    }
+};
+
+Reply Split(bool ok, const std::string& out)
+{
+    Reply r;
+    r.ok = ok;
+    const size_t end = out.find("\r\n\r\n");
+    r.complete = end != std::string::npos;
+    r.head = r.complete ? out.substr(0, end + 2) : out;
+    r.body = r.complete ? out.substr(end + 4) : "";
+    return r;
+}
+
+// Runs `fn` with standard output on a new file opened with `flags` (extra
+// open flags), in this process.
+Reply ToFile(const std::string& dir, const std::function<bool()>& fn, int flags = 0)
+{
+    const std::string path = dir + "/stdout";
+    const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | flags, 0600);
+    EXPECT_GE(fd, 0);
+    fflush(stdout);
+    const int saved = dup(1);
+    dup2(fd, 1);
+    close(fd);
+    const bool ok = fn();
+    fflush(stdout);
+    dup2(saved, 1);
+    close(saved);
+    return Split(ok, VELA::Test::ReadText(path));
+}
+
+// Runs `fn` in a child whose standard output is a pipe read by this
+// process.
+Reply ThroughPipe(const std::function<bool()>& fn)
+{
+    int fds[2];
+    EXPECT_EQ(0, pipe(fds));
+    fflush(stdout);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        close(fds[0]);
+        dup2(fds[1], 1);
+        close(fds[1]);
+        _exit(fn() ? 0 : 1);
+    }
+    close(fds[1]);
+    std::string out;
+    char buf[65536];
+    ssize_t n;
+    while ((n = read(fds[0], buf, sizeof(buf))) > 0) {
+        out.append(buf, static_cast<size_t>(n));
+    }
+    close(fds[0]);
+    int status = 0;
+    waitpid(pid, &status, 0);
+    return Split(WIFEXITED(status) && WEXITSTATUS(status) == 0, out);
+}
+
+std::string Pattern(size_t size)
+{
+    std::string data(size, '\0');
+    for (size_t i = 0; i < size; ++i) {
+        data[i] = static_cast<char>((i * 131 + i / 7) & 0xff);
+    }
+    return data;
+}
+
+class HttpOutput : public StateRootTest {
+protected:
+    void SetUp() override
+    {
+        StateRootTest::SetUp();
+        FileOutputerHelper::SetFastOutputEnabled(true);
+        mkdir((root_.Path() + "/etc").c_str(), 0755);
+        mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
+        mkdir(files_.c_str(), 0755);
+    }
+    std::string Write(const std::string& name, const std::string& data)
+    {
+        const std::string path = files_ + "/" + name;
+        std::ofstream(path, std::ios::binary) << data;
+        return path;
+    }
+
+    ScopedEnv range_{"HTTP_RANGE", nullptr};
+    ScopedEnv ifRange_{"HTTP_IF_RANGE", nullptr};
+    ScopedEnv method_{"REQUEST_METHOD", "GET"};
+    std::string files_ = root_.Path() + "/files";
+    HTTPFileOutputer out_;
+};
+
+TEST_F(HttpOutput, WholeFileThroughPipeFileAndAppendOnlyFile)
+{
+    // Larger than a pipe's buffer and than the copy buffer of the fallback.
+    const std::string data = Pattern(3 * 1024 * 1024 + 17);
+    const std::string path = Write("big.bin", data);
+    const auto send = [&] {
+        std::cout << "X-From-Cout: 1\r\n";
+        printf("X-From-Stdio: 2\r\n");
+        return out_.Output(path, "application/x-test");
+    };
+    // O_APPEND makes sendfile refuse the output: the read/write path runs.
+    for (const Reply& r : {ThroughPipe(send), ToFile(root_.Path(), send), ToFile(root_.Path(), send, O_APPEND)}) {
+        EXPECT_TRUE(r.ok);
+        EXPECT_EQ(0u, r.head.find("X-From-Cout: 1\r\nX-From-Stdio: 2\r\n"));
+        EXPECT_EQ("application/x-test", r.Header("Content-Type"));
+        EXPECT_EQ(std::to_string(data.size()), r.Header("Content-Length"));
+        EXPECT_EQ("bytes", r.Header("Accept-Ranges"));
+        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options"));
+        EXPECT_EQ("", r.Header("Status"));
+        EXPECT_TRUE(r.body == data) << "body of " << r.body.size() << " bytes differs";
+    }
+
+    ScopedEnv head("REQUEST_METHOD", "HEAD");
+    const Reply r = ToFile(root_.Path(), [&] { return out_.Output(path, ""); });
+    EXPECT_TRUE(r.ok && r.complete);
+    EXPECT_EQ(std::to_string(data.size()), r.Header("Content-Length"));
+    EXPECT_EQ("application/octet-stream", r.Header("Content-Type"));
+    EXPECT_EQ("", r.body);
+}
+
+TEST_F(HttpOutput, SingleRanges)
+{
+    const std::string data = Pattern(1000);
+    const std::string path = Write("r.bin", data);
+    struct Case {
+        const char* range;
+        int status;  // 200, 206 or 416
+        size_t first, last;
+    };
+    const Case cases[] = {
+        {"bytes=10-19", 206, 10, 19},   {"bytes=990-", 206, 990, 999},   {"bytes=-5", 206, 995, 999},
+        {"bytes=-5000", 206, 0, 999},   {"bytes=900-5000", 206, 900, 999}, {" BYTES=0-0 ", 206, 0, 0},
+        {"bytes=1000-", 416, 0, 0},     {"bytes=-0", 416, 0, 0},
+        {"bytes=99999999999999999999999-", 416, 0, 0},
+        {"bytes=5-1", 200, 0, 999},     {"bytes=0-1,5-6", 200, 0, 999},  {"bytes=abc", 200, 0, 999},
+        {"items=0-1", 200, 0, 999},     {"bytes=1-2x", 200, 0, 999},     {"bytes=", 200, 0, 999},
+    };
+    for (const Case& c : cases) {
+        ScopedEnv range("HTTP_RANGE", c.range);
+        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(path, "text/plain"); });
+        EXPECT_TRUE(r.ok && r.complete) << c.range;
+        if (c.status == 416) {
+            EXPECT_EQ("416 Range Not Satisfiable", r.Header("Status")) << c.range;
+            EXPECT_EQ("bytes */1000", r.Header("Content-Range")) << c.range;
+            EXPECT_EQ("", r.body) << c.range;
+            continue;
+        }
+        const std::string part = data.substr(c.first, c.last - c.first + 1);
+        EXPECT_EQ(c.status == 206 ? "206 Partial Content" : "", r.Header("Status")) << c.range;
+        EXPECT_EQ(c.status == 206 ? "bytes " + std::to_string(c.first) + "-" + std::to_string(c.last) + "/1000" : "",
+                  r.Header("Content-Range"))
+            << c.range;
+        EXPECT_EQ(std::to_string(part.size()), r.Header("Content-Length")) << c.range;
+        EXPECT_TRUE(r.body == part) << c.range;
+    }
+
+    // If-Range: only the date the file was sent with keeps the range.
+    ScopedEnv range("HTTP_RANGE", "bytes=0-9");
+    const std::string modified = ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).Header("Last-Modified");
+    ASSERT_NE("", modified);
+    {
+        ScopedEnv ifRange("HTTP_IF_RANGE", modified.c_str());
+        EXPECT_EQ(10u, ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).body.size());
+    }
+    {
+        ScopedEnv ifRange("HTTP_IF_RANGE", "\"some-etag\"");
+        EXPECT_EQ(data.size(), ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).body.size());
+    }
+
+    const std::string empty = Write("empty", "");
+    EXPECT_EQ("bytes */0", ToFile(root_.Path(), [&] { return out_.Output(empty, ""); }).Header("Content-Range"));
+}
+
+// A directory whose every ancestor only root or this account may change, as
+// a build directory normally is (CTest passes it), unlike $TMPDIR: the
+// place where X-Sendfile may be used at all.
+class ServerOnlyDir {
+public:
+    ServerOnlyDir() : base_("TMPDIR", getenv("VELA_TEST_BINARY_DIR")), dir_() { chmod(dir_.Path().c_str(), 0755); }
+    const std::string& Path() const { return dir_.Path(); }
+
+private:
+    ScopedEnv base_;
+    VELA::Test::TempDir dir_;
+};
+
+std::string RealPath(const std::string& path)
+{
+    char* real = realpath(path.c_str(), nullptr);
+    const std::string out = real != nullptr ? real : "";
+    free(real);
+    return out;
+}
+
+TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
+{
+    ASSERT_NE(nullptr, getenv("VELA_TEST_BINARY_DIR")) << "run through CTest";
+    ServerOnlyDir safe;
+    const std::string dir = safe.Path();
+    mkdir((dir + "/sub").c_str(), 0755);
+    const std::string path = dir + "/a b%c.txt";
+    std::ofstream(path) << "content";
+    chmod(path.c_str(), 0644);
+    ASSERT_FALSE(FileOutputerHelper::IsFastOutputEnabled());  // nothing configured
+
+    std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << "xsendfile=\"YES\"\n";
+    VELA::Test::TempDir other;  // another root: the configuration is read again
+    {
+        ScopedEnv root("VELA_ROOT", other.Path().c_str());
+        VELA::System::RootReset();
+        EXPECT_FALSE(FileOutputerHelper::IsFastOutputEnabled());
+    }
+    VELA::System::RootReset();
+    ASSERT_TRUE(FileOutputerHelper::IsFastOutputEnabled());
+    std::string expected = RealPath(dir);
+    ASSERT_NE("", expected);
+    expected += "/a%20b%25c.txt";
+    const int fd = open(path.c_str(), O_RDONLY);
+    ASSERT_GE(fd, 0);
+    const std::function<bool()> byServer[] = {
+        [&] { return out_.Output(path, "text/plain"); },
+        [&] { return out_.Output(dir + "/sub/../a b%c.txt", "text/plain"); },
+        [&] { return out_.Output(fd, "a b%c.txt", "text/plain"); },
+    };
+    for (const auto& call : byServer) {
+        const Reply r = ToFile(root_.Path(), call);
+        EXPECT_TRUE(r.ok && r.complete);
+        EXPECT_EQ(expected, r.Header("X-Sendfile"));
+        EXPECT_EQ("text/plain", r.Header("Content-Type"));
+        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options"));
+        EXPECT_EQ("attachment; filename=\"a b_c.txt\"; filename*=UTF-8''a%20b%25c.txt", r.Header("Content-Disposition"));
+        EXPECT_EQ("", r.Header("Content-Length"));
+        EXPECT_EQ("", r.body);
+    }
+    close(fd);
+
+    // The same file in places someone else could change before the web
+    // server opens it: sent from the open descriptor instead.
+    const auto place = [&](const std::string& folder, mode_t folderMode, mode_t fileMode, uid_t owner) {
+        mkdir(folder.c_str(), 0755);
+        chmod(folder.c_str(), folderMode);
+        const std::string file = folder + "/f.txt";
+        std::ofstream(file) << "content";
+        chmod(file.c_str(), fileMode);
+        EXPECT_EQ(0, owner == getuid() ? 0 : chown(folder.c_str(), owner, static_cast<gid_t>(-1)));
+        return file;
+    };
+    mkdir((dir + "/open").c_str(), 0755);
+    chmod((dir + "/open").c_str(), 0777);
+    std::vector<std::string> streamed = {
+        place(dir + "/others", 0777, 0644, getuid()),
+        place(dir + "/sticky", 01777, 0644, getuid()),
+        place(dir + "/group", 0775, 0644, getuid()),
+        place(dir + "/open/deeper", 0755, 0644, getuid()),  // an ancestor others may write to
+        place(dir + "/file-others", 0755, 0666, getuid()),
+        place(dir + "/file-group", 0755, 0664, getuid()),
+        dir + "/evil\r\nX-Injected: 1",
+    };
+    std::ofstream(streamed.back()) << "content";
+    if (getuid() == 0) {
+        streamed.push_back(place(dir + "/nobody", 0755, 0644, 65534));
+    }
+    for (const std::string& file : streamed) {
+        VELA::Test::LogCapture log;
+        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(file, "text/plain"); });
+        EXPECT_TRUE(r.ok) << file;
+        EXPECT_EQ("", r.Header("X-Sendfile")) << file;
+        EXPECT_EQ("", r.Header("X-Injected")) << file;
+        EXPECT_EQ("7", r.Header("Content-Length")) << file;
+        EXPECT_EQ("content", r.body) << file;
+        EXPECT_TRUE(log.Contains("X-Sendfile not used")) << file;
+    }
+
+    // A descriptor whose path was swapped for a link after the open: its
+    // own file goes out, streamed, and the link's target never does.
+    const std::string swapped = dir + "/swapped.txt";
+    std::ofstream(swapped) << "mine";
+    const int mine = open(swapped.c_str(), O_RDONLY);
+    ASSERT_GE(mine, 0);
+    ASSERT_EQ(0, symlink(path.c_str(), (dir + "/link").c_str()));
+    ASSERT_EQ(0, rename((dir + "/link").c_str(), swapped.c_str()));
+    const Reply kept = ToFile(root_.Path(), [&] { return out_.Output(mine, "swapped.txt", ""); });
+    close(mine);
+    EXPECT_EQ("", kept.Header("X-Sendfile"));
+    EXPECT_EQ("mine", kept.body);
+
+    FILE* file = fopen(path.c_str(), "r");
+    ASSERT_NE(nullptr, file);
+    const Reply stream = ToFile(root_.Path(), [&] { return out_.Output(file, "f", ""); });
+    fclose(file);
+    EXPECT_EQ("", stream.Header("X-Sendfile"));
+    EXPECT_EQ("content", stream.body);
+
+    FileOutputerHelper::SetFastOutputEnabled(false);
+    EXPECT_FALSE(FileOutputerHelper::IsFastOutputEnabled());
+    const Reply direct = ToFile(root_.Path(), [&] { return out_.Output(path, ""); });
+    EXPECT_EQ("", direct.Header("X-Sendfile"));
+    EXPECT_EQ("content", direct.body);
+}
+
+// A link anywhere on the path, the last component or a directory on the
+// way, is refused before anything is written (how the path is opened:
+// FileUtilTest.cpp).
+TEST_F(HttpOutput, SymbolicLinksOnThePathAreRefused)
+{
+    const std::string target = Write("target.txt", "secret");
+    mkdir((files_ + "/dir").c_str(), 0755);
+    const std::string inDir = files_ + "/dir/in.txt";
+    std::ofstream(inDir) << "in";
+    ASSERT_EQ(0, symlink(target.c_str(), (files_ + "/last").c_str()));
+    ASSERT_EQ(0, symlink((files_ + "/dir").c_str(), (files_ + "/middle").c_str()));
+    ASSERT_EQ(0, symlink("dir", (files_ + "/relative").c_str()));
+
+    for (const std::string& link : {files_ + "/last", files_ + "/middle/in.txt", files_ + "/relative/in.txt"}) {
+        VELA::Test::LogCapture log;
+        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(link, ""); });
+        EXPECT_FALSE(r.ok) << link;
+        EXPECT_EQ("", r.head) << link;
+        EXPECT_TRUE(log.Contains("symbolic link")) << link;
+    }
+
+    // A caller that trusts its links may have them followed.
+    out_.SetFollowSymlinks(true);
+    EXPECT_EQ("secret", ToFile(root_.Path(), [&] { return out_.Output(files_ + "/last", ""); }).body);
+    EXPECT_EQ("in", ToFile(root_.Path(), [&] { return out_.Output(files_ + "/middle/in.txt", ""); }).body);
+}
+
+TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
+{
+    const std::string fifo = files_ + "/fifo";
+    ASSERT_EQ(0, mkfifo(fifo.c_str(), 0600));
+    int fds[2];
+    ASSERT_EQ(0, pipe(fds));
+    FILE* pipeStream = fdopen(fds[0], "r");
+    ASSERT_NE(nullptr, pipeStream);
+    FILE* writeOnly = fopen((files_ + "/w").c_str(), "w");
+    ASSERT_NE(nullptr, writeOnly);
+    const int dirFd = open(files_.c_str(), O_RDONLY | O_DIRECTORY);
+    const int fifoFd = open(fifo.c_str(), O_RDONLY | O_NONBLOCK);
+    const int pathFd = open((files_ + "/w").c_str(), O_PATH);  // names a file, cannot read it
+    ASSERT_GE(dirFd, 0);
+    ASSERT_GE(fifoFd, 0);
+    ASSERT_GE(pathFd, 0);
+    for (const std::string& path : {files_, fifo}) {
+        errno = 0;
+        EXPECT_EQ(-1, HTTPFileOutputer::OpenForOutput(path)) << path;
+        EXPECT_EQ(EINVAL, errno) << path;
+    }
+    const std::function<bool()> calls[] = {
+        [&] { return out_.Output(files_, ""); },
+        [&] { return out_.Output(fifo, ""); },  // must not wait for a writer
+        [&] { return out_.Output(files_ + "/missing", ""); },
+        [&] { return out_.Output(std::string("a\0b", 3), ""); },
+        [&] { return out_.Output(static_cast<FILE*>(nullptr), "n", ""); },
+        [&] { return out_.Output(pipeStream, "n", ""); },
+        [&] { return out_.Output(writeOnly, "n", ""); },
+        [&] { return out_.Output(dirFd, "n", ""); },
+        [&] { return out_.Output(fifoFd, "n", ""); },
+        [&] { return out_.Output(fileno(writeOnly), "n", ""); },
+        [&] { return out_.Output(pathFd, "n", ""); },
+        [&] { return out_.Output(-1, "n", ""); },
+    };
+    for (const auto& call : calls) {
+        const Reply r = ToFile(root_.Path(), call);
+        EXPECT_FALSE(r.ok);
+        EXPECT_EQ("", r.head);
+    }
+    fclose(pipeStream);
+    fclose(writeOnly);
+    close(fds[1]);
+    close(dirFd);
+    close(fifoFd);
+    close(pathFd);
+}
+
+TEST_F(HttpOutput, DispositionNamesAreSafe)
+{
+    const std::string path = Write("data", "x");
+    struct Case {
+        std::string name;
+        std::string value;  // "" when no header is expected
+    };
+    const Case cases[] = {
+        {"report.pdf", "attachment; filename=\"report.pdf\"; filename*=UTF-8''report.pdf"},
+        {"a\"b\r\nc;d.txt", "attachment; filename=\"a_b__c;d.txt\"; filename*=UTF-8''a%22b__c%3Bd.txt"},
+        {"r\xc3\xa9sum\xc3\xa9 100%.txt",
+         "attachment; filename=\"r_sum_ 100_.txt\"; filename*=UTF-8''r%C3%A9sum%C3%A9%20100%25.txt"},
+        {"../x\\y", "attachment; filename=\".._x_y\"; filename*=UTF-8''.._x_y"},
+        {"\xff\xc0\x80.bin", "attachment; filename=\"___.bin\""},  // not UTF-8: no extended form
+        {"", ""},
+        // Cut to 255 bytes, never inside a character.
+        {std::string(254, 'n') + "\xc3\xa9.txt",
+         "attachment; filename=\"" + std::string(254, 'n') + "\"; filename*=UTF-8''" + std::string(254, 'n')},
+    };
+    FILE* file = fopen(path.c_str(), "r");
+    ASSERT_NE(nullptr, file);
+    for (const Case& c : cases) {
+        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(file, c.name, ""); });
+        EXPECT_TRUE(r.ok);
+        EXPECT_EQ(c.value, r.Header("Content-Disposition"));
+        EXPECT_EQ("x", r.body);
+    }
+    fclose(file);
+
+    EXPECT_EQ("attachment; filename=\"data\"; filename*=UTF-8''data",
+              ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).Header("Content-Disposition"));
+    out_.SetWriteDisposition(false);
+    EXPECT_EQ("", ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).Header("Content-Disposition"));
+}
+
+TEST_F(HttpOutput, ClientGoneIsAFailureNotACrash)
+{
+    const std::string path = Write("big", Pattern(1024 * 1024));
+    int fds[2];
+    ASSERT_EQ(0, pipe(fds));
+    close(fds[0]);  // nobody reads
+    fflush(stdout);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        dup2(fds[1], 1);
+        close(fds[1]);
+        const bool ok = out_.Output(path, "");
+        sigset_t mask;
+        sigprocmask(SIG_SETMASK, nullptr, &mask);
+        sigset_t pending;
+        sigpending(&pending);
+        // 2: the call failed and left SIGPIPE neither blocked nor pending.
+        _exit(!ok && !sigismember(&mask, SIGPIPE) && !sigismember(&pending, SIGPIPE) ? 2 : 1);
+    }
+    close(fds[1]);
+    int status = 0;
+    ASSERT_EQ(pid, waitpid(pid, &status, 0));
+    ASSERT_TRUE(WIFEXITED(status)) << "killed by signal " << WTERMSIG(status);
+    EXPECT_EQ(2, WEXITSTATUS(status));
+}
+
+}  // namespace

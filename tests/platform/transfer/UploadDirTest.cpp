@@ -1,0 +1,334 @@
+// Private upload directories (vela/uploaddir.h): made, used and removed;
+// which base directories are trusted; removal when a signal ends the
+// request; the sweep of directories left by processes that are gone.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <chrono>
+#include <climits>
+#include <csignal>
+#include <cstdlib>
+#include <fcntl.h>
+#include <string>
+#include <sys/file.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+#include <vector>
+
+#include "support/TestSupport.h"
+#include "vela/log.h"
+#include "vela/sysfile.h"
+#include "vela/upload.h"
+#include "vela/uploaddir.h"
+#include "vela/vlibc.h"
+
+namespace {
+
+using namespace VELA::Transfer;
+
+using VELA::Test::DirEntries;
+using VELA::Test::LogCapture;
+using VELA::Test::ReadText;
+using VELA::Test::TempDir;
+
+const char kType[] = "multipart/form-data; boundary=XyZ";
+const std::string kFileHead = "--XyZ\r\nContent-Disposition: form-data; name=\"f\"; filename=\"a.bin\"\r\n\r\n";
+
+mode_t ModeOf(const std::string& path)
+{
+    struct stat st;
+    return lstat(path.c_str(), &st) == 0 ? st.st_mode : 0;
+}
+
+void WriteFile(const std::string& path, const std::string& text)
+{
+    FILE* f = fopen(path.c_str(), "w");
+    ASSERT_NE(nullptr, f) << path;
+    fputs(text.c_str(), f);
+    fclose(f);
+}
+
+// Sets the modification time of `path` to `age` seconds ago.
+void Age(const std::string& path, int age)
+{
+    const struct timespec times[2] = {{time(nullptr) - age, 0}, {time(nullptr) - age, 0}};
+    ASSERT_EQ(0, utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW)) << path;
+}
+
+// A directory `name` in `base` holding one file, last changed `age` seconds ago.
+void MakeAged(const std::string& base, const std::string& name, int age)
+{
+    const std::string dir = base + "/" + name;
+    ASSERT_EQ(0, mkdir(dir.c_str(), 0700)) << dir;
+    WriteFile(dir + "/upload-abcdefghijklmnop", "left behind");
+    Age(dir, age);
+}
+
+bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+
+// Stores one upload with the multipart reader into `dir`; its stored path.
+std::string Store(const std::string& dir, const std::string& content)
+{
+    const std::string body = kFileHead + content + "\r\n--XyZ--\r\n";
+    const int fd = memfd_create("body", MFD_CLOEXEC);
+    EXPECT_EQ(static_cast<ssize_t>(body.size()), write(fd, body.data(), body.size()));
+    lseek(fd, 0, SEEK_SET);
+    UploadReader* reader = nullptr;
+    PVLIBCSZHASH fields = VLIBCSzHashAlloc(4);
+    PVLIBCSZHASH files = VLIBCSzHashAlloc(4);
+    std::string stored;
+    if (UploadReaderOpen(fd, body.size(), kType, &reader) == 1 &&
+        UploadReadAll(reader, fields, files, dir.c_str(), 0, nullptr) == 1) {
+        stored = VLIBCSzHashGetValue(files, "f");
+    }
+    UploadReaderFree(reader);
+    VLIBCSzHashFree(fields);
+    VLIBCSzHashFree(files);
+    close(fd);
+    return stored;
+}
+
+}  // namespace
+
+TEST(UploadDir, MadeOncePrivateAndRemovedWithItsFiles)
+{
+    TempDir base;
+    MakeAged(base.Path(), "vela-upload-aaaaaaaaaaaa", 2 * VELA_UPLOAD_SWEEP_AGE);  // of a dead process
+    char path[PATH_MAX];
+    char tiny[8];
+    EXPECT_EQ(-1, UploadDirGet(base.Path().c_str(), tiny, sizeof(tiny)));
+    ASSERT_EQ(2, UploadDirGet((base.Path() + "/").c_str(), path, sizeof(path)));
+    const std::string dir = path;
+    EXPECT_EQ(base.Path() + "/" VELA_UPLOAD_DIR_PREFIX, dir.substr(0, base.Path().size() + 13));
+    EXPECT_EQ(std::vector<std::string>{dir.substr(base.Path().size() + 1)}, DirEntries(base.Path()));
+    EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 0700), ModeOf(dir));
+
+    // Later calls, whatever base they name, get the same directory.
+    TempDir other;
+    ASSERT_EQ(1, UploadDirGet(other.Path().c_str(), path, sizeof(path)));
+    EXPECT_EQ(dir, path);
+    EXPECT_TRUE(DirEntries(other.Path()).empty());
+
+    const std::string stored = Store(dir, "data");
+    EXPECT_EQ(dir + "/", stored.substr(0, dir.size() + 1));
+    EXPECT_EQ("data", ReadText(stored));
+
+    // A child that inherited the handlers dies of the signal without
+    // touching its parent's directory.
+    ASSERT_EQ(0, UploadCleanupOnExit());
+    const pid_t child = fork();
+    if (child == 0) {
+        raise(SIGTERM);
+        _exit(0);
+    }
+    int status = 0;
+    ASSERT_EQ(child, waitpid(child, &status, 0));
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGTERM) << status;
+    EXPECT_EQ("data", ReadText(stored));
+
+    EXPECT_EQ(0, UploadDirRemove());
+    EXPECT_TRUE(DirEntries(base.Path()).empty());
+    EXPECT_EQ(0, UploadDirRemove());
+}
+
+TEST(UploadDir, OnlyTrustedBasesAreUsed)
+{
+    TempDir top;
+    ASSERT_EQ(0, chmod(top.Path().c_str(), 0755));
+    const std::string shared = top.Path() + "/shared";
+    ASSERT_EQ(0, mkdir(shared.c_str(), 0700));
+    ASSERT_EQ(0, chmod(shared.c_str(), 0777));  // as an earlier version made "@tmp"
+    {
+        LogCapture log;
+        EXPECT_EQ(1, UploadBaseUsable(shared.c_str()));
+        EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 01777), ModeOf(shared));
+        EXPECT_EQ(LOG_WARNING, log.PriorityOf({shared, "sticky bit"}));
+    }
+    const std::string file = top.Path() + "/file";
+    const std::string link = top.Path() + "/link";
+    WriteFile(file, "x");
+    ASSERT_EQ(0, symlink(shared.c_str(), link.c_str()));
+    char path[PATH_MAX];
+    for (const std::string& bad : {file, link, top.Path() + "/missing"}) {
+        EXPECT_EQ(0, UploadBaseUsable(bad.c_str())) << bad;
+        EXPECT_EQ(-1, UploadDirGet(bad.c_str(), path, sizeof(path))) << bad;
+        EXPECT_EQ(VLIBC_ERR_MKDIR, VLIBCErrGet()) << bad;
+    }
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "directories of other users need root";
+    }
+    // Another user's base: that user could remove or rename what we store,
+    // sticky bit or not. Writable by others without the sticky bit and not
+    // ours to repair: refused as well.
+    ASSERT_EQ(0, chown(shared.c_str(), 65534, 65534));
+    EXPECT_EQ(0, UploadBaseUsable(shared.c_str()));
+    ASSERT_EQ(0, chown(shared.c_str(), 0, 0));
+    ASSERT_EQ(0, chmod(shared.c_str(), 0777));
+    const pid_t child = fork();
+    if (child == 0) {
+        _exit(setresuid(65534, 65534, 65534) == 0 && UploadBaseUsable(shared.c_str()) == 0 ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(child, waitpid(child, &status, 0));
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+    EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 0777), ModeOf(shared));
+}
+
+// An upload in the middle of a file when a signal ends the process: the
+// partial file and the private directory go, and the process dies of that
+// signal. A signal ignored beforehand stays ignored. Without a signal (0)
+// the body ends early and the process calls exit().
+TEST(UploadDir, SignalsAndExitRemoveAPartialUpload)
+{
+    const struct {
+        int sig;
+        int ignored;  // ignored before the handlers are installed, sent first
+    } cases[] = {{SIGTERM, 0}, {SIGPIPE, 0}, {SIGHUP, 0},       {SIGINT, 0},
+                 {SIGALRM, 0}, {SIGXCPU, 0}, {SIGTERM, SIGHUP}, {0, 0}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.sig);
+        TempDir base;
+        int in[2];
+        ASSERT_EQ(0, pipe(in));
+        const pid_t child = fork();
+        if (child == 0) {
+            close(in[1]);
+            if (c.ignored != 0) {
+                signal(c.ignored, SIG_IGN);
+            }
+            char path[PATH_MAX];
+            UploadReader* reader = nullptr;
+            PVLIBCSZHASH fields = VLIBCSzHashAlloc(4);
+            PVLIBCSZHASH files = VLIBCSzHashAlloc(4);
+            if (UploadCleanupOnExit() != 0 || UploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 ||
+                UploadReaderOpen(in[0], 1ULL << 30, kType, &reader) != 1) {
+                _exit(2);
+            }
+            UploadReadAll(reader, fields, files, path, 0, nullptr);  // waits for the rest of the body
+            UploadReaderFree(reader);
+            VLIBCSzHashFree(fields);
+            VLIBCSzHashFree(files);
+            exit(3);
+        }
+        close(in[0]);
+        const std::string part = kFileHead + std::string(256 * 1024, 'p');
+        ASSERT_EQ(static_cast<ssize_t>(part.size()), write(in[1], part.data(), part.size()));
+        // Wait until the partial file is there, then end the process.
+        bool stored = false;
+        for (int i = 0; i < 500 && !stored; ++i) {
+            const std::vector<std::string> dirs = DirEntries(base.Path());
+            if (dirs.size() == 1) {
+                for (const std::string& f : DirEntries(base.Path() + "/" + dirs[0])) {
+                    struct stat st;
+                    stored = stored || (stat((base.Path() + "/" + dirs[0] + "/" + f).c_str(), &st) == 0 &&
+                                        st.st_size > 0);
+                }
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+        ASSERT_TRUE(stored);
+        if (c.ignored != 0) {
+            kill(child, c.ignored);
+        }
+        if (c.sig != 0) {
+            kill(child, c.sig);
+        }
+        close(in[1]);
+        int status = 0;
+        ASSERT_EQ(child, waitpid(child, &status, 0));
+        EXPECT_TRUE(c.sig != 0 ? WIFSIGNALED(status) && WTERMSIG(status) == c.sig
+                               : WIFEXITED(status) && WEXITSTATUS(status) == 3)
+            << status;
+        EXPECT_TRUE(DirEntries(base.Path()).empty());
+    }
+}
+
+// A process that gives up root for good while its directory is root's
+// cannot remove it any more: its reaper does, once the process lets go of it
+// or is killed.
+TEST(UploadDir, ReaperRemovesWhatRootStoredAfterTheDrop)
+{
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "giving up root needs root";
+    }
+    for (bool killed : {false, true}) {
+        SCOPED_TRACE(killed ? "killed" : "lets go");
+        TempDir base;
+        int ready[2];
+        ASSERT_EQ(0, pipe(ready));
+        const pid_t child = fork();
+        if (child == 0) {
+            char path[PATH_MAX];
+            if (UploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 || Store(path, "root's").empty() ||
+                UploadDirReaper() != 1 || setresgid(65534, 65534, 65534) != 0 ||
+                setresuid(65534, 65534, 65534) != 0) {
+                _exit(2);
+            }
+            if (!killed) {
+                _exit(UploadDirRemove());
+            }
+            (void)!write(ready[1], "r", 1);
+            pause();
+        }
+        close(ready[1]);
+        char c;
+        if (killed && read(ready[0], &c, 1) == 1) {
+            kill(child, SIGKILL);
+        }
+        close(ready[0]);
+        int status = 0;
+        ASSERT_EQ(child, waitpid(child, &status, 0));
+        EXPECT_TRUE(killed ? WIFSIGNALED(status) : WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+        for (int i = 0; i < 500 && !DirEntries(base.Path()).empty(); ++i) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+        EXPECT_TRUE(DirEntries(base.Path()).empty());
+    }
+}
+
+TEST(UploadDir, SweepTakesOnlyStaleUnlockedDirectoriesOfOurs)
+{
+    TempDir base;
+    TempDir elsewhere;
+    const std::string& b = base.Path();
+    const int old = 2 * VELA_UPLOAD_SWEEP_AGE;
+    WriteFile(elsewhere.Path() + "/precious", "keep");
+    MakeAged(b, "vela-upload-stalestale22", old);
+    ASSERT_EQ(0, symlink((elsewhere.Path() + "/precious").c_str(), (b + "/vela-upload-stalestale22/ln").c_str()));
+    Age(b + "/vela-upload-stalestale22", old);
+    MakeAged(b, "vela-upload-livelivelive", old);
+    MakeAged(b, "vela-upload-freshfresh22", 0);
+    MakeAged(b, "vela-upload-short", old);
+    MakeAged(b, "other-upload-stalestale", old);
+    MakeAged(elsewhere.Path(), "target", old);
+    ASSERT_EQ(0, symlink((elsewhere.Path() + "/target").c_str(), (b + "/vela-upload-linklinklink").c_str()));
+    WriteFile(b + "/vela-upload-filefilefile", "a file");
+    if (geteuid() == 0) {
+        MakeAged(b, "vela-upload-foreignforei", old);
+        ASSERT_EQ(0, chown((b + "/vela-upload-foreignforei").c_str(), 65534, 65534));
+    }
+    // A live request holds its directory's lock.
+    const int live = open((b + "/vela-upload-livelivelive").c_str(), O_RDONLY | O_DIRECTORY);
+    ASSERT_EQ(0, flock(live, LOCK_EX));
+
+    EXPECT_EQ(1, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_FALSE(Exists(b + "/vela-upload-stalestale22"));
+    EXPECT_EQ("keep", ReadText(elsewhere.Path() + "/precious"));
+    EXPECT_TRUE(Exists(elsewhere.Path() + "/target/upload-abcdefghijklmnop"));
+    EXPECT_EQ(geteuid() == 0 ? 7u : 6u, DirEntries(b).size());
+
+    close(live);  // the request is gone
+    EXPECT_EQ(1, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_FALSE(Exists(b + "/vela-upload-livelivelive"));
+
+    // Bounded work: eight directories per call.
+    for (int i = 0; i < 10; ++i) {
+        MakeAged(b, "vela-upload-bulkbulk22" + std::string(1, 'a' + i) + "a", old);
+    }
+    EXPECT_EQ(8, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_EQ(2, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+    EXPECT_EQ(0, UploadSweep(b.c_str(), VELA_UPLOAD_SWEEP_AGE));
+}
