@@ -53,16 +53,10 @@ bool ReadInput(int argc, char** argv, std::string& text)
 
 }  // namespace
 
-int main(int argc, char** argv)
+// What a handler reads of the request: names, URL, cookies, client kind
+// and session facts.
+Json::Value Seen(const VELA::APIRequest& request)
 {
-    std::string text;
-    Json::Value input;
-    if (!ReadInput(argc, argv, text) || !VELA::JsonParse(text, input)) {
-        fprintf(stderr, "vela-demo: the input is not a JSON document\n");
-        return 2;
-    }
-    VELA::APIRequest request(input);
-
     Json::Value seen(Json::objectValue);
     seen["api"] = request.GetAPIClass();
     seen["version"] = request.GetAPIVersion();
@@ -86,6 +80,20 @@ int main(int argc, char** argv)
     seen["session"]["uiLanguage"] = request.GetUILanguage();
     seen["session"]["allowUser"] = request.GetAllowUser();
     seen["session"]["authResult"] = static_cast<int>(request.GetAuthResult());
+    seen["upload"] = request.IsUploadRequest();
+    return seen;
+}
+
+int main(int argc, char** argv)
+{
+    std::string text;
+    Json::Value input;
+    if (!ReadInput(argc, argv, text) || !VELA::JsonParse(text, input)) {
+        fprintf(stderr, "vela-demo: the input is not a JSON document\n");
+        return 2;
+    }
+    VELA::APIRequest request(input);
+    Json::Value seen = Seen(request);
     // Typed parameters, with the flags a handler would test.
     auto count = request.GetAndCheckInt("count", VELA::APIRequest::OPTIONAL);
     auto tags = request.GetAndCheckUnitArray("tags", VELA::APIRequest::OPTIONAL);
@@ -97,7 +105,6 @@ int main(int argc, char** argv)
     seen["param"]["enabled"] = enabled.IsInvalid() ? Json::Value("invalid") : Json::Value(enabled.Get());
     seen["param"]["port"] = port.Get();
     seen["param"]["portIsDefault"] = port.IsDefault();
-    seen["upload"] = request.IsUploadRequest();
 
     // What an echo handler would answer.
     VELA::APIResponse response(&request);
