@@ -1,7 +1,7 @@
 // Usage counter: calls per API, version and method, in JSON files under
 // /var/spool/webapi, when the owner agreed to usage data collection
-// (enable_data_collect="yes" in /etc/velainfo.conf). Nothing is logged and
-// every failure only skips the count.
+// (enable_data_collect="yes" in /etc/velainfo.conf). A failure never fails
+// the call: the count is skipped, and every count lost is logged.
 //
 // File <dir>/<stem>.json, where <stem> is the API name cut before its fourth
 // dot; one member per call kind:
@@ -9,9 +9,11 @@
 // The read-modify-write is serialised by an flock on <file>.lock.
 #include "dispatcher/UsageCounter.h"
 
+#include <cerrno>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <ctime>
 #include <fcntl.h>
 #include <mutex>
@@ -21,6 +23,7 @@
 #include "dispatcher/ResolvedCall.h"
 #include "dispatcher/Road.h"
 #include "platform/system/FileUtil.h"
+#include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
@@ -33,8 +36,18 @@ namespace {
 
 const char kInfoFile[] = "/etc/velainfo.conf";
 const char kCounterDir[] = "/var/spool/webapi";
+// Only the server's own account uses the directory, and a directory it
+// cannot search is one it cannot create files in.
+const mode_t kCounterDirMode = 0700;
 const int kLockWaitSeconds = 2;
 const size_t kMaxStem = 200;
+
+// Why a count was lost: what failed on `path`, with the error of that call.
+std::string Failed(const char* what, const std::string& path)
+{
+    const int err = errno;
+    return std::string(what) + " " + path + " [" + strerror(err) + "]";
+}
 
 // Replaces `file` with `value`: a temporary file in the same directory,
 // renamed over it, so a reader or a crash never sees a cut file. No fsync:
@@ -51,7 +64,9 @@ bool WriteCounters(const std::string& file, const Json::Value& value)
     const bool ok = System::WriteAll(fd.Get(), text.data(), text.size()) && close(fd.Release()) == 0 &&
                     rename(tmp.c_str(), file.c_str()) == 0;
     if (!ok) {
+        const int err = errno;
         unlink(tmp.c_str());
+        errno = err;
     }
     return ok;
 }
@@ -81,14 +96,16 @@ bool CollectEnabled()
 }
 
 // Creates the counter directory once per process and touches its marker.
-bool CounterDirReady(const std::string& dir)
+// False, with `why`, when there is no directory.
+bool CounterDirReady(const std::string& dir, std::string& why)
 {
     CounterState& state = State();
     std::lock_guard<std::mutex> guard(state.lock);
     if (state.dirReady) {
         return true;
     }
-    if (VELAFSMkdirP(dir.c_str(), 0, 0, static_cast<uid_t>(-1), static_cast<gid_t>(-1), 0600) != 0) {
+    if (VELAFSMkdirP(dir.c_str(), 0, 0, static_cast<uid_t>(-1), static_cast<gid_t>(-1), kCounterDirMode) != 0) {
+        why = Failed("cannot create", dir);
         return false;
     }
     VLIBCFileTouch((dir + "/.timestamp").c_str());
@@ -116,18 +133,23 @@ std::string FileStem(const std::string& api)
     return stem;
 }
 
-void Count(const std::string& dir, const std::string& api, const std::string& method, int version)
+// Counts one call; false, with `why`, when the count is lost.
+bool Count(const std::string& dir, const std::string& api, const std::string& method, int version,
+           std::string& why)
 {
     const std::string stem = FileStem(api);
     if (stem.empty()) {
-        return;
+        why = "the API name cannot name a counter file";
+        return false;
     }
     const std::string file = dir + "/" + stem + ".json";
     const std::string lockFile = file + ".lock";
     int handle = -1;
     if (VLIBCFileLockTimeByFile(lockFile.c_str(), 1, kLockWaitSeconds, &handle) != 0) {
-        return;
+        why = Failed("cannot lock", lockFile);
+        return false;
     }
+    bool written = false;
     try {
         Json::Value counters;
         if (!JsonReadFile(file, counters) || !counters.isObject()) {
@@ -146,11 +168,15 @@ void Count(const std::string& dir, const std::string& api, const std::string& me
                 count = static_cast<Json::Int64>(count.asInt64() + 1);
             }
         }
-        WriteCounters(file, counters);
+        written = WriteCounters(file, counters);
+        if (!written) {
+            why = Failed("cannot write", file);
+        }
     } catch (...) {
-        // A count is never worth failing the call.
+        why = "out of memory";  // a count is never worth failing the call
     }
     VLIBCFileUnlockByFile(handle);
+    return written;
 }
 
 }  // namespace
@@ -169,11 +195,16 @@ static void CountCall(const std::string& api, int version, const std::string& me
     if (!CollectEnabled()) {
         return;
     }
-    const std::string dir = VELA::System::Path(kCounterDir);
-    if (!CounterDirReady(dir)) {
-        return;
+    try {
+        const std::string dir = VELA::System::Path(kCounterDir);
+        std::string why;
+        if (!CounterDirReady(dir, why) || !Count(dir, api, method, version, why)) {
+            VELA_LOG_ERR("usage count of %.200s_%d_%.200s lost: %s", api.c_str(), version, method.c_str(),
+                         why.c_str());
+        }
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("usage count lost: out of memory");
     }
-    Count(dir, api, method, version);
 }
 
 void APIRunner::IncreaseCounter(APIRequest* req)

@@ -32,6 +32,17 @@ bool IsReadableRegular(int fd)
            S_ISREG(st.st_mode);
 }
 
+// A stream the outputer can send: open for reading and not a directory.
+// Regular files go out with their length; anything else (a pipe, a socket)
+// to its end without one.
+bool IsReadableStream(int fd)
+{
+    struct stat st;
+    const int mode = fd < 0 ? -1 : fcntl(fd, F_GETFL);
+    return mode >= 0 && (mode & O_ACCMODE) != O_WRONLY && (mode & O_PATH) == 0 && fstat(fd, &st) == 0 &&
+           !S_ISDIR(st.st_mode);
+}
+
 }  // namespace
 
 APIDownload::APIDownload() : d_(nullptr)
@@ -172,8 +183,8 @@ bool APIDownload::Output(int fd, std::string const& name)
 
 bool APIDownload::Output(FILE* file)
 {
-    if (file == nullptr || !IsReadableRegular(fileno(file))) {
-        VELA_LOG_ERR("download refused: the stream is not a readable regular file");
+    if (file == nullptr || !IsReadableStream(fileno(file))) {
+        VELA_LOG_ERR("download refused: the stream cannot be read");
         return false;
     }
     PrintHeader();

@@ -144,7 +144,11 @@ bool SetEnv(const char* name, const std::string& value, APIResponse* resp)
 
 // A sharing id becomes the sharing header; with it, a sharing session id
 // joins the cookie header. A sharing session id alone changes nothing.
-bool MoveSharingParams(const IdentityParams& p, APIResponse* resp, std::string& cookie, std::string& sharingHeader)
+// `cookieCameIn`: the client sent a non-empty cookie header, which is what
+// decides whether "; " separates what is appended (not the header as it
+// stands after an earlier addition).
+bool MoveSharingParams(const IdentityParams& p, bool cookieCameIn, APIResponse* resp, std::string& cookie,
+                       std::string& sharingHeader)
 {
     if (!p.hasSharingId) {
         return true;
@@ -156,7 +160,7 @@ bool MoveSharingParams(const IdentityParams& p, APIResponse* resp, std::string& 
     if (!p.hasSharingSid) {
         return true;
     }
-    if (!cookie.empty()) {
+    if (cookieCameIn) {
         cookie += "; ";
     }
     cookie += std::string(kSharingSidCookie) + "=" + p.sharingSid;
@@ -166,14 +170,15 @@ bool MoveSharingParams(const IdentityParams& p, APIResponse* resp, std::string& 
 // The session id of the query replaces the one of the cookie header: the
 // first "id=" in the header (a plain substring search, which can also hit
 // the end of a longer name) becomes "abandoned=", and the new id is
-// appended. Without a session id, an access token goes into the
-// environment (a failure there sets no error).
-bool MoveSessionParams(const IdentityParams& p, APIResponse* resp, std::string& cookie)
+// appended; both only when the client sent a cookie header. Without a
+// session id, an access token goes into the environment (a failure there
+// sets no error).
+bool MoveSessionParams(const IdentityParams& p, bool cookieCameIn, APIResponse* resp, std::string& cookie)
 {
     if (!p.hasSid) {
         return !p.hasTid || SetEnv("velaAccessToken", p.tid, nullptr);
     }
-    if (!cookie.empty()) {
+    if (cookieCameIn) {
         cookie += "; ";
         const size_t at = cookie.find("id=");
         if (at != std::string::npos) {
@@ -205,18 +210,17 @@ bool MoveIdentityParams(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)
 
     std::string cookie = RequestFacts::Text(req->GetEnv("HTTP_COOKIE"));
     std::string sharingHeader = RequestFacts::Text(req->GetEnv(kSharingHeaderEnv));
-    if (!MoveSharingParams(p, resp, cookie, sharingHeader) || !MoveSessionParams(p, resp, cookie)) {
+    const bool cookieCameIn = !cookie.empty();
+    if (!MoveSharingParams(p, cookieCameIn, resp, cookie, sharingHeader) ||
+        !MoveSessionParams(p, cookieCameIn, resp, cookie)) {
         return false;
     }
 
+    // Both headers join the request's environment, empty ones included.
     VelaCgiLoadInCookies(cgi);
     Json::Value env(Json::objectValue);
-    if (!cookie.empty()) {
-        env["HTTP_COOKIE"] = cookie;
-    }
-    if (!sharingHeader.empty()) {
-        env[kSharingHeaderEnv] = sharingHeader;
-    }
+    env["HTTP_COOKIE"] = cookie;
+    env[kSharingHeaderEnv] = sharingHeader;
     req->InitEnv(env);
     return true;
 }

@@ -49,8 +49,20 @@
 // therefore always streamed. Output(FILE*) never uses X-Sendfile: its
 // caller may remove or change the file as soon as the call returns.
 //
-// Only regular files are sent. Output returns false, having written nothing,
-// when the file cannot be opened or is not a regular file; it returns false
+// Streams: Output(FILE*) also takes a readable stream that is not a regular
+// file (a pipe, a socket, a FIFO, a device). Its length is unknown, so it
+// goes out with
+//   Content-Type, Content-Disposition (as above), Accept-Ranges: none,
+//   X-Content-Type-Options: nosniff
+// and no Content-Length, Last-Modified or range answer; the body is what
+// the stream gives from where its reader stands (bytes already in its
+// buffer first) to its end, written as it arrives (the descriptor is
+// non-blocking meanwhile, its flags restored afterwards). The answer ends
+// when the CGI output does.
+//
+// Otherwise only regular files are sent. Output returns false, having
+// written nothing, when the file cannot be opened, is not a regular file
+// (but for the streams above) or is a directory; it returns false
 // as well when the client went away or the file shrank while it was being
 // sent (the answer is then cut short). No call throws; SIGPIPE never kills
 // the process during a call.
@@ -91,8 +103,9 @@ public:
     bool Output(int fd, const std::string& name, const std::string& mimeType);
     // Sends the whole of the open regular file `file`, from its first byte
     // whatever its position (pending output of the stream is flushed
-    // first), never through X-Sendfile. `name` as above. The stream is not
-    // closed.
+    // first), never through X-Sendfile; any other readable stream to its
+    // end without a length (see Streams above). `name` as above. The stream
+    // is not closed.
     bool Output(FILE* file, const std::string& name, const std::string& mimeType);
 
     // Whether Output(path) follows symbolic links (off by default). Only for

@@ -68,9 +68,12 @@ public:
     // is sent (X-Sendfile). False, with nothing written, when `fd` is not a
     // readable regular file.
     bool Output(int fd, std::string const& name);
-    // Sends the whole of the open regular file `file` (not closed), as
+    // Sends the open stream `file` (not closed), as
     // application/octet-stream unless a MIME type was set, without a file
-    // name.
+    // name: a regular file whole, with its length; any other readable
+    // stream (a pipe from popen, a socket, a FIFO) from where its reader
+    // stands to its end, without a length and without ranges. False, with
+    // nothing written, when `file` cannot be read or is a directory.
     bool Output(FILE* file);
 
     // Fast output (X-Sendfile) off for the rest of the process.

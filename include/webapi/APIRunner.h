@@ -62,7 +62,10 @@ public:
     // The response body plus "httpd_restart"; null without a response.
     Json::Value GetResponse();
     // Runs the response's after-reply callbacks in a detached child, one
-    // second later, so that the reply is not held up.
+    // second later, so that the reply is not held up: the child's standard
+    // input and output are /dev/null (its standard error too unless that is
+    // a file), and it closes every pipe and socket it inherited, so the web
+    // server sees the answer end at once. A callback opens what it needs.
     void HandleCallback(APIResponse* resp);
 
     // Runs one API on behalf of `user`. Until the exec handler exists these

@@ -609,6 +609,109 @@ bool SendOpenFile(int fd, const struct stat& st, const std::string& name, const 
     return SendBody(kOut, fd, static_cast<off_t>(first), last - first + 1);
 }
 
+// ---- Streams that are not regular files ----
+
+// The descriptor in non-blocking mode for its scope, so that a read gives
+// what has arrived instead of waiting for a whole buffer; the flags are put
+// back afterwards.
+class NonBlockingScope {
+public:
+    explicit NonBlockingScope(int fd) : fd_(fd), flags_(fcntl(fd, F_GETFL))
+    {
+        changed_ = flags_ >= 0 && (flags_ & O_NONBLOCK) == 0 && fcntl(fd_, F_SETFL, flags_ | O_NONBLOCK) == 0;
+    }
+    ~NonBlockingScope()
+    {
+        if (changed_) {
+            const int saved = errno;
+            fcntl(fd_, F_SETFL, flags_);
+            errno = saved;
+        }
+    }
+    NonBlockingScope(const NonBlockingScope&) = delete;
+    NonBlockingScope& operator=(const NonBlockingScope&) = delete;
+
+private:
+    int fd_;
+    int flags_;
+    bool changed_ = false;
+};
+
+bool WaitReadable(int fd)
+{
+    struct pollfd p = {fd, POLLIN, 0};
+    for (;;) {
+        const int n = poll(&p, 1, -1);
+        if (n > 0) {
+            return true;
+        }
+        if (n < 0 && errno != EINTR) {
+            return false;
+        }
+    }
+}
+
+// The rest of `file`, a readable stream that is not a regular file (a
+// pipe, a socket, a device): its length is unknown, so no Content-Length
+// and no ranges; the content is read through the stream itself, so what
+// its buffer already holds goes out first, and sent as it arrives.
+bool SendStream(FILE* file, const struct stat& st, const std::string& name, const std::string& mimeType,
+                bool writeDisposition)
+{
+    const int fd = fileno(file);
+    const int mode = fcntl(fd, F_GETFL);
+    if (S_ISDIR(st.st_mode) || mode < 0 || (mode & O_ACCMODE) == O_WRONLY) {
+        VELA_LOG_ERR("refused to send a stream that cannot be read");
+        return false;
+    }
+    std::unique_ptr<char[]> buffer(new (std::nothrow) char[kCopyBuffer]);
+    if (!buffer) {
+        VELA_LOG_ERR("out of memory for a download");
+        return false;
+    }
+    std::string block;
+    AddLine(block, "Content-Type", SafeMimeType(mimeType));
+    const std::string disposition = writeDisposition ? DispositionValue(name) : std::string();
+    if (!disposition.empty()) {
+        AddLine(block, "Content-Disposition", disposition);
+    }
+    AddLine(block, "Accept-Ranges", "none");
+    AddLine(block, "X-Content-Type-Options", "nosniff");
+    block += "\r\n";
+
+    FlushStreams();
+    SigpipeBlock noSigpipe;
+    if (!WriteOut(kOut, block.data(), block.size())) {
+        LogWriteFailure(errno);
+        return false;
+    }
+    if (IsHeadRequest()) {
+        return true;
+    }
+    NonBlockingScope nonBlocking(fd);
+    for (;;) {
+        errno = 0;
+        const size_t got = fread(buffer.get(), 1, kCopyBuffer, file);
+        if (got > 0 && !WriteOut(kOut, buffer.get(), got)) {
+            LogWriteFailure(errno);
+            return false;
+        }
+        if (feof(file)) {
+            return true;
+        }
+        if (!ferror(file)) {
+            continue;
+        }
+        const int err = errno;
+        if (err == EINTR || ((err == EAGAIN || err == EWOULDBLOCK) && WaitReadable(fd))) {
+            clearerr(file);
+            continue;
+        }
+        VELA_LOG_ERR("cannot read the stream of a download: %s", strerror(err));
+        return false;
+    }
+}
+
 // ---- Fast output: which paths the web server may be given ----
 
 // An entry nobody less privileged than the web server can change: owned by
@@ -792,6 +895,15 @@ bool HTTPFileOutputer::Output(FILE* file, const std::string& name, const std::st
     if (file == nullptr) {
         VELA_LOG_ERR("refused download: no file");
         return false;
+    }
+    struct stat st;
+    if (fstat(fileno(file), &st) == 0 && !S_ISREG(st.st_mode)) {
+        try {
+            return SendStream(file, st, name, mimeType, writeDisposition_);
+        } catch (const std::exception&) {
+            VELA_LOG_ERR("out of memory while sending a stream");
+            return false;
+        }
     }
     if (fflush(file) != 0) {
         VELA_LOG_ERR("cannot flush the file of a download: %m");

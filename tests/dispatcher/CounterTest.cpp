@@ -5,6 +5,8 @@
 
 #include <chrono>
 #include <ctime>
+#include <grp.h>
+#include <pwd.h>
 #include <string>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -12,6 +14,7 @@
 
 #include "dispatcher/PipeFixture.h"
 #include "dispatcher/UsageCounter.h"
+#include "platform/IdentityTestUtil.h"
 #include "support/TestSupport.h"
 #include "vela/sysfile.h"
 #include "webapi/APIRequest.h"
@@ -154,6 +157,62 @@ TEST_F(Counter, ConcurrentProcessesLoseNoCount)
            kProcesses, ms, ms / (kProcesses * kCounts));
     EXPECT_EQ(Json::Value(kProcesses * kCounts),
               Counters("VELA.Core.Share.List")["VELA.Core.Share.List_1_get"]["count"]);
+}
+
+// A server that runs as an ordinary user: the directory it creates lets it
+// write its counts; where it cannot write, every count lost is logged.
+TEST_F(Counter, OrdinaryUserCountsOrLogsTheLoss)
+{
+    Collect("yes");
+    // As root the counting runs as "nobody"; otherwise as the test's user.
+    const struct passwd* pw = geteuid() == 0 ? getpwnam("nobody") : nullptr;
+    const uid_t uid = pw != nullptr ? pw->pw_uid : geteuid();
+    const gid_t gid = pw != nullptr ? pw->pw_gid : getegid();
+    ASSERT_NE(0u, uid) << "no unprivileged account";
+    const std::string spool = root_.Path() + "/var/spool";
+    ASSERT_EQ(0, chmod(root_.Path().c_str(), 0755));
+    ASSERT_EQ(0, chmod((root_.Path() + "/etc/velainfo.conf").c_str(), 0644));
+    ASSERT_EQ(0, system(("mkdir -p '" + spool + "'").c_str()));
+    ASSERT_EQ(0, chown(spool.c_str(), uid, gid));
+
+    // Counts `calls` calls as the user; the lines logged about lost counts.
+    const auto countAsUser = [&](int calls) {
+        return VELA::Test::InChild([&]() -> std::string {
+            if (geteuid() == 0 &&
+                (setgroups(0, nullptr) != 0 || setresgid(gid, gid, gid) != 0 || setresuid(uid, uid, uid) != 0)) {
+                return "cannot become the user";
+            }
+            VELA::ResetUsageCounterState();
+            VELA::Test::LogCapture log;
+            APIRunner runner;
+            for (int i = 0; i < calls; ++i) {
+                Count(runner, "VELA.Core.Share", 1, "get");
+            }
+            std::string lost;
+            for (const std::string& line : log.Lines()) {
+                if (line.find("usage count") != std::string::npos) {
+                    lost += line + "\n";
+                }
+            }
+            return lost;
+        });
+    };
+
+    EXPECT_EQ("", countAsUser(2));
+    struct stat st;
+    ASSERT_EQ(0, stat(spool_.c_str(), &st));
+    EXPECT_EQ(uid, st.st_uid);
+    EXPECT_EQ(static_cast<mode_t>(S_IRWXU), st.st_mode & 07777);
+    EXPECT_EQ(Json::Value(2), Counters("VELA.Core.Share")["VELA.Core.Share_1_get"]["count"]);
+
+    ASSERT_EQ(0, chmod(spool_.c_str(), 0500));
+    const std::string lost = countAsUser(2);
+    size_t lines = 0;
+    for (size_t at = 0; (at = lost.find("VELA.Core.Share_1_get lost", at)) != std::string::npos; ++at) {
+        ++lines;
+    }
+    EXPECT_EQ(2u, lines) << lost;
+    EXPECT_EQ(Json::Value(2), Counters("VELA.Core.Share")["VELA.Core.Share_1_get"]["count"]);
 }
 
 // The pipeline counts only what the front end marked for counting, never a

@@ -10,6 +10,7 @@
 #include <sstream>
 #include <string>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -258,6 +259,61 @@ TEST_F(Pipeline, CallbacksRunInAChildAfterTheReply)
     runner.HandleCallback(&empty);
     EXPECT_EQ(-1, waitpid(-1, &status, WNOHANG));
     EXPECT_EQ(ECHILD, errno);
+}
+
+// The after-reply child keeps none of the descriptors a web server may be
+// waiting on: its standard output and error, and a pipe it inherited, all
+// reach end of file while the callback (3 s) is still running.
+TEST_F(Pipeline, CallbacksDoNotHoldTheReply)
+{
+    const std::string marker = root_.Path() + "/callback.done";
+    APIRunner runner;
+    ASSERT_TRUE(runner.Run(
+        Call("VELA.Pipe.Test", 1, "callback", J(R"({"file": ")" + marker + R"(", "sleep": "3"})"))));
+    int out[2], err[2], extra[2];
+    ASSERT_EQ(0, pipe(out));
+    ASSERT_EQ(0, pipe(err));
+    ASSERT_EQ(0, pipe(extra));
+    fflush(stdout);
+    fflush(stderr);
+    const int savedOut = dup(STDOUT_FILENO);
+    const int savedErr = dup(STDERR_FILENO);
+    ASSERT_GE(savedOut, 0);
+    ASSERT_GE(savedErr, 0);
+    dup2(out[1], STDOUT_FILENO);
+    dup2(err[1], STDERR_FILENO);
+    std::cout << "reply";  // still buffered when the child is made
+    runner.HandleCallback(runner.GetResponseObject());
+    std::cout.flush();
+    dup2(savedOut, STDOUT_FILENO);
+    dup2(savedErr, STDERR_FILENO);
+    for (int fd : {savedOut, savedErr, out[1], err[1], extra[1]}) {
+        close(fd);
+    }
+    std::string replies[3];
+    int i = 0;
+    for (int fd : {out[0], err[0], extra[0]}) {
+        char buf[256];
+        for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;) {
+            replies[i].append(buf, static_cast<size_t>(n));
+        }
+        close(fd);
+        ++i;
+    }
+    struct stat st;
+    EXPECT_NE(0, stat(marker.c_str(), &st)) << "the child held a descriptor until its callback ended";
+    EXPECT_EQ("reply", replies[0]);  // once: the child wrote nothing of the parent's
+    EXPECT_EQ("", replies[1]);
+    EXPECT_EQ("", replies[2]);
+
+    std::string pid;
+    for (int n = 0; n < 600 && pid.empty(); ++n) {  // up to a minute on a slow machine
+        usleep(100 * 1000);
+        pid = VELA::Test::ReadText(marker);
+    }
+    ASSERT_FALSE(pid.empty()) << "callback did not run";
+    int status = 0;
+    EXPECT_EQ(static_cast<pid_t>(std::stol(pid)), waitpid(static_cast<pid_t>(std::stol(pid)), &status, 0));
 }
 
 TEST_F(Pipeline, ProcessNameFollowsTheCall)

@@ -107,6 +107,27 @@ TEST_F(Download, StreamIsOctetStreamUnlessTyped)
     EXPECT_NE(std::string::npos, out.find("Content-Type: text/csv\r\n"));
     EXPECT_EQ("hello", out.substr(out.size() - 5));
     fclose(file);
+
+    // Generated content: a pipe goes out to its end, without a length.
+    ScopedEnv range("HTTP_RANGE", "bytes=0-1");
+    response.SetHeader("X-A", "1");
+    FILE* pipe = popen("printf 'made by a program'", "r");
+    ASSERT_NE(nullptr, pipe);
+    out = Capture([&] { return download.Output(pipe); }, ok);
+    pclose(pipe);
+    EXPECT_TRUE(ok);
+    EXPECT_EQ(0u, out.find("X-A: 1\r\nContent-Type: text/csv\r\n")) << out;
+    EXPECT_EQ(std::string::npos, out.find("Content-Length"));
+    EXPECT_EQ(std::string::npos, out.find("Status"));
+    const size_t end = out.find("\r\n\r\n");
+    EXPECT_EQ("made by a program", end == std::string::npos ? "" : out.substr(end + 4));
+
+    // A stream that cannot be read is refused before anything is written.
+    FILE* writeOnly = fopen((root_.Path() + "/w").c_str(), "w");
+    ASSERT_NE(nullptr, writeOnly);
+    EXPECT_EQ("", Capture([&] { return download.Output(writeOnly); }, ok));
+    EXPECT_FALSE(ok);
+    fclose(writeOnly);
 }
 
 TEST_F(Download, OwnResponseNoResponseAndMissingFiles)

@@ -184,7 +184,7 @@ TEST_F(WebEntryInit, SharingParameters)
         ASSERT_TRUE(entry.Initialize(Json::Value()));
         EXPECT_EQ("a=1", EnvOr("HTTP_COOKIE", "-"));
         EXPECT_EQ("-", EnvOr("HTTP_X_VELA_SHARING", "-"));
-        EXPECT_FALSE(entry.GetRequest()->HasEnv("HTTP_X_VELA_SHARING"));
+        EXPECT_FALSE(entry.GetRequest()->IsSharing());
         EXPECT_FALSE(entry.GetRequest()->HasCookie("sharing_sid"));
     }
     Set("QUERY_STRING", "_sharing_id=Link1&_sharing_sid=q");
@@ -194,6 +194,41 @@ TEST_F(WebEntryInit, SharingParameters)
     EXPECT_EQ("Link1", EnvOr("HTTP_X_VELA_SHARING", "-"));
     EXPECT_EQ("Link1", entry.GetRequest()->GetSharingID());
     EXPECT_EQ("q", entry.GetRequest()->GetSharingSID());
+}
+
+// Once an identity parameter is given, the cookie header and the sharing
+// header are merged into the request's environment even when empty; "; "
+// joins what is appended only to a cookie header the client sent.
+TEST_F(WebEntryInit, IdentityHeadersAfterTheParameters)
+{
+    Set("REQUEST_METHOD", "GET");
+    const struct {
+        const char* query;
+        const char* cookieIn;  // null: no Cookie header
+        const char* cookie;
+        const char* sharing;
+    } cases[] = {
+        {"tid=tok1", nullptr, "", ""},
+        {"_sharing_sid=q", nullptr, "", ""},
+        {"_sid=abc", "", "id=abc", ""},
+        {"_sharing_id=L1", "a=1", "a=1", "L1"},
+        {"_sharing_id=L1&_sharing_sid=q", nullptr, "sharing_sid=q", "L1"},
+        // No Cookie header came in: nothing joins the session id to the
+        // sharing session cookie, and no "id=" is looked for.
+        {"_sharing_id=L1&_sharing_sid=q&_sid=abc", nullptr, "sharing_sid=qid=abc", "L1"},
+        {"_sharing_id=L1&_sharing_sid=q&_sid=abc", "id=old", "abandoned=old; sharing_sid=q; id=abc", "L1"},
+    };
+    for (const auto& c : cases) {
+        Set("QUERY_STRING", c.query);
+        Set("HTTP_COOKIE", c.cookieIn);
+        Set("HTTP_X_VELA_SHARING", nullptr);
+        VELA::WebEntry entry;
+        ASSERT_TRUE(entry.Initialize(Json::Value())) << c.query;
+        const VELA::APIRequest* req = entry.GetRequest();
+        EXPECT_EQ(Json::Value(c.cookie), req->GetEnv("HTTP_COOKIE")) << c.query;
+        EXPECT_EQ(Json::Value(c.sharing), req->GetEnv("HTTP_X_VELA_SHARING")) << c.query;
+        EXPECT_EQ(c.sharing[0] != '\0', req->IsSharing()) << c.query;
+    }
 }
 
 TEST_F(WebEntryInit, PostBodyOverridesQueryAndStdinIsClosedAfterIt)

@@ -3,6 +3,7 @@
 #include <cerrno>
 #include <climits>
 #include <cstdio>
+#include <cstdlib>
 #include <grp.h>
 #include <iostream>
 #include <stdexcept>
@@ -13,6 +14,7 @@
 
 #include <json/json.h>
 
+#include "webapi/APIDownload.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APITable.h"
@@ -75,12 +77,18 @@ void NiceFail(APIRequest*, APIResponse* resp)
     resp->SetError(555, details);
 }
 
-// After the reply: writes the pid of the process that runs the callback
-// into the file named by the request's "file" parameter.
+// After the reply: waits the request's "sleep" seconds (0 to 30, default
+// 0), then writes the pid of the process that runs the callback into the
+// file named by the request's "file" parameter. "restart": "1" asks for a
+// restart of the web server as well.
 std::string g_callbackFile;
+unsigned g_callbackSleep = 0;
 
 void WritePid(void* arg)
 {
+    for (unsigned left = g_callbackSleep; left > 0;) {
+        left = sleep(left);
+    }
     const std::string* path = static_cast<const std::string*>(arg);
     const std::string tmp = *path + ".tmp";
     FILE* f = fopen(tmp.c_str(), "w");
@@ -95,8 +103,35 @@ void WritePid(void* arg)
 void Callback(APIRequest* req, APIResponse* resp)
 {
     g_callbackFile = req->GetParam("file", "").asString();
+    const long long wait = atoll(req->GetParam("sleep", "0").asString().c_str());
+    g_callbackSleep = wait > 0 && wait <= 30 ? static_cast<unsigned>(wait) : 0;
     resp->SetCallbackFunc(WritePid, &g_callbackFile);
+    if (req->GetParam("restart", "0").asString() == "1") {
+        resp->SetHttpdRestart(true);
+    }
     resp->SetSuccess();
+}
+
+// A download of generated content: the output of "seq 1 <count>" (count
+// from the request, 1 to 10,000,000) read from a pipe.
+void Stream(APIRequest* req, APIResponse* resp)
+{
+    const long long count = atoll(req->GetParam("count", "1").asString().c_str());
+    if (count < 1 || count > 10000000) {
+        resp->SetError(101);
+        return;
+    }
+    FILE* pipe = popen(("seq 1 " + std::to_string(count)).c_str(), "r");
+    if (pipe == nullptr) {
+        resp->SetError(500);
+        return;
+    }
+    VELA::APIDownload download(resp);
+    download.SetMimeType("text/plain");
+    if (!download.Output(pipe)) {
+        resp->SetError(500);
+    }
+    pclose(pipe);
 }
 
 // The ids and groups the handler runs with, and the method it serves.
@@ -134,6 +169,7 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Pipe.Test", 1, "chdir", ChangeDir},
     {"VELA.Pipe.Test", 1, "throws", Throws},
     {"VELA.Pipe.Test", 1, "callback", Callback},
+    {"VELA.Pipe.Test", 1, "stream", Stream},
     {"VELA.Pipe.Test", 1, "upload", Echo},
     {"VELA.Pipe.Test", 1, "v1only", Echo},
     {"VELA.Pipe.Test", 1, "timeout", Echo},

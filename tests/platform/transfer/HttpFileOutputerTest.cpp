@@ -10,7 +10,9 @@
 #include <fstream>
 #include <functional>
 #include <iostream>
+#include <poll.h>
 #include <string>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -164,6 +166,66 @@ TEST_F(HttpOutput, WholeFileThroughPipeFileAndAppendOnlyFile)
     EXPECT_TRUE(r.ok && r.complete);
     EXPECT_EQ(std::to_string(data.size()), r.Header("Content-Length"));
     EXPECT_EQ("application/octet-stream", r.Header("Content-Type"));
+    EXPECT_EQ("", r.body);
+}
+
+// A stream that is not a regular file (a pipe, a socket) goes out to its
+// end without a length and without ranges, from where its reader stands:
+// bytes already in the stream's buffer included.
+TEST_F(HttpOutput, StreamsWithoutALength)
+{
+    // Larger than a pipe's buffer and than the copy buffer.
+    const std::string data = Pattern(2 * 1024 * 1024 + 5);
+    ScopedEnv range("HTTP_RANGE", "bytes=0-9");
+    const struct {
+        const char* what;
+        int domain;  // -1: a pipe
+        bool nonBlocking;
+    } kinds[] = {{"pipe", -1, false}, {"non-blocking pipe", -1, true}, {"socket", AF_UNIX, false}};
+    for (const auto& kind : kinds) {
+        int fds[2];
+        ASSERT_EQ(0, kind.domain < 0 ? pipe(fds) : socketpair(kind.domain, SOCK_STREAM, 0, fds)) << kind.what;
+        fflush(stdout);
+        const pid_t writer = fork();
+        ASSERT_GE(writer, 0);
+        if (writer == 0) {
+            close(fds[0]);
+            const bool sent = VELA::Platform::WriteAll(fds[1], data.data(), data.size());
+            _exit(sent ? 0 : 1);
+        }
+        close(fds[1]);
+        if (kind.nonBlocking) {
+            ASSERT_EQ(0, fcntl(fds[0], F_SETFL, fcntl(fds[0], F_GETFL) | O_NONBLOCK));
+        }
+        FILE* stream = fdopen(fds[0], "r");
+        ASSERT_NE(nullptr, stream);
+        struct pollfd in = {fds[0], POLLIN, 0};
+        ASSERT_EQ(1, poll(&in, 1, -1));
+        ASSERT_EQ(data[0], static_cast<char>(fgetc(stream)));  // the rest of a buffer is left in the stream
+        const Reply r = ThroughPipe([&] { return out_.Output(stream, "made.tar", "application/x-tar"); });
+        fclose(stream);
+        int status = 0;
+        EXPECT_EQ(writer, waitpid(writer, &status, 0));
+        EXPECT_TRUE(r.ok) << kind.what;
+        EXPECT_EQ("application/x-tar", r.Header("Content-Type")) << kind.what;
+        EXPECT_EQ("attachment; filename=\"made.tar\"; filename*=UTF-8''made.tar", r.Header("Content-Disposition"));
+        EXPECT_EQ("none", r.Header("Accept-Ranges")) << kind.what;
+        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options")) << kind.what;
+        for (const char* absent : {"Content-Length", "Status", "Content-Range", "Last-Modified"}) {
+            EXPECT_EQ("", r.Header(absent)) << kind.what << ": " << absent;
+        }
+        EXPECT_TRUE(r.body == data.substr(1)) << kind.what << ": body of " << r.body.size() << " bytes differs";
+    }
+
+    // HEAD: the headers only.
+    ScopedEnv head("REQUEST_METHOD", "HEAD");
+    FILE* stream = popen("echo generated", "r");
+    ASSERT_NE(nullptr, stream);
+    const Reply r = ToFile(root_.Path(), [&] { return out_.Output(stream, "", ""); });
+    pclose(stream);
+    EXPECT_TRUE(r.ok && r.complete);
+    EXPECT_EQ("application/octet-stream", r.Header("Content-Type"));
+    EXPECT_EQ("", r.Header("Content-Length"));
     EXPECT_EQ("", r.body);
 }
 
@@ -378,10 +440,6 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
 {
     const std::string fifo = files_ + "/fifo";
     ASSERT_EQ(0, mkfifo(fifo.c_str(), 0600));
-    int fds[2];
-    ASSERT_EQ(0, pipe(fds));
-    FILE* pipeStream = fdopen(fds[0], "r");
-    ASSERT_NE(nullptr, pipeStream);
     FILE* writeOnly = fopen((files_ + "/w").c_str(), "w");
     ASSERT_NE(nullptr, writeOnly);
     const int dirFd = open(files_.c_str(), O_RDONLY | O_DIRECTORY);
@@ -390,6 +448,8 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
     ASSERT_GE(dirFd, 0);
     ASSERT_GE(fifoFd, 0);
     ASSERT_GE(pathFd, 0);
+    FILE* dirStream = fdopen(dup(dirFd), "r");
+    ASSERT_NE(nullptr, dirStream);
     for (const std::string& path : {files_, fifo}) {
         errno = 0;
         EXPECT_EQ(-1, HTTPFileOutputer::OpenForOutput(path)) << path;
@@ -401,7 +461,7 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
         [&] { return out_.Output(files_ + "/missing", ""); },
         [&] { return out_.Output(std::string("a\0b", 3), ""); },
         [&] { return out_.Output(static_cast<FILE*>(nullptr), "n", ""); },
-        [&] { return out_.Output(pipeStream, "n", ""); },
+        [&] { return out_.Output(dirStream, "n", ""); },
         [&] { return out_.Output(writeOnly, "n", ""); },
         [&] { return out_.Output(dirFd, "n", ""); },
         [&] { return out_.Output(fifoFd, "n", ""); },
@@ -414,9 +474,8 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
         EXPECT_FALSE(r.ok);
         EXPECT_EQ("", r.head);
     }
-    fclose(pipeStream);
+    fclose(dirStream);
     fclose(writeOnly);
-    close(fds[1]);
     close(dirFd);
     close(fifoFd);
     close(pathFd);

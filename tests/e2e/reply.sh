@@ -1,0 +1,99 @@
+#!/usr/bin/env bash
+# The reply reaches the client at once, through the real web server (a
+# private lighttpd, as in e2e.sh): work a handler leaves for after the reply
+# (a slow callback, a restart of the web server) does not hold the answer
+# open, and generated content (a download read from a pipe) goes out to its
+# end without a length.
+#
+# No check here measures time: the callback of VELA.Pipe.Test's "callback"
+# writes its marker file only when it ends, several seconds after the reply,
+# so the answer must be complete while the marker is still missing, and the
+# marker must appear later.
+#
+# usage: reply.sh VELASCGI STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR
+# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without the
+# tools or when not run as root.
+set -u
+
+[ $# -eq 4 ] || { echo "usage: reply.sh VELASCGI STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR" >&2; exit 2; }
+VELASCGI=$(realpath -e "$1") || exit 1
+WEBAPI=$(realpath -e "$2") || exit 1
+PIPE_LIB=$(realpath -e "$3") || exit 1
+SRC=$(realpath -e "$4") || exit 1
+
+. "$SRC/tests/e2e/server.sh"
+srv_require "the after-reply work runs as root" seq cmp sleep
+srv_traps
+
+# ---- The system root: the staged web-API directory plus VELA.Pipe.Test of
+# the test handler library, run as root so that its callbacks are too; the
+# web server to restart is a stand-in process ("sleep", which USR1 ends)
+# named by a pid file under the root.
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
+api=$ROOT/usr/vela/velaman/webapi
+rm "$api" && mkdir "$api" && ln -s "$WEBAPI"/* "$api"/ || exit 1
+cat >"$api/VELA.Pipe.Test.lib" <<EOF
+{"VELA.Pipe.Test": {"lib": "$PIPE_LIB", "minVersion": 1, "maxVersion": 1, "authLevel": 0, "runAs": "system",
+  "methods": {"1": ["callback", {"stream": {"allowDownload": true}}]}}}
+EOF
+mkdir -p "$ROOT/run" "$RUN/www" || exit 1
+sleep 600 &
+standin=$!
+disown "$standin"  # its end by USR1 is expected: no job report
+trap 'kill "$standin" 2>/dev/null; if [ "$failures" -ne 0 ]; then srv_logs; fi; srv_cleanup' EXIT
+echo "$standin" >"$ROOT/run/standin.pid"
+chmod 0644 "$ROOT/run/standin.pid"
+printf 'httpd_name="sleep"\nhttpd_pidfile="/run/standin.pid"\nhttpd_restart_signal="USR1"\n' \
+  >"$ROOT/etc/vela/webapi.conf"
+srv_start "$RUN/www" || { failures=1; kill "$standin"; exit 1; }
+
+# wait_for CHECK...: up to a minute until the command CHECK succeeds.
+wait_for() {
+  local _
+  for _ in $(seq 1 600); do
+    "$@" && return 0
+    sleep 0.1
+  done
+  return 1
+}
+# The stand-in runs (a zombie, which kill -0 still finds, does not).
+alive() {
+  local state
+  state=$(awk '{print $3}' "/proc/$standin/stat" 2>/dev/null)
+  [ -n "$state" ] && [ "$state" != Z ]
+}
+gone() { ! alive; }
+
+# ---- A handler whose callback takes 3 s, and a restart of the web server
+# after it: the answer is complete before either has happened.
+marker=$TMP/callback.done
+call "$URL?api=VELA.Pipe.Test&version=1&method=callback&sleep=3&file=$marker"
+expect_status "callback" 200
+expect "callback" '"success":true'
+[ -e "$marker" ] && fail "the answer was held until the callback ended"
+wait_for test -s "$marker" || fail "the callback did not run"
+call "$URL?api=VELA.Pipe.Test&version=1&method=callback&sleep=3&file=$marker.2&restart=1"
+expect "callback and restart" '"success":true'
+[ -e "$marker.2" ] && fail "the answer with a restart was held until the callback ended"
+alive || fail "the answer with a restart was held until the web server was restarted"
+wait_for gone || fail "the web server was not restarted after the reply"
+wait_for test -s "$marker.2" || fail "the callback before the restart did not run"
+kill "$standin" 2>/dev/null
+
+# ---- Generated content: the output of a program, read from a pipe, whole
+# and without a length of velascgi's own (a Range changes nothing).
+seq 1 300000 >"$TMP/expected"
+call -H "Range: bytes=0-9" "$URL?api=VELA.Pipe.Test&version=1&method=stream&count=300000"
+expect_status "stream" 200
+expect_header "stream" 'Content-Type: text/plain'
+expect_header "stream" 'Accept-Ranges: none'
+cmp -s "$TMP/expected" "$TMP/body" || fail "stream: the body is not the program's output ($(wc -c <"$TMP/body") bytes)"
+
+srv_sanitizer_clean || fail "sanitizer reports in the logs"
+
+if [ "$failures" -ne 0 ]; then
+  echo "$failures check(s) failed"
+  exit 1
+fi
+echo "all reply checks passed ($URL)"
+exit 0
