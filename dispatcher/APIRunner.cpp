@@ -340,8 +340,8 @@ void LetGoOfTheReply()
             close(fd);
         }
     }
-    if (LogIdent()[0] != '\0') {
-        openlog(LogIdent(), LOG_CONS | LOG_PID, LOG_USER);
+    if (ProcessLogIdent()[0] != '\0') {
+        openlog(ProcessLogIdent(), LOG_CONS | LOG_PID, LOG_USER);
     }
 }
 

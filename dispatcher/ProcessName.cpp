@@ -42,6 +42,8 @@ void Sanitize(char* text)
 
 }  // namespace
 
+const char* ProcessLogIdent() { return LogIdent(); }
+
 bool NameProcess(APIRunnerPrivate& d, const APIName& api, int version, const std::string& method,
                  APIResponse* resp)
 {

@@ -17,5 +17,8 @@ bool NameProcess(APIRunnerPrivate& d, const APIName& api, int version, const std
                  APIResponse* resp);
 // Puts the name the process started with back everywhere.
 void RestoreProcessName(APIRunnerPrivate& d);
+// The log identity the process names itself with ("" before it is named):
+// for a child that closes the log and opens it again.
+const char* ProcessLogIdent();
 
 }  // namespace VELA

@@ -184,7 +184,7 @@ TEST_F(Counter, OrdinaryUserCountsOrLogsTheLoss)
             }
             VELA::ResetUsageCounterState();
             VELA::Test::LogCapture log;
-            APIRunner runner;
+            CountingRunner runner;
             for (int i = 0; i < calls; ++i) {
                 Count(runner, "VELA.Core.Share", 1, "get");
             }

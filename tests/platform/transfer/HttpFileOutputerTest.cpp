@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "platform/StateRootTest.h"
+#include "platform/system/FileUtil.h"
 #include "support/TestSupport.h"
 #include "vela/httpoutput.h"
 
@@ -190,7 +191,7 @@ TEST_F(HttpOutput, StreamsWithoutALength)
         ASSERT_GE(writer, 0);
         if (writer == 0) {
             close(fds[0]);
-            const bool sent = VELA::Platform::WriteAll(fds[1], data.data(), data.size());
+            const bool sent = VELA::System::WriteAll(fds[1], data.data(), data.size());
             _exit(sent ? 0 : 1);
         }
         close(fds[1]);
