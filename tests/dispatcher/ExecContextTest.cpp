@@ -342,7 +342,7 @@ TEST_F(Identity, RootGuardAndSetVelaInfo)
                 errors += "guard claims root without a way back; ";
             }
         }
-        if (!Logged(log, kAuthErr, "IdentityTest:\\d+ ERROR: IF_RUN_AS\\(0, 0\\)\n")) {
+        if (!Logged(log, kAuthErr, "ExecContextTest:\\d+ ERROR: IF_RUN_AS\\(0, 0\\)\n")) {
             errors += "no guard error line: " + log;
         }
         if (VELA::APIUtils::SetVelaInfo("pipe_test_key", "refused")) {
