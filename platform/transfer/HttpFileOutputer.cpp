@@ -468,7 +468,7 @@ bool TrimmedRange(const char* header, std::string& text)
     return true;
 }
 
-// The one byte-range-spec at `pos` of the Range text `text` ("a-b", "a-",
+// The one byte range at `pos` of the Range text `text` ("a-b", "a-",
 // or the suffix range "-n") against a file of `size` bytes, as ParseRange
 // answers.
 RangeKind ParseRangeSpec(const std::string& text, size_t pos, uint64_t size, uint64_t& first, uint64_t& last)
