@@ -113,10 +113,11 @@ private:
     bool blocked_ = false;
 };
 
-// Waits until a non-blocking `fd` takes more bytes.
-bool WaitWritable(int fd)
+// Waits until a non-blocking `fd` is ready for `events` (POLLIN: has bytes
+// to read, POLLOUT: takes more bytes).
+bool WaitFor(int fd, short events)
 {
-    struct pollfd p = {fd, POLLOUT, 0};
+    struct pollfd p = {fd, events, 0};
     for (;;) {
         const int n = poll(&p, 1, -1);
         if (n > 0) {
@@ -142,7 +143,7 @@ bool WriteOut(int fd, const char* data, size_t len)
             continue;
         }
         if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
-            if (!WaitWritable(fd)) {
+            if (!WaitFor(fd, POLLOUT)) {
                 return false;
             }
             continue;
@@ -184,7 +185,7 @@ bool SendfileStep(int out, int in, off_t& offset, uint64_t& length, bool& useSen
         return true;
     }
     if (errno == EAGAIN || errno == EWOULDBLOCK) {
-        if (!WaitWritable(out)) {
+        if (!WaitFor(out, POLLOUT)) {
             LogWriteFailure(errno);
             return false;
         }
@@ -637,20 +638,6 @@ private:
     bool changed_ = false;
 };
 
-bool WaitReadable(int fd)
-{
-    struct pollfd p = {fd, POLLIN, 0};
-    for (;;) {
-        const int n = poll(&p, 1, -1);
-        if (n > 0) {
-            return true;
-        }
-        if (n < 0 && errno != EINTR) {
-            return false;
-        }
-    }
-}
-
 // The rest of `file`, a readable stream that is not a regular file (a
 // pipe, a socket, a device): its length is unknown, so no Content-Length
 // and no ranges; the content is read through the stream itself, so what
@@ -703,7 +690,7 @@ bool SendStream(FILE* file, const struct stat& st, const std::string& name, cons
             continue;
         }
         const int err = errno;
-        if (err == EINTR || ((err == EAGAIN || err == EWOULDBLOCK) && WaitReadable(fd))) {
+        if (err == EINTR || ((err == EAGAIN || err == EWOULDBLOCK) && WaitFor(fd, POLLIN))) {
             clearerr(file);
             continue;
         }
