@@ -1,7 +1,8 @@
-// Running a few statements with full rights, and writing the system
-// information file.
+// Running a few statements with full rights, writing the system
+// information file, and the JSON pipe between a forked child and its parent.
 #pragma once
 
+#include <json/json.h>
 #include <string>
 #include <sys/types.h>
 
@@ -39,6 +40,55 @@ public:
     // Writes key="value" into the system information file
     // (<root>/etc/velainfo.conf) with full rights.
     static bool SetVelaInfo(const std::string& key, const std::string& value);
+};
+
+// One-way channel through which a forked child hands JSON documents back to
+// its parent. The parent calls Init before fork; the child keeps the write
+// end (WriteOnly), the parent the read end (ReadOnly), so the parent reads
+// end of file when the child dies before writing.
+//
+// Each document travels as its length (4 bytes, unsigned, native byte
+// order: both ends are this program on this machine) followed by its
+// compact JSON text. The ends are close-on-exec, so a program the child
+// starts does not keep the pipe open; an end put on a standard descriptor
+// with ReadOnly/WriteOnly is inherited as usual.
+class Pipe {
+public:
+    // The largest document ReadJson accepts (a bigger length is refused
+    // before anything is allocated).
+    static const unsigned int kMaxDocument = 64u << 20;
+
+    Pipe();
+    ~Pipe();  // Close()
+    Pipe(const Pipe&) = delete;
+    Pipe& operator=(const Pipe&) = delete;
+
+    // Opens the pipe. False (both ends -1) when the system refuses.
+    bool Init();
+    // Keeps only the read end: closes the write end, then, if `fd` >= 0,
+    // duplicates the read end onto `fd` and returns dup2's result (0 makes
+    // the pipe the standard input). A negative `fd` only closes.
+    int ReadOnly(int fd);
+    // The mirror image: keeps only the write end (1 sends standard output
+    // into the pipe).
+    int WriteOnly(int fd);
+    // Closes both ends; harmless when they are closed already.
+    void Close();
+
+    // Sends one document. False when the pipe took less than all of it.
+    bool WriteJson(const Json::Value& value);
+    // Zeroes `size` bytes of `buf`, then one read of up to `size` bytes from
+    // the read end; read's result.
+    int Read(char* buf, int size);
+    // Receives one document. False (logged) at end of file before a
+    // length, for a document too large, cut short or not valid JSON.
+    bool ReadJson(Json::Value& out);
+
+    int ReadFd() const { return fds_[0]; }
+    int WriteFd() const { return fds_[1]; }
+
+private:
+    int fds_[2];  // read end, write end; -1 when closed
 };
 
 }  // namespace VELA
