@@ -28,6 +28,7 @@
 #include "dispatcher/Refusal.h"
 #include "dispatcher/ResolvedCall.h"
 #include "dispatcher/Road.h"
+#include "subprocess/CompoundHandler.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
@@ -201,9 +202,9 @@ bool APIRunner::ProcessEntry(APIRequest* req, APIResponse* resp)
 
 bool APIRunner::HandleCompound(APIRequest* req, APIResponse* resp)
 {
-    // Compound requests are not served yet: refuse rather than pretend.
-    VELA_REFUSE(resp, WEBAPI_ERR_NO_RESPONSE, "compound requests are not available");
-    return false;
+    CompoundHandler handler(req, resp, this);
+    handler.SetLimits(LoadCompoundLimits(), d_->compoundDepth > 0 ? d_->compoundDepth - 1 : 0);
+    return handler.Process();
 }
 
 bool APIRunner::ProcessLib(APIRequest* req, APIResponse* resp)

@@ -37,27 +37,12 @@ constexpr int kCpuGraceSeconds = 5;
 
 using Settings = std::vector<std::pair<std::string, std::string>>;
 
-// `value` from the last line of `key` in `settings`, when that is a number
-// in [min, max]; a bad one is logged and the value kept.
 template <typename T>
 void Setting(const Settings& settings, const char* key, long long min, long long max, T& value)
 {
-    const std::string* text = nullptr;
-    for (const auto& line : settings) {
-        if (line.first == key) {
-            text = &line.second;
-        }
-    }
-    long long parsed = 0;
-    if (text == nullptr) {
-        return;
-    }
-    if (!System::ParseDecimal(*text, min, max, parsed)) {
-        VELA_LOG_ERR("%s: %s=\"%.32s\" is not a number from %lld to %lld, keeping %lld", kConfPath, key,
-                     text->c_str(), min, max, static_cast<long long>(value));
-        return;
-    }
-    value = static_cast<T>(parsed);
+    long long number = static_cast<long long>(value);
+    System::NumberSetting(settings, kConfPath, key, min, max, number);
+    value = static_cast<T>(number);
 }
 
 uint64_t KeyedHash(const unsigned char* key, const unsigned char* data, size_t len)

@@ -90,6 +90,11 @@ namespace System {
 // (a later line of a key follows its earlier ones). 1 when read, 0 when the
 // file is missing (`out` empty), -1 when it is corrupt or unreadable.
 int ReadKeyValueFile(const char* path, std::vector<std::pair<std::string, std::string>>& out);
+// `value` from the last line of `key` in `settings` (as ReadKeyValueFile
+// gives them), when that is a decimal number in [min, max]. An absent key
+// keeps `value`; a bad one is logged, naming `path`, and keeps it too.
+void NumberSetting(const std::vector<std::pair<std::string, std::string>>& settings, const char* path,
+                   const char* key, long long min, long long max, long long& value);
 }  // namespace System
 }  // namespace VELA
 

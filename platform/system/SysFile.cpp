@@ -718,3 +718,24 @@ int VLIBCFileUnlockByFile(int handle)
     }
     return rc;
 }
+
+void VELA::System::NumberSetting(const std::vector<std::pair<std::string, std::string>>& settings,
+                                 const char* path, const char* key, long long min, long long max, long long& value)
+{
+    const std::string* text = nullptr;
+    for (const auto& line : settings) {
+        if (line.first == key) {
+            text = &line.second;
+        }
+    }
+    long long parsed = 0;
+    if (text == nullptr) {
+        return;
+    }
+    if (!ParseDecimal(*text, min, max, parsed)) {
+        VELA_LOG_ERR("%s: %s=\"%.32s\" is not a number from %lld to %lld, keeping %lld", path, key, text->c_str(),
+                     min, max, value);
+        return;
+    }
+    value = parsed;
+}
