@@ -117,13 +117,7 @@ void APIRequestPrivate::InitEnv(const Json::Value& env)
 void APIRequestPrivate::InitParam(const Json::Value& request, bool reset)
 {
     if (reset) {
-        // A request reused for another call (a compound's calls) names no
-        // API until the new parameters do: a call without "api" must not
-        // run as the one before it.
         ClearData("param", "");
-        apiClass.clear();
-        apiVersion = 0;
-        apiMethod.clear();
     }
     if (!request.isObject()) {
         return;

@@ -81,6 +81,14 @@ bool CountCalls(const Json::Value& compound, long long depthLeft, long long budg
     return true;
 }
 
+// Whether `entry` names its own call. The sub-request is reused from call
+// to call and keeps the names of the last call that gave them, so an entry
+// without its own would run as the call before it.
+bool NamesItsCall(const Json::Value& entry)
+{
+    return entry.isObject() && entry.isMember("api") && entry.isMember("version") && entry.isMember("method");
+}
+
 // Standard input and output of a child point at /dev/null: the child never
 // reads the request body nor writes into the reply.
 void DetachStandardStreams()
@@ -225,7 +233,7 @@ void CompoundHandler::PreloadLibs()
 // described is left for its own turn to refuse.
 void CompoundHandler::PreloadEntry(const Json::Value& entry, int depth)
 {
-    if (!entry.isObject()) {
+    if (!NamesItsCall(entry)) {
         return;
     }
     Json::Value request(Json::objectValue);
@@ -284,6 +292,13 @@ _tag_WEBAPI_ERR CompoundHandler::CompoundProcessEntry(const Json::Value& entry, 
     if (stopWhenError_ && hasFail_) {
         errorText_ = kStopText;
         code = WEBAPI_ERR_COMPOUND_STOPPED;
+    } else if (!NamesItsCall(entry)) {
+        VELA_LOG_ERR("call %u names no api, version and method", index);
+        subResp_->SetError(WEBAPI_ERR_BAD_REQUEST);
+        output_["result"][index] = subResp_->GetBody();
+        info_[index] = Json::Value(Json::objectValue);
+        info_[index]["error"] = WEBAPI_ERR_BAD_REQUEST;
+        return WEBAPI_ERR_BAD_REQUEST;
     } else if (flag("allowUpload") || flag("allowDownload")) {
         errorText_ = kTransferText;
         code = WEBAPI_ERR_COMPOUND_TRANSFER;

@@ -58,8 +58,8 @@ public:
     // re-derives cookies, request method and sharing identifiers.
     void InitEnv(const Json::Value& env);
     // Merges "getParam", then "postParam" (decrypted first) into the
-    // parameters; the body wins. `reset` clears the parameters (and the API
-    // name, version and method they gave) first.
+    // parameters; the body wins. `reset` clears the parameters first (the
+    // API name, version and method stay until new parameters name others).
     void InitParam(const Json::Value& request, bool reset);
     // Replaces the API description.
     void InitAPIInfo(const Json::Value& info);

