@@ -119,7 +119,7 @@ int DecimalOption(const char* text)
 
 // The session facts of the user the platform named for `verdict`, from the
 // login options and the session the platform put into the CGI handle.
-void StoreSessionFacts(APIRequest* req, VELACGI_CTX* cgi, const char* user, int verdict)
+Json::Value StoreSessionFacts(APIRequest* req, VELACGI_CTX* cgi, const char* user, int verdict)
 {
     setenv("VELA_WEBAPI_USERNAME", user, 1);
     int timeout = DecimalOption(VelaCgiGetOption(cgi, VELACGI_OPT_TIMEOUT, "0"));
@@ -146,6 +146,7 @@ void StoreSessionFacts(APIRequest* req, VELACGI_CTX* cgi, const char* user, int 
     session["webapi"] = webapi != nullptr ? webapi : "";
     session["isAuthorized"] = true;
     req->InitSession(session);
+    return session;
 }
 
 // Sets the session check's `code` on `resp`; a refusal that is enforced
@@ -260,15 +261,25 @@ VELACGI_CTX* PermissionCheck::Handle(VELACGI_CTX* cgi)
 
 int PermissionCheck::CheckPermission(bool allowTimeout, VELACGI_CTX* cgi)
 {
-    APIRequest* req = runner_.GetRequest();
+    return CheckRequest(runner_.GetRequest(), allowTimeout, cgi);
+}
+
+int PermissionCheck::CheckRequest(APIRequest* req, bool allowTimeout, VELACGI_CTX* cgi)
+{
     if (req == nullptr) {
         return WEBAPI_ERR_NO_PERMISSION;
     }
     Json::Value& slot = Slot(allowTimeout);
-    if (slot.isInt()) {
+    Given& given = given_[allowTimeout ? 0 : 1];
+    const std::string call = req->GetAPIClass() + "\n" + req->GetAPIMethod();
+    if (slot.isInt() && (given.tokenCall.empty() || given.tokenCall == call)) {
+        if (given.session.isObject() && !req->IsAuthorized()) {
+            req->InitSession(given.session);  // another call of the same client
+        }
+        req->SetAuthResult(static_cast<_tag_authorized_result_>(slot.asInt()));
         return VerdictToError(slot.asInt());
     }
-    const int verdict = AskPlatform(req, Handle(cgi), allowTimeout);
+    const int verdict = AskPlatform(req, Handle(cgi), allowTimeout, given);
     req->SetAuthResult(static_cast<_tag_authorized_result_>(verdict));
     slot = verdict;
     return VerdictToError(verdict);
@@ -277,8 +288,9 @@ int PermissionCheck::CheckPermission(bool allowTimeout, VELACGI_CTX* cgi)
 // The platform's verdict on the session id or, failing that, the access
 // token of `req`; the session facts are stored whenever the platform named
 // a user (also for a refused token, so that the reply knows who asked).
-int PermissionCheck::AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTimeout)
+int PermissionCheck::AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTimeout, Given& given)
 {
+    given = Given();
     const std::string sid = req->GetSessionID();
     const char* tokenEnv = req->GetVelaAccessTokenID();
     const std::string token = tokenEnv != nullptr ? tokenEnv : "";
@@ -307,10 +319,11 @@ int PermissionCheck::AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTi
         const int granted = VelaAccessTokenGrant(token.c_str(), api.c_str(), method.c_str(), user, sizeof(user));
         verdict = granted < 0 ? AUTH_RESULT_UNAUTHENTICATED : AUTH_RESULT_AUTHORIZED;
         facts = true;
+        given.tokenCall = api + "\n" + method;
     }
     if (facts) {
         user[sizeof(user) - 1] = '\0';
-        StoreSessionFacts(req, cgi, user, verdict);
+        given.session = StoreSessionFacts(req, cgi, user, verdict);
     }
     return verdict;
 }
@@ -321,7 +334,7 @@ bool PermissionCheck::CheckPermission(APIRequest* req, APIResponse* resp, VELACG
         return false;
     }
     const bool allowTimeout = runner_.GetMethodAttr(req, "allowTimeout");
-    const int code = CheckPermission(allowTimeout, cgi);
+    const int code = CheckRequest(req, allowTimeout, cgi);
     RecordCode(req, resp, code, Slot(allowTimeout));
     if (code != WEBAPI_ERR_NONE) {
         const char* word = ServerErrorWord(code);

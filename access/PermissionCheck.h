@@ -6,7 +6,9 @@
 // its permission hooks. The verdict of the platform (VelaCgiIsAuthorizedEx,
 // VelaAccessTokenGrant) is asked at most once per value of "allowTimeout"
 // and kept in the check: {"permResult": [verdict with timeout allowed,
-// verdict without]}, null until asked.
+// verdict without]}, null until asked. A token's verdict holds for the one
+// API and method it was granted for: every call of a compound request is
+// checked on its own.
 #pragma once
 
 #include <json/json.h>
@@ -41,6 +43,12 @@ public:
     // the session facts stored in the request. `cgi` is the runner's CGI
     // handle; null (a runner built by hand) uses one of the check's own.
     int CheckPermission(bool allowTimeout, VELACGI_CTX* cgi);
+    // The same for `req`, which may be another call of the same client (a
+    // call of a compound request): a cached session verdict is given with
+    // the session facts it produced; a verdict that an access token gave
+    // holds only for the API and method it was asked for, and another call
+    // asks the platform again.
+    int CheckRequest(APIRequest* req, bool allowTimeout, VELACGI_CTX* cgi);
     // The whole check of `req`: the session check with the method's
     // "allowTimeout", its error code and server-error word on `resp`, then
     // the user classes and the application privilege (105). True when the
@@ -55,14 +63,23 @@ public:
     const Json::Value& Verdicts() const { return permission_; }
 
 private:
+    // What a cached verdict was given with: the session facts stored in
+    // the request, and, for a verdict of an access token, the call it was
+    // granted for ("<api>\n<method>"; empty for a session's verdict).
+    struct Given {
+        Json::Value session;
+        std::string tokenCall;
+    };
+
     Json::Value& Slot(bool allowTimeout);
     VELACGI_CTX* Handle(VELACGI_CTX* cgi);
-    int AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTimeout);
+    int AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTimeout, Given& given);
     bool CheckUserClass(APIRequest* req, APIResponse* resp, const std::string& user);
 
     APIRunner& runner_;
     VELACGI_CTX* ownCgi_;     // the handle of a check without the runner's
     Json::Value permission_;  // {"permResult": [with timeout allowed, without]}
+    Given given_[2];          // beside each slot
 };
 
 }  // namespace VELA

@@ -418,3 +418,32 @@ TEST_F(PermissionCheckTest, WebEntryHooksCheckTheSessionOfItsRequest)
 }
 
 }  // namespace
+
+// The calls of a compound request are other request objects of the same
+// client, checked by the runner's one PermissionCheck.
+TEST_F(PermissionCheckTest, EveryCallOfOneClientIsCheckedOnItsOwn)
+{
+    const std::string sid = Login("daemon");
+    {
+        PreparedCall c("get", sid);
+        APIRequest sub(*c.Req());  // copied before the check: no facts yet
+        ASSERT_TRUE(c.Check());
+        APIResponse subResp(&sub);
+        ASSERT_TRUE(c.check.CheckPermission(&sub, &subResp, nullptr));
+        EXPECT_EQ("daemon", sub.GetLoginUserName());  // the cached verdict brings its facts
+    }
+    // A token granted for "get" only: the cached verdict does not open "poll".
+    std::string token, id;
+    ASSERT_EQ(0, VelaAccessTokenCreate("daemon", {"VELA.Test.*"}, {"get"}, 0, token, id));
+    ScopedEnv tid("velaAccessToken", token.c_str());
+    PreparedCall c("get", "");
+    ASSERT_TRUE(c.Check());
+    APIRequest sub(*c.Req());
+    Json::Value poll;
+    poll["postParam"]["method"] = "poll";
+    sub.InitParam(poll, false);
+    APIResponse subResp(&sub);
+    EXPECT_FALSE(c.check.CheckPermission(&sub, &subResp, nullptr));
+    EXPECT_EQ(119, subResp.GetError());
+    EXPECT_TRUE(c.Check());  // and "get" is still granted
+}
