@@ -6,16 +6,35 @@
 #             C++ CGI (JsonCpp only) that builds the same answer;
 #   upload    a multipart upload through velascgi against cat of the file
 #             into a file on the same disk, with velascgi's peak memory;
-#   download  a download through velascgi against cat of the file.
+#   download  a download through velascgi against cat of the file;
+#   compound  a compound request (VELA.Entry.Request) of 10 echo calls, in
+#             sequential and in parallel mode, against 10 separate requests
+#             of the same echo: wall time through lighttpd (alternating
+#             rounds in shuffled order, medians); CPU time and page faults
+#             (perf) and instructions (callgrind) of the whole velascgi
+#             process tree, forked children included, with velascgi run
+#             directly with the environment and body lighttpd gave it
+#             (recorded through a wrapper); beside them what the time is
+#             spent on (a compound of no call, a compound whose calls run
+#             in process, the forks alone, what a forked worker executes);
+#             then 10 calls that each sleep 100 ms in one parallel compound
+#             against the same in sequence and against one such call alone.
+#             The in-process and sleeping calls come from the benchmark's
+#             own API VELA.Bench.Compound (bench_compound.cpp), installed in
+#             the state root only. perf and valgrind are optional.
 #
 # usage: bench/web/run.sh [build-dir]          (default: build)
 #
 # Environment (all optional):
 #   BENCH_SIZE_MB=1024        size of the transferred file, MiB
-#   BENCH_PARTS="rps upload download"
+#   BENCH_PARTS="rps upload download compound"
 #   BENCH_DURATION=10 BENCH_ROUNDS=3 BENCH_CONNECTIONS=8 BENCH_THREADS=2
 #                             wrk: seconds per run, alternating rounds
 #   BENCH_TRANSFER_ROUNDS=3   alternating rounds of each transfer
+#   BENCH_COMPOUND_ROUNDS=21  rounds of the compound's wall-time figures
+#   BENCH_SLEEP_ROUNDS=3      rounds of the sleeping calls
+#   BENCH_CALLGRIND=1         0 leaves out the compound's instruction counts
+#                             (they need valgrind and take a minute or two)
 #   BENCH_DIR=$TMPDIR         where the state root and the big files go
 #   BENCH_XSENDFILE=1         also download with X-Sendfile on; velascgi uses
 #                             it only when BENCH_DIR and every directory above
@@ -25,7 +44,9 @@
 #                             override lighttpd's server.stream-*-body
 #   BENCH_LIGHTTPD_EXTRA      lines added to the lighttpd configuration
 #   BENCH_ECHO_QUERY, BENCH_UPLOAD_QUERY, BENCH_DOWNLOAD_QUERY
-#                             query strings of the sample's methods
+#                             query strings of the sample's methods (the
+#                             echo's parameters are also each call of the
+#                             compound)
 #   BENCH_PLAIN=1             no private mount namespace (see below)
 #
 # The server is the project's own lighttpd configuration, written by
@@ -42,12 +63,14 @@ build=$(cd "${1:-$top/build}" 2>/dev/null && pwd) || {
 }
 
 SIZE_MB=${BENCH_SIZE_MB:-1024}
-PARTS=${BENCH_PARTS:-rps upload download}
+PARTS=${BENCH_PARTS:-rps upload download compound}
 DURATION=${BENCH_DURATION:-10}
 ROUNDS=${BENCH_ROUNDS:-3}
 CONNS=${BENCH_CONNECTIONS:-8}
 THREADS=${BENCH_THREADS:-2}
 XROUNDS=${BENCH_TRANSFER_ROUNDS:-3}
+CROUNDS=${BENCH_COMPOUND_ROUNDS:-21}
+SROUNDS=${BENCH_SLEEP_ROUNDS:-3}
 ECHO_QUERY=${BENCH_ECHO_QUERY:-api=VELA.Sample.Echo&version=1&method=echo&text=hello&count=3}
 UPLOAD_QUERY=${BENCH_UPLOAD_QUERY:-api=VELA.Sample&version=1&method=upload}
 DOWNLOAD_QUERY=${BENCH_DOWNLOAD_QUERY:-api=VELA.Sample&version=1&method=download&name=data.bin}
@@ -59,6 +82,8 @@ MINIMAL=$build/bench/web/vela-bench-minimal-cgi
 BENCH_LIB=$build/bench/web/libvela-bench-transfer.so
 LOG_SINK=$build/bench/web/vela-bench-log-sink
 PEAK_RSS=$build/bench/web/vela-bench-peak-rss
+COMPOUND_LIB=$build/bench/web/libvela-bench-compound.so
+FORK_COST=$build/bench/web/vela-bench-fork-cost
 STAGE=$build/root
 
 die() {
@@ -69,7 +94,7 @@ for tool in lighttpd curl wrk awk ss shuf; do
     command -v "$tool" >/dev/null || die "$tool is not installed (scripts/install-deps.sh)"
 done
 [ -x "$MINIMAL" ] && [ -x "$LOG_SINK" ] && [ -x "$PEAK_RSS" ] || die "the benchmark programs are not built in $build"
-for n in "$SIZE_MB" "$DURATION" "$ROUNDS" "$CONNS" "$THREADS" "$XROUNDS"; do
+for n in "$SIZE_MB" "$DURATION" "$ROUNDS" "$CONNS" "$THREADS" "$XROUNDS" "$CROUNDS" "$SROUNDS"; do
     case $n in '' | *[!0-9]* | 0) die "sizes, durations and counts must be positive numbers" ;; esac
 done
 have_velascgi=0
@@ -166,6 +191,21 @@ if [ "$have_velascgi" = 1 ]; then
     }
 }
 EOF
+    # The compound benchmark's own API, in this root only: its "echo" is
+    # grantable, so a sequential compound runs it in process.
+    if [ -f "$COMPOUND_LIB" ]; then
+        cp "$COMPOUND_LIB" "$WEBAPI_DIR/bench/" || die "cannot install $COMPOUND_LIB"
+        cat >"$WEBAPI_DIR/VELA.Bench.Compound.lib" <<EOF
+{
+    "VELA.Bench.Compound": {
+        "lib": "bench/libvela-bench-compound.so",
+        "minVersion": 1,
+        "maxVersion": 1,
+        "methods": {"1": ["sleep", {"echo": {"grantable": true}}]}
+    }
+}
+EOF
+    fi
 fi
 
 echo "/volume1" >"$ROOT/etc/vela/volumes.conf"
@@ -547,6 +587,476 @@ bench_download() {
     printf 'velascgi peak RSS: %s KiB\n' "$mp"
 }
 
+# ---- compound requests -----------------------------------------------------------
+
+CALLS=10
+SLEEP_MS=100
+SLEEP_GOAL_MS=300
+SPEEDUP_GOAL=5
+
+# url_encode TEXT: TEXT percent-encoded for a form body, byte by byte (the
+# unreserved characters of RFC 3986 stay as they are).
+url_encode() {
+    local LC_ALL=C
+    local text=$1 out="" c i
+    for ((i = 0; i < ${#text}; i++)); do
+        c=${text:i:1}
+        case $c in
+        [A-Za-z0-9._~-]) out+=$c ;;
+        *)
+            printf -v c '%%%02X' "'$c"
+            out+=$c
+            ;;
+        esac
+    done
+    printf '%s' "$out"
+}
+# query_json QUERY: the parameters of a query string as one JSON object of
+# strings, the values a handler gets from that query string; fails for a
+# parameter holding a control character.
+query_json() {
+    local -a pairs
+    local pair name value part out="" sep=""
+    IFS='&' read -r -a pairs <<<"$1"
+    for pair in "${pairs[@]}"; do
+        [ -n "$pair" ] || continue
+        name=${pair%%=*}
+        value=""
+        [[ $pair == *=* ]] && value=${pair#*=}
+        for part in name value; do
+            local v=${!part}
+            v=${v//+/ }
+            v=${v//\\/\\\\}
+            printf -v v '%b' "${v//%/\\x}"
+            case $v in *[[:cntrl:]]*) return 1 ;; esac
+            v=${v//\\/\\\\}
+            v=${v//\"/\\\"}
+            printf -v "$part" '"%s"' "$v"
+        done
+        out+="$sep$name:$value"
+        sep=,
+    done
+    printf '{%s}' "$out"
+}
+# compound_form FILE MODE CALL N: the form body of a compound request of N
+# copies of the JSON object CALL, in MODE, into FILE.
+compound_form() {
+    local list="" i
+    for ((i = 0; i < $4; i++)); do
+        list+="${list:+,}$3"
+    done
+    printf 'api=VELA.Entry.Request&version=1&method=request&mode=%s&compound=%s' "$2" "$(url_encode "[$list]")" >"$1"
+}
+# post_form BODY ANSWER: one POST of the form in file BODY to the entry;
+# curl's time_total in milliseconds goes to T, the answer into file ANSWER.
+post_form() {
+    local out
+    out=$(curl -sS -o "$2" -w '%{http_code} %{time_total}' "${COOKIE_ARGS[@]}" \
+        -H 'Content-Type: application/x-www-form-urlencoded' --data-binary "@$1" "$BASE/webapi/entry.cgi") ||
+        die "curl failed on a compound request"
+    if [ "${out%% *}" != 200 ]; then
+        head -c 600 "$2" >&2
+        die "HTTP ${out%% *} for a compound request"
+    fi
+    T=$(awk -v s="${out#* }" 'BEGIN { printf "%.3f", s * 1000 }')
+}
+# get_each N URL: N GETs of URL one after the other on one keep-alive
+# connection; the sum of their time_total in milliseconds goes to T, the
+# answers into $work/answer-get-1 ... N, each checked for success.
+get_each() {
+    local n=$1 url=$2 i out
+    local -a args=()
+    for ((i = 1; i <= n; i++)); do
+        args+=(-o "$work/answer-get-$i" "$url")
+    done
+    out=$(curl -sS -w '%{http_code} %{time_total}\n' "${COOKIE_ARGS[@]}" "${args[@]}") ||
+        die "curl failed on the separate requests"
+    T=$(printf '%s\n' "$out" | awk -v n="$n" '$1 == 200 { ok++; t += $2 } END { if (ok != n) exit 1; printf "%.3f", t * 1000 }') || {
+        printf '%s\n' "$out" >&2
+        die "a separate request did not answer 200"
+    }
+    for ((i = 1; i <= n; i++)); do
+        grep -q '"success":true' "$work/answer-get-$i" || {
+            head -c 600 "$work/answer-get-$i" >&2
+            die "a separate request failed"
+        }
+    done
+}
+# compound_ok ANSWER N: the compound answered success, no call failed, and
+# all N calls succeeded.
+compound_ok() {
+    grep -q '"has_fail":false' "$1" && [ "$(grep -o '"success":true' "$1" | wc -l)" = $(($2 + 1)) ] && return 0
+    head -c 600 "$1" >&2
+    echo >&2
+    return 1
+}
+smallest() { tr ' ' '\n' | grep . | sort -g | head -1; }
+ms() { awk -v t="$1" 'BEGIN { printf "%.1f", t }'; }
+# spread VALUES: "median (smallest .. largest)" of milliseconds.
+spread() { printf '%7.1f ms (%s .. %s)' "$(echo "$1" | median)" "$(ms "$(echo "$1" | smallest)")" "$(ms "$(echo "$1" | largest)")"; }
+faster() { awk -v a="$1" -v b="$2" 'BEGIN { if (b <= 0) print "n/a"; else printf "%.2fx", a / b }'; }
+goal_speedup() { at_least "$(awk -v a="$1" -v b="$2" 'BEGIN { if (b > 0) print a / b; else print 0 }')" "$SPEEDUP_GOAL"; }
+
+# ---- the process tree of one request, run again outside lighttpd
+
+# Records, through a wrapper lighttpd runs instead of velascgi, the
+# environment and the body of one request, to run velascgi again with them.
+CAPTURE_CGI=$work/bin/velascgi-capture
+make_capture_wrapper() {
+    mkdir -p "$work/capture"
+    cat >"$CAPTURE_CGI" <<EOF
+#!/bin/sh
+env -0 >'$work/capture/env' && cat >'$work/capture/body' || exit 1
+exec '$VELASCGI' <'$work/capture/body'
+EOF
+    chmod 755 "$CAPTURE_CGI"
+}
+# capture NAME CURL-ARGS...: the request of CURL-ARGS through the wrapper,
+# kept as $work/cap-NAME/{env,body}.
+capture() {
+    local name=$1
+    shift
+    rm -f "$work/capture/env" "$work/capture/body"
+    curl -sS -o "$work/capture/answer" "${COOKIE_ARGS[@]}" "$@" || die "curl failed while recording a request"
+    grep -q '"success":true' "$work/capture/answer" || {
+        head -c 600 "$work/capture/answer" >&2
+        die "the recorded request $name failed"
+    }
+    mkdir -p "$work/cap-$name" && cp "$work/capture/env" "$work/capture/body" "$work/cap-$name/" ||
+        die "the wrapper recorded nothing"
+}
+# capture_all: records the requests whose process trees are measured: one
+# echo, and the compounds whose form bodies are in $work/body-NAME.
+capture_all() {
+    make_capture_wrapper
+    serve "$CAPTURE_CGI" 0
+    capture separate "$BASE/webapi/entry.cgi?$ECHO_QUERY"
+    local m
+    for m in sequential parallel empty inprocess; do
+        capture "$m" -H 'Content-Type: application/x-www-form-urlencoded' --data-binary "@$work/body-$m" "$BASE/webapi/entry.cgi"
+    done
+    serve "$VELASCGI" 0
+}
+# replay_env CAPTURE: the recorded environment into REPLAY_ENV, as lighttpd
+# gave it to velascgi.
+REPLAY_ENV=()
+replay_env() {
+    local e
+    local -a envs
+    mapfile -d '' envs <"$1/env"
+    REPLAY_ENV=()
+    for e in "${envs[@]}"; do
+        case $e in
+        PWD=*) ;; # added by the wrapper's shell
+        SCRIPT_FILENAME=*) REPLAY_ENV+=("SCRIPT_FILENAME=$VELASCGI") ;;
+        *) REPLAY_ENV+=("$e") ;;
+        esac
+    done
+}
+
+# ---- CPU time of a process tree
+
+# cpu_tree CAPTURE PROGRAM: "milliseconds page-faults" of CPU time
+# (task-clock) and page faults of PROGRAM, run with the environment and body
+# recorded in CAPTURE, and of every process it forks, detached ones
+# included (perf counts every descendant). It runs under a chain of bash,
+# env and cat that ends only when the last process holding its standard
+# error has ended (a compound's children point only their standard input
+# and output at /dev/null); the chain's own cost is measured with /bin/true
+# as PROGRAM.
+cpu_tree() {
+    replay_env "$1"
+    perf stat -x, -o "$work/perf-stat.txt" -e task-clock,page-faults -- \
+        bash -c '"$@" <"$0" 2>&1 >/dev/null | cat >/dev/null' "$1/body" env -i "${REPLAY_ENV[@]}" "$2" ||
+        die "perf stat failed"
+    awk -F, '$3 ~ /^task-clock/ { t = $1 } $3 ~ /^page-faults/ { f = $1 } END { printf "%.3f %d\n", t, f }' \
+        "$work/perf-stat.txt"
+}
+# cpu_median CAPTURE PROGRAM RUNS: medians of cpu_tree over RUNS runs.
+cpu_median() {
+    local i t f all_t="" all_f=""
+    for ((i = 0; i < $3; i++)); do
+        read -r t f <<<"$(cpu_tree "$1" "$2")"
+        all_t+="$t "
+        all_f+="$f "
+    done
+    echo "$(echo "$all_t" | median) $(echo "$all_f" | median)"
+}
+# sub A B [N]: (A - B) / N with two decimals.
+sub() { awk -v a="$1" -v b="$2" -v n="${3:-1}" 'BEGIN { printf "%.2f", (a - b) / n }'; }
+
+compound_cpu() {
+    local runs=11 m
+    local -a chain
+    local -A t=() f=()
+    read -r -a chain <<<"$(cpu_median "$work/cap-separate" /bin/true "$runs")"
+    for m in separate sequential parallel empty inprocess; do
+        read -r "t[$m]" "f[$m]" <<<"$(cpu_median "$work/cap-$m" "$VELASCGI" "$runs")"
+        t[$m]=$(sub "${t[$m]}" "${chain[0]}")
+        f[$m]=$(sub "${f[$m]}" "${chain[1]}")
+    done
+    echo "CPU time (perf stat: task-clock and page faults of the whole process tree, user and kernel, median of $runs runs;"
+    echo "velascgi run directly as for the instructions below, less the launching chain: ${chain[0]} ms, ${chain[1]} faults):"
+    printf '  %-34s %7.2f ms CPU %6.0f page faults\n' "one separate request" "${t[separate]}" "${f[separate]}"
+    for m in sequential parallel empty inprocess; do
+        printf '  %-34s %7.2f ms CPU %6.0f page faults\n' "$(compound_label "$m")" "${t[$m]}" "${f[$m]}"
+    done
+    printf '  %-34s %7s ms CPU %6s page faults (sequential; in-process: %s ms, %s faults)\n' "a forked call adds" \
+        "$(sub "${t[sequential]}" "${t[empty]}" "$CALLS")" "$(sub "${f[sequential]}" "${f[empty]}" "$CALLS")" \
+        "$(sub "${t[inprocess]}" "${t[empty]}" "$CALLS")" "$(sub "${f[inprocess]}" "${f[empty]}" "$CALLS")"
+}
+compound_label() {
+    case $1 in
+    sequential | parallel) echo "compound, $1" ;;
+    empty) echo "compound of no call" ;;
+    inprocess) echo "compound of $CALLS in-process calls" ;;
+    esac
+}
+
+# ---- instructions of a process tree
+
+# callgrind_run DIR CAPTURE: velascgi run directly with the environment and
+# body recorded in CAPTURE, under callgrind with every process it forks. The
+# counts are dumped and zeroed before each fork, so a child counts only its
+# own instructions. The run is over when every process has ended (as for
+# cpu_tree).
+callgrind_run() {
+    local dir=$1 cap=$2
+    mkdir -p "$dir"
+    replay_env "$cap"
+    CG_RUNS=$((CG_RUNS + 1))
+    env -i "${REPLAY_ENV[@]}" "$VALGRIND" --tool=callgrind --trace-children=yes --dump-before='*fork*' \
+        --log-file="$dir/valgrind.%p" --callgrind-out-file="$dir/callgrind.out.%p" "$VELASCGI" \
+        <"$cap/body" 2>&1 >"$dir/answer.$CG_RUNS" | cat >>"$dir/stderr"
+    grep -q '"success":true' "$dir/answer.$CG_RUNS" || {
+        head -c 600 "$dir/answer.$CG_RUNS" >&2
+        tail -n 20 "$dir/stderr" "$dir"/valgrind.* >&2
+        die "velascgi under callgrind did not succeed"
+    }
+}
+CG_RUNS=0
+# callgrind_procs DIR: one line "pid level instructions" for every process
+# of DIR, its level in the process tree from the parent pids valgrind
+# logged: 0 for a velascgi run, 1 for its children (the intermediate child
+# of a detached fork), 2 for theirs (the workers), capped at 2.
+callgrind_procs() {
+    local dir=$1 f pid
+    {
+        for f in "$dir"/valgrind.*; do
+            echo "P ${f##*.} $(sed -n 's/^==[0-9]*== Parent PID: //p' "$f")"
+        done
+        for f in "$dir"/callgrind.out.*; do
+            pid=${f#"$dir"/callgrind.out.}
+            echo "I ${pid%%.*} $(sed -n 's/^totals: *//p' "$f")"
+        done
+    } | awk '
+        $1 == "P" { parent[$2] = $3 }
+        $1 == "I" { if ($3 == "") bad = 1; ins[$2] += $3 }
+        function level(p) { return (parent[p] in parent) ? 1 + level(parent[p]) : 0 }
+        END {
+            if (bad) exit 1
+            for (p in parent) { l = level(p); print p, (l > 2 ? 2 : l), ins[p] + 0 }
+        }' || die "a callgrind output of $dir is incomplete"
+}
+# callgrind_tree DIR: "total processes requests instr intermediates instr
+# workers instr" of the processes of DIR.
+callgrind_tree() {
+    callgrind_procs "$1" | awk '
+        { n[$2]++; i[$2] += $3; t += $3; np++ }
+        END { printf "%d %d %d %d %d %d %d %d\n", t, np, n[0], i[0], n[1], i[1], n[2], i[2] }'
+}
+# callgrind_workers DIR: what a worker of DIR spends its instructions on, as
+# the mean over the workers of the inclusive cost of a few functions:
+#   "workers permission-check symbol-binding dlopen answer"
+# The figures overlap: symbols are bound lazily inside the others.
+callgrind_workers() {
+    local dir=$1 pid level n f
+    callgrind_procs "$dir" | while read -r pid level n; do
+        [ "$level" = 2 ] || continue
+        for f in "$dir/callgrind.out.$pid" "$dir/callgrind.out.$pid".*; do
+            [ -f "$f" ] || continue
+            callgrind_annotate --inclusive=yes --threshold=100 "$f" 2>/dev/null | awk -v pid="$pid" '
+                function num(s) { gsub(",", "", s); return s + 0 }
+                function keep(k) { v = num($1); if (v > m[k]) m[k] = v }
+                index($0, "PermissionCheck::CheckPermission(VELA::APIRequest*") { keep("perm") }
+                index($0, ":_dl_runtime_resolve") { keep("bind") }
+                index($0, ":dlopen@@") { keep("dlopen") }
+                index($0, "Pipe::WriteJson(") { keep("answer") }
+                END { print pid, m["perm"] + 0, m["bind"] + 0, m["dlopen"] + 0, m["answer"] + 0 }'
+        done
+    done | awk '
+        { w[$1] = 1; p += $2; b += $3; d += $4; a += $5 }
+        END { n = length(w); if (n == 0) n = 1; printf "%d %d %d %d %d\n", length(w), p / n, b / n, d / n, a / n }'
+}
+# M: instructions in millions.
+mi() { awk -v n="$1" 'BEGIN { if (n < 100000) printf "%.1f k", n / 1e3; else printf "%.2f M", n / 1e6 }'; }
+
+compound_instructions() {
+    local m
+    echo "instructions (callgrind over the whole velascgi process tree, children counted; velascgi run directly"
+    echo "with the environment and body lighttpd gave it for the same request, recorded through a wrapper):"
+    local i
+    for ((i = 0; i < CALLS; i++)); do
+        callgrind_run "$work/cg-separate" "$work/cap-separate"
+    done
+    for m in sequential parallel empty inprocess; do
+        callgrind_run "$work/cg-$m" "$work/cap-$m"
+    done
+    local -a sep empty inproc tree w
+    read -r -a sep <<<"$(callgrind_tree "$work/cg-separate")"
+    read -r -a empty <<<"$(callgrind_tree "$work/cg-empty")"
+    read -r -a inproc <<<"$(callgrind_tree "$work/cg-inprocess")"
+    printf '  %-34s %10s in %2d processes, %s a request\n' "$CALLS separate requests" "$(mi "${sep[0]}")" "${sep[1]}" \
+        "$(mi $((sep[0] / sep[1])))"
+    for m in sequential parallel; do
+        read -r -a tree <<<"$(callgrind_tree "$work/cg-$m")"
+        printf '  %-34s %10s in %2d processes, %s fewer (goal >= %sx: %s)\n' "compound, $m" "$(mi "${tree[0]}")" \
+            "${tree[1]}" "$(faster "${sep[0]}" "${tree[0]}")" "$SPEEDUP_GOAL" "$(goal_speedup "${sep[0]}" "${tree[0]}")"
+    done
+    printf '  %-34s %10s in %2d process, %s fewer\n' "compound of $CALLS in-process calls" "$(mi "${inproc[0]}")" \
+        "${inproc[1]}" "$(faster "${sep[0]}" "${inproc[0]}")"
+    echo "where the instructions go:"
+    printf '  %-34s %10s\n' "compound of no call" "$(mi "${empty[0]}")"
+    printf '  %-34s %10s a call\n' "an in-process call" "$(mi $(((inproc[0] - empty[0]) / CALLS)))"
+    for m in sequential parallel; do
+        read -r -a tree <<<"$(callgrind_tree "$work/cg-$m")"
+        printf '  %-34s %10s a call: request process %s, intermediate child %s, worker %s\n' "a forked call, $m" \
+            "$(mi $(((tree[0] - empty[0]) / CALLS)))" "$(mi $(((tree[3] - empty[0]) / CALLS)))" \
+            "$(mi $((tree[4] > 0 ? tree[5] / tree[4] : 0)))" "$(mi $((tree[6] > 0 ? tree[7] / tree[6] : 0)))"
+        if command -v callgrind_annotate >/dev/null; then
+            read -r -a w <<<"$(callgrind_workers "$work/cg-$m")"
+            printf '  %-34s permission check %s, lazy symbol binding %s, dlopen %s, answer into the pipe %s\n' \
+                "  a worker, inclusive costs:" "$(mi "${w[1]}")" "$(mi "${w[2]}")" "$(mi "${w[3]}")" "$(mi "${w[4]}")"
+        fi
+    done
+    echo "  (the worker's figures overlap: symbols are bound lazily inside the others)"
+}
+
+bench_compound() {
+    [ -f "$COMPOUND_LIB" ] && [ -x "$FORK_COST" ] || die "the compound benchmark's programs are not built in $build"
+    serve "$VELASCGI" 0
+    prepare_login || die "the echo call does not succeed: set BENCH_ECHO_QUERY"
+    local echo_url="$BASE/webapi/entry.cgi?$ECHO_QUERY" call inproc rest
+    call=$(query_json "$ECHO_QUERY") || die "BENCH_ECHO_QUERY holds a control character"
+    # The in-process echo gets the same parameters.
+    rest=$(printf '%s\n' "$ECHO_QUERY" | tr '&' '\n' | grep -v -E '^(api|version|method)(=|$)' | paste -sd '&')
+    inproc=$(query_json "api=VELA.Bench.Compound&version=1&method=echo&$rest") || die "BENCH_ECHO_QUERY holds a control character"
+    compound_form "$work/body-sequential" sequential "$call" "$CALLS"
+    compound_form "$work/body-parallel" parallel "$call" "$CALLS"
+    compound_form "$work/body-empty" sequential "$call" 0
+    compound_form "$work/body-inprocess" sequential "$inproc" "$CALLS"
+    echo "== compound of $CALLS echo calls in one request vs $CALLS separate requests =="
+    echo "one call: $call; $LOGIN_NOTE"
+    echo "compounds are POST forms to VELA.Entry.Request, the separate requests GETs on one keep-alive connection"
+    post_form "$work/body-sequential" "$work/answer-sequential"
+    compound_ok "$work/answer-sequential" "$CALLS" || die "the compound of echo calls failed"
+    echo "compound answer: $(head -c 240 "$work/answer-sequential")..."
+
+    # Warm-up: page cache, libraries, description files.
+    local m r
+    get_each "$CALLS" "$echo_url"
+    for m in sequential parallel empty inprocess; do
+        post_form "$work/body-$m" "$work/answer-$m"
+    done
+    local -A times=()
+    for r in $(seq 1 "$CROUNDS"); do
+        for m in $(printf '%s\n' separate sequential parallel empty inprocess | shuf); do
+            if [ "$m" = separate ]; then
+                get_each "$CALLS" "$echo_url"
+            else
+                post_form "$work/body-$m" "$work/answer-$m"
+                compound_ok "$work/answer-$m" "$([ "$m" = empty ] && echo 0 || echo "$CALLS")" || die "the $m compound failed"
+            fi
+            times[$m]+="$T "
+        done
+    done
+    local sep seq par empty inproc_t
+    sep=$(echo "${times[separate]}" | median)
+    seq=$(echo "${times[sequential]}" | median)
+    par=$(echo "${times[parallel]}" | median)
+    empty=$(echo "${times[empty]}" | median)
+    inproc_t=$(echo "${times[inprocess]}" | median)
+    echo "wall time (curl's time_total), median (fastest .. slowest) of $CROUNDS rounds, each in a shuffled order;"
+    echo "the machine is shared (load average $(loadavg)), so single rounds scatter:"
+    printf '  %-34s %s   %s ms a request\n' "$CALLS separate requests" "$(spread "${times[separate]}")" \
+        "$(awk -v t="$sep" -v n="$CALLS" 'BEGIN { printf "%.2f", t / n }')"
+    for m in sequential parallel; do
+        local t=$seq
+        [ "$m" = parallel ] && t=$par
+        printf '  %-34s %s   %s faster (goal >= %sx: %s)\n' "compound, $m" "$(spread "${times[$m]}")" \
+            "$(faster "$sep" "$t")" "$SPEEDUP_GOAL" "$(goal_speedup "$sep" "$t")"
+    done
+    echo "where the time goes (medians):"
+    printf '  %-34s %s   the request and the entry API alone (no call: no session check)\n' "compound of no call" "$(spread "${times[empty]}")"
+    printf '  %-34s %s   %s ms a call, %s faster than the separate requests:\n' \
+        "compound of $CALLS in-process calls" "$(spread "${times[inprocess]}")" \
+        "$(awk -v a="$inproc_t" -v b="$empty" -v n="$CALLS" 'BEGIN { printf "%.2f", (a - b) / n }')" \
+        "$(faster "$sep" "$inproc_t")"
+    printf '  %-34s the echo of VELA.Bench.Compound, "grantable": a sequential compound runs it in process\n' ""
+    printf '  %-34s %s ms sequential, %s ms parallel (each compound less the compound of no call, / %d)\n' \
+        "a forked call adds" \
+        "$(awk -v a="$seq" -v b="$empty" -v n="$CALLS" 'BEGIN { printf "%.2f", (a - b) / n }')" \
+        "$(awk -v a="$par" -v b="$empty" -v n="$CALLS" 'BEGIN { printf "%.2f", (a - b) / n }')" "$CALLS"
+    local forks
+    forks=$("$FORK_COST" -n 200 "$ROOT/usr/vela/velaman/webapi/sample/libvela-sample.so" "$COMPOUND_LIB") ||
+        die "vela-bench-fork-cost failed"
+    printf '  %-34s %s\n' "the forks alone, median of 200" \
+        "$(printf '%s\n' "$forks" | awk '{ printf "%s%s %.0f us", sep, $1, $2; sep = ", " }')"
+    echo "  (vela-bench-fork-cost: fork and wait; fork, a byte through a pipe, wait; the detached fork of a compound's"
+    echo "  children, a double fork, and a byte from the worker; in a process holding velascgi's libraries)"
+
+    local perf=0 valgrind=0
+    command -v perf >/dev/null && perf stat -e task-clock,page-faults -o /dev/null true 2>/dev/null && perf=1
+    [ "${BENCH_CALLGRIND:-1}" = 1 ] && VALGRIND=$(command -v valgrind) && valgrind=1
+    [ "$perf" = 1 ] || [ "$valgrind" = 1 ] && capture_all
+    if [ "$perf" = 1 ]; then
+        compound_cpu
+    else
+        echo "CPU time: perf is not installed or may not count here"
+    fi
+    if [ "${BENCH_CALLGRIND:-1}" != 1 ]; then
+        echo "instructions: left out (BENCH_CALLGRIND=${BENCH_CALLGRIND:-})"
+    elif [ "$valgrind" = 0 ]; then
+        echo "instructions: valgrind is not installed"
+    else
+        compound_instructions
+    fi
+    bench_compound_sleep
+}
+
+bench_compound_sleep() {
+    serve "$VELASCGI" 0
+    local url="$BASE/webapi/entry.cgi?api=VELA.Bench.Compound&version=1&method=sleep&ms=$SLEEP_MS"
+    local call="{\"api\":\"VELA.Bench.Compound\",\"version\":1,\"method\":\"sleep\",\"ms\":$SLEEP_MS}"
+    compound_form "$work/body-sleep-sequential" sequential "$call" "$CALLS"
+    compound_form "$work/body-sleep-parallel" parallel "$call" "$CALLS"
+    echo "== $CALLS calls that each sleep $SLEEP_MS ms: one parallel compound vs one sequential compound vs one call =="
+    echo "one call: $call (VELA.Bench.Compound, forked in both modes); curl's time_total, $SROUNDS rounds in a shuffled order"
+    local r m
+    local -A times=()
+    for r in $(seq 1 "$SROUNDS"); do
+        for m in $(printf '%s\n' single sequential parallel | shuf); do
+            if [ "$m" = single ]; then
+                get_each 1 "$url"
+            else
+                post_form "$work/body-sleep-$m" "$work/answer-sleep-$m"
+                compound_ok "$work/answer-sleep-$m" "$CALLS" || die "the $m compound of sleeping calls failed"
+            fi
+            times[$m]+="$T "
+        done
+        printf 'round %d: one call %7.1f ms   sequential compound %7.1f ms   parallel compound %7.1f ms\n' "$r" \
+            "$(echo "${times[single]}" | awk '{ print $NF }')" "$(echo "${times[sequential]}" | awk '{ print $NF }')" \
+            "$(echo "${times[parallel]}" | awk '{ print $NF }')"
+    done
+    local par
+    par=$(echo "${times[parallel]}" | median)
+    printf 'median:  one call %.1f ms   sequential compound %.1f ms   parallel compound %.1f ms (goal < %d ms: %s; slowest round %s ms)\n' \
+        "$(echo "${times[single]}" | median)" "$(echo "${times[sequential]}" | median)" "$par" "$SLEEP_GOAL_MS" \
+        "$(awk -v t="$par" -v g="$SLEEP_GOAL_MS" 'BEGIN { print (t + 0 < g + 0) ? "met" : "MISSED" }')" \
+        "$(ms "$(echo "${times[parallel]}" | largest)")"
+    echo "parallel answer: $(head -c 200 "$work/answer-sleep-parallel")..."
+}
+
 # ---- baselines alone -------------------------------------------------------------
 
 # Without velascgi: the baselines, to see the script and the machine work.
@@ -589,6 +1099,7 @@ for part in $PARTS; do
             bench_download 1
         fi
         ;;
+    compound) bench_compound ;;
     *) die "unknown part $part" ;;
     esac
 done
