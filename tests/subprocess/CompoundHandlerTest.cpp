@@ -229,8 +229,17 @@ TEST_F(CompoundTest, ChildPastItsTimeIsKilledAndTheOthersStillAnswer)
     EXPECT_TRUE(log.Contains("call 0 gave no answer in 1 s: killed"));
     const pid_t sleeper = static_cast<pid_t>(atoi(VELA::Test::ReadText(pidFile).c_str()));
     ASSERT_GT(sleeper, 0);
-    // Gone, or a zombie of whoever adopted it: killed either way.
-    const std::string stat = VELA::Test::ReadText("/proc/" + std::to_string(sleeper) + "/stat");
+    // Gone, or a zombie of whoever adopted it: killed either way. The kill
+    // takes effect asynchronously; a sleeper that was not killed would
+    // still be asleep ten seconds from now.
+    std::string stat;
+    for (int i = 0; i < 200; ++i) {
+        stat = VELA::Test::ReadText("/proc/" + std::to_string(sleeper) + "/stat");
+        if (stat.empty() || stat.find(") Z ") != std::string::npos) {
+            break;
+        }
+        usleep(25000);
+    }
     EXPECT_TRUE(stat.empty() || stat.find(") Z ") != std::string::npos) << stat;
 }
 
