@@ -11,6 +11,7 @@
 #include <iostream>
 #include <poll.h>
 #include <string>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include "dispatcher/Refusal.h"
@@ -111,6 +112,60 @@ bool WriteAll(int fd, const char* data, size_t len)
     }
     return true;
 }
+
+// The detached child of a call. It is not this process's child, so waitpid
+// cannot say when it ends; a pidfd can. Its pipes alone cannot either: a
+// process the handler forked (without exec) keeps their write ends open
+// after the child has died, and a read would wait for that process.
+class Worker {
+public:
+    explicit Worker(pid_t pid) : pidfd_(static_cast<int>(syscall(SYS_pidfd_open, pid, 0))), ended_(false)
+    {
+        // Gone already (ESRCH). Without pidfds (an old kernel), reads end
+        // at end of file only.
+        ended_ = pidfd_ < 0 && errno == ESRCH;
+    }
+    ~Worker()
+    {
+        if (pidfd_ >= 0) {
+            close(pidfd_);
+        }
+    }
+    Worker(const Worker&) = delete;
+    Worker& operator=(const Worker&) = delete;
+
+    // Waits until `fd` has something to read (data or end of file), the
+    // child has ended, or `doneFd` (when >= 0) is readable, which says the
+    // child is done writing to `fd`. In the last two cases all the child
+    // wrote to `fd` is in the pipe: `fd` is made non-blocking, so reads
+    // take what is there and then stop.
+    void Await(int fd, int doneFd = -1)
+    {
+        bool done = ended_;
+        while (!done) {
+            struct pollfd p[3] = {{fd, POLLIN, 0}, {pidfd_, POLLIN, 0}, {doneFd, POLLIN, 0}};
+            if (poll(p, 3, -1) < 0) {
+                if (errno == EINTR) {
+                    continue;
+                }
+                return;
+            }
+            ended_ = p[1].revents != 0;
+            done = ended_ || p[2].revents != 0;
+            if (!done) {
+                return;
+            }
+        }
+        const int flags = fcntl(fd, F_GETFL);
+        if (flags >= 0 && (flags & O_NONBLOCK) == 0) {
+            fcntl(fd, F_SETFL, flags | O_NONBLOCK);
+        }
+    }
+
+private:
+    int pidfd_;
+    bool ended_;
+};
 
 }  // namespace
 
@@ -249,6 +304,8 @@ void ExecHandler::RunFork(Json::Value& result)
         _exit(status);
     }
     answer.ReadOnly(-1);
+    Worker worker(pid);
+    worker.Await(answer.ReadFd());
     if (!answer.ReadJson(result)) {
         Fail(result, WEBAPI_ERR_NO_RESPONSE);
         VELA_LOG_ERR("read json failed");
@@ -294,10 +351,13 @@ void ExecHandler::RunForkForStdout(Json::Value& result)
     }
     answer.ReadOnly(-1);
     output.ReadOnly(-1);
+    Worker worker(pid);
     char buf[kChunk];
     bool inBody = false;
     bool forwarding = true;
     for (;;) {
+        // The child writes its answer only after its output has ended.
+        worker.Await(output.ReadFd(), answer.ReadFd());
         const int n = output.Read(buf, kChunk - 1);
         if (n < 1) {
             break;
@@ -323,6 +383,7 @@ void ExecHandler::RunForkForStdout(Json::Value& result)
             forwarding = false;
         }
     }
+    worker.Await(answer.ReadFd());
     if (!answer.ReadJson(result)) {
         Fail(result, WEBAPI_ERR_NO_RESPONSE);
         VELA_LOG_ERR("read json failed");

@@ -37,7 +37,10 @@ public:
     // identity switch never touches the caller. With `outFd` >= 0 the
     // method always runs in a child. A child's standard input is /dev/null,
     // and so is its standard output unless it is forwarded: it never
-    // writes into the caller's reply.
+    // writes into the caller's reply. The caller waits for the child, not
+    // for processes the handler left behind holding the child's pipes: once
+    // the child has ended (seen through a pidfd), what it wrote is read and
+    // the rest is not waited for.
     void Process(Json::Value& result);
 
     // True when api, method and user are given; else `result` is 101.

@@ -16,6 +16,7 @@
 #include <string>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include "platform/IdentityTestUtil.h"
@@ -115,7 +116,7 @@ protected:
     void Describe(const std::string& idsUser)
     {
         const std::string methods = R"(["report", {"reportGrantable": {"grantable": true}},
-            {"reportDefault": {"grantByDefault": true}}, {"noisy": {"allowDownload": true}}, "crash",
+            {"reportDefault": {"grantByDefault": true}}, {"noisy": {"allowDownload": true}}, "crash", "orphan",
             {"output": {"grantable": true, "allowDownload": true}}])";
         Write("VELA.Exec.lib", J(R"({
             "VELA.Exec.Test": {"lib": ")" + Lib() + R"(", "minVersion": 1, "maxVersion": 1,
@@ -362,6 +363,47 @@ TEST_F(ExecHandlerTest, OutFdWhoseReaderLeftStillGetsTheAnswer)
     close(fds[1]);
     EXPECT_EQ(Json::Value(true), result["success"]) << result;
     EXPECT_TRUE(LoggedLine(log, "^ExecHandler:\\d+ cannot forward the output of VELA.Exec.Test output"));
+}
+
+// A process the handler left behind holds the child's pipes open after the
+// child has ended: the answer (or the refusal of a dead child) still comes,
+// without waiting for that process.
+TEST_F(ExecHandlerTest, ProcessLeftBehindByTheHandlerDoesNotHoldTheCaller)
+{
+    const int probe = static_cast<int>(syscall(SYS_pidfd_open, getpid(), 0));
+    if (probe < 0) {
+        GTEST_SKIP() << "no pidfd on this kernel: the end of a detached child is seen at end of file only";
+    }
+    close(probe);
+    const std::string fifo = root_.Path() + "/fifo";
+    ASSERT_EQ(0, mkfifo(fifo.c_str(), 0600));
+    // Lets the process left behind end.
+    auto release = [&] {
+        const int fd = open(fifo.c_str(), O_WRONLY | O_CLOEXEC);
+        ASSERT_GE(fd, 0);
+        close(fd);
+    };
+    const std::string path = root_.Path() + "/out";
+    const int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    ASSERT_GE(fd, 0);
+    Json::Value params(Json::objectValue);
+    params["fifo"] = fifo;
+
+    params["how"] = "kill";
+    EXPECT_EQ(Failure(117), Exec(kApi, "orphan", params, Self().c_str()));
+    release();
+    EXPECT_EQ(Failure(117), Exec(kApi, "orphan", params, Self().c_str(), fd));
+    release();
+
+    // An answer larger than a pipe holds, while the output stays open.
+    params["how"] = "return";
+    params["pad"] = 1 << 20;
+    const Json::Value result = Exec(kApi, "orphan", params, Self().c_str(), fd);
+    release();
+    close(fd);
+    EXPECT_EQ(Json::Value(true), result["success"]) << result["error"];
+    EXPECT_EQ(1u << 20, result["data"]["pad"].asString().size());
+    EXPECT_EQ("before", VELA::Test::ReadText(path));
 }
 
 // A child never writes into the caller's standard output (a CGI reply) nor

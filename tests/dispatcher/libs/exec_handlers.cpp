@@ -140,6 +140,32 @@ void Output(APIRequest* req, APIResponse* resp)
     resp->SetSuccess(data);
 }
 
+// Leaves a process behind that holds every descriptor of the call (its
+// standard output and its answer pipe) until someone opens the FIFO named
+// by "fifo" for writing and closes it. Then dies ("how": "kill"), or writes
+// a CGI reply ("X: 1", an empty line, "before") and answers with "pad"
+// bytes of padding.
+void Orphan(APIRequest* req, APIResponse* resp)
+{
+    const std::string fifo = req->GetParam("fifo", "").asString();
+    const pid_t pid = fork();
+    if (pid == 0) {
+        const int fd = open(fifo.c_str(), O_RDONLY);
+        char c;
+        while (fd >= 0 && read(fd, &c, 1) > 0) {
+        }
+        _exit(0);
+    }
+    if (pid < 0 || req->GetParam("how", "kill").asString() == "kill") {
+        raise(SIGKILL);
+    }
+    const std::string reply = "X: 1\r\n\r\nbefore";
+    WriteAll(STDOUT_FILENO, reply.data(), reply.size());
+    Json::Value data(Json::objectValue);
+    data["pad"] = std::string(static_cast<size_t>(Count(req, "pad", 0)), 'p');
+    resp->SetSuccess(data);
+}
+
 _tag_API_TABLE g_table[] = {
     {"VELA.Exec.Test", 1, "report", Report},
     {"VELA.Exec.Test", 1, "reportGrantable", Report},
@@ -147,6 +173,7 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Exec.Test", 1, "noisy", Noisy},
     {"VELA.Exec.Test", 1, "crash", Crash},
     {"VELA.Exec.Test", 1, "output", Output},
+    {"VELA.Exec.Test", 1, "orphan", Orphan},
     {"VELA.Exec.Ids", 1, "report", Report},
     {"VELA.Exec.Ids", 1, "reportGrantable", Report},
     {"VELA.Exec.Ids", 1, "reportDefault", Report},
