@@ -198,7 +198,12 @@ void ExecHandler::Process(Json::Value& result)
         }
         PrepareReq();
         if (outFd_ < 0) {
-            APIRequest req(request_);
+            // The call's names are all the look-up needs: no copy of params.
+            Json::Value names(Json::objectValue);
+            for (const char* key : {"api", "method", "version"}) {
+                names["postParam"][key] = request_["postParam"][key];
+            }
+            APIRequest req(names);
             // A method that switches identity for good runs in a child, so
             // that the switch never touches this process.
             const bool inProcess =
