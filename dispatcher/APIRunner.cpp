@@ -382,6 +382,11 @@ void APIRunner::Exec(Json::Value& out, int fd, const char* api, int version, con
         out = Json::Value(Json::objectValue);
         out["success"] = false;
         out["error"]["code"] = WEBAPI_ERR_NO_RESPONSE;
+    } catch (...) {
+        VELA_LOG_ERR("running %s for a user failed", api ? LogSafe(api).c_str() : "(null)");
+        out = Json::Value(Json::objectValue);
+        out["success"] = false;
+        out["error"]["code"] = WEBAPI_ERR_NO_RESPONSE;
     }
 }
 

@@ -219,6 +219,9 @@ void ExecHandler::Process(Json::Value& result)
     } catch (const std::exception& e) {
         VELA_LOG_ERR("running %s for a user failed: %s", api_ ? LogSafe(api_).c_str() : "(null)", e.what());
         Fail(result, WEBAPI_ERR_NO_RESPONSE);
+    } catch (...) {
+        VELA_LOG_ERR("running %s for a user failed", api_ ? LogSafe(api_).c_str() : "(null)");
+        Fail(result, WEBAPI_ERR_NO_RESPONSE);
     }
     if (cwd != nullptr) {
         if (chdir(cwd) != 0) {
