@@ -167,13 +167,19 @@ void RecordCode(APIRequest* req, APIResponse* resp, int code, const Json::Value&
     }
 }
 
-// The API's "appPriv" (empty: none) into `appPriv`; false, with 105 on
-// `resp`, when `user` does not hold it from the client's address.
-bool CheckAppPriv(APIRequest* req, APIResponse* resp, const std::string& user, std::string& appPriv)
+// The API's "appPriv" (empty: none) into `appPriv`; whether `user` holds it
+// from the client's address.
+bool HoldsAppPriv(APIRequest* req, const std::string& user, std::string& appPriv)
 {
     const Json::Value privValue = req->GetAPIInfo("appPriv", Json::Value(""));
     appPriv = privValue.isString() ? privValue.asString() : "";
-    if (!appPriv.empty() && VLIBAppPrivUserHas(user.c_str(), appPriv.c_str(), req->GetRemoteIP().c_str()) != 1) {
+    return appPriv.empty() || VLIBAppPrivUserHas(user.c_str(), appPriv.c_str(), req->GetRemoteIP().c_str()) == 1;
+}
+
+// HoldsAppPriv, with 105 on `resp` and one line when it does not.
+bool CheckAppPriv(APIRequest* req, APIResponse* resp, const std::string& user, std::string& appPriv)
+{
+    if (!HoldsAppPriv(req, user, appPriv)) {
         VELA_REFUSE(resp, WEBAPI_ERR_NO_PERMISSION, "user \"%s\" lacks the application privilege %s for %s",
                     LogSafe(user).c_str(), appPriv.c_str(), LogSafe(req->GetAPIClass()).c_str());
         return false;
@@ -354,7 +360,7 @@ bool PermissionCheck::CheckPermission(APIRequest* req, APIResponse* resp, VELACG
 
 // User classes: the method's own "allowUser" list replaces the API's. A
 // missing, non-array or empty list admits every logged-in user.
-bool PermissionCheck::CheckUserClass(APIRequest* req, APIResponse* resp, const std::string& user)
+bool PermissionCheck::ClassAdmitted(APIRequest* req, const std::string& cls)
 {
     Json::Value allowUser = req->GetAPIInfo("allowUser", Json::Value());
     const Json::Value& method = runner_.GetMethod(req->GetAPIClass(), req->GetAPIVersion(), req->GetAPIMethod());
@@ -364,15 +370,39 @@ bool PermissionCheck::CheckUserClass(APIRequest* req, APIResponse* resp, const s
     if (!allowUser.isArray() || allowUser.empty()) {
         return true;
     }
-    const std::string cls = UserClass(req->IsAdmin(), user);
     for (const Json::Value& entry : allowUser) {
         if (entry.isString() && entry.asString() == cls) {
             return true;
         }
     }
+    return false;
+}
+
+bool PermissionCheck::CheckUserClass(APIRequest* req, APIResponse* resp, const std::string& user)
+{
+    const std::string cls = UserClass(req->IsAdmin(), user);
+    if (ClassAdmitted(req, cls)) {
+        return true;
+    }
     VELA_REFUSE(resp, WEBAPI_ERR_NO_PERMISSION, "user \"%s\" (%s) may not call %s", LogSafe(user).c_str(),
                 cls.c_str(), LogSafe(req->GetAPIClass()).c_str());
     return false;
+}
+
+bool PermissionCheck::UserMayCall(APIRequest* req)
+{
+    if (req == nullptr) {
+        return false;
+    }
+    if (!NeedPermission(req)) {
+        return true;
+    }
+    const std::string user = req->GetLoginUserName();
+    std::string appPriv;
+    if (ClassAdmitted(req, UserClass(req->IsAdmin(), user)) && HoldsAppPriv(req, user, appPriv)) {
+        return true;
+    }
+    return SkipPermission(req);
 }
 
 bool PermissionCheck::CheckSharingPermission(APIRequest* req, APIResponse* resp)

@@ -55,6 +55,16 @@ public:
     // call may go on; the session facts are rebuilt with "appPriv".
     bool CheckPermission(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi);
 
+    // The rules of the whole check that do not depend on a session, for a
+    // caller that already acts as the user of `req`'s session facts
+    // ("username", "isAdmin"), the API's description handed to `req`
+    // (APIRunner::AddAPIInfo): an "authLevel" of 0 admits everyone;
+    // otherwise the user's class must be in "allowUser" and the user must
+    // hold the API's "appPriv" from `req`'s client address (when none is
+    // known, only rules without addresses apply); a refusal is not enforced
+    // when "authLevel" is 2. Logs no refusal, sets no error, stores nothing.
+    bool UserMayCall(APIRequest* req);
+
     // A call through a sharing link: refused (105) until sharing links are
     // served.
     static bool CheckSharingPermission(APIRequest* req, APIResponse* resp);
@@ -74,6 +84,8 @@ private:
     Json::Value& Slot(bool allowTimeout);
     VELACGI_CTX* Handle(VELACGI_CTX* cgi);
     int AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTimeout, Given& given);
+    // Whether the method's (or else the API's) "allowUser" admits `cls`.
+    bool ClassAdmitted(APIRequest* req, const std::string& cls);
     bool CheckUserClass(APIRequest* req, APIResponse* resp, const std::string& user);
 
     APIRunner& runner_;

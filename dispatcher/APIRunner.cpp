@@ -29,6 +29,7 @@
 #include "dispatcher/ResolvedCall.h"
 #include "dispatcher/Road.h"
 #include "subprocess/CompoundHandler.h"
+#include "subprocess/ExecHandler.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/vlibc.h"
@@ -45,15 +46,6 @@ namespace {
 
 const char kLibDefPath[] = "/usr/vela/velaman/webapi/lib.def";
 const char kEntryAPI[] = "VELA.Entry.Request";
-
-// The answer of the exec calls until the exec handler exists.
-void ExecUnavailable(Json::Value& out, const char* api, const char* method)
-{
-    VELA_LOG_ERR("running %s %s for a user is not available", api ? api : "(null)", method ? method : "(null)");
-    out = Json::Value(Json::objectValue);
-    out["success"] = false;
-    out["error"]["code"] = WEBAPI_ERR_NO_RESPONSE;
-}
 
 }  // namespace
 
@@ -382,7 +374,21 @@ void APIRunner::HandleCallback(APIResponse* resp)
 void APIRunner::Exec(Json::Value& out, int fd, const char* api, int version, const char* method,
                      const Json::Value& params, const Json::Value& extra, const char* user)
 {
-    ExecUnavailable(out, api, method);
+    try {
+        ExecHandler handler(api, version, method, params, extra, user, fd);
+        handler.Process(out);
+    } catch (const std::exception& e) {
+        // Out of memory before the call could start.
+        VELA_LOG_ERR("running %s for a user failed: %s", api ? LogSafe(api).c_str() : "(null)", e.what());
+        out = Json::Value(Json::objectValue);
+        out["success"] = false;
+        out["error"]["code"] = WEBAPI_ERR_NO_RESPONSE;
+    } catch (...) {
+        VELA_LOG_ERR("running %s for a user failed", api ? LogSafe(api).c_str() : "(null)");
+        out = Json::Value(Json::objectValue);
+        out["success"] = false;
+        out["error"]["code"] = WEBAPI_ERR_NO_RESPONSE;
+    }
 }
 
 void APIRunner::Exec(Json::Value& out, const char* api, int version, const char* method,

@@ -68,8 +68,21 @@ public:
     // server sees the answer end at once. A callback opens what it needs.
     void HandleCallback(APIResponse* resp);
 
-    // Runs one API on behalf of `user`. Until the exec handler exists these
-    // answer {"success": false, "error": {"code": 117}}.
+    // Runs one API method on behalf of `user`, with `params` as its
+    // parameters ("api", "method" and "version" in them are replaced by the
+    // arguments) and `extra` as the request's attributes; the answer is
+    // left in `out` (the response body and "httpd_restart"). No permission
+    // is checked: the caller decides whether `user` may call the method.
+    // The call runs from the web-API directory; the working directory, the
+    // identity and USERNAME / VELA_WEBAPI_USERNAME are put back afterwards.
+    // A method that would switch identity for good ("grantable" and
+    // "grantByDefault" both false) runs in a detached child whose standard
+    // input and output are /dev/null. With `fd` >= 0 the call always runs in
+    // a child, and the body the handler writes to standard output (after its
+    // header lines and the empty line) goes to `fd`. Errors of its own:
+    // 101 api, method or user missing, or not usable; 117 the child could
+    // not be made or gave no answer. The forms without `fd` forward
+    // nothing; the last passes an empty object as `extra`.
     void Exec(Json::Value& out, int fd, const char* api, int version, const char* method,
               const Json::Value& params, const Json::Value& extra, const char* user);
     void Exec(Json::Value& out, const char* api, int version, const char* method,

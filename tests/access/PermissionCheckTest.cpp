@@ -350,6 +350,50 @@ TEST_F(PermissionCheckTest, ApplicationPrivilegeIsCheckedFromTheClientAddress)
     }
 }
 
+// The judgement of a caller that already acts as the user (velaapi): the
+// description's rules without a session, with no refusal logged or set.
+TEST_F(PermissionCheckTest, UserMayCallJudgesTheDescriptionWithoutASession)
+{
+    ASSERT_EQ(0, mkdir((root_.Path() + "/etc").c_str(), 0755));
+    ASSERT_EQ(0, mkdir((root_.Path() + "/etc/vela").c_str(), 0755));
+    ASSERT_TRUE(VELA::JsonWriteFile(root_.Path() + "/etc/vela/app_privileges.json",
+                                    J(R"({"applications": {"VELA.Open": {"users": ["daemon"]},
+                                        "VELA.Near": {"users": ["daemon"], "allow_from": ["192.0.2.0/24"]}}})")));
+    const struct {
+        const char* apiLevel;
+        const char* method;
+        const char* user;
+        const char* remote;
+        bool allowed;
+    } cases[] = {
+        {R"({"allowUser": ["admin.local"]})", "get", "daemon", kClient, false},
+        {R"({"allowUser": ["admin.local"]})", "get", "root", kClient, true},
+        {R"({"allowUser": ["admin.local"]})", "own", "daemon", kClient, true},
+        {R"({"allowUser": ["admin.local"], "authLevel": 0})", "get", "daemon", kClient, true},
+        {R"({"allowUser": ["admin.local"], "authLevel": 2})", "get", "daemon", kClient, true},
+        {R"({"appPriv": "VELA.Open"})", "get", "daemon", nullptr, true},
+        {R"({"appPriv": "VELA.Open"})", "get", "nobody", nullptr, false},
+        {R"({"appPriv": "VELA.Near"})", "get", "daemon", kClient, true},
+        // No client address is known: a rule bound to addresses grants nothing.
+        {R"({"appPriv": "VELA.Near"})", "get", "daemon", nullptr, false},
+    };
+    for (const auto& c : cases) {
+        ScopedEnv remote("REMOTE_ADDR", c.remote);
+        Declare(Desc(c.apiLevel));
+        PreparedCall call(c.method, "");
+        Json::Value session(Json::objectValue);
+        session["username"] = c.user;
+        session["isAdmin"] = std::string(c.user) == "root";
+        call.Req()->InitSession(session);
+        LogCapture log;
+        EXPECT_EQ(c.allowed, call.check.UserMayCall(call.Req())) << c.apiLevel << " " << c.method << " " << c.user;
+        EXPECT_FALSE(log.Contains("PermissionCheck:")) << c.apiLevel << ": a refusal was logged";
+        EXPECT_EQ(0, call.Resp()->GetError()) << c.apiLevel;
+    }
+    Runner runner;
+    EXPECT_FALSE(PermissionCheck(runner).UserMayCall(nullptr));
+}
+
 TEST_F(PermissionCheckTest, AccessTokenGrantsOnlyItsMethods)
 {
     std::string token, id;
