@@ -10,14 +10,8 @@
 # tools or when not run as root.
 set -u
 
-[ $# -eq 5 ] || { echo "usage: upload.sh VELASCGI VELAADM STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR" >&2; exit 2; }
-VELASCGI=$(realpath -e "$1") || exit 1
-VELAADM=$(realpath -e "$2") || exit 1
-WEBAPI=$(realpath -e "$3") || exit 1
-PIPE_LIB=$(realpath -e "$4") || exit 1
-SRC=$(realpath -e "$5") || exit 1
-
-. "$SRC/tests/e2e/server.sh"
+. "$(dirname "$0")/server.sh"
+srv_args VELASCGI VELAADM WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "velascgi stores uploads as root and switches identity" setpriv flock find stat
 srv_traps
 
@@ -26,20 +20,16 @@ srv_traps
 # runs with root's rights; one data volume whose "@tmp" is world-writable
 # without the sticky bit, as earlier versions made it.
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
-api=$ROOT/usr/vela/velaman/webapi
-rm "$api" && mkdir "$api" && ln -s "$WEBAPI"/* "$api"/ || exit 1
-cat >"$api/VELA.Pipe.Ids.lib" <<EOF
+srv_api VELA.Pipe.Ids <<EOF
 {"VELA.Pipe.Ids": {"lib": "$PIPE_LIB", "minVersion": 1, "maxVersion": 1, "authLevel": 0,
   "methods": {"1": [{"upload": {"allowUpload": true, "runAs": "nobody"}},
                     {"byDefault": {"grantByDefault": true}}]}}}
 EOF
 echo /vol1 >"$ROOT/etc/vela/volumes.conf"
 UP=$ROOT/vol1/@tmp
-mkdir -p "$UP" "$RUN/www" && chmod 0777 "$UP" || exit 1
-srv_start "$RUN/www" || { failures=1; exit 1; }
-
-sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
-[ -n "$sid" ] || fail "velaadm created no session"
+mkdir -p "$UP" && chmod 0777 "$UP" || exit 1
+srv_serve
+srv_session
 COOKIE="id=$sid"
 printf 'small file\n' >"$TMP/small.txt"
 head -c 33554432 /dev/urandom >"$TMP/big.bin"
@@ -119,11 +109,4 @@ expect "upload after dead requests" '"success":true'
 exec {lockfd}<&-
 rm -rf "${UP:?}/$live"
 
-srv_sanitizer_clean || fail "sanitizer reports in the logs"
-
-if [ "$failures" -ne 0 ]; then
-  echo "$failures check(s) failed"
-  exit 1
-fi
-echo "all upload checks passed ($URL)"
-exit 0
+srv_finish "all upload checks passed ($URL)"
