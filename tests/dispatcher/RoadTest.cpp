@@ -29,7 +29,8 @@ protected:
     };
 
     // Runs `request` through Run of a fresh runner (`process`: through
-    // Process, as a sub-request would), capturing the log.
+    // Process, as a sub-request would), capturing the log. Run's refusal
+    // answers success false and no restart.
     static Outcome RunCall(const Json::Value& request, bool process = false)
     {
         Outcome out;
@@ -43,6 +44,8 @@ protected:
         } else {
             EXPECT_FALSE(runner.Run(request)) << request;
             out.code = runner.GetResponseObject()->GetError();
+            EXPECT_EQ(Json::Value(false), runner.GetResponse()["success"]) << request;
+            EXPECT_EQ(Json::Value(false), runner.GetResponse()["httpd_restart"]) << request;
         }
         out.lines = log.Lines();
         return out;
@@ -92,6 +95,8 @@ TEST_F(Road, EveryRefusalLogsOnceWhereItIsDecided)
          "Registry", "no version 3"},
         {"method not listed", Call("VELA.Pipe.Test", 1, "nope"), false, WEBAPI_ERR_NO_SUCH_METHOD, "Registry",
          "no method \"nope\""},
+        {"method with a line break", Call("VELA.Pipe.Test", 1, "no\nsuch"), false, WEBAPI_ERR_NO_SUCH_METHOD,
+         "Registry", "VELA.Pipe.Test version 1 has no method \"no\\x0asuch\""},
         {"upload not allowed", upload, false, WEBAPI_ERR_UPLOAD_NOT_ALLOWED, "Registry", "takes no upload"},
         {"relay_ds reaching Process", relay, true, WEBAPI_ERR_RELAY_FAILED, "APIRunner", "relaying"},
         {"entry API without compound", Call("VELA.Entry.Request", 1, "request"), false,
