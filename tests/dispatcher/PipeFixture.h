@@ -1,7 +1,8 @@
-// Fixture of the pipeline, counter and identity tests: a fresh system root
-// whose web-API directory holds lib.def and the descriptions of the test
-// handler libraries (tests/dispatcher/libs/pipe_*.cpp), with the working
-// directory there for the test's duration.
+// WebapiDirFixture: a fresh system root whose web-API directory is the
+// working directory for the test's duration. PipeFixture, of the pipeline,
+// counter and identity tests: that directory holds lib.def and the
+// descriptions of the test handler libraries
+// (tests/dispatcher/libs/pipe_*.cpp).
 #pragma once
 
 #include <climits>
@@ -17,7 +18,7 @@
 #include "support/JsonLiteral.h"
 #include "vela/webapiutil.h"
 
-class PipeFixture : public StateRootTest {
+class WebapiDirFixture : public StateRootTest {
 protected:
     void SetUp() override
     {
@@ -28,12 +29,6 @@ protected:
         webapiDir_ = root_.Path() + "/usr/vela/velaman/webapi";
         ASSERT_EQ(0, system(("mkdir -p '" + webapiDir_ + "'").c_str()));
         ASSERT_EQ(0, chdir(webapiDir_.c_str()));
-        WriteJson("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0,
-                                   "methods": {"allowDemo": false}})"));
-        WriteJson("VELA.Pipe.lib", Descriptions());
-        WriteJson("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": ")" + Lib("pipe_handlers") + R"(",
-            "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(",
-            "methods": {"1": ["request", "other"]}}})"));
     }
     void TearDown() override
     {
@@ -41,6 +36,28 @@ protected:
             EXPECT_EQ(0, chdir(oldCwd_.c_str()));
         }
         StateRootTest::TearDown();
+    }
+
+    void WriteJson(const std::string& name, const Json::Value& value)
+    {
+        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + name, value, 0644)) << name;
+    }
+
+    std::string oldCwd_;
+    std::string webapiDir_;
+};
+
+class PipeFixture : public WebapiDirFixture {
+protected:
+    void SetUp() override
+    {
+        WebapiDirFixture::SetUp();
+        WriteJson("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0,
+                                   "methods": {"allowDemo": false}})"));
+        WriteJson("VELA.Pipe.lib", Descriptions());
+        WriteJson("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": ")" + Lib("pipe_handlers") + R"(",
+            "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(",
+            "methods": {"1": ["request", "other"]}}})"));
     }
 
     // Path of a test handler library lib<name>.so.
@@ -56,11 +73,6 @@ protected:
     {
         const struct passwd* pw = getpwuid(geteuid());
         return pw ? pw->pw_name : "system";
-    }
-
-    void WriteJson(const std::string& name, const Json::Value& value)
-    {
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + name, value, 0644)) << name;
     }
 
     // A request JSON for one call.
@@ -103,7 +115,4 @@ protected:
                 "maxVersion": 1, "methods": {"1": ["get"]}}
         })");
     }
-
-    std::string oldCwd_;
-    std::string webapiDir_;
 };
