@@ -49,7 +49,7 @@ nobody_uid=$(id -u nobody)
 nobody_gid=$(id -g nobody)
 call --cookie "$COOKIE" -F "method=byDefault" -F "f=@$TMP/small.txt" "$IDS"
 expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$nobody_uid,$nobody_uid]" \
-  '"method":"upload"'
+  '"method":"upload"' '"methodParam":"upload"'
 [ "$(stat -c %a "$UP")" = 1777 ] || fail "@tmp is $(stat -c %a "$UP") after an upload, not 1777"
 [ -z "$(left)" ] || fail "an upload left $(left)in @tmp"
 

@@ -84,7 +84,7 @@ protected:
         for (const auto& v : vars) {
             list.push_back(v.first + "=" + v.second);
         }
-        const std::string out = RunProgram(BuiltProgram("velascgi"), list, body);
+        const std::string out = RunWithEnv(BuiltProgram("velascgi"), list, body);
         Reply reply;
         const size_t end = out.find("\r\n\r\n");
         EXPECT_NE(std::string::npos, end) << out;

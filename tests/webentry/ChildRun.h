@@ -56,7 +56,7 @@ inline std::string BuiltProgram(const std::string& name)
 
 // Runs `program` with exactly `env` as its environment and `input` on its
 // standard input; its standard output.
-inline std::string RunProgram(const std::string& program, std::vector<std::string> env, const std::string& input)
+inline std::string RunWithEnv(const std::string& program, std::vector<std::string> env, const std::string& input)
 {
     return RunChild(input, [&] {
         std::vector<char*> envp;

@@ -40,7 +40,7 @@ TEST(Velascgi, RefusalsOfTheRegistryAndTheFrontEnd)
     for (const auto& c : cases) {
         std::vector<std::string> env = c.env;
         env.push_back("VELA_ROOT=" + root);
-        EXPECT_EQ(std::string(kHeaders) + c.body, RunProgram(BuiltProgram("velascgi"), env, "")) << c.body;
+        EXPECT_EQ(std::string(kHeaders) + c.body, RunWithEnv(BuiltProgram("velascgi"), env, "")) << c.body;
     }
 }
 
@@ -48,7 +48,7 @@ TEST(Velascgi, MissingWebApiDirectoryAnswers500)
 {
     VELA::Test::TempDir empty;
     const std::string reply =
-        RunProgram(BuiltProgram("velascgi"), {"VELA_ROOT=" + empty.Path(), "REQUEST_METHOD=GET"}, "");
+        RunWithEnv(BuiltProgram("velascgi"), {"VELA_ROOT=" + empty.Path(), "REQUEST_METHOD=GET"}, "");
     EXPECT_EQ(0u, reply.find("Status: 500 Internal Server Error\r\n")) << reply;
     EXPECT_NE(std::string::npos, reply.find("\r\n\r\n{\"error\":{\"code\":117},\"success\":false}")) << reply;
 }
