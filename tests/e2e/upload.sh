@@ -55,9 +55,9 @@ expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$no
 
 # ---- A client that goes away in the middle of a big file, for an upload the
 # front end stores and one the handler reads itself. While it is in flight,
-# another local user can neither read the partial file nor put a file of
-# their own in its place; shortly after the client is gone, nothing of it
-# is left.
+# another local user can neither read the partial file, nor put a file of
+# their own in its place, nor move its directory away; shortly after the
+# client is gone, nothing of it is left.
 for target in "$IDS" "$DEFERRED"; do
   name=${target#*api=}
   name="client gone (${name%%&*})"
@@ -79,6 +79,10 @@ for target in "$IDS" "$DEFERRED"; do
     if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
         sh -c 'echo evil >"$1/evil" && mv -f "$1/evil" "$2"' sh "$UP" "$partial" 2>/dev/null; then
       fail "$name: nobody replaced the partial file $partial"
+    fi
+    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
+        mv -f "$(dirname "$partial")" "$UP/moved" 2>/dev/null; then
+      fail "$name: nobody moved the directory of the partial file $partial"
     fi
     rm -f "$UP/evil"
   fi
