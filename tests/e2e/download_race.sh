@@ -6,11 +6,7 @@
 # Hundreds of downloads, streamed by velascgi and with X-Sendfile on: no
 # answer may carry the root-only content. Then, without the loop, X-Sendfile
 # is used for the folder once root owns it, and not while "nobody" does.
-#
-# usage: download_race.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR [REQUESTS]
-# REQUESTS per mode, 250 by default. Exit 0 when every check passed, 1
-# otherwise, 77 (skipped) without lighttpd, curl, perl or setpriv, or when not
-# run as root.
+# A fifth argument: the downloads per mode (250).
 set -u
 
 . "$(dirname "$0")/server.sh"

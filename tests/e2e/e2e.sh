@@ -3,11 +3,6 @@
 # deploy/lighttpd.conf.in, runs velascgi on a free port of 127.0.0.1 under a
 # temporary system root that serves the staged web-API directory; curl then
 # calls the sample API the way a browser or a client program would.
-#
-# usage: e2e.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR
-# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without lighttpd
-# or curl, or when not run as root (velascgi switches identity per API, which
-# only root can do).
 set -u
 
 . "$(dirname "$0")/server.sh"

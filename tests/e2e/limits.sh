@@ -3,8 +3,6 @@
 # make the parser quadratic, a body that never arrives, more requests at once
 # than a client may have, and "version" texts that only look like 1, each
 # through a private lighttpd.
-#
-# usage: limits.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR
 set -u
 
 . "$(dirname "$0")/server.sh"

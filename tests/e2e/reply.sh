@@ -9,10 +9,6 @@
 # writes its marker file only when it ends, several seconds after the reply,
 # so the answer must be complete while the marker is still missing, and the
 # marker must appear later.
-#
-# usage: reply.sh VELASCGI STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR
-# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without the
-# tools or when not run as root.
 set -u
 
 . "$(dirname "$0")/server.sh"

@@ -1,7 +1,9 @@
 # Shared by the end-to-end scripts that drive the real server (sourced, not
 # run): a temporary system root that serves the staged web-API directory, a
 # private lighttpd from deploy/lighttpd.conf.in on a free port of 127.0.0.1,
-# and Linux accounts made for the run and removed afterwards.
+# and Linux accounts made for the run and removed afterwards. A script takes
+# the paths its srv_args names and exits 0 when every check passed, 1
+# otherwise, 77 (skipped) without a tool it needs or without root.
 #
 #   srv_args NAME... -- ARG...     each NAME the real path of its ARG; exits 2
 #                                  with the usage when the counts differ

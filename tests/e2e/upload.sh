@@ -4,10 +4,6 @@
 # the API, a local user going for the files of an upload in flight, a client
 # that goes away in the middle of the body, and directories left behind by
 # requests that died.
-#
-# usage: upload.sh VELASCGI VELAADM STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR
-# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without the
-# tools or when not run as root.
 set -u
 
 . "$(dirname "$0")/server.sh"
