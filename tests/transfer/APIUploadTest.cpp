@@ -3,6 +3,7 @@
 // comes on standard input, as in the CGI program.
 #include <gtest/gtest.h>
 
+#include <fstream>
 #include <memory>
 #include <string>
 #include <sys/mman.h>
@@ -72,10 +73,7 @@ protected:
     void Mkdir(const std::string& path) { mkdir(Root(path).c_str(), 0755); }
     void Write(const std::string& path, const std::string& text)
     {
-        FILE* f = fopen(Root(path).c_str(), "w");
-        ASSERT_NE(nullptr, f);
-        fputs(text.c_str(), f);
-        fclose(f);
+        ASSERT_TRUE(std::ofstream(Root(path)) << text) << path;
     }
     bool MountTmpfs(const std::string& path, const char* size)
     {
