@@ -136,6 +136,12 @@ TEST_F(Pipeline, PermissionAndUploadHooks)
         EXPECT_EQ(WEBAPI_ERR_NO_PERMISSION, runner.GetResponseObject()->GetError());
     }
     {
+        // Asked before the library is opened.
+        HookRunner runner;
+        EXPECT_FALSE(runner.Run(Call("VELA.Pipe.NoLib", 1, "get")));
+        EXPECT_EQ(WEBAPI_ERR_NO_PERMISSION, runner.GetResponseObject()->GetError());
+    }
+    {
         HookRunner runner;
         runner.skip = true;
         EXPECT_TRUE(runner.Run(Call("VELA.Pipe.Test", 1, "echo")));
