@@ -7,16 +7,16 @@
 # (of a method that polls), a session past its lifetime, another
 # client address, a missing token, a user on an administrators' API.
 # Also: a login with parameters encrypted by openssl, blocking after repeated
-# failures, and the modes of the session files. Attacks that must fail: an
-# account named "system" (the dispatcher's run-as name) taken for root,
-# forwarding headers of a client that is no configured proxy, a password in
-# the URL, and the login guard played (locking the owner out from elsewhere,
-# spraying from forged addresses).
+# failures. Attacks that must fail: an account named "system" (the
+# dispatcher's run-as name) taken for root, forwarding headers of a client
+# that is no configured proxy, a password in the URL, and the login guard
+# played (locking the owner out from elsewhere, spraying from forged
+# addresses).
 set -u
 
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
-srv_require "accounts, PAM, identity switches" openssl useradd chpasswd runuser
+srv_require "accounts, PAM, identity switches" openssl useradd chpasswd
 srv_traps
 
 # Error codes of VELA.Auth login (webapi/auth/).
@@ -110,16 +110,9 @@ login_refused() {
 }
 login_fails() { login_refused "$1" "$ERR_WRONG_PASSWORD" "${@:2}"; }
 
-# ---- A user logs in: the answer, the cookie and its attributes.
+# ---- A user logs in (the cookie's attributes: webapi/AuthTest.cpp).
 JAR1=$TMP/jar1
-if login "login" "$USER1" "$PASS1" -c "$JAR1"; then
-  expect "login" "\"account\":\"$USER1\"" '"isAdmin":false'
-  tr -d '\r' <"$TMP/headers" | grep -i '^Set-Cookie: id=' >"$TMP/setcookie"
-  grep -qF "id=$sid;" "$TMP/setcookie" || fail "login: no cookie id=<sid>: $(cat "$TMP/setcookie")"
-  for attr in HttpOnly 'SameSite=Strict' 'path=/'; do
-    grep -qi -- "; *$attr\\(;\\|\$\\)" "$TMP/setcookie" || fail "login: the cookie lacks $attr: $(cat "$TMP/setcookie")"
-  done
-fi
+login "login" "$USER1" "$PASS1" -c "$JAR1" && expect "login" "\"account\":\"$USER1\"" '"isAdmin":false'
 SID1=$sid TOKEN1=$token
 
 # ---- The session opens a method that needs a login: cookie plus token, in
@@ -229,20 +222,8 @@ if getent passwd system >/dev/null; then
   fi
 fi
 
-# ---- Session files: 0600 in a 0700 directory, out of reach of the user.
+# The session files' modes: platform/session/SessionTest.cpp.
 SESSIONS=$ROOT/run/vela/sessions
-if [ -f "$SESSIONS/$SID1" ]; then
-  [ "$(stat -c %a "$SESSIONS/$SID1")" = 600 ] || fail "session file mode $(stat -c %a "$SESSIONS/$SID1")"
-  [ "$(stat -c %a "$SESSIONS")" = 700 ] || fail "session directory mode $(stat -c %a "$SESSIONS")"
-  if runuser -u "$USER1" -- cat "$SESSIONS/$SID1" >/dev/null 2>&1; then
-    fail "$USER1 can read its session file"
-  fi
-  if runuser -u "$USER1" -- ls "$SESSIONS" >/dev/null 2>&1; then
-    fail "$USER1 can list the session directory"
-  fi
-else
-  fail "no session file $SESSIONS/$SID1"
-fi
 
 # ---- A new login with the old cookie replaces the old session.
 if login "second login" "$USER1" "$PASS1" -b "$JAR1" -c "$JAR1"; then
