@@ -175,17 +175,6 @@ TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticatedOptionalLoginNoR
     EXPECT_FALSE(optionalLog.Contains("session check refused"));
 }
 
-TEST_F(PermissionCheckTest, ASessionIdCutByANulByteNamesNoSession)
-{
-    const std::string sid = Login("root");
-    PreparedCall c("get", sid + "%00x");
-    ASSERT_EQ(sid + std::string(1, '\0') + "x", c.Req()->GetSessionID());
-    EXPECT_FALSE(c.Check());
-    EXPECT_EQ(105, c.Resp()->GetError());
-    EXPECT_EQ(AUTH_RESULT_NO_SESSION, c.Req()->GetAuthResult());
-    EXPECT_EQ("", c.Req()->GetLoginUserName());
-}
-
 TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
 {
     VELA::Session::Options options;
@@ -223,7 +212,7 @@ TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlo
     EXPECT_EQ(J("[-2, 1]"), c.Slots());
 }
 
-TEST_F(PermissionCheckTest, TimeoutAddressAndTokenProtectionRefusals)
+TEST_F(PermissionCheckTest, TimeoutAddressTokenProtectionAndCutIdRefusals)
 {
     VELA::Session::Options options;
     options.idleTimeout = 60;
@@ -258,6 +247,15 @@ TEST_F(PermissionCheckTest, TimeoutAddressAndTokenProtectionRefusals)
         EXPECT_EQ("noprivilege", c.Resp()->GetServerError());
         EXPECT_TRUE(log.Contains("WebEntry:566 Token Authentication Fail."));
     }
+    {
+        // A session id cut by a NUL byte names no session.
+        PreparedCall c("get", other + "%00x");
+        ASSERT_EQ(other + std::string(1, '\0') + "x", c.Req()->GetSessionID());
+        EXPECT_FALSE(c.Check());
+        EXPECT_EQ(105, c.Resp()->GetError());
+        EXPECT_EQ(AUTH_RESULT_NO_SESSION, c.Req()->GetAuthResult());
+        EXPECT_EQ("", c.Req()->GetLoginUserName());
+    }
 }
 
 TEST_F(PermissionCheckTest, AllowTimeoutDoesNotMoveTheLastUse)
@@ -277,7 +275,7 @@ TEST_F(PermissionCheckTest, AllowTimeoutDoesNotMoveTheLastUse)
     EXPECT_EQ(kStart + 100, LastUse(sid));
 }
 
-TEST_F(PermissionCheckTest, UserClassesOfTheApiAndTheMethod)
+TEST_F(PermissionCheckTest, UserClassesAndApplicationPrivilege)
 {
     const std::string admin = Login("root");
     const std::string normal = Login("daemon");
@@ -304,12 +302,8 @@ TEST_F(PermissionCheckTest, UserClassesOfTheApiAndTheMethod)
             EXPECT_FALSE(call.Resp()->HasServerError());
         }
     }
-}
 
-TEST_F(PermissionCheckTest, ApplicationPrivilegeIsCheckedFromTheClientAddress)
-{
-    const std::string normal = Login("daemon");
-    const std::string admin = Login("root");
+    // An application privilege is checked from the client address.
     Declare(Desc(R"({"appPriv": "VELA.Photo"})"));
     {
         PreparedCall c("get", normal);

@@ -190,7 +190,7 @@ TEST_F(Identity, NotGrantableStaysTheUser)
 }
 
 // Refused switches end the call before the handler, with the preset 117.
-TEST_F(Identity, RefusedSwitchSkipsTheHandler)
+TEST_F(Identity, RefusedSwitchSkipsTheHandlerSystemIsNoRoot)
 {
     const struct {
         const char* method;
@@ -207,12 +207,9 @@ TEST_F(Identity, RefusedSwitchSkipsTheHandler)
         EXPECT_TRUE(Logged(report["log"].asString(), LOG_ERR, c.line)) << report["log"].asString();
         EXPECT_EQ(rootIds_, report["after"]) << c.method;
     }
-}
 
-// A session's user "system" (an account of that name, or none) is an
-// account like any other for grantByUser: never the run-as superuser.
-TEST_F(Identity, SessionUserSystemNeverRunsAsRoot)
-{
+    // A session's user "system" (an account of that name, or none) is an
+    // account like any other for grantByUser: never the run-as superuser.
     const Json::Value report = RunInChild(IdsCall("byUser", J(R"({"username": "system"})")));
     const Json::Value& seen = report["answer"]["data"];
     EXPECT_NE(Triple(0, 0, 0), seen["uid"]) << report["answer"];

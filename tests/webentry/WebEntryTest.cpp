@@ -175,12 +175,10 @@ TEST_F(WebEntryInit, IdentityParametersMoveIntoTheHeaders)
             EXPECT_EQ(c.sid, req->GetSessionID());
         }
     }
-}
 
-TEST_F(WebEntryInit, SessionIdThatWouldAddACookieIsRefused)
-{
-    Set("REQUEST_METHOD", "GET");
+    // A session id that would add a cookie is refused.
     Set("HTTP_COOKIE", "x=1");
+    Set("HTTP_X_VELA_SHARING", nullptr);
     for (const char* query : {"_sid=abc%3B%20sharing_sid%3Devil", "_sharing_id=L1&_sharing_sid=q%3B%20id%3Devil",
                               "_sid=ok&_sharing_id=L1&_sharing_sid=q%2C"}) {
         Set("QUERY_STRING", query);
