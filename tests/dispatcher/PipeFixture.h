@@ -43,6 +43,18 @@ protected:
         ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + name, value, 0644)) << name;
     }
 
+    // A request JSON for one call.
+    static Json::Value Call(const std::string& api, int version, const std::string& method,
+                            const Json::Value& params = Json::Value(Json::objectValue))
+    {
+        Json::Value request(Json::objectValue);
+        request["getParam"] = params;
+        request["getParam"]["api"] = api;
+        request["getParam"]["version"] = version;
+        request["getParam"]["method"] = method;
+        return request;
+    }
+
     std::string oldCwd_;
     std::string webapiDir_;
 };
@@ -73,18 +85,6 @@ protected:
     {
         const struct passwd* pw = getpwuid(geteuid());
         return pw ? pw->pw_name : "system";
-    }
-
-    // A request JSON for one call.
-    static Json::Value Call(const std::string& api, int version, const std::string& method,
-                            const Json::Value& params = Json::Value(Json::objectValue))
-    {
-        Json::Value request(Json::objectValue);
-        request["getParam"] = params;
-        request["getParam"]["api"] = api;
-        request["getParam"]["version"] = version;
-        request["getParam"]["method"] = method;
-        return request;
     }
 
     // The descriptions of VELA.Pipe.lib; tests add to them and write again.

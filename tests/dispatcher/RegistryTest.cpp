@@ -31,14 +31,12 @@ public:
     const Json::Value& Descriptions() const { return d_->registry.Table(); }
 };
 
-class Registry : public PipeFixture {
+// A web-API directory holding only this test's files.
+class Registry : public WebapiDirFixture {
 protected:
     void SetUp() override
     {
-        PipeFixture::SetUp();
-        // Start from a web-API directory holding only this test's files.
-        unlink("VELA.Pipe.lib");
-        unlink("VELA.Entry.lib");
+        WebapiDirFixture::SetUp();
         WriteJson("lib.def", J(R"({"authLevel": 2, "allowUser": ["admin.local"], "priority": 3,
                                    "requestFormat": "XML",
                                    "methods": {"allowUpload": false, "allowDownload": true}})"));
