@@ -150,7 +150,7 @@ TEST(RequestAllowUser, BitsFromTheDescription)
     }
 }
 
-TEST(RequestUpload, ContentTypeAndSliceHeader)
+TEST(RequestKind, UploadPollingTaskAndAccessToken)
 {
     auto upload = [](const char* env) { return APIRequest(J(std::string(R"({"environ": )") + env + "}")).IsUploadRequest(); };
     EXPECT_TRUE(upload(R"({"CONTENT_TYPE": "multipart/form-data; boundary=x"})"));
@@ -159,15 +159,23 @@ TEST(RequestUpload, ContentTypeAndSliceHeader)
     EXPECT_FALSE(upload(R"({"CONTENT_TYPE": "application/json"})"));
     EXPECT_FALSE(upload("{}"));
     EXPECT_FALSE(upload(R"({"HTTP_X_TYPE_NAME": "SLICEUPLOADX"})"));
-}
 
-TEST(RequestPollingTask, NeedsBothIdAndUser)
-{
+    // A polling task needs both an id and a user.
     EXPECT_FALSE(APIRequest(J(R"({"environ": {"task_id": "t"}})")).IsPollingTask());
     APIRequest r(J(R"({"environ": {"task_id": "t", "task_user": "u", "full_task_id": "@u/t"}})"));
     EXPECT_TRUE(r.IsPollingTask());
     EXPECT_EQ("@u/t", r.GetPollingTaskId());
     EXPECT_EQ("", APIRequest().GetPollingTaskId());
+
+    // The access token comes from the process environment, not the request's.
+    APIRequest t(J(R"({"environ": {"velaAccessToken": "fromRequest"}})"));
+    {
+        VELA::Test::ScopedEnv env("velaAccessToken", nullptr);
+        EXPECT_EQ(nullptr, t.GetVelaAccessTokenID());
+    }
+    VELA::Test::ScopedEnv env("velaAccessToken", "tok");
+    ASSERT_NE(nullptr, t.GetVelaAccessTokenID());
+    EXPECT_STREQ("tok", t.GetVelaAccessTokenID());
 }
 
 TEST(RequestEncryptedParams, HalfPairsEmptyMembersAndFailedDecryption)
@@ -209,18 +217,6 @@ TEST(RequestPreferenceDir, UnderTheRootOrTmp)
     EXPECT_EQ("/tmp", APIRequest(J(R"({"session": {"username": "a/b"}})")).GetPreferenceDir());
     EXPECT_EQ("/tmp", APIRequest().GetPreferenceDir());
     VELA::System::RootReset();
-}
-
-TEST(RequestToken, AccessTokenComesFromTheProcessEnvironment)
-{
-    APIRequest r(J(R"({"environ": {"velaAccessToken": "fromRequest"}})"));
-    {
-        VELA::Test::ScopedEnv env("velaAccessToken", nullptr);
-        EXPECT_EQ(nullptr, r.GetVelaAccessTokenID());
-    }
-    VELA::Test::ScopedEnv env("velaAccessToken", "tok");
-    ASSERT_NE(nullptr, r.GetVelaAccessTokenID());
-    EXPECT_STREQ("tok", r.GetVelaAccessTokenID());
 }
 
 namespace {

@@ -149,7 +149,7 @@ TEST(RequestSession, SecondSessionReplacesTheFirstAndItsVerdict)
     EXPECT_EQ(J(R"({"other": 1})"), d.GetAPIInfo(""));
 }
 
-TEST(RequestAttr, AnyTypeButNoEmptyName)
+TEST(RequestAttrAndCookie, AnyTypeOrStringsButNoEmptyName)
 {
     APIRequest r;
     EXPECT_TRUE(r.SetAttr("n", 5));
@@ -158,13 +158,10 @@ TEST(RequestAttr, AnyTypeButNoEmptyName)
     EXPECT_FALSE(r.SetAttr("", 1));
     EXPECT_TRUE(r.HasAttr("z"));
     EXPECT_EQ(J(R"({"a": [1]})"), r.GetAttr("o"));
-}
 
-TEST(RequestCookie, NonStringCookieGivesTheDefault)
-{
-    APIRequest r;
-    // Only strings can be stored through SetCookie; a non-string reaches the
-    // store only through the private side.
+    // Cookies: only strings can be stored through SetCookie; a non-string
+    // reaches the store only through the private side, and reads as the
+    // default.
     r.GetPrivate()->SetData("cookie", "n", Json::Value(5), false);
     EXPECT_TRUE(r.HasCookie("n"));
     EXPECT_EQ("dflt", r.GetCookie("n", "dflt"));
