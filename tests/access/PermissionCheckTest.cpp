@@ -4,7 +4,6 @@
 // check behind WebEntry's permission hooks after Initialize.
 #include <gtest/gtest.h>
 
-#include <climits>
 #include <stdlib.h>
 #include <string>
 #include <sys/stat.h>
@@ -12,12 +11,11 @@
 #include <vector>
 
 #include "access/PermissionCheck.h"
-#include "platform/StateRootTest.h"
+#include "dispatcher/PipeFixture.h"
 #include "support/JsonLiteral.h"
 #include "support/TestSupport.h"
 #include "vela/session.h"
 #include "vela/token.h"
-#include "vela/webapiutil.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APIRunner.h"
@@ -90,25 +88,12 @@ struct PreparedCall {
 };
 
 // A fresh system root whose web-API directory is the working directory.
-class PermissionCheckTest : public StateRootTest {
+class PermissionCheckTest : public WebapiDirFixture {
 protected:
     void SetUp() override
     {
-        StateRootTest::SetUp();
-        char cwd[PATH_MAX];
-        ASSERT_NE(nullptr, getcwd(cwd, sizeof(cwd)));
-        oldCwd_ = cwd;
-        webapiDir_ = root_.Path() + "/usr/vela/velaman/webapi";
-        ASSERT_EQ(0, system(("mkdir -p '" + webapiDir_ + "'").c_str()));
-        ASSERT_EQ(0, chdir(webapiDir_.c_str()));
+        WebapiDirFixture::SetUp();
         Declare(Desc());
-    }
-    void TearDown() override
-    {
-        if (!oldCwd_.empty()) {
-            EXPECT_EQ(0, chdir(oldCwd_.c_str()));
-        }
-        StateRootTest::TearDown();
     }
 
     // kApi as `desc` for the runners made from now on.
@@ -116,7 +101,7 @@ protected:
     {
         Json::Value file(Json::objectValue);
         file[kApi] = desc;
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + kApi + ".lib", file, 0644));
+        WriteJson(std::string(kApi) + ".lib", file);
     }
     std::string Login(const char* user, VELA::Session::Options options = VELA::Session::Options())
     {
@@ -137,8 +122,6 @@ protected:
         return -1;
     }
 
-    std::string oldCwd_;
-    std::string webapiDir_;
     ScopedEnv remote_{"REMOTE_ADDR", kClient};
     ScopedEnv token_{"velaAccessToken", nullptr};
     ScopedEnv user_{"VELA_WEBAPI_USERNAME", nullptr};
@@ -164,7 +147,7 @@ TEST(PermissionCheckAuthLevel, DecidesWhetherTheCheckRunsAndIsEnforced)
     }
 }
 
-TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticated)
+TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticatedOptionalLoginNoRefusal)
 {
     LogCapture log;
     PreparedCall c("get", "");
@@ -179,29 +162,17 @@ TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticated)
         refusals += line.find("session check refused") != std::string::npos;
     }
     EXPECT_EQ(1, refusals);
-}
 
-TEST_F(PermissionCheckTest, OptionalLoginIsNoRefusalAndLogsNothing)
-{
+    // Where the login is optional, the same verdict is no refusal and logs
+    // nothing.
     Declare(Desc(R"({"authLevel": 2})"));
-    LogCapture log;
-    PreparedCall c("get", "");
-    EXPECT_FALSE(c.Check());
-    EXPECT_TRUE(PermissionCheck::SkipPermission(c.Req()));
-    EXPECT_EQ(119, c.Resp()->GetError());
-    EXPECT_EQ("unauth", c.Resp()->GetServerError());
-    EXPECT_FALSE(log.Contains("session check refused"));
-}
-
-TEST_F(PermissionCheckTest, ASessionIdCutByANulByteNamesNoSession)
-{
-    const std::string sid = Login("root");
-    PreparedCall c("get", sid + "%00x");
-    ASSERT_EQ(sid + std::string(1, '\0') + "x", c.Req()->GetSessionID());
-    EXPECT_FALSE(c.Check());
-    EXPECT_EQ(105, c.Resp()->GetError());
-    EXPECT_EQ(AUTH_RESULT_NO_SESSION, c.Req()->GetAuthResult());
-    EXPECT_EQ("", c.Req()->GetLoginUserName());
+    LogCapture optionalLog;
+    PreparedCall optional("get", "");
+    EXPECT_FALSE(optional.Check());
+    EXPECT_TRUE(PermissionCheck::SkipPermission(optional.Req()));
+    EXPECT_EQ(119, optional.Resp()->GetError());
+    EXPECT_EQ("unauth", optional.Resp()->GetServerError());
+    EXPECT_FALSE(optionalLog.Contains("session check refused"));
 }
 
 TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlot)
@@ -241,7 +212,7 @@ TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlo
     EXPECT_EQ(J("[-2, 1]"), c.Slots());
 }
 
-TEST_F(PermissionCheckTest, TimeoutAddressAndTokenProtectionRefusals)
+TEST_F(PermissionCheckTest, TimeoutAddressTokenProtectionAndCutIdRefusals)
 {
     VELA::Session::Options options;
     options.idleTimeout = 60;
@@ -276,6 +247,15 @@ TEST_F(PermissionCheckTest, TimeoutAddressAndTokenProtectionRefusals)
         EXPECT_EQ("noprivilege", c.Resp()->GetServerError());
         EXPECT_TRUE(log.Contains("WebEntry:566 Token Authentication Fail."));
     }
+    {
+        // A session id cut by a NUL byte names no session.
+        PreparedCall c("get", other + "%00x");
+        ASSERT_EQ(other + std::string(1, '\0') + "x", c.Req()->GetSessionID());
+        EXPECT_FALSE(c.Check());
+        EXPECT_EQ(105, c.Resp()->GetError());
+        EXPECT_EQ(AUTH_RESULT_NO_SESSION, c.Req()->GetAuthResult());
+        EXPECT_EQ("", c.Req()->GetLoginUserName());
+    }
 }
 
 TEST_F(PermissionCheckTest, AllowTimeoutDoesNotMoveTheLastUse)
@@ -295,7 +275,7 @@ TEST_F(PermissionCheckTest, AllowTimeoutDoesNotMoveTheLastUse)
     EXPECT_EQ(kStart + 100, LastUse(sid));
 }
 
-TEST_F(PermissionCheckTest, UserClassesOfTheApiAndTheMethod)
+TEST_F(PermissionCheckTest, UserClassesAndApplicationPrivilege)
 {
     const std::string admin = Login("root");
     const std::string normal = Login("daemon");
@@ -322,12 +302,8 @@ TEST_F(PermissionCheckTest, UserClassesOfTheApiAndTheMethod)
             EXPECT_FALSE(call.Resp()->HasServerError());
         }
     }
-}
 
-TEST_F(PermissionCheckTest, ApplicationPrivilegeIsCheckedFromTheClientAddress)
-{
-    const std::string normal = Login("daemon");
-    const std::string admin = Login("root");
+    // An application privilege is checked from the client address.
     Declare(Desc(R"({"appPriv": "VELA.Photo"})"));
     {
         PreparedCall c("get", normal);
@@ -419,15 +395,6 @@ TEST_F(PermissionCheckTest, AccessTokenGrantsOnlyItsMethods)
         EXPECT_EQ("unauth", c.Resp()->GetServerError());
         EXPECT_EQ("", c.Req()->GetLoginUserName());
     }
-}
-
-TEST_F(PermissionCheckTest, SharingLinksAreRefused)
-{
-    LogCapture log;
-    PreparedCall c("get", "");
-    EXPECT_FALSE(PermissionCheck::CheckSharingPermission(c.Req(), c.Resp()));
-    EXPECT_EQ(105, c.Resp()->GetError());
-    EXPECT_TRUE(log.Contains("sharing links are not available"));
 }
 
 // The front end's hooks on a request built by Initialize from the CGI

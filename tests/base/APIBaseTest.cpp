@@ -1,13 +1,9 @@
+// APIBase: the sections of a request or response store, set, read and
+// cleared.
 #include <gtest/gtest.h>
-
-#include <fstream>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include "base/APIBase.h"
 #include "support/JsonLiteral.h"
-#include "support/TestSupport.h"
-#include "webapi/JsonUtil.h"
 
 namespace {
 
@@ -24,17 +20,14 @@ public:
 
 }  // namespace
 
-TEST(APIBaseSet, NeverCreatesASection)
+TEST(APIBaseSet, NeverCreatesASectionStringsOnlyRefusesNonObjects)
 {
     Store s;
     EXPECT_FALSE(s.SetData("nope", "k", 1, false));
     EXPECT_FALSE(s.SetData("nope", J(R"({"a": 1})"), false));
     EXPECT_FALSE(s.Raw().isMember("nope"));
-}
 
-TEST(APIBaseSet, StringsOnlyMergeSkipsOthersButSucceeds)
-{
-    Store s;
+    // A strings-only merge skips the others but succeeds.
     EXPECT_TRUE(s.SetData("obj", J(R"({"a": "x", "b": 1})"), true));
     EXPECT_TRUE(s.HasData("obj", "a"));
     EXPECT_FALSE(s.HasData("obj", "b"));
@@ -42,11 +35,8 @@ TEST(APIBaseSet, StringsOnlyMergeSkipsOthersButSucceeds)
     EXPECT_FALSE(s.HasData("obj", "c"));
     EXPECT_FALSE(s.SetData("obj", "k", 1, true));
     EXPECT_TRUE(s.SetData("obj", "k", "v", true));
-}
 
-TEST(APIBaseSet, RefusesEmptyAndNonObjects)
-{
-    Store s;
+    // Empty objects and non-objects are refused.
     EXPECT_FALSE(s.SetData("obj", J("{}"), false));
     EXPECT_FALSE(s.SetData("obj", J("[1,2]"), false));
     EXPECT_FALSE(s.SetData("obj", Json::Value("s"), false));
@@ -85,42 +75,4 @@ TEST(APIBaseClear, EntriesAndSections)
     EXPECT_TRUE(s.Raw()["obj"].empty());
     EXPECT_TRUE(s.SetData("obj", "again", 1, false));
     EXPECT_FALSE(s.ClearData("arr", "k"));
-}
-
-TEST(JsonUtil, ParseRefusesGarbageAndExtremeNesting)
-{
-    Json::Value v(5);
-    EXPECT_FALSE(VELA::JsonParse("{\"a\": 1} trailing", v));
-    EXPECT_FALSE(VELA::JsonParse("", v));
-    EXPECT_FALSE(VELA::JsonParse(std::string(100000, '['), v));
-    EXPECT_EQ(Json::Value(5), v);
-    EXPECT_TRUE(VELA::JsonParse(std::string(100, '[') + std::string(100, ']'), v));
-}
-
-TEST(JsonUtil, WriteIsAtomicAndReadable)
-{
-    VELA::Test::TempDir dir;
-    const std::string path = dir.Path() + "/doc.json";
-    ASSERT_TRUE(VELA::JsonWriteFile(path, J(R"({"a": [1, "x"]})"), 0600));
-    Json::Value back;
-    ASSERT_TRUE(VELA::JsonReadFile(path, back));
-    EXPECT_EQ(J(R"({"a": [1, "x"]})"), back);
-    struct stat st;
-    ASSERT_EQ(0, stat(path.c_str(), &st));
-    EXPECT_EQ(0600u, st.st_mode & 0777);
-    EXPECT_FALSE(VELA::JsonWriteFile(dir.Path() + "/no/such/dir/doc.json", 1));
-    EXPECT_FALSE(VELA::JsonReadFile(dir.Path() + "/missing.json", back));
-    std::ofstream(dir.Path() + "/bad.json") << "{\"a\":";
-    EXPECT_FALSE(VELA::JsonReadFile(dir.Path() + "/bad.json", back));
-}
-
-TEST(JsonUtil, SearchArrayIndexByJsonEquality)
-{
-    const Json::Value arr = J(R"([1, "1", {"a": [2]}, null])");
-    EXPECT_EQ(0, VELA::JsonSearchArrayIndex(arr, 1));
-    EXPECT_EQ(1, VELA::JsonSearchArrayIndex(arr, "1"));
-    EXPECT_EQ(2, VELA::JsonSearchArrayIndex(arr, J(R"({"a": [2]})")));
-    EXPECT_EQ(3, VELA::JsonSearchArrayIndex(arr, Json::Value()));
-    EXPECT_EQ(-1, VELA::JsonSearchArrayIndex(arr, 2));
-    EXPECT_EQ(-1, VELA::JsonSearchArrayIndex(J(R"({"a": 1})"), 1));
 }

@@ -1,8 +1,13 @@
 // JsonFlag: how description and request settings read as yes or no.
-// JsonToString: the text every answer is written as.
+// JsonToString: the text every answer is written as. Parsing, files and
+// the search in arrays.
 #include <gtest/gtest.h>
 
+#include <fstream>
+#include <sys/stat.h>
+
 #include "support/JsonLiteral.h"
+#include "support/TestSupport.h"
 #include "webapi/JsonUtil.h"
 
 namespace {
@@ -59,6 +64,44 @@ TEST(JsonToString, EveryByteOutsideUTF8BecomesOneReplacementCharacter)
     Json::Value object(Json::objectValue);
     object["k\xff"] = std::string("\x01\"\xed\xa0\x80", 5);
     EXPECT_EQ("{\"k" + R + "\":\"\\u0001\\\"" + R + R + R + "\"}", VELA::JsonToString(object));
+}
+
+TEST(JsonUtil, ParseRefusesGarbageAndExtremeNesting)
+{
+    Json::Value v(5);
+    EXPECT_FALSE(VELA::JsonParse("{\"a\": 1} trailing", v));
+    EXPECT_FALSE(VELA::JsonParse("", v));
+    EXPECT_FALSE(VELA::JsonParse(std::string(100000, '['), v));
+    EXPECT_EQ(Json::Value(5), v);
+    EXPECT_TRUE(VELA::JsonParse(std::string(100, '[') + std::string(100, ']'), v));
+}
+
+TEST(JsonUtil, WriteIsAtomicAndReadable)
+{
+    VELA::Test::TempDir dir;
+    const std::string path = dir.Path() + "/doc.json";
+    ASSERT_TRUE(VELA::JsonWriteFile(path, J(R"({"a": [1, "x"]})"), 0600));
+    Json::Value back;
+    ASSERT_TRUE(VELA::JsonReadFile(path, back));
+    EXPECT_EQ(J(R"({"a": [1, "x"]})"), back);
+    struct stat st;
+    ASSERT_EQ(0, stat(path.c_str(), &st));
+    EXPECT_EQ(0600u, st.st_mode & 0777);
+    EXPECT_FALSE(VELA::JsonWriteFile(dir.Path() + "/no/such/dir/doc.json", 1));
+    EXPECT_FALSE(VELA::JsonReadFile(dir.Path() + "/missing.json", back));
+    std::ofstream(dir.Path() + "/bad.json") << "{\"a\":";
+    EXPECT_FALSE(VELA::JsonReadFile(dir.Path() + "/bad.json", back));
+}
+
+TEST(JsonUtil, SearchArrayIndexByJsonEquality)
+{
+    const Json::Value arr = J(R"([1, "1", {"a": [2]}, null])");
+    EXPECT_EQ(0, VELA::JsonSearchArrayIndex(arr, 1));
+    EXPECT_EQ(1, VELA::JsonSearchArrayIndex(arr, "1"));
+    EXPECT_EQ(2, VELA::JsonSearchArrayIndex(arr, J(R"({"a": [2]})")));
+    EXPECT_EQ(3, VELA::JsonSearchArrayIndex(arr, Json::Value()));
+    EXPECT_EQ(-1, VELA::JsonSearchArrayIndex(arr, 2));
+    EXPECT_EQ(-1, VELA::JsonSearchArrayIndex(J(R"({"a": 1})"), 1));
 }
 
 }  // namespace

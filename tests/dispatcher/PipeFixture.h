@@ -1,7 +1,8 @@
-// Fixture of the pipeline, counter and identity tests: a fresh system root
-// whose web-API directory holds lib.def and the descriptions of the test
-// handler libraries (tests/dispatcher/libs/pipe_*.cpp), with the working
-// directory there for the test's duration.
+// WebapiDirFixture: a fresh system root whose web-API directory is the
+// working directory for the test's duration. PipeFixture, of the pipeline,
+// counter and identity tests: that directory holds lib.def and the
+// descriptions of the test handler libraries
+// (tests/dispatcher/libs/pipe_*.cpp).
 #pragma once
 
 #include <climits>
@@ -17,7 +18,7 @@
 #include "support/JsonLiteral.h"
 #include "vela/webapiutil.h"
 
-class PipeFixture : public StateRootTest {
+class WebapiDirFixture : public StateRootTest {
 protected:
     void SetUp() override
     {
@@ -28,12 +29,6 @@ protected:
         webapiDir_ = root_.Path() + "/usr/vela/velaman/webapi";
         ASSERT_EQ(0, system(("mkdir -p '" + webapiDir_ + "'").c_str()));
         ASSERT_EQ(0, chdir(webapiDir_.c_str()));
-        WriteJson("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0,
-                                   "methods": {"allowDemo": false}})"));
-        WriteJson("VELA.Pipe.lib", Descriptions());
-        WriteJson("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": ")" + Lib("pipe_handlers") + R"(",
-            "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(",
-            "methods": {"1": ["request", "other"]}}})"));
     }
     void TearDown() override
     {
@@ -41,21 +36,6 @@ protected:
             EXPECT_EQ(0, chdir(oldCwd_.c_str()));
         }
         StateRootTest::TearDown();
-    }
-
-    // Path of a test handler library lib<name>.so.
-    static std::string Lib(const std::string& name)
-    {
-        const char* dir = getenv("VELA_TEST_BINARY_DIR");
-        return std::string(dir ? dir : ".") + "/tests/dispatcher/libs/lib" + name + ".so";
-    }
-
-    // The user the handlers run as: the test's own, so the switch needs no
-    // rights the test lacks.
-    static std::string RunAs()
-    {
-        const struct passwd* pw = getpwuid(geteuid());
-        return pw ? pw->pw_name : "system";
     }
 
     void WriteJson(const std::string& name, const Json::Value& value)
@@ -73,6 +53,38 @@ protected:
         request["getParam"]["version"] = version;
         request["getParam"]["method"] = method;
         return request;
+    }
+
+    std::string oldCwd_;
+    std::string webapiDir_;
+};
+
+class PipeFixture : public WebapiDirFixture {
+protected:
+    void SetUp() override
+    {
+        WebapiDirFixture::SetUp();
+        WriteJson("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0,
+                                   "methods": {"allowDemo": false}})"));
+        WriteJson("VELA.Pipe.lib", Descriptions());
+        WriteJson("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": ")" + Lib("pipe_handlers") + R"(",
+            "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(",
+            "methods": {"1": ["request", "other"]}}})"));
+    }
+
+    // Path of a test handler library lib<name>.so.
+    static std::string Lib(const std::string& name)
+    {
+        const char* dir = getenv("VELA_TEST_BINARY_DIR");
+        return std::string(dir ? dir : ".") + "/tests/dispatcher/libs/lib" + name + ".so";
+    }
+
+    // The user the handlers run as: the test's own, so the switch needs no
+    // rights the test lacks.
+    static std::string RunAs()
+    {
+        const struct passwd* pw = getpwuid(geteuid());
+        return pw ? pw->pw_name : "system";
     }
 
     // The descriptions of VELA.Pipe.lib; tests add to them and write again.
@@ -103,7 +115,4 @@ protected:
                 "maxVersion": 1, "methods": {"1": ["get"]}}
         })");
     }
-
-    std::string oldCwd_;
-    std::string webapiDir_;
 };

@@ -6,23 +6,14 @@
 # Hundreds of downloads, streamed by velascgi and with X-Sendfile on: no
 # answer may carry the root-only content. Then, without the loop, X-Sendfile
 # is used for the folder once root owns it, and not while "nobody" does.
-#
-# usage: download_race.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR [REQUESTS]
-# REQUESTS per mode, 250 by default. Exit 0 when every check passed, 1
-# otherwise, 77 (skipped) without lighttpd, curl, perl or setpriv, or when not
-# run as root.
+# A fifth argument: the downloads per mode (250).
 set -u
 
-[ $# -ge 4 ] || { echo "usage: download_race.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR [REQUESTS]" >&2; exit 2; }
-VELASCGI=$(realpath -e "$1") || exit 1
-VELAADM=$(realpath -e "$2") || exit 1
-WEBAPI=$(realpath -e "$3") || exit 1
-SRC=$(realpath -e "$4") || exit 1
+. "$(dirname "$0")/server.sh"
 REQUESTS=${5:-250}
-
-. "$SRC/tests/e2e/server.sh"
+srv_args VELASCGI VELAADM WEBAPI SRC -- "${@:1:4}"
 srv_require "a root-only file, an unprivileged account, identity switches" perl setpriv
-srv_traps
+srv_traps stop_swapper
 SWAPPER=""
 stop_swapper() {
   if [ -n "$SWAPPER" ]; then
@@ -31,15 +22,9 @@ stop_swapper() {
     SWAPPER=""
   fi
 }
-trap 'stop_swapper; if [ "$failures" -ne 0 ]; then srv_logs; fi; srv_cleanup' EXIT
 
-# X-Sendfile is given only paths that no other account can change, so the
-# temporary root must not lie below a directory others may write to (/tmp).
-if [ -d /run ] && [ -w /run ]; then
-  export TMPDIR=/run
-fi
-srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
-mkdir -p "$ROOT/vol1/sample" "$RUN/www"
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1
+mkdir -p "$ROOT/vol1/sample"
 echo /vol1 >"$ROOT/etc/vela/volumes.conf"
 DIR=$ROOT/vol1/sample
 SECRET=$TMP/secret
@@ -50,9 +35,8 @@ chown -R nobody "$DIR"
 setpriv --reuid=nobody --regid="$(id -g nobody)" --clear-groups test -r "$SECRET" &&
   { fail "nobody can read the secret: the test proves nothing"; exit 1; }
 
-srv_start "$RUN/www" --xsendfile-dir "$ROOT/vol1" || { failures=1; exit 1; }
-sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
-[ -n "$sid" ] || fail "velaadm created no session"
+srv_serve --xsendfile-dir "$ROOT/vol1"
+srv_session
 DOWNLOAD="$URL?api=VELA.Sample&version=1&method=download&name=file.txt"
 
 # The swap, as "nobody", in one of two ways:
@@ -148,10 +132,4 @@ expect_status "download from root's folder" 200
 [ "$(cat "$TMP/body")" = public ] || fail "download from root's folder: $(head -c 200 "$TMP/body")"
 expect_header "download from root's folder (X-Sendfile)" 'ETag:'
 
-srv_sanitizer_clean || fail "sanitizer reports in the logs"
-if [ "$failures" -ne 0 ]; then
-  echo "$failures check(s) failed"
-  exit 1
-fi
-echo "no download leaked the root-only file ($URL)"
-exit 0
+srv_finish "no download leaked the root-only file ($URL)"

@@ -3,36 +3,19 @@
 # deploy/lighttpd.conf.in, runs velascgi on a free port of 127.0.0.1 under a
 # temporary system root that serves the staged web-API directory; curl then
 # calls the sample API the way a browser or a client program would.
-#
-# usage: e2e.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR
-# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without lighttpd
-# or curl, or when not run as root (velascgi switches identity per API, which
-# only root can do).
 set -u
 
-[ $# -eq 4 ] || { echo "usage: e2e.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR" >&2; exit 2; }
-VELASCGI=$(realpath -e "$1") || exit 1
-VELAADM=$(realpath -e "$2") || exit 1
-WEBAPI=$(realpath -e "$3") || exit 1
-SRC=$(realpath -e "$4") || exit 1
-
-. "$SRC/tests/e2e/server.sh"
+. "$(dirname "$0")/server.sh"
+srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
 srv_require "velascgi switches to the identity each API asks for" cksum cmp
 srv_traps
 
 # ---- The system root: the staged web-API directory, one data volume.
-# X-Sendfile is given only paths that no other account can change, so the
-# root must not lie below a directory others may write to (/tmp).
-if [ -d /run ] && [ -w /run ]; then
-  export TMPDIR=/run
-fi
-srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
-mkdir -p "$ROOT/vol1/sample" "$RUN/www"
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1
+mkdir -p "$ROOT/vol1/sample"
 echo /vol1 >"$ROOT/etc/vela/volumes.conf"
-srv_start "$RUN/www" --xsendfile-dir "$ROOT/vol1" || { failures=1; exit 1; }
-
-sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
-[ -n "$sid" ] || fail "velaadm created no session"
+srv_serve --xsendfile-dir "$ROOT/vol1"
+srv_session
 COOKIE="id=$sid"
 
 # ---- The sample's echo, by GET and by POST.
@@ -112,12 +95,4 @@ expect "unknown API" '"success":false' '"code":102'
 call --cookie "$COOKIE" -X POST -H 'Content-Type: application/x-www-form-urlencoded' --data-binary '' "$URL"
 expect "POST with an empty body" '"success":false' '"code":101'
 
-# ---- Nothing went wrong inside velascgi.
-srv_sanitizer_clean || fail "sanitizer reports in the logs"
-
-if [ "$failures" -ne 0 ]; then
-  echo "$failures check(s) failed"
-  exit 1
-fi
-echo "all end-to-end checks passed ($URL)"
-exit 0
+srv_finish "all end-to-end checks passed ($URL)"

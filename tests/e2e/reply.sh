@@ -9,19 +9,10 @@
 # writes its marker file only when it ends, several seconds after the reply,
 # so the answer must be complete while the marker is still missing, and the
 # marker must appear later.
-#
-# usage: reply.sh VELASCGI STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR
-# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without the
-# tools or when not run as root.
 set -u
 
-[ $# -eq 4 ] || { echo "usage: reply.sh VELASCGI STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR" >&2; exit 2; }
-VELASCGI=$(realpath -e "$1") || exit 1
-WEBAPI=$(realpath -e "$2") || exit 1
-PIPE_LIB=$(realpath -e "$3") || exit 1
-SRC=$(realpath -e "$4") || exit 1
-
-. "$SRC/tests/e2e/server.sh"
+. "$(dirname "$0")/server.sh"
+srv_args VELASCGI WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "the after-reply work runs as root" seq cmp sleep
 srv_traps
 
@@ -30,22 +21,20 @@ srv_traps
 # web server to restart is a stand-in process ("sleep", which USR1 ends)
 # named by a pid file under the root.
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
-api=$ROOT/usr/vela/velaman/webapi
-rm "$api" && mkdir "$api" && ln -s "$WEBAPI"/* "$api"/ || exit 1
-cat >"$api/VELA.Pipe.Test.lib" <<EOF
+srv_api VELA.Pipe.Test <<EOF
 {"VELA.Pipe.Test": {"lib": "$PIPE_LIB", "minVersion": 1, "maxVersion": 1, "authLevel": 0, "runAs": "system",
   "methods": {"1": ["callback", {"stream": {"allowDownload": true}}]}}}
 EOF
-mkdir -p "$ROOT/run" "$RUN/www" || exit 1
+mkdir -p "$ROOT/run" || exit 1
 sleep 600 &
 standin=$!
 disown "$standin"  # its end by USR1 is expected: no job report
-trap 'kill "$standin" 2>/dev/null; if [ "$failures" -ne 0 ]; then srv_logs; fi; srv_cleanup' EXIT
+srv_traps 'kill "$standin" 2>/dev/null'
 echo "$standin" >"$ROOT/run/standin.pid"
 chmod 0644 "$ROOT/run/standin.pid"
 printf 'httpd_name="sleep"\nhttpd_pidfile="/run/standin.pid"\nhttpd_restart_signal="USR1"\n' \
   >"$ROOT/etc/vela/webapi.conf"
-srv_start "$RUN/www" || { failures=1; kill "$standin"; exit 1; }
+srv_serve
 
 # wait_for CHECK...: up to a minute until the command CHECK succeeds.
 wait_for() {
@@ -89,11 +78,4 @@ expect_header "stream" 'Content-Type: text/plain'
 expect_header "stream" 'Accept-Ranges: none'
 cmp -s "$TMP/expected" "$TMP/body" || fail "stream: the body is not the program's output ($(wc -c <"$TMP/body") bytes)"
 
-srv_sanitizer_clean || fail "sanitizer reports in the logs"
-
-if [ "$failures" -ne 0 ]; then
-  echo "$failures check(s) failed"
-  exit 1
-fi
-echo "all reply checks passed ($URL)"
-exit 0
+srv_finish "all reply checks passed ($URL)"

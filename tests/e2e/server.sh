@@ -1,21 +1,37 @@
 # Shared by the end-to-end scripts that drive the real server (sourced, not
 # run): a temporary system root that serves the staged web-API directory, a
 # private lighttpd from deploy/lighttpd.conf.in on a free port of 127.0.0.1,
-# and Linux accounts made for the run and removed afterwards.
+# and Linux accounts made for the run and removed afterwards. A script takes
+# the paths its srv_args names and exits 0 when every check passed, 1
+# otherwise, 77 (skipped) without a tool it needs or without root.
 #
+#   srv_args NAME... -- ARG...     each NAME the real path of its ARG; exits 2
+#                                  with the usage when the counts differ
 #   srv_require WHY TOOL...        exits 77 (skipped) when a TOOL is missing or
 #                                  when not root (WHY says what needs root)
-#   srv_traps                      clean-up at exit, with the logs after a failure
-#   srv_init SRC VELASCGI WEBAPI   TMP, ROOT and RUN; the root's web-API directory
+#   srv_traps [COMMAND]            clean-up at exit (COMMAND first), with the
+#                                  logs after a failure
+#   srv_init SRC VELASCGI WEBAPI [private]
+#                                  TMP, ROOT and RUN (with RUN/www); the root's
+#                                  web-API directory. "private": not below a
+#                                  directory others may write to (/tmp), as
+#                                  X-Sendfile paths must not be
+#   srv_api NAME <DESCRIPTION      the root's web-API directory: links to the
+#                                  staged one, and NAME.lib from standard input
 #   srv_start DOCROOT [ARG...]     lighttpd, ARGs go to scripts/lighttpd-conf.sh;
 #                                  sets BASE (http://127.0.0.1:<port>) and URL
 #                                  (the entry); 1 when it does not start
+#   srv_serve [ARG...]             srv_start RUN/www; exits 1 when it fails
+#   srv_session                    sid: a session of root from 127.0.0.1,
+#                                  made by $VELAADM
 #   srv_stop                       ends it (also done by srv_cleanup)
 #   srv_logs                       the tails of the server's and velascgi's logs
 #   srv_add_user NAME PASS [GROUP] a Linux account with that password
 #   srv_cleanup                    server, accounts, groups, TMP; call it from
 #                                  the caller's EXIT trap
 #   srv_sanitizer_clean            0 when no sanitizer report is in the logs
+#   srv_finish TEXT                exits: 1 after failed checks or sanitizer
+#                                  reports, else 0 printing TEXT
 #
 # Checks, counted in $failures:
 #   fail TEXT                      one failed check
@@ -31,6 +47,24 @@ TMP="" ROOT="" RUN="" BASE="" URL="" LPID=""
 SRV_SRC="" SRV_VELASCGI=""
 SRV_USERS=() SRV_GROUPS=()
 failures=0 status=""
+
+srv_args() {
+  local names=() name path
+  while [ "$1" != -- ]; do
+    names+=("$1")
+    shift
+  done
+  shift
+  if [ $# -ne ${#names[@]} ]; then
+    echo "usage: ${0##*/} ${names[*]}" >&2
+    exit 2
+  fi
+  for name in "${names[@]}"; do
+    path=$(realpath -e "$1") || exit 1
+    printf -v "$name" '%s' "$path"
+    shift
+  done
+}
 
 srv_require() {
   local why=$1 tool
@@ -48,7 +82,7 @@ srv_require() {
 }
 
 srv_traps() {
-  trap 'if [ "$failures" -ne 0 ]; then srv_logs; fi; srv_cleanup' EXIT
+  trap "${1:-:}"'; if [ "$failures" -ne 0 ]; then srv_logs; fi; srv_cleanup' EXIT
   trap 'exit 1' HUP INT TERM
 }
 
@@ -80,14 +114,26 @@ expect_status() {
 srv_init() {
   SRV_SRC=$1
   SRV_VELASCGI=$2
+  if [ "${4:-}" = private ] && [ -d /run ] && [ -w /run ]; then
+    export TMPDIR=/run
+  fi
   TMP=$(mktemp -d "${TMPDIR:-/tmp}/vela-e2e-XXXXXX") || return 1
   # Searchable like the real "/": what an account of the run can reach
   # below the root then depends on the modes the server gives its files.
   chmod 0755 "$TMP"
   ROOT=$TMP/root
   RUN=$TMP/run
-  mkdir -p "$ROOT/usr/vela/velaman" "$ROOT/etc/vela" "$RUN" || return 1
+  mkdir -p "$ROOT/usr/vela/velaman" "$ROOT/etc/vela" "$RUN/www" || return 1
   ln -s "$3" "$ROOT/usr/vela/velaman/webapi"
+}
+
+srv_api() {
+  local api=$ROOT/usr/vela/velaman/webapi staged
+  if [ -L "$api" ]; then
+    staged=$(readlink "$api")
+    rm "$api" && mkdir "$api" && ln -s "$staged"/* "$api"/ || exit 1
+  fi
+  cat >"$api/$1.lib" || exit 1
 }
 
 # lighttpd runs in the foreground as a child of the script (-D), so that
@@ -136,6 +182,15 @@ srv_start() {
   return 1
 }
 
+srv_serve() {
+  srv_start "$RUN/www" "$@" || { failures=1; exit 1; }
+}
+
+srv_session() {
+  sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
+  [ -n "$sid" ] || fail "velaadm created no session"
+}
+
 srv_stop() {
   if [ -n "$LPID" ]; then
     kill -TERM "$LPID" 2>/dev/null
@@ -180,6 +235,16 @@ srv_password() {
 
 srv_sanitizer_clean() {
   ! grep -qE 'AddressSanitizer|LeakSanitizer|runtime error:' "$RUN/error.log" "$RUN/cgi.log" 2>/dev/null
+}
+
+srv_finish() {
+  srv_sanitizer_clean || fail "sanitizer reports in the logs"
+  if [ "$failures" -ne 0 ]; then
+    echo "$failures check(s) failed"
+    exit 1
+  fi
+  echo "$1"
+  exit 0
 }
 
 srv_cleanup() {

@@ -4,20 +4,10 @@
 # the API, a local user going for the files of an upload in flight, a client
 # that goes away in the middle of the body, and directories left behind by
 # requests that died.
-#
-# usage: upload.sh VELASCGI VELAADM STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR
-# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without the
-# tools or when not run as root.
 set -u
 
-[ $# -eq 5 ] || { echo "usage: upload.sh VELASCGI VELAADM STAGED_WEBAPI_DIR PIPE_HANDLERS_LIB SOURCE_DIR" >&2; exit 2; }
-VELASCGI=$(realpath -e "$1") || exit 1
-VELAADM=$(realpath -e "$2") || exit 1
-WEBAPI=$(realpath -e "$3") || exit 1
-PIPE_LIB=$(realpath -e "$4") || exit 1
-SRC=$(realpath -e "$5") || exit 1
-
-. "$SRC/tests/e2e/server.sh"
+. "$(dirname "$0")/server.sh"
+srv_args VELASCGI VELAADM WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "velascgi stores uploads as root and switches identity" setpriv flock find stat
 srv_traps
 
@@ -26,20 +16,16 @@ srv_traps
 # runs with root's rights; one data volume whose "@tmp" is world-writable
 # without the sticky bit, as earlier versions made it.
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
-api=$ROOT/usr/vela/velaman/webapi
-rm "$api" && mkdir "$api" && ln -s "$WEBAPI"/* "$api"/ || exit 1
-cat >"$api/VELA.Pipe.Ids.lib" <<EOF
+srv_api VELA.Pipe.Ids <<EOF
 {"VELA.Pipe.Ids": {"lib": "$PIPE_LIB", "minVersion": 1, "maxVersion": 1, "authLevel": 0,
   "methods": {"1": [{"upload": {"allowUpload": true, "runAs": "nobody"}},
                     {"byDefault": {"grantByDefault": true}}]}}}
 EOF
 echo /vol1 >"$ROOT/etc/vela/volumes.conf"
 UP=$ROOT/vol1/@tmp
-mkdir -p "$UP" "$RUN/www" && chmod 0777 "$UP" || exit 1
-srv_start "$RUN/www" || { failures=1; exit 1; }
-
-sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
-[ -n "$sid" ] || fail "velaadm created no session"
+mkdir -p "$UP" && chmod 0777 "$UP" || exit 1
+srv_serve
+srv_session
 COOKIE="id=$sid"
 printf 'small file\n' >"$TMP/small.txt"
 head -c 33554432 /dev/urandom >"$TMP/big.bin"
@@ -59,15 +45,15 @@ nobody_uid=$(id -u nobody)
 nobody_gid=$(id -g nobody)
 call --cookie "$COOKIE" -F "method=byDefault" -F "f=@$TMP/small.txt" "$IDS"
 expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$nobody_uid,$nobody_uid]" \
-  '"method":"upload"'
+  '"method":"upload"' '"methodParam":"upload"'
 [ "$(stat -c %a "$UP")" = 1777 ] || fail "@tmp is $(stat -c %a "$UP") after an upload, not 1777"
 [ -z "$(left)" ] || fail "an upload left $(left)in @tmp"
 
 # ---- A client that goes away in the middle of a big file, for an upload the
 # front end stores and one the handler reads itself. While it is in flight,
-# another local user can neither read the partial file nor put a file of
-# their own in its place; shortly after the client is gone, nothing of it
-# is left.
+# another local user can neither read the partial file, nor put a file of
+# their own in its place, nor move its directory away; shortly after the
+# client is gone, nothing of it is left.
 for target in "$IDS" "$DEFERRED"; do
   name=${target#*api=}
   name="client gone (${name%%&*})"
@@ -89,6 +75,10 @@ for target in "$IDS" "$DEFERRED"; do
     if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
         sh -c 'echo evil >"$1/evil" && mv -f "$1/evil" "$2"' sh "$UP" "$partial" 2>/dev/null; then
       fail "$name: nobody replaced the partial file $partial"
+    fi
+    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
+        mv -f "$(dirname "$partial")" "$UP/moved" 2>/dev/null; then
+      fail "$name: nobody moved the directory of the partial file $partial"
     fi
     rm -f "$UP/evil"
   fi
@@ -119,11 +109,4 @@ expect "upload after dead requests" '"success":true'
 exec {lockfd}<&-
 rm -rf "${UP:?}/$live"
 
-srv_sanitizer_clean || fail "sanitizer reports in the logs"
-
-if [ "$failures" -ne 0 ]; then
-  echo "$failures check(s) failed"
-  exit 1
-fi
-echo "all upload checks passed ($URL)"
-exit 0
+srv_finish "all upload checks passed ($URL)"

@@ -25,15 +25,14 @@ static_assert(WEBAPI_ERR_POLLING_FINISH_FAILED == 501 && WEBAPI_ERR_POLLING_BAD_
                   WEBAPI_ERR_POLLING_SIGNAL_FAILED == 506 && WEBAPI_ERR_POLLING_NO_SUCH_TASK == 508,
               "background-task error codes");
 
+// [value, flags]: S set, R reset, I invalid, D default.
 template <typename T>
 Json::Value Describe(APIParameter<T> const& p, Json::Value const& value)
 {
-    Json::Value out(Json::objectValue);
-    out["value"] = value;
-    out["set"] = p.IsSet();
-    out["reset"] = p.IsReset();
-    out["invalid"] = p.IsInvalid();
-    out["default"] = p.IsDefault();
+    Json::Value out(Json::arrayValue);
+    out.append(value);
+    out.append(std::string(p.IsSet() ? "S" : "") + (p.IsReset() ? "R" : "") + (p.IsInvalid() ? "I" : "") +
+               (p.IsDefault() ? "D" : ""));
     return out;
 }
 
@@ -66,7 +65,7 @@ Json::Value ReadParams(APIRequest* req)
     APIParameter<long long> big = req->GetAndCheckIntegral<long long>("big", APIRequest::REQUIRED);
     data["big"] = Describe(big, Json::Value(static_cast<Json::Int64>(big.Get())));
     APIParameter<unsigned int> mask = req->GetAndCheckIntegral<unsigned int>("mask", APIRequest::REQUIRED);
-    data["mask"] = Describe(mask, Json::Value(static_cast<Json::UInt>(mask.Get())));
+    data["mask"] = Describe(mask, Json::Value(static_cast<Json::Int64>(mask.Get())));
     APIParameter<unsigned long long> size =
         req->GetAndCheckIntegral<unsigned long long>("size", APIRequest::REQUIRED);
     data["size"] = Describe(size, Json::Value(static_cast<Json::UInt64>(size.Get())));

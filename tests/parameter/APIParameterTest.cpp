@@ -76,7 +76,7 @@ bool Positive(int const& v)
     return v > 0;
 }
 
-TEST(CheckValueTypeAndGet, NullIsReset)
+TEST(CheckValueTypeAndGet, NullIsResetValidatorDecides)
 {
     g_validatorCalls = 0;
     APIParameter<int> p;
@@ -86,10 +86,7 @@ TEST(CheckValueTypeAndGet, NullIsReset)
     EXPECT_TRUE(p.SetDefault(7));
     EXPECT_EQ(p.Get(9), 0);
     EXPECT_EQ(Flags(p), "SR");
-}
 
-TEST(CheckValueTypeAndGet, Validator)
-{
     APIParameter<int> refused;
     EXPECT_FALSE(refused.CheckValueTypeAndGet(Json::Value(0), Json::nullValue, Positive));
     EXPECT_EQ(Flags(refused), "SI");
@@ -109,7 +106,7 @@ TEST(CheckValueTypeAndGet, Validator)
     EXPECT_EQ(g_validatorCalls, 0);
 }
 
-TEST(Factory, MissingMember)
+TEST(Factory, MissingMemberArrayAndObject)
 {
     Json::Value obj = Parse("{\"other\":1}");
     APIParameter<int> required = APIParameterFactoryBasicImpl<int>::FromJson(obj, "n", PARAM_REQUIRED);
@@ -127,21 +124,18 @@ TEST(Factory, MissingMember)
         EXPECT_EQ(Flags(APIParameterFactoryBasicImpl<std::string>::FromJson(Parse(notObject), "n", PARAM_OPTIONAL)),
                   "I");
     }
-}
 
-TEST(Factory, ArrayAndObject)
-{
-    Json::Value obj = Parse("{\"a\":[1,2],\"o\":{\"k\":1},\"z\":null}");
-    APIParameter<Json::Value> array = APIParameterFactory::ArrayFromJson(obj, "a", PARAM_REQUIRED);
+    Json::Value mixed = Parse("{\"a\":[1,2],\"o\":{\"k\":1},\"z\":null}");
+    APIParameter<Json::Value> array = APIParameterFactory::ArrayFromJson(mixed, "a", PARAM_REQUIRED);
     EXPECT_EQ(Flags(array), "S");
-    EXPECT_EQ(array.Get(), obj["a"]);
-    APIParameter<Json::Value> notArray = APIParameterFactory::ArrayFromJson(obj, "o", PARAM_REQUIRED);
+    EXPECT_EQ(array.Get(), mixed["a"]);
+    APIParameter<Json::Value> notArray = APIParameterFactory::ArrayFromJson(mixed, "o", PARAM_REQUIRED);
     EXPECT_EQ(Flags(notArray), "SI");
     EXPECT_TRUE(notArray.Get().isNull());
 
-    EXPECT_EQ(APIParameterFactory::ObjectFromJson(obj, "o", PARAM_REQUIRED).Get(), obj["o"]);
-    EXPECT_EQ(Flags(APIParameterFactory::ObjectFromJson(obj, "a", PARAM_REQUIRED)), "SI");
-    EXPECT_EQ(Flags(APIParameterFactory::ObjectFromJson(obj, "z", PARAM_REQUIRED)), "SR");
+    EXPECT_EQ(APIParameterFactory::ObjectFromJson(mixed, "o", PARAM_REQUIRED).Get(), mixed["o"]);
+    EXPECT_EQ(Flags(APIParameterFactory::ObjectFromJson(mixed, "a", PARAM_REQUIRED)), "SI");
+    EXPECT_EQ(Flags(APIParameterFactory::ObjectFromJson(mixed, "z", PARAM_REQUIRED)), "SR");
     EXPECT_EQ(Flags(APIParameterFactory::ArrayFromJson(Parse("[]"), "n", PARAM_OPTIONAL)), "I");
 }
 

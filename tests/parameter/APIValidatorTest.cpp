@@ -30,7 +30,7 @@ void ExpectAll(bool (*check)(std::string const&), std::vector<std::string> const
     }
 }
 
-TEST(TextFormat, Patterns)
+TEST(TextFormat, PatternsHostAndAddress)
 {
     // In the e-mail pattern "+-\" is a range: ":" and "[" lie inside it.
     ExpectAll(V::IsEMail, {"john.doe@example.com", "a\"b,(c)<d>@host", "a:b[@host"}, true);
@@ -44,10 +44,7 @@ TEST(TextFormat, Patterns)
     ExpectAll(V::IsDigit, {"", "12a", "-1", std::string("12\0x", 4)}, false);
     ExpectAll(V::IsFarlinkId, {"Ab-12"}, true);
     ExpectAll(V::IsFarlinkId, {"a_b", ""}, false);
-}
 
-TEST(TextFormat, HostAndAddress)
-{
     ExpectAll(V::IsHostname, {"nas-01"}, true);
     ExpectAll(V::IsHostname, {"-nas", std::string("nas\0-", 5), ""}, false);
     ExpectAll(V::IsDomain, {"corp.example.com"}, true);
@@ -60,17 +57,15 @@ TEST(TextFormat, HostAndAddress)
     ExpectAll(V::IsIPv6, {"192.168.0.1", ""}, false);
 }
 
-TEST(CheckRegex, BadPatternLogs)
+TEST(CheckRegex, BadPatternLogsSharedAcrossThreads)
 {
     static const char bad[] = "a(b";
     VELA::Test::LogCapture capture;
     EXPECT_FALSE(V::CheckRegex("a(b", bad));
     EXPECT_TRUE(capture.Contains("APIValidator:57 Invalid pattern"));
     EXPECT_FALSE(V::CheckRegex("x", nullptr));
-}
 
-TEST(CheckRegex, SharedAcrossThreads)
-{
+    // One validator, shared across threads.
     static const char pattern[] = "^x+$";
     std::vector<APIValidator*> seen(8, nullptr);
     std::vector<int> matched(8, 0);
@@ -91,7 +86,7 @@ TEST(CheckRegex, SharedAcrossThreads)
     }
 }
 
-TEST(Numeric, PortAndEqual)
+TEST(Numeric, PortEqualAndRanges)
 {
     EXPECT_FALSE(V::IsPort(-1));
     EXPECT_TRUE(V::IsPort(0));
@@ -108,10 +103,7 @@ TEST(Numeric, PortAndEqual)
     EXPECT_TRUE(V::IsEqual(Param(0.3), 0.1 + 0.2));
     EXPECT_FALSE(V::IsEqual(Param(0.3), 0.3001));
     EXPECT_FALSE(V::IsEqual(Param(0.3, true), 0.3));
-}
 
-TEST(Numeric, Ranges)
-{
     EXPECT_TRUE(V::IsBetween(Param(5), 5, 10));
     EXPECT_TRUE(V::IsBetween(Param(10), 5, 10));
     EXPECT_FALSE(V::IsBetween(Param(11), 5, 10));

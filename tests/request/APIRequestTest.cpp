@@ -24,25 +24,25 @@ void ExpectEmpty(const APIRequest& r)
 
 }  // namespace
 
-TEST(RequestConstruct, AnythingButANonEmptyObjectGivesAnEmptyRequest)
+TEST(RequestConstruct, AnythingButANonEmptyObjectOfObjectsGivesAnEmptyRequest)
 {
     for (const char* text : {"null", "{}", "[]", "[1,2]", "\"text\"", "7", "true"}) {
         SCOPED_TRACE(text);
         APIRequest r(J(text));
         ExpectEmpty(r);
     }
-}
-
-TEST(RequestConstruct, MembersOfTheWrongTypeAreIgnored)
-{
+    // Members of the wrong type are ignored.
     APIRequest r(J(R"({"environ": [1], "getParam": "api=x", "postParam": 5, "reqLib": 3, "session": []})"));
     ExpectEmpty(r);
     EXPECT_EQ(Json::Value(Json::objectValue), r.GetAPIInfo("", Json::Value("d")));
 }
 
+// The environment keeps only strings; demonstration mode is never active.
 TEST(RequestConstruct, EnvironKeepsOnlyStrings)
 {
-    APIRequest r(J(R"({"environ": {"REQUEST_METHOD": "GET", "CONTENT_LENGTH": 12, "X": null, "Y": {"a": 1}}})"));
+    APIRequest r(J(R"({"environ": {"REQUEST_METHOD": "GET", "CONTENT_LENGTH": 12, "X": null, "Y": {"a": 1},
+                                   "DEMO": "1"}})"));
+    EXPECT_FALSE(r.IsDemoMode());
     EXPECT_EQ("GET", r.GetEnv("REQUEST_METHOD").asString());
     EXPECT_FALSE(r.HasEnv("CONTENT_LENGTH"));
     EXPECT_FALSE(r.HasEnv("X"));
@@ -98,7 +98,7 @@ TEST(RequestParam, OnlyAnIntegerOrExactDecimalTextIsAVersion)
     }
 }
 
-TEST(RequestParam, ResetWithoutParametersKeepsTheApiIdentity)
+TEST(RequestParam, ResetKeepsTheApiIdentityMergeKeepsTheRest)
 {
     APIRequest r(J(R"({"getParam": {"api": "VELA.A", "version": 2, "method": "get", "x": 1}})"));
     r.InitParam(J("{}"), true);
@@ -107,23 +107,16 @@ TEST(RequestParam, ResetWithoutParametersKeepsTheApiIdentity)
     EXPECT_EQ("VELA.A", r.GetAPIClass());
     EXPECT_EQ(2, r.GetAPIVersion());
     EXPECT_EQ("get", r.GetAPIMethod());
-}
 
-TEST(RequestParam, WithoutResetEarlierParametersStay)
-{
-    APIRequest r(J(R"({"getParam": {"a": 1, "b": 2}})"));
-    r.InitParam(J(R"({"postParam": {"b": 3}})"), false);
-    EXPECT_EQ(1, r.GetParam("a").asInt());
-    EXPECT_EQ(3, r.GetParam("b").asInt());
-}
-
-TEST(RequestParam, CallerObjectIsNotChanged)
-{
-    Json::Value request = J(R"({"getParam": {"__nEkOtReHpIc": "t", "__tXeTrEhPiC": "", "a": 1}})");
+    // Without a reset earlier parameters stay; the caller's object is not
+    // changed.
+    APIRequest m(J(R"({"getParam": {"a": 1, "b": 2}})"));
+    Json::Value request = J(R"({"getParam": {"__nEkOtReHpIc": "t", "__tXeTrEhPiC": ""}, "postParam": {"b": 3}})");
     const Json::Value before = request;
-    APIRequest r(J("{}"));
-    r.InitParam(request, false);
+    m.InitParam(request, false);
     EXPECT_EQ(before, request);
+    EXPECT_EQ(1, m.GetParam("a").asInt());
+    EXPECT_EQ(3, m.GetParam("b").asInt());
 }
 
 TEST(RequestParam, ParamRefIsTheStoredValueOrTheDefaultItself)
@@ -147,18 +140,16 @@ TEST(RequestSession, SecondSessionReplacesTheFirstAndItsVerdict)
     EXPECT_FALSE(r.IsAdmin());
     EXPECT_EQ(5, r.GetTimeoutDuration());
     EXPECT_EQ(AUTH_RESULT_NONE, r.GetAuthResult());
+
+    // So does new API info the description.
+    APIRequest d(J(R"({"reqLib": {"lib": "a.so", "methods": {"1": ["get"]}}})"));
+    EXPECT_EQ("a.so", d.GetAPIInfo("lib").asString());
+    d.InitAPIInfo(J(R"({"other": 1})"));
+    EXPECT_FALSE(d.GetAPIInfo("lib", Json::Value(false)).asBool());
+    EXPECT_EQ(J(R"({"other": 1})"), d.GetAPIInfo(""));
 }
 
-TEST(RequestSession, InfoReplacesTheDescription)
-{
-    APIRequest r(J(R"({"reqLib": {"lib": "a.so", "methods": {"1": ["get"]}}})"));
-    EXPECT_EQ("a.so", r.GetAPIInfo("lib").asString());
-    r.InitAPIInfo(J(R"({"other": 1})"));
-    EXPECT_FALSE(r.GetAPIInfo("lib", Json::Value(false)).asBool());
-    EXPECT_EQ(J(R"({"other": 1})"), r.GetAPIInfo(""));
-}
-
-TEST(RequestAttr, AnyTypeButNoEmptyName)
+TEST(RequestAttrAndCookie, AnyTypeOrStringsButNoEmptyName)
 {
     APIRequest r;
     EXPECT_TRUE(r.SetAttr("n", 5));
@@ -167,13 +158,10 @@ TEST(RequestAttr, AnyTypeButNoEmptyName)
     EXPECT_FALSE(r.SetAttr("", 1));
     EXPECT_TRUE(r.HasAttr("z"));
     EXPECT_EQ(J(R"({"a": [1]})"), r.GetAttr("o"));
-}
 
-TEST(RequestCookie, NonStringCookieGivesTheDefault)
-{
-    APIRequest r;
-    // Only strings can be stored through SetCookie; a non-string reaches the
-    // store only through the private side.
+    // Cookies: only strings can be stored through SetCookie; a non-string
+    // reaches the store only through the private side, and reads as the
+    // default.
     r.GetPrivate()->SetData("cookie", "n", Json::Value(5), false);
     EXPECT_TRUE(r.HasCookie("n"));
     EXPECT_EQ("dflt", r.GetCookie("n", "dflt"));
@@ -201,10 +189,4 @@ TEST(RequestCopy, CopiesShareNothing)
     EXPECT_EQ("link", b.GetSharingID());
     EXPECT_TRUE(b.IsSharing());
     EXPECT_EQ(&b, b.GetPrivate()->owner);
-}
-
-TEST(RequestMisc, DemoModeIsNeverActive)
-{
-    APIRequest r(J(R"({"environ": {"DEMO": "1"}})"));
-    EXPECT_FALSE(r.IsDemoMode());
 }

@@ -20,7 +20,9 @@ std::unique_ptr<APIRequest> Request(const std::string& params)
     return std::unique_ptr<APIRequest>(new APIRequest(request));
 }
 
-TEST(GetAndCheck, BasicTypes)
+bool Positive(long long const& v) { return v > 0; }
+
+TEST(GetAndCheck, BasicAndIntegralTypes)
 {
     auto req = Request(R"({"i":5,"s":"5","b":true,"r":3,"big":2147483648,"a":[1],"o":{"k":"v"}})");
     EXPECT_EQ(req->GetAndCheckInt("i", REQ).Get(), 5);
@@ -36,13 +38,9 @@ TEST(GetAndCheck, BasicTypes)
     EXPECT_EQ(Flags(req->GetAndCheckArray("o", REQ)), "SI");
     EXPECT_EQ(req->GetAndCheckObject("o", REQ).Get(), Parse(R"({"k":"v"})"));
     EXPECT_EQ(Flags(req->GetAndCheckObject("a", REQ)), "SI");
-}
 
-bool Positive(long long const& v) { return v > 0; }
-
-TEST(GetAndCheck, Integral)
-{
-    auto req = Request(R"({"big":2147483648,"neg":-1,"zero":0,"huge":18446744073709551615})");
+    // Integral types of every width, with a validator.
+    req = Request(R"({"big":2147483648,"neg":-1,"zero":0,"huge":18446744073709551615})");
     EXPECT_EQ(req->GetAndCheckIntegral<long long>("big", REQ).Get(), 2147483648LL);
     EXPECT_EQ(req->GetAndCheckIntegral<long long>("neg", REQ).Get(), -1);
     EXPECT_EQ(Flags(req->GetAndCheckIntegral<long long>("huge", REQ)), "SI");

@@ -23,18 +23,16 @@ Json::Value Obj(const char* key, const Json::Value& value)
     return v;
 }
 
-TEST(APIResponseBody, FreshResponseHasEmptyBodyAndJsonContentType)
+// A fresh response has an empty body and the JSON content type; an error,
+// then a success, each replace the whole body.
+TEST(APIResponseBody, FreshThenErrorThenSuccessReplacesWholeBody)
 {
     APIResponse resp(nullptr);
     EXPECT_EQ(Json::Value(Json::objectValue), resp.GetBody());
     EXPECT_EQ(0, resp.GetError());
     EXPECT_EQ("application/json; charset=\"UTF-8\"", resp.GetHeader("Content-type"));
     EXPECT_EQ(Json::Value(Json::arrayValue), resp.GetCookies());
-}
 
-TEST(APIResponseBody, ErrorThenSuccessReplacesWholeBody)
-{
-    APIResponse resp(nullptr);
     resp.SetError(WEBAPI_ERR_NO_PERMISSION);
     Json::Value error = Obj("success", false);
     error["error"] = Obj("code", 105);
@@ -68,7 +66,7 @@ TEST(APIResponseBody, PollingTaskAnswerReachesTheHookOnly)
     EXPECT_EQ(Json::Value(true), resp.GetBody()["success"]);
 }
 
-TEST(APIResponseHeader, LineBreaksAndEmptyNamesAreRefused)
+TEST(APIResponseHeader, LineBreaksAndEmptyNamesAreRefusedServerError)
 {
     APIResponse resp(nullptr);
     const Json::Value before = resp.GetHeaders();
@@ -86,11 +84,7 @@ TEST(APIResponseHeader, LineBreaksAndEmptyNamesAreRefused)
     EXPECT_EQ("2", resp.GetHeader("X-A", "none"));
     EXPECT_EQ("none", resp.GetHeader("X-B", "none"));
     EXPECT_TRUE(resp.HasHeader("X-A"));
-}
 
-TEST(APIResponseHeader, ServerError)
-{
-    APIResponse resp(nullptr);
     EXPECT_FALSE(resp.HasServerError());
     EXPECT_EQ("", resp.GetServerError());
     EXPECT_TRUE(resp.SetServerError("disk full"));
@@ -98,7 +92,7 @@ TEST(APIResponseHeader, ServerError)
     EXPECT_EQ("disk full", resp.GetHeader("x-request-error"));
 }
 
-TEST(APIResponseStatus, DefaultSetAndUnreadable)
+TEST(APIResponseStatus, DefaultSetUnreadableAndOptions)
 {
     APIResponse resp(nullptr);
     EXPECT_EQ(200, resp.GetStatus());
@@ -109,9 +103,17 @@ TEST(APIResponseStatus, DefaultSetAndUnreadable)
               resp.GetPrivate()->GetData("option", "statusMsg", Json::Value()));
     ASSERT_TRUE(resp.SetHeader("Status", "abc"));
     EXPECT_EQ(0, resp.GetStatus());
+
+    // Output and restart options.
+    EXPECT_TRUE(resp.IsEnableOutput());
+    EXPECT_FALSE(resp.GetHttpdRestart());
+    EXPECT_TRUE(resp.SetEnableOutput(false));
+    EXPECT_TRUE(resp.SetHttpdRestart(true));
+    EXPECT_FALSE(resp.IsEnableOutput());
+    EXPECT_TRUE(resp.GetHttpdRestart());
 }
 
-TEST(APIResponseRedirect, BuildsLocationOnCurrentHost)
+TEST(APIResponseRedirect, BuildsLocationOnCurrentHostOrIsRefused)
 {
     Json::Value env = Obj("HTTPS", "on");
     env["HTTP_HOST"] = "h";
@@ -127,37 +129,23 @@ TEST(APIResponseRedirect, BuildsLocationOnCurrentHost)
     APIResponse plain(&plainReq);
     EXPECT_TRUE(plain.Redirect("/"));
     EXPECT_EQ("http://h:5000/", plain.GetHeader("Location"));
-}
 
-TEST(APIResponseRedirect, RefusedWithoutRequestEmptyPathOrLineBreak)
-{
+    // Refused without a request, with an empty path or a line break.
     APIResponse none(nullptr);
     EXPECT_FALSE(none.Redirect("/p"));
-
-    APIRequest req = MakeRequest(Obj("HTTP_HOST", "h"));
-    APIResponse resp(&req);
-    EXPECT_FALSE(resp.Redirect(""));
-    EXPECT_FALSE(resp.Redirect("/p\r\nSet-Cookie: a=b"));
-    EXPECT_FALSE(resp.HasHeader("Location"));
-    EXPECT_FALSE(resp.HasHeader("Status"));
-}
-
-TEST(APIResponseOption, OutputAndRestartDefaults)
-{
-    APIResponse resp(nullptr);
-    EXPECT_TRUE(resp.IsEnableOutput());
-    EXPECT_FALSE(resp.GetHttpdRestart());
-    EXPECT_TRUE(resp.SetEnableOutput(false));
-    EXPECT_TRUE(resp.SetHttpdRestart(true));
-    EXPECT_FALSE(resp.IsEnableOutput());
-    EXPECT_TRUE(resp.GetHttpdRestart());
+    APIRequest hReq = MakeRequest(Obj("HTTP_HOST", "h"));
+    APIResponse refused(&hReq);
+    EXPECT_FALSE(refused.Redirect(""));
+    EXPECT_FALSE(refused.Redirect("/p\r\nSet-Cookie: a=b"));
+    EXPECT_FALSE(refused.HasHeader("Location"));
+    EXPECT_FALSE(refused.HasHeader("Status"));
 }
 
 int g_a, g_b;
 void CallbackF(void*) {}
 void CallbackG(void*) {}
 
-TEST(APIResponseCallback, DuplicatesAndNullAreDropped)
+TEST(APIResponseCallback, DuplicatesAndNullAreDroppedOrderKept)
 {
     APIResponse resp(nullptr);
     resp.SetCallbackFunc(CallbackF, &g_a);
@@ -166,10 +154,8 @@ TEST(APIResponseCallback, DuplicatesAndNullAreDropped)
     resp.SetCallbackFunc(CallbackF, &g_b);
     const APICallbackList expected = {{CallbackF, &g_a}, {CallbackF, &g_b}};
     EXPECT_EQ(expected, resp.GetCallbackFuncs());
-}
 
-TEST(APIResponseCallback, ListFromAnotherResponseKeepsOrder)
-{
+    // A list from another response keeps its order.
     APIResponse from(nullptr);
     from.SetCallbackFunc(CallbackF, &g_a);
     from.SetCallbackFunc(CallbackG, &g_b);
@@ -179,8 +165,8 @@ TEST(APIResponseCallback, ListFromAnotherResponseKeepsOrder)
     to.SetCallbackFuncs(&from.GetCallbackFuncs());
     to.SetCallbackFuncs(nullptr);
     to.SetCallbackFuncs(&to.GetCallbackFuncs());
-    const APICallbackList expected = {{CallbackG, &g_b}, {CallbackF, &g_a}, {CallbackG, nullptr}};
-    EXPECT_EQ(expected, to.GetCallbackFuncs());
+    const APICallbackList merged = {{CallbackG, &g_b}, {CallbackF, &g_a}, {CallbackG, nullptr}};
+    EXPECT_EQ(merged, to.GetCallbackFuncs());
 }
 
 }  // namespace

@@ -1,6 +1,7 @@
 // Set-Cookie lines of APIResponse::AddCookie.
 #include <climits>
 #include <gtest/gtest.h>
+#include <vector>
 
 #include "support/TestSupport.h"
 #include "webapi/APIRequest.h"
@@ -28,7 +29,7 @@ std::string TenMinuteLine(const Json::Value& clientTime)
     return resp.GetCookies()[0].asString();
 }
 
-TEST(APIResponseCookie, ExpiryForms)
+TEST(APIResponseCookie, ExpiryFormsAndNow)
 {
     APIResponse resp(nullptr);
     EXPECT_TRUE(resp.AddCookie("sid", "x", "/", -1, "", false, true));
@@ -39,9 +40,16 @@ TEST(APIResponseCookie, ExpiryForms)
     expected.append("sid=x; path=/");
     expected.append("sid=x; path=/webman; expires=Thu, 01-Jan-1970 00:00:01 GMT; domain=nas.lan; secure");
     EXPECT_EQ(expected, resp.GetCookies());
+
+    // Without a client time the expiry counts from now.
+    APIResponse now(nullptr);
+    ASSERT_TRUE(now.AddCookie("id", "v", "/", 1, "", false, false));
+    const std::string line = now.GetCookies()[0].asString();
+    EXPECT_EQ(0u, line.find("id=v; path=/; expires=")) << line;
+    EXPECT_EQ(std::string::npos, line.find("1970")) << line;
 }
 
-TEST(APIResponseCookie, ExpiryFromClientTime)
+TEST(APIResponseCookie, ExpiryFromClientTimeOrZero)
 {
     APIRequest req = RequestWithClientTime(0);
     APIResponse resp(&req);
@@ -49,44 +57,33 @@ TEST(APIResponseCookie, ExpiryFromClientTime)
     EXPECT_EQ("id=a%20b; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT; secure; httponly",
               resp.GetCookies()[0].asString());
 
-    const std::string suffix = "; path=/; expires=";
-    EXPECT_EQ("id=v" + suffix + "Tue, 14-Nov-2023 22:23:20 GMT", TenMinuteLine(1700000000));
-    EXPECT_EQ("id=v" + suffix + "Sat, 01-Jan-2000 00:10:00 GMT", TenMinuteLine("946684800"));
-    EXPECT_EQ("id=v" + suffix + "Thu, 01-Jan-1970 00:11:00 GMT", TenMinuteLine("+60"));
-    EXPECT_EQ("id=v" + suffix + "Thu, 01-Jan-1970 00:09:00 GMT", TenMinuteLine("-60"));
-    EXPECT_EQ("id=v" + suffix + "Thu, 01-Jan-1970 00:11:00 GMT", TenMinuteLine(60.0));
     // Read as an integer, like a number sent as text anywhere: blanks around
-    // it are skipped and a fraction is dropped.
-    const std::string nov14 = "id=v" + suffix + "Tue, 14-Nov-2023 22:23:20 GMT";
-    for (const Json::Value& v : {Json::Value(1700000000.9), Json::Value("1700000000.9"),
-                                 Json::Value(" 1700000000"), Json::Value("\t1700000000 ")}) {
-        EXPECT_EQ(nov14, TenMinuteLine(v)) << v.toStyledString();
+    // it are skipped and a fraction is dropped; text that is no number
+    // counts as 0.
+    const struct {
+        const char* expires;
+        std::vector<Json::Value> clientTimes;
+    } cases[] = {
+        {"Tue, 14-Nov-2023 22:23:20 GMT",
+         {1700000000, 1700000000.9, "1700000000.9", " 1700000000", "\t1700000000 "}},
+        {"Sat, 01-Jan-2000 00:10:00 GMT", {"946684800"}},
+        {"Thu, 01-Jan-1970 00:11:00 GMT", {"+60", 60.0}},
+        {"Thu, 01-Jan-1970 00:09:00 GMT", {"-60", "-60.5"}},
+        {"Thu, 01-Jan-1970 00:10:00 GMT",
+         {"abc", "12abc", "1e3", "0x10", "5.", ".5", "5 5", std::string("5\0", 2), "", "-", "99999999999999999999",
+          1e30, true, Json::Value(), Json::Value(Json::arrayValue)}},
+    };
+    for (const auto& c : cases) {
+        for (const Json::Value& v : c.clientTimes) {
+            EXPECT_EQ(std::string("id=v; path=/; expires=") + c.expires, TenMinuteLine(v)) << v.toStyledString();
+        }
     }
-    EXPECT_EQ("id=v" + suffix + "Thu, 01-Jan-1970 00:09:00 GMT", TenMinuteLine("-60.5"));
 }
 
-TEST(APIResponseCookie, UnreadableClientTimeCountsAsZero)
-{
-    const std::string epoch = "id=v; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT";
-    for (const Json::Value& v :
-         {Json::Value("abc"), Json::Value("12abc"), Json::Value("1e3"), Json::Value("0x10"), Json::Value("5."),
-          Json::Value(".5"), Json::Value("5 5"), Json::Value(std::string("5\0", 2)), Json::Value(""),
-          Json::Value("-"), Json::Value("99999999999999999999"), Json::Value(1e30), Json::Value(true),
-          Json::Value(), Json::Value(Json::arrayValue)}) {
-        EXPECT_EQ(epoch, TenMinuteLine(v)) << v.toStyledString();
-    }
-}
-
-TEST(APIResponseCookie, ExpiryWithoutClientTimeUsesNow)
-{
-    APIResponse resp(nullptr);
-    ASSERT_TRUE(resp.AddCookie("id", "v", "/", 1, "", false, false));
-    const std::string line = resp.GetCookies()[0].asString();
-    EXPECT_EQ(0u, line.find("id=v; path=/; expires=")) << line;
-    EXPECT_EQ(std::string::npos, line.find("1970")) << line;
-}
-
-TEST(APIResponseCookie, ExpiryOutOfRangeIsRefused)
+// Refused: an expiry out of range, a missing name or path and a line break
+// in path or domain (none of them logged), a name with a character outside
+// the token set (logged).
+TEST(APIResponseCookie, RefusedCookies)
 {
     APIRequest req = RequestWithClientTime(0);
     APIResponse resp(&req);
@@ -94,26 +91,6 @@ TEST(APIResponseCookie, ExpiryOutOfRangeIsRefused)
     // Fits time_t, but the year does not fit struct tm.
     EXPECT_FALSE(resp.AddCookie("id", "v", "/", 2000000000000000L, "", false, false));
     EXPECT_EQ("", TenMinuteLine("9223372036854775807"));
-    EXPECT_EQ(0u, resp.GetCookies().size());
-}
-
-TEST(APIResponseCookie, InvalidNameIsRefusedAndLogged)
-{
-    APIResponse resp(nullptr);
-    VELA::Test::LogCapture log;
-    EXPECT_FALSE(resp.AddCookie("a.b", "v", "/", 0, "", false, false));
-    EXPECT_TRUE(log.Contains("APIResponse(84)AddCookie: key[a.b] contains invalid character"));
-    EXPECT_FALSE(resp.AddCookie("a b", "v", "/", 0, "", false, false));
-    EXPECT_TRUE(log.Contains("key[a b] contains invalid character"));
-    EXPECT_FALSE(resp.AddCookie("caf\xc3\xa9", "v", "/", 0, "", false, false));
-    EXPECT_FALSE(resp.AddCookie("a;b", "v", "/", 0, "", false, false));
-    EXPECT_TRUE(resp.AddCookie("Az_09-x", "v", "/", 0, "", false, false));
-    EXPECT_EQ(1u, resp.GetCookies().size());
-}
-
-TEST(APIResponseCookie, MissingPartsAndLineBreaksInPathOrDomainAreRefused)
-{
-    APIResponse resp(nullptr);
     {
         VELA::Test::LogCapture log;
         EXPECT_FALSE(resp.AddCookie("", "v", "/", 0, "", false, false));
@@ -123,6 +100,16 @@ TEST(APIResponseCookie, MissingPartsAndLineBreaksInPathOrDomainAreRefused)
     EXPECT_FALSE(resp.AddCookie("id", "v", "/\r\nX-A: 1", 0, "", false, false));
     EXPECT_FALSE(resp.AddCookie("id", "v", "/", 0, "h\n", false, false));
     EXPECT_EQ(0u, resp.GetCookies().size());
+
+    VELA::Test::LogCapture log;
+    EXPECT_FALSE(resp.AddCookie("a.b", "v", "/", 0, "", false, false));
+    EXPECT_TRUE(log.Contains("APIResponse(84)AddCookie: key[a.b] contains invalid character"));
+    EXPECT_FALSE(resp.AddCookie("a b", "v", "/", 0, "", false, false));
+    EXPECT_TRUE(log.Contains("key[a b] contains invalid character"));
+    EXPECT_FALSE(resp.AddCookie("caf\xc3\xa9", "v", "/", 0, "", false, false));
+    EXPECT_FALSE(resp.AddCookie("a;b", "v", "/", 0, "", false, false));
+    EXPECT_TRUE(resp.AddCookie("Az_09-x", "v", "/", 0, "", false, false));
+    EXPECT_EQ(1u, resp.GetCookies().size());
 }
 
 TEST(APIResponseCookie, SameNameTwiceKeepsBothInOrderWithValuesEncoded)

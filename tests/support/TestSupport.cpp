@@ -38,15 +38,7 @@ int LogCapture::PriorityOf(std::initializer_list<std::string> texts) const
     return -1;
 }
 
-bool LogCapture::Contains(const std::string& text) const
-{
-    for (const auto& line : lines_) {
-        if (line.find(text) != std::string::npos) {
-            return true;
-        }
-    }
-    return false;
-}
+bool LogCapture::Contains(const std::string& text) const { return PriorityOf({text}) != -1; }
 
 TempDir::TempDir()
 {

@@ -10,16 +10,9 @@ export VELA_ROOT
 unset VELA_LOG_STDERR
 trap 'rm -rf "$VELA_ROOT"' EXIT
 
-failures=0
 OUT="$VELA_ROOT/.out"
 ERR="$VELA_ROOT/.err"
-
-fail() {
-    echo "FAIL: $*" >&2
-    echo "  stdout: $(cat "$OUT" 2>/dev/null)" >&2
-    echo "  stderr: $(cat "$ERR" 2>/dev/null)" >&2
-    failures=$((failures + 1))
-}
+. "$(dirname "$0")/checks.sh"
 
 # expect STATUS ARGS...: runs velaadm, checks its exit status.
 expect() {
@@ -30,38 +23,35 @@ expect() {
     [ "$got" -eq "$want" ] || fail "velaadm $* exited $got, expected $want"
 }
 
-stdout_has() { grep -q -- "$1" "$OUT" || fail "stdout lacks \"$1\""; }
-stderr_has() { grep -q -- "$1" "$ERR" || fail "stderr lacks \"$1\""; }
-stdout_lacks() { ! grep -q -- "$1" "$OUT" || fail "stdout shows \"$1\""; }
+# refused STATUS TEXT ARGS...: velaadm ARGS exits STATUS saying TEXT.
+refused() {
+    want=$1 text=$2
+    shift 2
+    expect "$want" "$@"
+    stderr_has "$text"
+}
 mode_is() {
     m=$(stat -c %a "$1" 2>/dev/null)
     [ "$m" = "$2" ] || fail "$1 has mode ${m:-none}, expected $2"
 }
 
 # ---- usage errors
-expect 2
-stderr_has "usage: velaadm"
-expect 2 frobnicate
-stderr_has "unknown command"
+refused 2 "usage: velaadm"
+refused 2 "unknown command" frobnicate
 expect 2 session
 expect 2 session frobnicate
 expect 2 session create
-expect 2 session create root --timeout abc
-stderr_has "\-\-timeout must be"
+refused 2 "\-\-timeout must be" session create root --timeout abc
 expect 2 session create root --timeout -5
-expect 2 session create root --ip
-stderr_has "needs a value"
-expect 2 session create root --bogus
-stderr_has "unknown option --bogus"
+refused 2 "needs a value" session create root --ip
+refused 2 "unknown option --bogus" session create root --bogus
 expect 2 session list extra
 expect 0 --help
 stdout_has "session create"
 
 # ---- sessions
-expect 1 session create vela-no-such-user
-stderr_has "no user \"vela-no-such-user\""
-expect 1 session create root --ip 999.1.1.1
-stderr_has "not an IP address"
+refused 1 "no user \"vela-no-such-user\"" session create vela-no-such-user
+refused 1 "not an IP address" session create root --ip 999.1.1.1
 
 expect 0 session create root --ip 192.0.2.7 --timeout 600 --token
 sid=$(sed -n 's/^sid=//p' "$OUT")
@@ -86,21 +76,17 @@ stdout_lacks "$token"
 
 expect 0 session revoke "$sid"
 [ ! -e "$VELA_ROOT/run/vela/sessions/$sid" ] || fail "revoked session file still exists"
-expect 1 session revoke "$sid"
-stderr_has "no session"
+refused 1 "no session" session revoke "$sid"
 expect 1 session revoke ../x
 expect 2 session revoke
 expect 0 session list
 stdout_lacks "$sid"
 
 # ---- access tokens
-expect 2 token create root --method get
-stderr_has "at least one --api"
-expect 2 token create root --api 'a*b' --method get
-stderr_has "invalid pattern"
+refused 2 "at least one --api" token create root --method get
+refused 2 "invalid pattern" token create root --api 'a*b' --method get
 expect 2 token create root --api x --method y --expires 0
-expect 1 token create vela-no-such-user --api x --method y
-stderr_has "no user \"vela-no-such-user\""
+refused 1 "no user \"vela-no-such-user\"" token create vela-no-such-user --api x --method y
 
 expect 0 token create root --api 'VELA.Demo.*' --api VELA.Other --method 'get*' --expires 3600
 tid=$(sed -n 's/^id=//p' "$OUT")
@@ -120,8 +106,7 @@ stdout_lacks "${tok#*.}"
 
 expect 0 token revoke "$tid"
 [ ! -e "$VELA_ROOT/var/lib/vela/tokens/$tid" ] || fail "revoked token file still exists"
-expect 1 token revoke "$tid"
-stderr_has "no access token"
+refused 1 "no access token" token revoke "$tid"
 expect 1 token revoke ../../x
 
 # ---- public key: printed as PEM, or a clear refusal while none is available
@@ -140,9 +125,4 @@ extra=$(find "$VELA_ROOT" -mindepth 1 \( -path "$VELA_ROOT/run" -o -path "$VELA_
     -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$VELA_ROOT/etc*" -o -path "$OUT" -o -path "$ERR" \) \
     -prune -o -print)
 [ -z "$extra" ] || fail "unexpected files: $extra"
-
-if [ "$failures" -ne 0 ]; then
-    echo "$failures check(s) failed" >&2
-    exit 1
-fi
-echo "velaadm: all checks passed"
+finish velaadm

@@ -15,14 +15,7 @@ TMP=$(mktemp -d "${TMPDIR:-/tmp}/velarun-test-XXXXXX") || exit 1
 trap 'rm -rf "$TMP"' EXIT
 OUT=$TMP/out
 ERR=$TMP/err
-
-failures=0
-fail() {
-    echo "FAIL: $*" >&2
-    echo "  stdout: $(cat "$OUT" 2>/dev/null)" >&2
-    echo "  stderr: $(cat "$ERR" 2>/dev/null)" >&2
-    failures=$((failures + 1))
-}
+. "$(dirname "$0")/checks.sh"
 
 # call STATUS JSON [ARGS...]: runs velarun with JSON on standard input.
 call() {
@@ -34,9 +27,13 @@ call() {
     [ "$got" -eq "$want" ] || fail "velarun $* <<< $json exited $got, expected $want"
 }
 
-# answer_is TEXT: the one line printed is exactly TEXT.
-answer_is() {
-    [ "$(cat "$OUT")" = "$1" ] || fail "answer is not $1"
+# answers STATUS TEXT JSON [ARGS...]: call, and the one line printed is
+# exactly TEXT.
+answers() {
+    status=$1 text=$2
+    shift 2
+    call "$status" "$@"
+    [ "$(cat "$OUT")" = "$text" ] || fail "answer is not $text"
     [ "$(wc -l <"$OUT")" -eq 1 ] || fail "answer is not one line"
 }
 
@@ -44,49 +41,45 @@ req() { printf '{"getParam": {"api": "%s", "version": %s, "method": "%s"%s}}' "$
 
 case $PART in
 refusals)
-    call 1 "$(req VELA.Nope 1 get)"
-    answer_is '{"error":{"code":102},"httpd_restart":false,"success":false}'
-    call 1 "$(req VELA.Sample 1 nope)"
-    answer_is '{"error":{"code":103},"httpd_restart":false,"success":false}'
-    call 1 "$(req ../VELA.Sample 1 echo)"
-    answer_is '{"error":{"code":102},"httpd_restart":false,"success":false}'
-    call 1 '{}'
-    answer_is '{"error":{"code":101},"httpd_restart":false,"success":false}'
+    answers 1 '{"error":{"code":102},"httpd_restart":false,"success":false}' "$(req VELA.Nope 1 get)"
+    answers 1 '{"error":{"code":103},"httpd_restart":false,"success":false}' "$(req VELA.Sample 1 nope)"
+    answers 1 '{"error":{"code":102},"httpd_restart":false,"success":false}' "$(req ../VELA.Sample 1 echo)"
+    answers 1 '{"error":{"code":101},"httpd_restart":false,"success":false}' '{}'
 
     call 2 '{"getParam": ' -
-    grep -q "not valid JSON" "$ERR" || fail "no message for bad JSON"
+    stderr_has "not valid JSON"
     [ ! -s "$OUT" ] || fail "an answer was printed for bad JSON"
     call 2 '{}' "$TMP/missing.json"
-    grep -q "cannot open" "$ERR" || fail "no message for a missing file"
+    stderr_has "cannot open"
     call 2 '{}' --bogus
     call 2 '{}' a.json b.json
     call 2 '{}' -C
     call 2 '{}' -C "$TMP/nowhere"
-    grep -q "cannot enter" "$ERR" || fail "no message for a missing directory"
+    stderr_has "cannot enter"
     ;;
 sample)
     [ "$(id -u)" -eq 0 ] || { echo "skipped: the sample's calls switch identity and need root"; exit 77; }
-    call 0 "$(req VELA.Sample 1 echo ', "text": "hi", "n": [1, 2]')"
-    answer_is '{"data":{"api":"VELA.Sample","method":"echo","n":[1,2],"text":"hi","version":1},"httpd_restart":false,"success":true}'
+    answers 0 '{"data":{"api":"VELA.Sample","method":"echo","n":[1,2],"text":"hi","version":1},"httpd_restart":false,"success":true}' \
+        "$(req VELA.Sample 1 echo ', "text": "hi", "n": [1, 2]')"
 
     # From a file, with the directory given.
     req VELA.Sample.Echo 1 echo >"$TMP/echo.json"
-    call 0 '' -C "$WEBAPI" "$TMP/echo.json"
-    answer_is '{"data":{"api":"VELA.Sample.Echo","method":"echo","version":1},"httpd_restart":false,"success":true}'
+    answers 0 '{"data":{"api":"VELA.Sample.Echo","method":"echo","version":1},"httpd_restart":false,"success":true}' \
+        '' -C "$WEBAPI" "$TMP/echo.json"
 
     call 1 "$(req VELA.Sample 1 fail)"
-    grep -q '"code":1001' "$OUT" || fail "fail does not answer 1001"
+    stdout_has '"code":1001'
 
-    call 0 "$(req VELA.Sample 1 typed ', "name": "disk-1", "tags": ["a"]')"
-    answer_is '{"data":{"enabled":false,"name":"disk-1","port":5000,"portIsDefault":true,"tags":["a"]},"httpd_restart":false,"success":true}'
-    call 1 "$(req VELA.Sample 1 typed ', "name": "a/b", "port": 70000, "tags": [1]')"
-    answer_is '{"error":{"code":101,"errors":[{"name":"name","reason":"invalid"},{"name":"port","reason":"invalid"},{"name":"tags","reason":"invalid"}]},"httpd_restart":false,"success":false}'
+    answers 0 '{"data":{"enabled":false,"name":"disk-1","port":5000,"portIsDefault":true,"tags":["a"]},"httpd_restart":false,"success":true}' \
+        "$(req VELA.Sample 1 typed ', "name": "disk-1", "tags": ["a"]')"
+    answers 1 '{"error":{"code":101,"errors":[{"name":"name","reason":"invalid"},{"name":"port","reason":"invalid"},{"name":"tags","reason":"invalid"}]},"httpd_restart":false,"success":false}' \
+        "$(req VELA.Sample 1 typed ', "name": "a/b", "port": 70000, "tags": [1]')"
     call 1 "$(req VELA.Sample 1 typed)"
-    grep -q '{"name":"name","reason":"missing"}' "$OUT" || fail "a missing name is not reported"
+    stdout_has '{"name":"name","reason":"missing"}'
 
     if nobody=$(id -u nobody 2>/dev/null) && group=$(id -g nobody 2>/dev/null); then
-        call 0 "$(req VELA.Sample 1 whoami)"
-        answer_is "{\"data\":{\"gid\":[$group,$group,$group],\"uid\":[$nobody,$nobody,$nobody],\"user\":\"\"},\"httpd_restart\":false,\"success\":true}"
+        answers 0 "{\"data\":{\"gid\":[$group,$group,$group],\"uid\":[$nobody,$nobody,$nobody],\"user\":\"\"},\"httpd_restart\":false,\"success\":true}" \
+            "$(req VELA.Sample 1 whoami)"
     fi
     ;;
 *)
@@ -95,5 +88,4 @@ sample)
     ;;
 esac
 
-[ "$failures" -eq 0 ] || exit 1
-echo "velarun $PART: all checks passed"
+finish "velarun $PART"

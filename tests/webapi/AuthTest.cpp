@@ -4,9 +4,9 @@
 // password. The account is the test's own user.
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <fstream>
 #include <json/json.h>
+#include <map>
 #include <pwd.h>
 #include <string>
 #include <sys/stat.h>
@@ -22,12 +22,6 @@
 
 namespace {
 
-std::string BinaryDir()
-{
-    const char* dir = getenv("VELA_TEST_BINARY_DIR");
-    return dir != nullptr ? dir : "";
-}
-
 struct Reply {
     std::vector<std::string> cookies;  // the Set-Cookie values
     Json::Value body;
@@ -41,7 +35,7 @@ protected:
         const struct passwd* pw = getpwuid(geteuid());
         ASSERT_NE(nullptr, pw);
         user_ = pw->pw_name;
-        const std::string staged = BinaryDir() + "/root/usr/vela/velaman/webapi";
+        const std::string staged = BuiltProgram("root/usr/vela/velaman/webapi");
         const std::string webapi = root_.Path() + "/usr/vela/velaman/webapi";
         ASSERT_EQ(0, system(("mkdir -p '" + webapi + "' '" + root_.Path() + "/etc/pam.d' '" + root_.Path() +
                              "/etc/vela'")
@@ -74,39 +68,23 @@ protected:
     Reply Call(const std::string& method, const std::string& body, std::vector<std::string> env = {},
                const std::string& query = "")
     {
-        std::vector<std::string> vars = {
-            "VELA_ROOT=" + root_.Path(),
-            "REMOTE_ADDR=192.0.2.7",
-            "HTTP_HOST=nas.example",
-            "QUERY_STRING=api=VELA.Auth&version=1&method=" + method + query,
-            body.empty() ? "REQUEST_METHOD=GET" : "REQUEST_METHOD=POST",
-            "CONTENT_TYPE=application/x-www-form-urlencoded",
-            "CONTENT_LENGTH=" + std::to_string(body.size()),
+        std::map<std::string, std::string> vars = {
+            {"VELA_ROOT", root_.Path()},
+            {"REMOTE_ADDR", "192.0.2.7"},
+            {"HTTP_HOST", "nas.example"},
+            {"QUERY_STRING", "api=VELA.Auth&version=1&method=" + method + query},
+            {"REQUEST_METHOD", body.empty() ? "GET" : "POST"},
+            {"CONTENT_TYPE", "application/x-www-form-urlencoded"},
+            {"CONTENT_LENGTH", std::to_string(body.size())},
         };
         for (const std::string& e : env) {
-            const std::string name = e.substr(0, e.find('=') + 1);
-            bool replaced = false;
-            for (std::string& v : vars) {
-                if (v.compare(0, name.size(), name) == 0) {
-                    v = e;
-                    replaced = true;
-                }
-            }
-            if (!replaced) {
-                vars.push_back(e);
-            }
+            vars[e.substr(0, e.find('='))] = e.substr(e.find('=') + 1);
         }
-        const std::string program = BinaryDir() + "/velascgi";
-        const std::string out = RunChild(body, [&] {
-            std::vector<char*> envp;
-            for (std::string& e : vars) {
-                envp.push_back(&e[0]);
-            }
-            envp.push_back(nullptr);
-            char* argv[] = {const_cast<char*>(program.c_str()), nullptr};
-            execve(program.c_str(), argv, envp.data());
-            _exit(127);
-        });
+        std::vector<std::string> list;
+        for (const auto& v : vars) {
+            list.push_back(v.first + "=" + v.second);
+        }
+        const std::string out = RunWithEnv(BuiltProgram("velascgi"), list, body);
         Reply reply;
         const size_t end = out.find("\r\n\r\n");
         EXPECT_NE(std::string::npos, end) << out;

@@ -4,10 +4,12 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <functional>
 #include <string>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <vector>
 
 // `child` runs with `input` on its standard input (then end of file); the
 // child's standard output is returned once it has exited.
@@ -43,4 +45,27 @@ inline std::string RunChild(const std::string& input, const std::function<void()
     waitpid(pid, &status, 0);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
     return text;
+}
+
+// The path of the program `name` of the build (VELA_TEST_BINARY_DIR).
+inline std::string BuiltProgram(const std::string& name)
+{
+    const char* dir = getenv("VELA_TEST_BINARY_DIR");
+    return std::string(dir != nullptr ? dir : ".") + "/" + name;
+}
+
+// Runs `program` with exactly `env` as its environment and `input` on its
+// standard input; its standard output.
+inline std::string RunWithEnv(const std::string& program, std::vector<std::string> env, const std::string& input)
+{
+    return RunChild(input, [&] {
+        std::vector<char*> envp;
+        for (std::string& e : env) {
+            envp.push_back(&e[0]);
+        }
+        envp.push_back(nullptr);
+        char* argv[] = {const_cast<char*>(program.c_str()), nullptr};
+        execve(program.c_str(), argv, envp.data());
+        _exit(127);
+    });
 }

@@ -40,19 +40,18 @@ std::string Header(VELA::WebEntry& entry)
 
 }  // namespace
 
-TEST(WebEntryOutputHeader, FreshAndEmptyResponses)
+TEST(WebEntryOutputHeader, FreshEmptyAndFullResponses)
 {
     VELA::WebEntry entry;
     EXPECT_EQ(std::string("Content-type: application/json; charset=\"UTF-8\"\r\n") + kFixed, Header(entry));
 
     entry.GetResponseObject()->GetPrivate()->ClearData("headers", "");
     EXPECT_EQ(kFixed, Header(entry));
-}
 
-TEST(WebEntryOutputHeader, NameOrderNonStringsSkippedCookiesBeforeFixedLines)
-{
-    VELA::WebEntry entry;
-    VELA::APIResponse* resp = entry.GetResponseObject();
+    // Headers in name order, non-strings skipped, cookies before the fixed
+    // lines.
+    VELA::WebEntry full;
+    VELA::APIResponse* resp = full.GetResponseObject();
     ASSERT_TRUE(resp->SetHeader("X-Trace", "t1"));
     ASSERT_TRUE(resp->SetHeader("Location", "https://h/x"));
     ASSERT_TRUE(resp->GetPrivate()->SetData("headers", "X-Count", Json::Value(5), false));
@@ -66,7 +65,7 @@ TEST(WebEntryOutputHeader, NameOrderNonStringsSkippedCookiesBeforeFixedLines)
                                  "X-Trace: t1\r\n"
                                  "Set-Cookie: " + cookies[0].asString() + "\r\n"
                                  "Set-Cookie: " + cookies[1].asString() + "\r\n" + kFixed;
-    EXPECT_EQ(expected, Header(entry));
+    EXPECT_EQ(expected, Header(full));
 }
 
 TEST(WebEntryOutputBody, CompactJsonThenFlush)

@@ -2,7 +2,6 @@
 // body on standard input, the reply on standard output.
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <string>
 #include <sys/stat.h>
 #include <vector>
@@ -21,63 +20,35 @@ const char kHeaders[] =
     "Expires: 0\r\n"
     "\r\n";
 
-std::string BinaryDir()
-{
-    const char* dir = getenv("VELA_TEST_BINARY_DIR");
-    return dir != nullptr ? dir : "";
-}
-
-// Runs velascgi with exactly `env` as its environment and `body` on its
-// standard input; its standard output.
-std::string RunCgi(const std::vector<std::string>& env, const std::string& body)
-{
-    const std::string program = BinaryDir() + "/velascgi";
-    return RunChild(body, [&] {
-        std::vector<char*> envp;
-        for (const std::string& e : env) {
-            envp.push_back(const_cast<char*>(e.c_str()));
-        }
-        envp.push_back(nullptr);
-        char* argv[] = {const_cast<char*>(program.c_str()), nullptr};
-        execve(program.c_str(), argv, envp.data());
-        _exit(127);
-    });
-}
-
-class Velascgi : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        struct stat st;
-        root_ = BinaryDir() + "/root";
-        ASSERT_EQ(0, stat((root_ + "/usr/vela/velaman/webapi/lib.def").c_str(), &st))
-            << "the build stages the web-API directory under " << root_;
-    }
-    std::string root_;
-};
-
 }  // namespace
 
-TEST_F(Velascgi, UnknownApiAnswers102)
+TEST(Velascgi, RefusalsOfTheRegistryAndTheFrontEnd)
 {
-    const std::string reply = RunCgi({"VELA_ROOT=" + root_, "REQUEST_METHOD=GET",
-                                      "QUERY_STRING=api=VELA.NoSuchApi&version=1&method=get"},
-                                     "");
-    EXPECT_EQ(std::string(kHeaders) + R"({"error":{"code":102},"success":false})", reply);
+    const std::string root = BuiltProgram("root");
+    struct stat st;
+    ASSERT_EQ(0, stat((root + "/usr/vela/velaman/webapi/lib.def").c_str(), &st))
+        << "the build stages the web-API directory under " << root;
+    const struct {
+        std::vector<std::string> env;
+        const char* body;
+    } cases[] = {
+        {{"REQUEST_METHOD=GET", "QUERY_STRING=api=VELA.NoSuchApi&version=1&method=get"},
+         R"({"error":{"code":102},"success":false})"},
+        {{"REQUEST_METHOD=POST", "CONTENT_LENGTH=0", "CONTENT_TYPE=application/x-www-form-urlencoded"},
+         R"({"error":{"code":101},"success":false})"},
+    };
+    for (const auto& c : cases) {
+        std::vector<std::string> env = c.env;
+        env.push_back("VELA_ROOT=" + root);
+        EXPECT_EQ(std::string(kHeaders) + c.body, RunWithEnv(BuiltProgram("velascgi"), env, "")) << c.body;
+    }
 }
 
-TEST_F(Velascgi, PostWithEmptyBodyAnswers101)
-{
-    const std::string reply = RunCgi({"VELA_ROOT=" + root_, "REQUEST_METHOD=POST", "CONTENT_LENGTH=0",
-                                      "CONTENT_TYPE=application/x-www-form-urlencoded"},
-                                     "");
-    EXPECT_EQ(std::string(kHeaders) + R"({"error":{"code":101},"success":false})", reply);
-}
-
-TEST_F(Velascgi, MissingWebApiDirectoryAnswers500)
+TEST(Velascgi, MissingWebApiDirectoryAnswers500)
 {
     VELA::Test::TempDir empty;
-    const std::string reply = RunCgi({"VELA_ROOT=" + empty.Path(), "REQUEST_METHOD=GET"}, "");
+    const std::string reply =
+        RunWithEnv(BuiltProgram("velascgi"), {"VELA_ROOT=" + empty.Path(), "REQUEST_METHOD=GET"}, "");
     EXPECT_EQ(0u, reply.find("Status: 500 Internal Server Error\r\n")) << reply;
     EXPECT_NE(std::string::npos, reply.find("\r\n\r\n{\"error\":{\"code\":117},\"success\":false}")) << reply;
 }

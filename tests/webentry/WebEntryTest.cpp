@@ -79,7 +79,7 @@ protected:
 
 }  // namespace
 
-TEST_F(WebEntryInit, GetWithoutQueryString)
+TEST_F(WebEntryInit, GetQueryParametersAndBrokenPercentEncoding)
 {
     Set("REQUEST_METHOD", "GET");
     Set("HTTP_ACCEPT_LANGUAGE", "de-DE,de;q=0.9");
@@ -92,11 +92,7 @@ TEST_F(WebEntryInit, GetWithoutQueryString)
     EXPECT_EQ(Json::Value(true), req->GetAttr("_collector_count_webapi"));
     EXPECT_EQ("ger", req->GetUILanguage());
     EXPECT_EQ("GET", req->GetEnv("REQUEST_METHOD").asString());
-}
 
-TEST_F(WebEntryInit, QueryParametersAndBrokenPercentEncoding)
-{
-    Set("REQUEST_METHOD", "GET");
     Set("QUERY_STRING", "api=VELA.Sample&version=1&method=echo&n=a%20b+c");
     {
         VELA::WebEntry entry;
@@ -115,34 +111,74 @@ TEST_F(WebEntryInit, QueryParametersAndBrokenPercentEncoding)
     }
 }
 
-TEST_F(WebEntryInit, SessionIdReplacesTheCookieId)
+// The identity parameters of the query move into the process environment
+// and the request's: "_sid" replaces the cookie's id (the first "id=" of the
+// header, a plain substring search, becomes "abandoned="), "tid" becomes
+// the access token only without "_sid", "_sharing_id" the sharing header,
+// and "_sharing_sid" a cookie only with a sharing id. Once an identity
+// parameter is given, both headers join the request's environment even when
+// empty; "; " joins what is appended only to a cookie header the client sent.
+TEST_F(WebEntryInit, IdentityParametersMoveIntoTheHeaders)
 {
     Set("REQUEST_METHOD", "GET");
-    Set("QUERY_STRING", "_sid=abc");
-    Set("HTTP_COOKIE", "id=old; x=1");
-    VELA::WebEntry entry;
-    ASSERT_TRUE(entry.Initialize(Json::Value()));
-    EXPECT_EQ("abandoned=old; x=1; id=abc", EnvOr("HTTP_COOKIE", "-"));
-    EXPECT_EQ("abandoned=old; x=1; id=abc", entry.GetRequest()->GetEnv("HTTP_COOKIE").asString());
-    EXPECT_EQ("abc", entry.GetRequest()->GetSessionID());
-    EXPECT_EQ("-", EnvOr("velaAccessToken", "-"));
+    const struct {
+        const char* query;
+        const char* cookieIn;   // null: no Cookie header
+        const char* cookie;     // the request's
+        const char* envCookie;  // the process's ("-": unset)
+        const char* sharing;    // the request's (the process's: "-" when empty)
+        const char* token;      // velaAccessToken ("-": unset)
+        const char* sid;        // the request's session id (null: not looked at)
+    } cases[] = {
+        {"_sid=abc", "id=old; x=1", "abandoned=old; x=1; id=abc", "abandoned=old; x=1; id=abc", "", "-", "abc"},
+        {"_sid=abc", "xsid=old", "xsabandoned=old; id=abc", "xsabandoned=old; id=abc", "", "-", "abc"},
+        {"_sid=abc", nullptr, "id=abc", "id=abc", "", "-", "abc"},
+        {"_sid=abc", "", "id=abc", "id=abc", "", "-", "abc"},
+        {"tid=tok1", "id=old", "id=old", "id=old", "", "tok1", "old"},
+        {"tid=tok1", nullptr, "", "-", "", "tok1", nullptr},
+        {"tid=tok1&_sid=abc", "id=old", "abandoned=old; id=abc", "abandoned=old; id=abc", "", "-", "abc"},
+        {"_sharing_sid=q", "a=1", "a=1", "a=1", "", "-", nullptr},
+        {"_sharing_sid=q", nullptr, "", "-", "", "-", nullptr},
+        {"_sharing_id=L1", "a=1", "a=1", "a=1", "L1", "-", nullptr},
+        {"_sharing_id=L1&_sharing_sid=q", "a=1", "a=1; sharing_sid=q", "a=1; sharing_sid=q", "L1", "-", nullptr},
+        {"_sharing_id=L1&_sharing_sid=q", nullptr, "sharing_sid=q", "sharing_sid=q", "L1", "-", nullptr},
+        // No Cookie header came in: nothing joins the session id to the
+        // sharing session cookie, and no "id=" is looked for.
+        {"_sharing_id=L1&_sharing_sid=q&_sid=abc", nullptr, "sharing_sid=qid=abc", "sharing_sid=qid=abc", "L1", "-",
+         nullptr},
+        {"_sharing_id=L1&_sharing_sid=q&_sid=abc", "id=old", "abandoned=old; sharing_sid=q; id=abc",
+         "abandoned=old; sharing_sid=q; id=abc", "L1", "-", "abc"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(std::string(c.query) + " / " + (c.cookieIn ? c.cookieIn : "(no cookie)"));
+        Set("QUERY_STRING", c.query);
+        Set("HTTP_COOKIE", c.cookieIn);
+        Set("HTTP_X_VELA_SHARING", nullptr);
+        Set("velaAccessToken", nullptr);
+        VELA::WebEntry entry;
+        ASSERT_TRUE(entry.Initialize(Json::Value()));
+        const VELA::APIRequest* req = entry.GetRequest();
+        EXPECT_EQ(Json::Value(c.cookie), req->GetEnv("HTTP_COOKIE"));
+        EXPECT_EQ(c.envCookie, EnvOr("HTTP_COOKIE", "-"));
+        EXPECT_EQ(Json::Value(c.sharing), req->GetEnv("HTTP_X_VELA_SHARING"));
+        EXPECT_EQ(*c.sharing ? c.sharing : "-", EnvOr("HTTP_X_VELA_SHARING", "-"));
+        EXPECT_EQ(*c.sharing != '\0', req->IsSharing());
+        EXPECT_EQ(c.sharing, req->GetSharingID());
+        EXPECT_EQ(c.token, EnvOr("velaAccessToken", "-"));
+        EXPECT_EQ(c.token, std::string(req->GetVelaAccessTokenID() ? req->GetVelaAccessTokenID() : "-"));
+        const std::string cookie = c.cookie;
+        const size_t at = cookie.find("sharing_sid=");
+        EXPECT_EQ(at != std::string::npos, req->HasCookie("sharing_sid"));
+        EXPECT_EQ(at == std::string::npos ? "" : cookie.substr(at + 12, cookie.find(';', at) - at - 12),
+                  req->GetSharingSID());
+        if (c.sid != nullptr) {
+            EXPECT_EQ(c.sid, req->GetSessionID());
+        }
+    }
 
-    // The search is a plain substring search: it also hits a longer name.
-    Set("HTTP_COOKIE", "xsid=old");
-    VELA::WebEntry second;
-    ASSERT_TRUE(second.Initialize(Json::Value()));
-    EXPECT_EQ("xsabandoned=old; id=abc", EnvOr("HTTP_COOKIE", "-"));
-
-    Set("HTTP_COOKIE", nullptr);
-    VELA::WebEntry third;
-    ASSERT_TRUE(third.Initialize(Json::Value()));
-    EXPECT_EQ("id=abc", EnvOr("HTTP_COOKIE", "-"));
-}
-
-TEST_F(WebEntryInit, SessionIdThatWouldAddACookieIsRefused)
-{
-    Set("REQUEST_METHOD", "GET");
+    // A session id that would add a cookie is refused.
     Set("HTTP_COOKIE", "x=1");
+    Set("HTTP_X_VELA_SHARING", nullptr);
     for (const char* query : {"_sid=abc%3B%20sharing_sid%3Devil", "_sharing_id=L1&_sharing_sid=q%3B%20id%3Devil",
                               "_sid=ok&_sharing_id=L1&_sharing_sid=q%2C"}) {
         Set("QUERY_STRING", query);
@@ -154,84 +190,7 @@ TEST_F(WebEntryInit, SessionIdThatWouldAddACookieIsRefused)
     }
 }
 
-TEST_F(WebEntryInit, AccessTokenOnlyWithoutSessionId)
-{
-    Set("REQUEST_METHOD", "GET");
-    Set("QUERY_STRING", "tid=tok1");
-    Set("HTTP_COOKIE", "id=old");
-    {
-        VELA::WebEntry entry;
-        ASSERT_TRUE(entry.Initialize(Json::Value()));
-        EXPECT_EQ("tok1", EnvOr("velaAccessToken", "-"));
-        EXPECT_EQ("id=old", EnvOr("HTTP_COOKIE", "-"));
-        EXPECT_STREQ("tok1", entry.GetRequest()->GetVelaAccessTokenID());
-    }
-    unsetenv("velaAccessToken");
-    Set("QUERY_STRING", "tid=tok1&_sid=abc");
-    VELA::WebEntry entry;
-    ASSERT_TRUE(entry.Initialize(Json::Value()));
-    EXPECT_EQ("-", EnvOr("velaAccessToken", "-"));
-    EXPECT_EQ("abandoned=old; id=abc", EnvOr("HTTP_COOKIE", "-"));
-}
-
-TEST_F(WebEntryInit, SharingParameters)
-{
-    Set("REQUEST_METHOD", "GET");
-    Set("HTTP_COOKIE", "a=1");
-    Set("QUERY_STRING", "_sharing_sid=q");
-    {
-        VELA::WebEntry entry;
-        ASSERT_TRUE(entry.Initialize(Json::Value()));
-        EXPECT_EQ("a=1", EnvOr("HTTP_COOKIE", "-"));
-        EXPECT_EQ("-", EnvOr("HTTP_X_VELA_SHARING", "-"));
-        EXPECT_FALSE(entry.GetRequest()->IsSharing());
-        EXPECT_FALSE(entry.GetRequest()->HasCookie("sharing_sid"));
-    }
-    Set("QUERY_STRING", "_sharing_id=Link1&_sharing_sid=q");
-    VELA::WebEntry entry;
-    ASSERT_TRUE(entry.Initialize(Json::Value()));
-    EXPECT_EQ("a=1; sharing_sid=q", EnvOr("HTTP_COOKIE", "-"));
-    EXPECT_EQ("Link1", EnvOr("HTTP_X_VELA_SHARING", "-"));
-    EXPECT_EQ("Link1", entry.GetRequest()->GetSharingID());
-    EXPECT_EQ("q", entry.GetRequest()->GetSharingSID());
-}
-
-// Once an identity parameter is given, the cookie header and the sharing
-// header are merged into the request's environment even when empty; "; "
-// joins what is appended only to a cookie header the client sent.
-TEST_F(WebEntryInit, IdentityHeadersAfterTheParameters)
-{
-    Set("REQUEST_METHOD", "GET");
-    const struct {
-        const char* query;
-        const char* cookieIn;  // null: no Cookie header
-        const char* cookie;
-        const char* sharing;
-    } cases[] = {
-        {"tid=tok1", nullptr, "", ""},
-        {"_sharing_sid=q", nullptr, "", ""},
-        {"_sid=abc", "", "id=abc", ""},
-        {"_sharing_id=L1", "a=1", "a=1", "L1"},
-        {"_sharing_id=L1&_sharing_sid=q", nullptr, "sharing_sid=q", "L1"},
-        // No Cookie header came in: nothing joins the session id to the
-        // sharing session cookie, and no "id=" is looked for.
-        {"_sharing_id=L1&_sharing_sid=q&_sid=abc", nullptr, "sharing_sid=qid=abc", "L1"},
-        {"_sharing_id=L1&_sharing_sid=q&_sid=abc", "id=old", "abandoned=old; sharing_sid=q; id=abc", "L1"},
-    };
-    for (const auto& c : cases) {
-        Set("QUERY_STRING", c.query);
-        Set("HTTP_COOKIE", c.cookieIn);
-        Set("HTTP_X_VELA_SHARING", nullptr);
-        VELA::WebEntry entry;
-        ASSERT_TRUE(entry.Initialize(Json::Value())) << c.query;
-        const VELA::APIRequest* req = entry.GetRequest();
-        EXPECT_EQ(Json::Value(c.cookie), req->GetEnv("HTTP_COOKIE")) << c.query;
-        EXPECT_EQ(Json::Value(c.sharing), req->GetEnv("HTTP_X_VELA_SHARING")) << c.query;
-        EXPECT_EQ(c.sharing[0] != '\0', req->IsSharing()) << c.query;
-    }
-}
-
-TEST_F(WebEntryInit, PostBodyOverridesQueryAndStdinIsClosedAfterIt)
+TEST_F(WebEntryInit, PostBodyOverridesQueryStdinIsClosedAfterItBadBodiesRefused)
 {
     Set("REQUEST_METHOD", "POST");
     Set("QUERY_STRING", "method=get&q=1");
@@ -241,11 +200,7 @@ TEST_F(WebEntryInit, PostBodyOverridesQueryAndStdinIsClosedAfterIt)
     EXPECT_TRUE(r["ok"].asBool()) << r;
     EXPECT_EQ(J(R"({"method": "set", "q": "1", "b": "x+y"})"), r["params"]);
     EXPECT_EQ(0, r["stdinLeft"].asInt());  // /dev/null, not the rest of the pipe
-}
 
-TEST_F(WebEntryInit, PostBodiesRefused)
-{
-    Set("REQUEST_METHOD", "POST");
     const struct {
         const char* length;
         std::string body;

@@ -137,24 +137,22 @@ void Stream(APIRequest* req, APIResponse* resp)
 // The ids and groups the handler runs with, and the method it serves.
 void Ids(APIRequest* req, APIResponse* resp)
 {
-    uid_t r, e, s;
-    gid_t rg, eg, sg;
-    if (getresuid(&r, &e, &s) != 0 || getresgid(&rg, &eg, &sg) != 0) {
+    uid_t u[3];
+    gid_t g[3];
+    if (getresuid(&u[0], &u[1], &u[2]) != 0 || getresgid(&g[0], &g[1], &g[2]) != 0) {
         resp->SetError(500);
         return;
     }
     Json::Value data(Json::objectValue);
-    for (uid_t id : {r, e, s}) {
-        data["uid"].append(static_cast<Json::UInt>(id));
-    }
-    for (gid_t id : {rg, eg, sg}) {
-        data["gid"].append(static_cast<Json::UInt>(id));
+    for (int i = 0; i < 3; ++i) {
+        data["uid"].append(static_cast<Json::UInt>(u[i]));
+        data["gid"].append(static_cast<Json::UInt>(g[i]));
     }
     std::vector<gid_t> groups(static_cast<size_t>(getgroups(0, nullptr)));
     groups.resize(static_cast<size_t>(getgroups(static_cast<int>(groups.size()), groups.data())));
     data["groups"] = Json::Value(Json::arrayValue);
-    for (gid_t g : groups) {
-        data["groups"].append(static_cast<Json::UInt>(g));
+    for (gid_t group : groups) {
+        data["groups"].append(static_cast<Json::UInt>(group));
     }
     data["method"] = req->GetAPIMethod();
     data["methodParam"] = req->GetParam("method", "");
