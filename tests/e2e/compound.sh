@@ -6,23 +6,14 @@
 # run by hiding it in a compound, in sequence or in parallel.
 #
 # usage: compound.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR
-# Exit 0 when every check passed, 1 otherwise, 77 (skipped) without the
-# tools or when not run as root.
 set -u
 
-[ $# -eq 4 ] || { echo "usage: compound.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR" >&2; exit 2; }
-VELASCGI=$(realpath -e "$1") || exit 1
-VELAADM=$(realpath -e "$2") || exit 1
-WEBAPI=$(realpath -e "$3") || exit 1
-SRC=$(realpath -e "$4") || exit 1
-
-. "$SRC/tests/e2e/server.sh"
-srv_require "velascgi switches to the identity each API asks for"
+. "$(dirname "$0")/server.sh"
+srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
+srv_require "velascgi switches to the identity each API asks for" python3
 srv_traps
-
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
-mkdir -p "$RUN/www"
-srv_start "$RUN/www" || { failures=1; exit 1; }
+srv_serve
 
 # "nobody" is an ordinary account on every Debian machine: not in the
 # administrators group. root is an administrator.
@@ -92,6 +83,4 @@ expect "129 calls" '"success":false' '"code":110'
 call --cookie "id=$USER_SID" --data "$ENTRY&compound=%7B%7D" "$URL"
 expect "compound not a list" '"success":false' '"code":110'
 
-srv_sanitizer_clean || fail "sanitizer reports in the logs"
-[ "$failures" -eq 0 ] && echo "compound: all checks passed"
-exit $((failures != 0))
+srv_finish "all compound checks passed ($URL)"
