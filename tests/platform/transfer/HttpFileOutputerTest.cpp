@@ -13,14 +13,10 @@
 #include <poll.h>
 #include <string>
 #include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 #include <vector>
 
-#include "platform/StateRootTest.h"
+#include "platform/PlatformTest.h"
 #include "platform/system/FileUtil.h"
-#include "support/TestSupport.h"
 #include "vela/httpoutput.h"
 
 namespace {
@@ -62,8 +58,8 @@ Reply Split(bool ok, const std::string& out)
     return r;
 }
 
-// Runs `fn` with standard output on a new file opened with `flags` (extra
-// open flags), in this process.
+// Runs `fn` with standard output on a new file in `dir` opened with `flags`
+// (extra open flags), in this process.
 Reply ToFile(const std::string& dir, const std::function<bool()>& fn, int flags = 0)
 {
     const std::string path = dir + "/stdout";
@@ -122,8 +118,6 @@ protected:
     {
         StateRootTest::SetUp();
         FileOutputerHelper::SetFastOutputEnabled(true);
-        mkdir((root_.Path() + "/etc").c_str(), 0755);
-        mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
         mkdir(files_.c_str(), 0755);
     }
     std::string Write(const std::string& name, const std::string& data)
@@ -131,6 +125,12 @@ protected:
         const std::string path = files_ + "/" + name;
         std::ofstream(path, std::ios::binary) << data;
         return path;
+    }
+    Reply ToFile(const std::function<bool()>& fn, int flags = 0) { return ::ToFile(root_.Path(), fn, flags); }
+    // The file at `path` sent with the MIME type `type`.
+    Reply Send(const std::string& path, const char* type = "")
+    {
+        return ToFile([&] { return out_.Output(path, type); });
     }
 
     ScopedEnv range_{"HTTP_RANGE", nullptr};
@@ -151,7 +151,7 @@ TEST_F(HttpOutput, WholeFileThroughPipeFileAndAppendOnlyFile)
         return out_.Output(path, "application/x-test");
     };
     // O_APPEND makes sendfile refuse the output: the read/write path runs.
-    for (const Reply& r : {ThroughPipe(send), ToFile(root_.Path(), send), ToFile(root_.Path(), send, O_APPEND)}) {
+    for (const Reply& r : {ThroughPipe(send), ToFile(send), ToFile(send, O_APPEND)}) {
         EXPECT_TRUE(r.ok);
         EXPECT_EQ(0u, r.head.find("X-From-Cout: 1\r\nX-From-Stdio: 2\r\n"));
         EXPECT_EQ("application/x-test", r.Header("Content-Type"));
@@ -163,7 +163,7 @@ TEST_F(HttpOutput, WholeFileThroughPipeFileAndAppendOnlyFile)
     }
 
     ScopedEnv head("REQUEST_METHOD", "HEAD");
-    const Reply r = ToFile(root_.Path(), [&] { return out_.Output(path, ""); });
+    const Reply r = Send(path);
     EXPECT_TRUE(r.ok && r.complete);
     EXPECT_EQ(std::to_string(data.size()), r.Header("Content-Length"));
     EXPECT_EQ("application/octet-stream", r.Header("Content-Type"));
@@ -222,7 +222,7 @@ TEST_F(HttpOutput, StreamsWithoutALength)
     ScopedEnv head("REQUEST_METHOD", "HEAD");
     FILE* stream = popen("echo generated", "r");
     ASSERT_NE(nullptr, stream);
-    const Reply r = ToFile(root_.Path(), [&] { return out_.Output(stream, "", ""); });
+    const Reply r = ToFile([&] { return out_.Output(stream, "", ""); });
     pclose(stream);
     EXPECT_TRUE(r.ok && r.complete);
     EXPECT_EQ("application/octet-stream", r.Header("Content-Type"));
@@ -249,7 +249,7 @@ TEST_F(HttpOutput, SingleRanges)
     };
     for (const Case& c : cases) {
         ScopedEnv range("HTTP_RANGE", c.range);
-        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(path, "text/plain"); });
+        const Reply r = Send(path, "text/plain");
         EXPECT_TRUE(r.ok && r.complete) << c.range;
         if (c.status == 416) {
             EXPECT_EQ("416 Range Not Satisfiable", r.Header("Status")) << c.range;
@@ -268,27 +268,20 @@ TEST_F(HttpOutput, SingleRanges)
 
     // If-Range: only the date the file was sent with keeps the range.
     ScopedEnv range("HTTP_RANGE", "bytes=0-9");
-    const std::string modified = ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).Header("Last-Modified");
+    const std::string modified = Send(path).Header("Last-Modified");
     ASSERT_NE("", modified);
-    {
-        ScopedEnv ifRange("HTTP_IF_RANGE", modified.c_str());
-        EXPECT_EQ(10u, ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).body.size());
+    for (const auto& ifRange :
+         {std::make_pair(modified, size_t{10}), std::make_pair(std::string("\"some-etag\""), data.size())}) {
+        ScopedEnv env("HTTP_IF_RANGE", ifRange.first.c_str());
+        EXPECT_EQ(ifRange.second, Send(path).body.size()) << ifRange.first;
     }
-    {
-        ScopedEnv ifRange("HTTP_IF_RANGE", "\"some-etag\"");
-        EXPECT_EQ(data.size(), ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).body.size());
-    }
-
-    const std::string empty = Write("empty", "");
-    EXPECT_EQ("bytes */0", ToFile(root_.Path(), [&] { return out_.Output(empty, ""); }).Header("Content-Range"));
+    EXPECT_EQ("bytes */0", Send(Write("empty", "")).Header("Content-Range"));
 }
 
-// A directory whose every ancestor only root or this account may change, as
-// a build directory normally is (CTest passes it), unlike $TMPDIR: the
-// place where X-Sendfile may be used at all.
-// A directory only root may change, whatever the checkout's place: /run
-// when it is root's alone (the checkout may sit below /tmp, which anyone
-// may write to), else the build directory.
+// A directory only root may change, the place where X-Sendfile may be used at
+// all, whatever the checkout's place: /run when it is root's alone (the
+// checkout may sit below /tmp, which anyone may write to), else the build
+// directory.
 const char* ServerOnlyBase()
 {
     struct stat st;
@@ -308,14 +301,6 @@ private:
     VELA::Test::TempDir dir_;
 };
 
-std::string RealPath(const std::string& path)
-{
-    char* real = realpath(path.c_str(), nullptr);
-    const std::string out = real != nullptr ? real : "";
-    free(real);
-    return out;
-}
-
 TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
 {
     ASSERT_NE(nullptr, getenv("VELA_TEST_BINARY_DIR")) << "run through CTest";
@@ -327,7 +312,7 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     chmod(path.c_str(), 0644);
     ASSERT_FALSE(FileOutputerHelper::IsFastOutputEnabled());  // nothing configured
 
-    std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << "xsendfile=\"YES\"\n";
+    Conf("webapi.conf", "xsendfile=\"YES\"\n");
     VELA::Test::TempDir other;  // another root: the configuration is read again
     {
         ScopedEnv root("VELA_ROOT", other.Path().c_str());
@@ -336,9 +321,10 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     }
     VELA::System::RootReset();
     ASSERT_TRUE(FileOutputerHelper::IsFastOutputEnabled());
-    std::string expected = RealPath(dir);
-    ASSERT_NE("", expected);
-    expected += "/a%20b%25c.txt";
+    char* real = realpath(dir.c_str(), nullptr);
+    ASSERT_NE(nullptr, real);
+    const std::string expected = std::string(real) + "/a%20b%25c.txt";
+    free(real);
     const int fd = open(path.c_str(), O_RDONLY);
     ASSERT_GE(fd, 0);
     const std::function<bool()> byServer[] = {
@@ -347,7 +333,7 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
         [&] { return out_.Output(fd, "a b%c.txt", "text/plain"); },
     };
     for (const auto& call : byServer) {
-        const Reply r = ToFile(root_.Path(), call);
+        const Reply r = ToFile(call);
         EXPECT_TRUE(r.ok && r.complete);
         EXPECT_EQ(expected, r.Header("X-Sendfile"));
         EXPECT_EQ("text/plain", r.Header("Content-Type"));
@@ -386,7 +372,7 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     }
     for (const std::string& file : streamed) {
         VELA::Test::LogCapture log;
-        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(file, "text/plain"); });
+        const Reply r = Send(file, "text/plain");
         EXPECT_TRUE(r.ok) << file;
         EXPECT_EQ("", r.Header("X-Sendfile")) << file;
         EXPECT_EQ("", r.Header("X-Injected")) << file;
@@ -403,21 +389,21 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     ASSERT_GE(mine, 0);
     ASSERT_EQ(0, symlink(path.c_str(), (dir + "/link").c_str()));
     ASSERT_EQ(0, rename((dir + "/link").c_str(), swapped.c_str()));
-    const Reply kept = ToFile(root_.Path(), [&] { return out_.Output(mine, "swapped.txt", ""); });
+    const Reply kept = ToFile([&] { return out_.Output(mine, "swapped.txt", ""); });
     close(mine);
     EXPECT_EQ("", kept.Header("X-Sendfile"));
     EXPECT_EQ("mine", kept.body);
 
     FILE* file = fopen(path.c_str(), "r");
     ASSERT_NE(nullptr, file);
-    const Reply stream = ToFile(root_.Path(), [&] { return out_.Output(file, "f", ""); });
+    const Reply stream = ToFile([&] { return out_.Output(file, "f", ""); });
     fclose(file);
     EXPECT_EQ("", stream.Header("X-Sendfile"));
     EXPECT_EQ("content", stream.body);
 
     FileOutputerHelper::SetFastOutputEnabled(false);
     EXPECT_FALSE(FileOutputerHelper::IsFastOutputEnabled());
-    const Reply direct = ToFile(root_.Path(), [&] { return out_.Output(path, ""); });
+    const Reply direct = Send(path);
     EXPECT_EQ("", direct.Header("X-Sendfile"));
     EXPECT_EQ("content", direct.body);
 }
@@ -437,7 +423,7 @@ TEST_F(HttpOutput, SymbolicLinksOnThePathAreRefused)
 
     for (const std::string& link : {files_ + "/last", files_ + "/middle/in.txt", files_ + "/relative/in.txt"}) {
         VELA::Test::LogCapture log;
-        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(link, ""); });
+        const Reply r = Send(link);
         EXPECT_FALSE(r.ok) << link;
         EXPECT_EQ("", r.head) << link;
         EXPECT_TRUE(log.Contains("symbolic link")) << link;
@@ -445,8 +431,8 @@ TEST_F(HttpOutput, SymbolicLinksOnThePathAreRefused)
 
     // A caller that trusts its links may have them followed.
     out_.SetFollowSymlinks(true);
-    EXPECT_EQ("secret", ToFile(root_.Path(), [&] { return out_.Output(files_ + "/last", ""); }).body);
-    EXPECT_EQ("in", ToFile(root_.Path(), [&] { return out_.Output(files_ + "/middle/in.txt", ""); }).body);
+    EXPECT_EQ("secret", Send(files_ + "/last").body);
+    EXPECT_EQ("in", Send(files_ + "/middle/in.txt").body);
 }
 
 TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
@@ -483,7 +469,7 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
         [&] { return out_.Output(-1, "n", ""); },
     };
     for (const auto& call : calls) {
-        const Reply r = ToFile(root_.Path(), call);
+        const Reply r = ToFile(call);
         EXPECT_FALSE(r.ok);
         EXPECT_EQ("", r.head);
     }
@@ -516,17 +502,16 @@ TEST_F(HttpOutput, DispositionNamesAreSafe)
     FILE* file = fopen(path.c_str(), "r");
     ASSERT_NE(nullptr, file);
     for (const Case& c : cases) {
-        const Reply r = ToFile(root_.Path(), [&] { return out_.Output(file, c.name, ""); });
+        const Reply r = ToFile([&] { return out_.Output(file, c.name, ""); });
         EXPECT_TRUE(r.ok);
         EXPECT_EQ(c.value, r.Header("Content-Disposition"));
         EXPECT_EQ("x", r.body);
     }
     fclose(file);
 
-    EXPECT_EQ("attachment; filename=\"data\"; filename*=UTF-8''data",
-              ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).Header("Content-Disposition"));
+    EXPECT_EQ("attachment; filename=\"data\"; filename*=UTF-8''data", Send(path).Header("Content-Disposition"));
     out_.SetWriteDisposition(false);
-    EXPECT_EQ("", ToFile(root_.Path(), [&] { return out_.Output(path, ""); }).Header("Content-Disposition"));
+    EXPECT_EQ("", Send(path).Header("Content-Disposition"));
 }
 
 TEST_F(HttpOutput, ClientGoneIsAFailureNotACrash)
