@@ -1,16 +1,10 @@
 // File helpers of the platform: opening a path without following any
 // symbolic link on it.
-#include <gtest/gtest.h>
-
 #include <cerrno>
 #include <fcntl.h>
-#include <fstream>
-#include <string>
-#include <sys/stat.h>
-#include <unistd.h>
 
+#include "platform/PlatformTest.h"
 #include "platform/system/FileUtil.h"
-#include "support/TestSupport.h"
 
 namespace {
 

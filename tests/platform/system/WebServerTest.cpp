@@ -1,17 +1,10 @@
 // Web-server restart: the signal reaches only a process that the pid file
 // names and that carries the configured name.
-#include <gtest/gtest.h>
 
 #include <csignal>
-#include <fstream>
-#include <string>
 #include <sys/prctl.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include "platform/StateRootTest.h"
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 #include "vela/webserver.h"
 
 namespace {
@@ -70,23 +63,17 @@ private:
     sigset_t old_;
 };
 
-class WebServer : public StateRootTest {
+class WebServer : public RootTest {
 protected:
-    void SetUp() override
+    WebServer()
     {
-        StateRootTest::SetUp();
-        mkdir((root_.Path() + "/etc").c_str(), 0755);
-        mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
-        mkdir((root_.Path() + "/run").c_str(), 0755);
-        Conf(std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/test.pid\"\n");
+        mkdir(In("/run").c_str(), 0755);
+        Conf("webapi.conf", std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/test.pid\"\n");
     }
-    void Conf(const std::string& text) { std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << text; }
     void PidFile(const std::string& text, mode_t mode = 0644)
     {
-        const std::string path = root_.Path() + "/run/test.pid";
-        unlink(path.c_str());
-        std::ofstream(path) << text;
-        chmod(path.c_str(), mode);
+        unlink(In("/run/test.pid").c_str());
+        VELA::Test::WriteFile(In("/run/test.pid"), text, mode);
     }
     bool Restart()
     {
@@ -115,7 +102,7 @@ TEST_F(WebServer, RefusesUntrustworthyPidFilesAndConfiguration)
 {
     Child server(kServerName);
     const std::string pid = std::to_string(server.Pid());
-    pid_t gone = fork();
+    const pid_t gone = fork();
     if (gone == 0) {
         _exit(0);
     }
@@ -129,16 +116,15 @@ TEST_F(WebServer, RefusesUntrustworthyPidFilesAndConfiguration)
     PidFile(pid, 0666);  // anyone could have written it
     EXPECT_FALSE(Restart());
     PidFile(pid);
-    const std::string link = root_.Path() + "/run/link.pid";
-    ASSERT_EQ(0, symlink((root_.Path() + "/run/test.pid").c_str(), link.c_str()));
-    Conf(std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/link.pid\"\n");
+    ASSERT_EQ(0, symlink(In("/run/test.pid").c_str(), In("/run/link.pid").c_str()));
+    Conf("webapi.conf", std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/link.pid\"\n");
     EXPECT_FALSE(Restart());
     for (const char* bad : {"httpd_name=\"a/b\"\nhttpd_pidfile=\"/run/test.pid\"\n",
                             "httpd_name=\"velatesthttpd\"\nhttpd_pidfile=\"run/test.pid\"\n",
                             "httpd_name=\"velatesthttpd\"\nhttpd_pidfile=\"/run/../run/test.pid\"\n",
                             "httpd_name=\"velatesthttpd\"\nhttpd_pidfile=\"/run/test.pid\"\nhttpd_restart_signal=KILL\n",
                             "httpd_name=\"unterminated\n"}) {
-        Conf(bad);
+        Conf("webapi.conf", bad);
         velaw3::Engine engine;
         EXPECT_FALSE(engine.IsValid()) << bad;
         EXPECT_FALSE(velaw3::TARN(engine).RestartService()) << bad;
