@@ -2,18 +2,13 @@
 // byte ranges, X-Sendfile only for paths nobody else can change, links on
 // the path refused, refusals, the disposition header, a client that goes
 // away.
-#include <gtest/gtest.h>
 
 #include <csignal>
 #include <cstdio>
 #include <fcntl.h>
-#include <fstream>
-#include <functional>
 #include <iostream>
 #include <poll.h>
-#include <string>
 #include <sys/socket.h>
-#include <vector>
 
 #include "platform/PlatformTest.h"
 #include "platform/system/FileUtil.h"

@@ -2,17 +2,11 @@
 // that look like delimiters, and the reader run over a memfd or a pipe.
 #pragma once
 
-#include <gtest/gtest.h>
-
-#include <string>
 #include <sys/mman.h>
 #include <thread>
-#include <unistd.h>
-#include <utility>
-#include <vector>
 
+#include "platform/PlatformTest.h"
 #include "vela/upload.h"
-#include "vela/vlibc.h"
 
 namespace VELA {
 namespace Test {
