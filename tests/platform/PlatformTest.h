@@ -98,6 +98,7 @@ public:
             pids_.push_back(pid);
         }
     }
+    pid_t Pid(size_t i) const { return pids_[i]; }
     // Waits for them all: their exit codes, 128 + the signal for a child a
     // signal ended, -1 for one that could not be forked.
     std::vector<int> Wait()

@@ -1,11 +1,7 @@
 // The CGI handle: cookies, the client address and the fail-closed session
 // calls.
-#include <gtest/gtest.h>
-
-#include <string>
 
 #include "platform/PlatformTest.h"
-#include "vela/cgi.h"
 
 namespace {
 

@@ -1,12 +1,7 @@
 // VelaCgiDetectAndDecryptParamLine: plain lines pass unchanged, malformed
 // ones are refused, a line encrypted as a whole is decrypted.
-#include <gtest/gtest.h>
-
-#include <string>
-
 #include "platform/session/CryptoTestUtil.h"
 #include "support/LinearTime.h"
-#include "vela/cgi.h"
 #include "vela/webapiutil.h"
 
 using VELA::Test::LogCapture;

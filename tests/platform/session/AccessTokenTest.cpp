@@ -1,11 +1,6 @@
 // Access tokens against real files under a temporary VELA_ROOT: grants,
 // patterns, expiry, users that went away, hostile tokens, corrupt files,
 // listing and revocation.
-#include <gtest/gtest.h>
-
-#include <fstream>
-#include <string>
-#include <vector>
 
 #include "platform/PlatformTest.h"
 #include "vela/token.h"

@@ -6,21 +6,15 @@
 // the openssl command-line tool, AES-GCM with libcrypto's encryption calls
 // (opened here with dlopen, since this program must not link libcrypto) and
 // one vector computed once with another implementation.
-#include <gtest/gtest.h>
-
-#include <openssl/evp.h>  // types only: this program does not link libcrypto
-
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <dlfcn.h>
+#include <openssl/evp.h>  // types only: this program does not link libcrypto
 #include <sstream>
-#include <string>
-#include <vector>
 
 #include "platform/session/CryptoTestUtil.h"
 #include "support/JsonLiteral.h"
-#include "vela/cgi.h"
 #include "webapi/APIRequest.h"
 #include "webapi/JsonUtil.h"
 

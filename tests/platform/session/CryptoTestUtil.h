@@ -3,17 +3,9 @@
 // openssl command.
 #pragma once
 
-#include <gtest/gtest.h>
-
 #include <fcntl.h>
-#include <string>
-#include <sys/wait.h>
-#include <unistd.h>
-#include <utility>
-#include <vector>
 
 #include "platform/PlatformTest.h"
-#include "support/TestSupport.h"
 
 namespace VELA {
 namespace Test {

@@ -5,11 +5,8 @@
 // the purge and the bound of the store, parallel processes, and the
 // settings file. "daemon" and "bin" are accounts every machine has; the
 // other names are no accounts.
-#include <gtest/gtest.h>
 
 #include <numeric>
-#include <string>
-#include <vector>
 
 #include "platform/PlatformTest.h"
 #include "vela/log.h"

@@ -1,16 +1,7 @@
 // The server's key pair for encrypted parameters: created on first use with
 // private modes, once however many processes ask at the same time, never
 // by a decryption, and an unusable key refused and kept as it is.
-#include <gtest/gtest.h>
-
-#include <fstream>
-#include <set>
-#include <string>
-#include <unistd.h>
-#include <vector>
-
 #include "platform/session/CryptoTestUtil.h"
-#include "vela/cgi.h"
 
 namespace {
 

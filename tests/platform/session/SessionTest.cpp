@@ -1,17 +1,11 @@
 // Login sessions against real files under a temporary VELA_ROOT: every
 // verdict of VelaCgiIsAuthorizedEx, hostile ids, corrupt files, clock steps,
 // concurrent processes, and the calls that read the same session.
-#include <gtest/gtest.h>
 
 #include <cstring>
-#include <fstream>
 #include <pwd.h>
-#include <string>
-#include <utility>
-#include <vector>
 
 #include "platform/PlatformTest.h"
-#include "vela/session.h"
 #include "vela/webapiutil.h"
 
 namespace {
