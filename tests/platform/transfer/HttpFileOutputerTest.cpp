@@ -53,49 +53,24 @@ Reply Split(bool ok, const std::string& out)
     return r;
 }
 
-// Runs `fn` with standard output on a new file in `dir` opened with `flags`
-// (extra open flags), in this process.
-Reply ToFile(const std::string& dir, const std::function<bool()>& fn, int flags = 0)
-{
-    const std::string path = dir + "/stdout";
-    const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | flags, 0600);
-    EXPECT_GE(fd, 0);
-    fflush(stdout);
-    const int saved = dup(1);
-    dup2(fd, 1);
-    close(fd);
-    const bool ok = fn();
-    fflush(stdout);
-    dup2(saved, 1);
-    close(saved);
-    return Split(ok, VELA::Test::ReadText(path));
-}
-
 // Runs `fn` in a child whose standard output is a pipe read by this
 // process.
 Reply ThroughPipe(const std::function<bool()>& fn)
 {
     int fds[2];
     EXPECT_EQ(0, pipe(fds));
-    fflush(stdout);
-    const pid_t pid = fork();
-    if (pid == 0) {
-        close(fds[0]);
+    VELA::Test::Children child(1, [&](int) {
         dup2(fds[1], 1);
-        close(fds[1]);
-        _exit(fn() ? 0 : 1);
-    }
+        return fn() ? 0 : 1;
+    });
     close(fds[1]);
     std::string out;
     char buf[65536];
-    ssize_t n;
-    while ((n = read(fds[0], buf, sizeof(buf))) > 0) {
+    for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;) {
         out.append(buf, static_cast<size_t>(n));
     }
     close(fds[0]);
-    int status = 0;
-    waitpid(pid, &status, 0);
-    return Split(WIFEXITED(status) && WEXITSTATUS(status) == 0, out);
+    return Split(child.Wait() == std::vector<int>{0}, out);
 }
 
 std::string Pattern(size_t size)
@@ -121,7 +96,23 @@ protected:
         std::ofstream(path, std::ios::binary) << data;
         return path;
     }
-    Reply ToFile(const std::function<bool()>& fn, int flags = 0) { return ::ToFile(root_.Path(), fn, flags); }
+    // Runs `fn` with standard output on a new file opened with `flags` (extra
+    // open flags), in this process.
+    Reply ToFile(const std::function<bool()>& fn, int flags = 0)
+    {
+        const std::string path = In("/stdout");
+        const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | flags, 0600);
+        EXPECT_GE(fd, 0);
+        fflush(stdout);
+        const int saved = dup(1);
+        dup2(fd, 1);
+        close(fd);
+        const bool ok = fn();
+        fflush(stdout);
+        dup2(saved, 1);
+        close(saved);
+        return Split(ok, VELA::Test::ReadText(path));
+    }
     // The file at `path` sent with the MIME type `type`.
     Reply Send(const std::string& path, const char* type = "")
     {
@@ -181,14 +172,10 @@ TEST_F(HttpOutput, StreamsWithoutALength)
     for (const auto& kind : kinds) {
         int fds[2];
         ASSERT_EQ(0, kind.domain < 0 ? pipe(fds) : socketpair(kind.domain, SOCK_STREAM, 0, fds)) << kind.what;
-        fflush(stdout);
-        const pid_t writer = fork();
-        ASSERT_GE(writer, 0);
-        if (writer == 0) {
+        VELA::Test::Children writer(1, [&](int) {
             close(fds[0]);
-            const bool sent = VELA::System::WriteAll(fds[1], data.data(), data.size());
-            _exit(sent ? 0 : 1);
-        }
+            return VELA::System::WriteAll(fds[1], data.data(), data.size()) ? 0 : 1;
+        });
         close(fds[1]);
         if (kind.nonBlocking) {
             ASSERT_EQ(0, fcntl(fds[0], F_SETFL, fcntl(fds[0], F_GETFL) | O_NONBLOCK));
@@ -200,8 +187,7 @@ TEST_F(HttpOutput, StreamsWithoutALength)
         ASSERT_EQ(data[0], static_cast<char>(fgetc(stream)));  // the rest of a buffer is left in the stream
         const Reply r = ThroughPipe([&] { return out_.Output(stream, "made.tar", "application/x-tar"); });
         fclose(stream);
-        int status = 0;
-        EXPECT_EQ(writer, waitpid(writer, &status, 0));
+        writer.Wait();
         EXPECT_TRUE(r.ok) << kind.what;
         EXPECT_EQ("application/x-tar", r.Header("Content-Type")) << kind.what;
         EXPECT_EQ("attachment; filename=\"made.tar\"; filename*=UTF-8''made.tar", r.Header("Content-Disposition"));
@@ -403,35 +389,17 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     EXPECT_EQ("content", direct.body);
 }
 
-// A link anywhere on the path, the last component or a directory on the
-// way, is refused before anything is written (how the path is opened:
-// FileUtilTest.cpp).
-TEST_F(HttpOutput, SymbolicLinksOnThePathAreRefused)
+// What is not a regular file is refused before anything is written, and so
+// is a link anywhere on the path, the last component or a directory on the
+// way (how the path is opened: FileUtilTest.cpp).
+TEST_F(HttpOutput, RefusesLinksAndWhatIsNotARegularFile)
 {
     const std::string target = Write("target.txt", "secret");
     mkdir((files_ + "/dir").c_str(), 0755);
-    const std::string inDir = files_ + "/dir/in.txt";
-    std::ofstream(inDir) << "in";
+    std::ofstream(files_ + "/dir/in.txt") << "in";
     ASSERT_EQ(0, symlink(target.c_str(), (files_ + "/last").c_str()));
     ASSERT_EQ(0, symlink((files_ + "/dir").c_str(), (files_ + "/middle").c_str()));
     ASSERT_EQ(0, symlink("dir", (files_ + "/relative").c_str()));
-
-    for (const std::string& link : {files_ + "/last", files_ + "/middle/in.txt", files_ + "/relative/in.txt"}) {
-        VELA::Test::LogCapture log;
-        const Reply r = Send(link);
-        EXPECT_FALSE(r.ok) << link;
-        EXPECT_EQ("", r.head) << link;
-        EXPECT_TRUE(log.Contains("symbolic link")) << link;
-    }
-
-    // A caller that trusts its links may have them followed.
-    out_.SetFollowSymlinks(true);
-    EXPECT_EQ("secret", Send(files_ + "/last").body);
-    EXPECT_EQ("in", Send(files_ + "/middle/in.txt").body);
-}
-
-TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
-{
     const std::string fifo = files_ + "/fifo";
     ASSERT_EQ(0, mkfifo(fifo.c_str(), 0600));
     FILE* writeOnly = fopen((files_ + "/w").c_str(), "w");
@@ -439,9 +407,7 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
     const int dirFd = open(files_.c_str(), O_RDONLY | O_DIRECTORY);
     const int fifoFd = open(fifo.c_str(), O_RDONLY | O_NONBLOCK);
     const int pathFd = open((files_ + "/w").c_str(), O_PATH);  // names a file, cannot read it
-    ASSERT_GE(dirFd, 0);
-    ASSERT_GE(fifoFd, 0);
-    ASSERT_GE(pathFd, 0);
+    ASSERT_TRUE(dirFd >= 0 && fifoFd >= 0 && pathFd >= 0);
     FILE* dirStream = fdopen(dup(dirFd), "r");
     ASSERT_NE(nullptr, dirStream);
     for (const std::string& path : {files_, fifo}) {
@@ -449,30 +415,43 @@ TEST_F(HttpOutput, RefusesWhatIsNotARegularFile)
         EXPECT_EQ(-1, HTTPFileOutputer::OpenForOutput(path)) << path;
         EXPECT_EQ(EINVAL, errno) << path;
     }
-    const std::function<bool()> calls[] = {
-        [&] { return out_.Output(files_, ""); },
-        [&] { return out_.Output(fifo, ""); },  // must not wait for a writer
-        [&] { return out_.Output(files_ + "/missing", ""); },
-        [&] { return out_.Output(std::string("a\0b", 3), ""); },
-        [&] { return out_.Output(static_cast<FILE*>(nullptr), "n", ""); },
-        [&] { return out_.Output(dirStream, "n", ""); },
-        [&] { return out_.Output(writeOnly, "n", ""); },
-        [&] { return out_.Output(dirFd, "n", ""); },
-        [&] { return out_.Output(fifoFd, "n", ""); },
-        [&] { return out_.Output(fileno(writeOnly), "n", ""); },
-        [&] { return out_.Output(pathFd, "n", ""); },
-        [&] { return out_.Output(-1, "n", ""); },
+    const struct {
+        const char* logged;  // a log line the refusal writes, or null
+        std::function<bool()> call;
+    } calls[] = {
+        {"symbolic link", [&] { return out_.Output(files_ + "/last", ""); }},
+        {"symbolic link", [&] { return out_.Output(files_ + "/middle/in.txt", ""); }},
+        {"symbolic link", [&] { return out_.Output(files_ + "/relative/in.txt", ""); }},
+        {nullptr, [&] { return out_.Output(files_, ""); }},
+        {nullptr, [&] { return out_.Output(fifo, ""); }},  // must not wait for a writer
+        {nullptr, [&] { return out_.Output(files_ + "/missing", ""); }},
+        {nullptr, [&] { return out_.Output(std::string("a\0b", 3), ""); }},
+        {nullptr, [&] { return out_.Output(static_cast<FILE*>(nullptr), "n", ""); }},
+        {nullptr, [&] { return out_.Output(dirStream, "n", ""); }},
+        {nullptr, [&] { return out_.Output(writeOnly, "n", ""); }},
+        {nullptr, [&] { return out_.Output(dirFd, "n", ""); }},
+        {nullptr, [&] { return out_.Output(fifoFd, "n", ""); }},
+        {nullptr, [&] { return out_.Output(fileno(writeOnly), "n", ""); }},
+        {nullptr, [&] { return out_.Output(pathFd, "n", ""); }},
+        {nullptr, [&] { return out_.Output(-1, "n", ""); }},
     };
-    for (const auto& call : calls) {
-        const Reply r = ToFile(call);
-        EXPECT_FALSE(r.ok);
-        EXPECT_EQ("", r.head);
+    for (size_t i = 0; i < sizeof(calls) / sizeof(calls[0]); ++i) {
+        VELA::Test::LogCapture log;
+        const Reply r = ToFile(calls[i].call);
+        EXPECT_FALSE(r.ok) << "call " << i;
+        EXPECT_EQ("", r.head) << "call " << i;
+        EXPECT_TRUE(calls[i].logged == nullptr || log.Contains(calls[i].logged)) << "call " << i;
     }
     fclose(dirStream);
     fclose(writeOnly);
-    close(dirFd);
-    close(fifoFd);
-    close(pathFd);
+    for (int fd : {dirFd, fifoFd, pathFd}) {
+        close(fd);
+    }
+
+    // A caller that trusts its links may have them followed.
+    out_.SetFollowSymlinks(true);
+    EXPECT_EQ("secret", Send(files_ + "/last").body);
+    EXPECT_EQ("in", Send(files_ + "/middle/in.txt").body);
 }
 
 TEST_F(HttpOutput, DispositionNamesAreSafe)
@@ -515,24 +494,17 @@ TEST_F(HttpOutput, ClientGoneIsAFailureNotACrash)
     int fds[2];
     ASSERT_EQ(0, pipe(fds));
     close(fds[0]);  // nobody reads
-    fflush(stdout);
-    const pid_t pid = fork();
-    if (pid == 0) {
-        dup2(fds[1], 1);
-        close(fds[1]);
-        const bool ok = out_.Output(path, "");
-        sigset_t mask;
-        sigprocmask(SIG_SETMASK, nullptr, &mask);
-        sigset_t pending;
-        sigpending(&pending);
-        // 2: the call failed and left SIGPIPE neither blocked nor pending.
-        _exit(!ok && !sigismember(&mask, SIGPIPE) && !sigismember(&pending, SIGPIPE) ? 2 : 1);
-    }
+    // 2: the call failed and left SIGPIPE neither blocked nor pending (128 +
+    // the signal: it killed the process).
+    EXPECT_EQ(std::vector<int>{2}, VELA::Test::InChildren(1, [&](int) {
+                  dup2(fds[1], 1);
+                  const bool ok = out_.Output(path, "");
+                  sigset_t mask, pending;
+                  sigprocmask(SIG_SETMASK, nullptr, &mask);
+                  sigpending(&pending);
+                  return !ok && !sigismember(&mask, SIGPIPE) && !sigismember(&pending, SIGPIPE) ? 2 : 1;
+              }));
     close(fds[1]);
-    int status = 0;
-    ASSERT_EQ(pid, waitpid(pid, &status, 0));
-    ASSERT_TRUE(WIFEXITED(status)) << "killed by signal " << WTERMSIG(status);
-    EXPECT_EQ(2, WEXITSTATUS(status));
 }
 
 }  // namespace
