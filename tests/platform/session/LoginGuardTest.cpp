@@ -215,13 +215,9 @@ TEST_F(LoginGuard, ExpiredRecordsArePurgedAndTheStoreIsBounded)
     EXPECT_EQ(20u, Records("addr-"));
     Now() += 10 * 60;  // the window has passed for all of them
     EXPECT_EQ(kAllow, Fail("x", "192.0.2.99"));
-    EXPECT_EQ(std::vector<std::string>({".lock", "addr-"}), [this] {
-        std::vector<std::string> kinds;
-        for (const std::string& name : DirEntries(GuardDir())) {
-            kinds.push_back(name.substr(0, 5));
-        }
-        return kinds;
-    }());
+    EXPECT_EQ(2u, DirEntries(GuardDir()).size());  // the lock and one address record
+    EXPECT_EQ(1u, Records(".lock"));
+    EXPECT_EQ(1u, Records("addr-"));
 
     settings_.maxRecords = 3;
     for (int i = 0; i < 3; ++i) {
@@ -240,9 +236,8 @@ TEST_F(LoginGuard, ExpiredRecordsArePurgedAndTheStoreIsBounded)
     for (int i = 0; i < 3; ++i) {
         EXPECT_EQ(kAllow, Fail("daemon", ("203.0.113." + std::to_string(i)).c_str())) << i;
     }
-    EXPECT_EQ(kBlocked, Try("daemon", "203.0.113.9"));
-    EXPECT_EQ(kAllow, Try("daemon", "198.51.100.2"));
-    EXPECT_EQ(kBlocked, Try("bin", "198.51.100.1"));
+    Run({{'T', "daemon", "203.0.113.9", kBlocked}, {'T', "daemon", "198.51.100.2", kAllow},
+         {'T', "bin", "198.51.100.1", kBlocked}});
     EXPECT_EQ(3u, Records("addr-"));
     Now() += 15 * 60;  // everything expired: new addresses are tracked again
     EXPECT_EQ(kAllow, Fail("x", "203.0.113.1"));
