@@ -8,8 +8,7 @@
 
 namespace {
 
-using VELA::Test::LogCapture;
-using VELA::Test::ReadText;
+using namespace VELA::Test;
 
 class AccessTokenTest : public StateRootTest {
 protected:
@@ -54,8 +53,8 @@ TEST_F(AccessTokenTest, CreateWritesPrivateFile)
     std::string id;
     const std::string token = Create({"VELA.Demo.*"}, {"get*", "list"}, 3600, "root", &id);
     EXPECT_EQ('.', token[VELA_TOKEN_ID_LEN]);
-    EXPECT_EQ(0700u, VELA::Test::Mode(Dir()));
-    EXPECT_EQ(0600u, VELA::Test::Mode(File(id)));
+    EXPECT_EQ(0700u, Mode(Dir()));
+    EXPECT_EQ(0600u, Mode(File(id)));
 
     Json::Value doc;
     ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(File(id), doc));
@@ -154,7 +153,7 @@ TEST_F(AccessTokenTest, CreateRefusesBadInput)
     EXPECT_EQ(-1, VelaAccessTokenCreate(nullptr, {"*"}, {"*"}, 0, token, id));
     EXPECT_EQ(-1, VelaAccessTokenCreate("a/b", {"*"}, {"*"}, 0, token, id));
     EXPECT_TRUE(token.empty());
-    EXPECT_TRUE(VELA::Test::DirEntries(Dir()).empty());
+    EXPECT_TRUE(DirEntries(Dir()).empty());
 }
 
 TEST_F(AccessTokenTest, HostileTokensTouchNothing)
@@ -162,7 +161,7 @@ TEST_F(AccessTokenTest, HostileTokensTouchNothing)
     std::string id;
     const std::string token = Create({"*"}, {"*"}, 0, "root", &id);
     std::ofstream(root_.Path() + "/x") << "outside";
-    const auto before = VELA::Test::Tree(root_.Path());
+    const auto before = Tree(root_.Path());
 
     std::string wrongSecret = token;
     wrongSecret.back() = wrongSecret.back() == 'A' ? 'B' : 'A';
@@ -187,7 +186,7 @@ TEST_F(AccessTokenTest, HostileTokensTouchNothing)
     EXPECT_EQ(-2, VelaAccessTokenRevoke(nullptr));
     EXPECT_TRUE(log_.Contains("malformed token"));
 
-    EXPECT_EQ(before, VELA::Test::Tree(root_.Path()));
+    EXPECT_EQ(before, Tree(root_.Path()));
     EXPECT_EQ(0, Grant(token, "VELA.Demo", "get"));
 }
 
@@ -207,11 +206,11 @@ TEST_F(AccessTokenTest, CorruptFilesGrantNothing)
     for (const char* key : {"version", "id", "secret", "user", "apis", "methods", "created", "expires"}) {
         changes.push_back({key, Json::Value()});
     }
-    for (const std::string& text : VELA::Test::JsonVariants(doc, changes)) {
+    for (const std::string& text : JsonVariants(doc, changes)) {
         bad.push_back(text);
     }
     for (const std::string& text : bad) {
-        VELA::Test::WriteFile(File(id), text, 0600);
+        WriteFile(File(id), text, 0600);
         EXPECT_EQ(-1, Grant(token, "VELA.Demo", "get")) << text;
         EXPECT_EQ(text, ReadText(File(id)));
     }

@@ -6,6 +6,7 @@
 // settings file. "daemon" and "bin" are accounts every machine has; the
 // other names are no accounts.
 
+#include <algorithm>
 #include <numeric>
 
 #include "platform/PlatformTest.h"
@@ -104,11 +105,9 @@ TEST_F(LoginGuard, OwnerIsNeverLockedOutByOtherAddresses)
     // Accounts ignore ASCII case; the count is logged once it reaches the limit.
     EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE,
               log.PriorityOf({"failures for account \"daemon\" reached 3", "the last from 192.0.2.66"}));
-    size_t notices = 0;
-    for (const std::string& line : log.Lines()) {
-        notices += line.find("failures for account") != std::string::npos ? 1 : 0;
-    }
-    EXPECT_EQ(1u, notices) << "logged once, not at every failure after";
+    EXPECT_EQ(1, std::count_if(log.Lines().begin(), log.Lines().end(), [](const std::string& line) {
+                  return line.find("failures for account") != std::string::npos;
+              })) << "logged once, not at every failure after";
 }
 
 TEST_F(LoginGuard, LimitPerAddressForAnyAccount)

@@ -10,11 +10,9 @@
 
 namespace {
 
+using namespace VELA::Test;
 using VELA::Session::Options;
-using VELA::Test::LogCapture;
-using VELA::Test::ReadText;
-using VELA::Test::ScopedEnv;
-using Handle = VELA::Test::CgiHandle;
+using Handle = CgiHandle;
 
 const char kClient[] = "192.0.2.7";
 const char kAbsent[] = "AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA";
@@ -113,8 +111,8 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
     for (char c : sid) {
         EXPECT_TRUE(isalnum(static_cast<unsigned char>(c)) || c == '-' || c == '_') << sid;
     }
-    EXPECT_EQ(0700u, VELA::Test::Mode(Dir()));
-    EXPECT_EQ(0600u, VELA::Test::Mode(File(sid)));
+    EXPECT_EQ(0700u, Mode(Dir()));
+    EXPECT_EQ(0600u, Mode(File(sid)));
 
     const Json::Value doc = Read(sid);
     EXPECT_EQ("root", doc["user"].asString());
@@ -255,7 +253,7 @@ TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
     // Files a path traversal could reach, inside and outside the state tree.
     std::ofstream(root_.Path() + "/x") << "outside";
     std::ofstream(root_.Path() + "/run/vela/x") << "outside";
-    const auto before = VELA::Test::Tree(root_.Path());
+    const auto before = Tree(root_.Path());
 
     char nul[33];
     memcpy(nul, sid.c_str(), 33);
@@ -279,7 +277,7 @@ TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
     EXPECT_EQ(-2, VELA::Session::Remove(nullptr));
     EXPECT_TRUE(log_.Contains("malformed session id"));
 
-    EXPECT_EQ(before, VELA::Test::Tree(root_.Path()));
+    EXPECT_EQ(before, Tree(root_.Path()));
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid, VELACGI_AUTH_NO_REFRESH));
 }
 
@@ -306,12 +304,12 @@ TEST_F(SessionTest, CorruptFilesAreNoSessionAndStayAsTheyAre)
                             "skipIP", "app", "webapi", "lang", "tokenProtect", "token"}) {
         changes.push_back({key, Json::Value()});  // missing
     }
-    for (const std::string& text : VELA::Test::JsonVariants(doc, changes)) {
+    for (const std::string& text : JsonVariants(doc, changes)) {
         bad.push_back(text);
     }
 
     for (const std::string& text : bad) {
-        VELA::Test::WriteFile(File(sid), text, 0600);
+        WriteFile(File(sid), text, 0600);
         EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(sid)) << text;
         EXPECT_EQ(-1, VelaCgiUIDGet(sid.c_str(), "root")) << text;
         EXPECT_EQ(text, ReadText(File(sid))) << "the file was rewritten";
@@ -528,7 +526,7 @@ TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
 {
     const std::string sid = Create();
     const int kChecks = 50;
-    const std::vector<int> failures = VELA::Test::InChildren(8, [&](int) {
+    const std::vector<int> failures = InChildren(8, [&](int) {
         int failed = 0;
         for (int i = 0; i < kChecks; ++i) {
             Now() = kStart + i;  // every check has a new time to write
@@ -547,7 +545,7 @@ TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
 
     // No temporary file is left behind.
-    for (const std::string& name : VELA::Test::DirEntries(Dir())) {
+    for (const std::string& name : DirEntries(Dir())) {
         EXPECT_TRUE(name == sid || name == ".lock") << name;
     }
 }
@@ -558,7 +556,7 @@ TEST_F(SessionTest, RemovalWinsOverConcurrentRefresh)
 {
     for (int round = 0; round < 5; ++round) {
         const std::string sid = Create();
-        VELA::Test::Children children(4, [&](int) {
+        Children children(4, [&](int) {
             bool removed = false;
             for (int i = 1; i <= 200; ++i) {
                 Now() = kStart + i;

@@ -22,9 +22,8 @@ protected:
 TEST_F(SysFile, SetReplacesOneLineAndKeepsTheRest)
 {
     const std::string file = In("/etc/velainfo.conf");
-    WriteFile(file,
-              "# comment\nmodel=\"X1\"\n\nenable_data_collect=\"no\"\nother=plain\nenable_data_collect=\"maybe\"");
-    ASSERT_EQ(0, chmod(file.c_str(), 0640));
+    WriteFile(file, "# comment\nmodel=\"X1\"\n\nenable_data_collect=\"no\"\nother=plain\nenable_data_collect=\"maybe\"",
+              0640);
 
     EXPECT_EQ(1, VLIBCFileCheckKeyValue("/etc/velainfo.conf", "enable_data_collect", "maybe", 0));  // last wins
     ASSERT_EQ(0, VLIBCINFOSetKeyValue("enable_data_collect", "yes"));
