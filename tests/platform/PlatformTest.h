@@ -83,6 +83,19 @@ inline std::vector<std::string> JsonVariants(const Json::Value& doc,
     return out;
 }
 
+// In the existing directory `files`: target.txt ("secret"), dir/in.txt
+// ("in"), and the links last (to target.txt), middle (to dir) and relative
+// (to "dir").
+inline void MakeLinkTree(const std::string& files)
+{
+    WriteFile(files + "/target.txt", "secret");
+    ASSERT_EQ(0, mkdir((files + "/dir").c_str(), 0755));
+    WriteFile(files + "/dir/in.txt", "in");
+    ASSERT_EQ(0, symlink((files + "/target.txt").c_str(), (files + "/last").c_str()));
+    ASSERT_EQ(0, symlink((files + "/dir").c_str(), (files + "/middle").c_str()));
+    ASSERT_EQ(0, symlink("dir", (files + "/relative").c_str()));
+}
+
 // Children forked at once, each running `body(i)` and exiting with what it
 // returns.
 class Children {

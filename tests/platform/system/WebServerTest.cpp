@@ -2,6 +2,7 @@
 // names and that carries the configured name.
 
 #include <csignal>
+#include <memory>
 #include <sys/prctl.h>
 
 #include "platform/PlatformTest.h"
@@ -17,50 +18,43 @@ class Child {
 public:
     explicit Child(const char* name)
     {
-        sigset_t usr1;
+        sigset_t usr1, old;
         sigemptyset(&usr1);
         sigaddset(&usr1, SIGUSR1);
-        sigprocmask(SIG_BLOCK, &usr1, &old_);
+        sigprocmask(SIG_BLOCK, &usr1, &old);
         int ready[2];
-        int go[2];
         EXPECT_EQ(0, pipe(ready));
-        EXPECT_EQ(0, pipe(go));
-        pid_ = fork();
-        if (pid_ == 0) {
-            close(ready[0]);
-            close(go[1]);  // else the read below never sees the parent's close
+        EXPECT_EQ(0, pipe(go_));
+        child_.reset(new VELA::Test::Children(1, [&](int) {
+            close(go_[1]);  // else the read below never sees the parent's close
             if (name != nullptr) {
                 prctl(PR_SET_NAME, name, 0, 0, 0);
             }
             char c = 'r';
             (void)!write(ready[1], &c, 1);
-            (void)!read(go[0], &c, 1);
+            (void)!read(go_[0], &c, 1);
             sigset_t pending;
             sigpending(&pending);
-            _exit(sigismember(&pending, SIGUSR1) ? 1 : 0);
-        }
-        sigprocmask(SIG_SETMASK, &old_, nullptr);
+            return sigismember(&pending, SIGUSR1) ? 1 : 0;
+        }));
+        sigprocmask(SIG_SETMASK, &old, nullptr);
         close(ready[1]);
-        close(go[0]);
+        close(go_[0]);
         char c;
         EXPECT_EQ(1, read(ready[0], &c, 1));
         close(ready[0]);
-        go_ = go[1];
     }
-    pid_t Pid() const { return pid_; }
+    pid_t Pid() const { return child_->Pid(0); }
     // True when the child saw SIGUSR1 pending.
     bool Finish()
     {
-        close(go_);
-        int status = 0;
-        waitpid(pid_, &status, 0);
-        return WIFEXITED(status) && WEXITSTATUS(status) == 1;
+        close(go_[1]);
+        return child_->Wait() == std::vector<int>{1};
     }
 
 private:
-    pid_t pid_;
-    int go_;
-    sigset_t old_;
+    int go_[2];
+    std::unique_ptr<VELA::Test::Children> child_;
 };
 
 class WebServer : public RootTest {
@@ -102,11 +96,9 @@ TEST_F(WebServer, RefusesUntrustworthyPidFilesAndConfiguration)
 {
     Child server(kServerName);
     const std::string pid = std::to_string(server.Pid());
-    const pid_t gone = fork();
-    if (gone == 0) {
-        _exit(0);
-    }
-    waitpid(gone, nullptr, 0);
+    VELA::Test::Children goneChild(1, [](int) { return 0; });
+    const pid_t gone = goneChild.Pid(0);
+    goneChild.Wait();
 
     for (const std::string& text : {std::string(""), std::string("abc"), std::string("0"), std::string("1"),
                                     std::string("-5"), pid + " 7", "+" + pid, std::to_string(gone)}) {

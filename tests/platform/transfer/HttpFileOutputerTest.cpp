@@ -394,12 +394,7 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
 // way (how the path is opened: FileUtilTest.cpp).
 TEST_F(HttpOutput, RefusesLinksAndWhatIsNotARegularFile)
 {
-    const std::string target = Write("target.txt", "secret");
-    mkdir((files_ + "/dir").c_str(), 0755);
-    std::ofstream(files_ + "/dir/in.txt") << "in";
-    ASSERT_EQ(0, symlink(target.c_str(), (files_ + "/last").c_str()));
-    ASSERT_EQ(0, symlink((files_ + "/dir").c_str(), (files_ + "/middle").c_str()));
-    ASSERT_EQ(0, symlink("dir", (files_ + "/relative").c_str()));
+    VELA::Test::MakeLinkTree(files_);
     const std::string fifo = files_ + "/fifo";
     ASSERT_EQ(0, mkfifo(fifo.c_str(), 0600));
     FILE* writeOnly = fopen((files_ + "/w").c_str(), "w");
