@@ -1,24 +1,12 @@
 // The CGI handle: cookies, the client address and the fail-closed session
 // calls.
-#include <gtest/gtest.h>
 
-#include <fstream>
-#include <string>
-#include <sys/stat.h>
-
-#include "support/TestSupport.h"
-#include "vela/cgi.h"
-#include "vela/vlibc.h"
+#include "platform/PlatformTest.h"
 
 namespace {
 
 using VELA::Test::ScopedEnv;
-
-struct Handle {
-    Handle() { EXPECT_EQ(0, VelaCgiInit("test", &ctx)); }
-    ~Handle() { VelaCgiFree(ctx); }
-    VELACGI_CTX* ctx = nullptr;
-};
+using Handle = VELA::Test::CgiHandle;
 
 TEST(Cgi, CookiesWithOddPieces)
 {
@@ -68,18 +56,8 @@ TEST(Cgi, CookieBounds)
     VelaCgiFree(nullptr);
 }
 
-class RemoteIP : public ::testing::Test {
+class RemoteIP : public RootTest {
 protected:
-    RemoteIP() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::System::RootReset(); }
-    ~RemoteIP() override { VELA::System::RootReset(); }
-
-    void Conf(const std::string& text)
-    {
-        mkdir((root_.Path() + "/etc").c_str(), 0755);
-        mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
-        std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << text;
-    }
-
     std::string Get(const char* remote, const char* forwarded)
     {
         ScopedEnv r("REMOTE_ADDR", remote);
@@ -87,9 +65,6 @@ protected:
         char buf[64];
         return VelaCgiGetRemoteIP(buf, sizeof(buf)) == 0 ? buf : "FAIL";
     }
-
-    VELA::Test::TempDir root_;
-    ScopedEnv env_;
 };
 
 TEST_F(RemoteIP, DirectClientIgnoresForwardedFor)
@@ -107,7 +82,7 @@ TEST_F(RemoteIP, NoProxyIsTrustedUnlessConfigured)
 {
     for (const char* conf : {static_cast<const char*>(nullptr), "admin_group=\"x\"\n", "trusted_proxies=\"\"\n"}) {
         if (conf != nullptr) {
-            Conf(conf);
+            Conf("webapi.conf", conf);
         }
         EXPECT_EQ("127.0.0.1", Get("127.0.0.1", "203.0.113.9")) << (conf ? conf : "no file");
         EXPECT_EQ("::1", Get("::1", "203.0.113.9, 127.0.0.1")) << (conf ? conf : "no file");
@@ -117,7 +92,7 @@ TEST_F(RemoteIP, NoProxyIsTrustedUnlessConfigured)
 
 TEST_F(RemoteIP, ConfiguredProxyTakesRightmostUntrusted)
 {
-    Conf("trusted_proxies=\"127.0.0.1 ::1, 127.0.0.2,127.0.0.5\"\n");
+    Conf("webapi.conf", "trusted_proxies=\"127.0.0.1 ::1, 127.0.0.2,127.0.0.5\"\n");
     EXPECT_EQ("127.0.0.1", Get("127.0.0.1", nullptr));
     EXPECT_EQ("127.0.0.1", Get("127.0.0.1", " "));
     EXPECT_EQ("203.0.113.9", Get("127.0.0.1", "10.9.9.9, 203.0.113.9"));  // left entry spoofable
@@ -132,7 +107,7 @@ TEST_F(RemoteIP, ConfiguredProxyTakesRightmostUntrusted)
 
 TEST_F(RemoteIP, OnlyConfiguredAddressesAreProxies)
 {
-    Conf("# proxies\nother=\"x\"\ntrusted_proxies=\"192.0.2.10 2001:db8::10 bogus\"\n");
+    Conf("webapi.conf", "# proxies\nother=\"x\"\ntrusted_proxies=\"192.0.2.10 2001:db8::10 bogus\"\n");
     EXPECT_EQ("203.0.113.9", Get("192.0.2.10", "203.0.113.9"));
     EXPECT_EQ("203.0.113.9", Get("2001:db8:0:0::10", "203.0.113.9, 192.0.2.10"));
     EXPECT_EQ("127.0.0.1", Get("127.0.0.1", "203.0.113.9"));

@@ -1,18 +1,10 @@
 // VelaCgiDetectAndDecryptParamLine: plain lines pass unchanged, malformed
 // ones are refused, a line encrypted as a whole is decrypted.
-#include <gtest/gtest.h>
-
-#include <cstdlib>
-#include <string>
-
-#include "platform/StateRootTest.h"
+#include "platform/session/CryptoTestUtil.h"
 #include "support/LinearTime.h"
-#include "support/TestSupport.h"
-#include "vela/cgi.h"
 #include "vela/webapiutil.h"
 
 using VELA::Test::LogCapture;
-using VELA::Test::ReadText;
 
 TEST(ParamLine, PlainLinesUnchanged)
 {
@@ -64,25 +56,15 @@ TEST(ParamLine, CheckTakesLinearTime)
     }
 }
 
-class ParamLineCipher : public StateRootTest {
+class ParamLineCipher : public RootTest {
 protected:
     // base64 of `plain` encrypted to the server key by the openssl tool.
     std::string Encrypt(const std::string& plain)
     {
-        const std::string dir = root_.Path();
         std::string pem;
         EXPECT_EQ(0, VelaCgiPublicKeyPEM(pem));
-        FILE* f = fopen((dir + "/pub.pem").c_str(), "w");
-        fputs(pem.c_str(), f);
-        fclose(f);
-        f = fopen((dir + "/plain").c_str(), "w");
-        fwrite(plain.data(), 1, plain.size(), f);
-        fclose(f);
-        const std::string cmd = "openssl pkeyutl -encrypt -pubin -inkey " + dir + "/pub.pem -in " + dir +
-                                "/plain -pkeyopt rsa_padding_mode:oaep -pkeyopt rsa_oaep_md:sha256 "
-                                "-pkeyopt rsa_mgf1_md:sha256 | base64 -w0 > " + dir + "/ct";
-        EXPECT_EQ(0, system(cmd.c_str()));
-        return ReadText(dir + "/ct");
+        VELA::Test::WriteFile(In("/pub.pem"), pem);
+        return VELA::Test::OpensslEncrypt(root_.Path(), In("/pub.pem"), plain);
     }
 };
 

@@ -1,51 +1,18 @@
 // Access tokens against real files under a temporary VELA_ROOT: grants,
 // patterns, expiry, users that went away, hostile tokens, corrupt files,
 // listing and revocation.
-#include <gtest/gtest.h>
 
-#include "platform/StateRootTest.h"
-
-#include <cstring>
-#include <dirent.h>
-#include <fstream>
-#include <set>
-#include <sstream>
-#include <string>
-#include <sys/stat.h>
-#include <unistd.h>
-#include <vector>
-
-#include "support/TestSupport.h"
-#include "vela/session.h"
+#include "platform/PlatformTest.h"
 #include "vela/token.h"
-#include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 
 namespace {
 
-using VELA::Test::LogCapture;
-using VELA::Test::ReadText;
-using VELA::Test::ScopedEnv;
-using VELA::Test::TempDir;
-
-
-std::set<std::string> Names(const std::string& dir)
-{
-    std::set<std::string> names;
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        return names;
-    }
-    while (struct dirent* ent = readdir(d)) {
-        names.insert(ent->d_name);
-    }
-    closedir(d);
-    return names;
-}
+using namespace VELA::Test;
 
 class AccessTokenTest : public StateRootTest {
 protected:
-    std::string Dir() const { return root_.Path() + "/var/lib/vela/tokens"; }
+    std::string Dir() const { return In("/var/lib/vela/tokens"); }
     std::string File(const std::string& id) const { return Dir() + "/" + id; }
 
     std::string Create(const std::vector<std::string>& apis, const std::vector<std::string>& methods,
@@ -86,11 +53,8 @@ TEST_F(AccessTokenTest, CreateWritesPrivateFile)
     std::string id;
     const std::string token = Create({"VELA.Demo.*"}, {"get*", "list"}, 3600, "root", &id);
     EXPECT_EQ('.', token[VELA_TOKEN_ID_LEN]);
-    struct stat st;
-    ASSERT_EQ(0, stat(Dir().c_str(), &st));
-    EXPECT_EQ(0700u, st.st_mode & 0777);
-    ASSERT_EQ(0, stat(File(id).c_str(), &st));
-    EXPECT_EQ(0600u, st.st_mode & 0777);
+    EXPECT_EQ(0700u, Mode(Dir()));
+    EXPECT_EQ(0600u, Mode(File(id)));
 
     Json::Value doc;
     ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(File(id), doc));
@@ -109,21 +73,22 @@ TEST_F(AccessTokenTest, CreateWritesPrivateFile)
 TEST_F(AccessTokenTest, PatternsSelectApiAndMethod)
 {
     const std::string token = Create({"VELA.Demo.*", "VELA.Exact"}, {"get*", "list"});
-    EXPECT_EQ(0, Grant(token, "VELA.Demo.Test", "get"));
-    EXPECT_STREQ("root", user_);
-    EXPECT_EQ(0, Grant(token, "VELA.Demo.Test", "getInfo"));
-    EXPECT_EQ(0, Grant(token, "VELA.Exact", "list"));
-    EXPECT_EQ(-3, Grant(token, "VELA.Demo", "get"));  // the prefix includes the "."
-    EXPECT_EQ(-3, Grant(token, "VELA.Exact2", "get"));
-    EXPECT_EQ(-3, Grant(token, "VELA.Other.Test", "get"));
-    EXPECT_EQ(-3, Grant(token, "vela.demo.test", "get"));  // case-sensitive
-    EXPECT_EQ(-3, Grant(token, "VELA.Demo.Test", "set"));
-    EXPECT_EQ(-3, Grant(token, "VELA.Demo.Test", "Get"));
-    EXPECT_EQ(-3, Grant(token, "VELA.Demo.Test", "listAll"));
-    EXPECT_STREQ("", user_);
-    EXPECT_EQ(-3, Grant(token, "", "get"));
-    EXPECT_EQ(-3, Grant(token, "VELA.Demo.../x", "get"));
-    EXPECT_EQ(-3, Grant(token, "VELA.Demo.Test", nullptr));
+    const struct {
+        const char* api;
+        const char* method;
+        int rc;
+    } cases[] = {
+        {"VELA.Demo.Test", "get", 0}, {"VELA.Demo.Test", "getInfo", 0}, {"VELA.Exact", "list", 0},
+        {"VELA.Demo", "get", -3},  // the prefix includes the "."
+        {"VELA.Exact2", "get", -3}, {"VELA.Other.Test", "get", -3},
+        {"vela.demo.test", "get", -3},  // case-sensitive
+        {"VELA.Demo.Test", "set", -3}, {"VELA.Demo.Test", "Get", -3}, {"VELA.Demo.Test", "listAll", -3},
+        {"", "get", -3}, {"VELA.Demo.../x", "get", -3}, {"VELA.Demo.Test", nullptr, -3},
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ(c.rc, Grant(token, c.api, c.method)) << c.api << " " << (c.method ? c.method : "null");
+        EXPECT_STREQ(c.rc == 0 ? "root" : "", user_) << c.api;
+    }
     EXPECT_EQ(-3, Grant(token, std::string(200, 'V').c_str(), "get"));
 
     const std::string all = Create({"*"}, {"*"});
@@ -188,7 +153,7 @@ TEST_F(AccessTokenTest, CreateRefusesBadInput)
     EXPECT_EQ(-1, VelaAccessTokenCreate(nullptr, {"*"}, {"*"}, 0, token, id));
     EXPECT_EQ(-1, VelaAccessTokenCreate("a/b", {"*"}, {"*"}, 0, token, id));
     EXPECT_TRUE(token.empty());
-    EXPECT_TRUE(Names(Dir()).size() <= 2);  // nothing but "." and ".." at most
+    EXPECT_TRUE(DirEntries(Dir()).empty());
 }
 
 TEST_F(AccessTokenTest, HostileTokensTouchNothing)
@@ -196,8 +161,7 @@ TEST_F(AccessTokenTest, HostileTokensTouchNothing)
     std::string id;
     const std::string token = Create({"*"}, {"*"}, 0, "root", &id);
     std::ofstream(root_.Path() + "/x") << "outside";
-    const std::set<std::string> before = Names(Dir());
-    const std::string beforeText = ReadText(File(id));
+    const auto before = Tree(root_.Path());
 
     std::string wrongSecret = token;
     wrongSecret.back() = wrongSecret.back() == 'A' ? 'B' : 'A';
@@ -222,9 +186,7 @@ TEST_F(AccessTokenTest, HostileTokensTouchNothing)
     EXPECT_EQ(-2, VelaAccessTokenRevoke(nullptr));
     EXPECT_TRUE(log_.Contains("malformed token"));
 
-    EXPECT_EQ(before, Names(Dir()));
-    EXPECT_EQ(beforeText, ReadText(File(id)));
-    EXPECT_EQ("outside", ReadText(root_.Path() + "/x"));
+    EXPECT_EQ(before, Tree(root_.Path()));
     EXPECT_EQ(0, Grant(token, "VELA.Demo", "get"));
 }
 
@@ -237,33 +199,18 @@ TEST_F(AccessTokenTest, CorruptFilesGrantNothing)
     ASSERT_TRUE(VELA::WebAPIUtil::ParseJson(good, doc));
 
     std::vector<std::string> bad = {"", "garbage", "[]", good.substr(0, good.size() / 2)};
-    auto mutate = [&](const char* key, const Json::Value& value) {
-        Json::Value changed = doc;
-        if (value.isNull()) {
-            changed.removeMember(key);
-        } else {
-            changed[key] = value;
-        }
-        bad.push_back(Json::writeString(Json::StreamWriterBuilder(), changed));
-    };
+    std::vector<std::pair<std::string, Json::Value>> changes = {
+        {"id", "BBBBBBBBBBBBBBBBBBBBBB"}, {"apis", Json::Value(Json::arrayValue)}, {"apis", "*"},
+        {"methods", Json::Value(Json::arrayValue)}, {"expires", "never"}, {"user", ""}, {"secret", "short"}};
+    changes[3].second.append("a*b");
     for (const char* key : {"version", "id", "secret", "user", "apis", "methods", "created", "expires"}) {
-        mutate(key, Json::Value());
+        changes.push_back({key, Json::Value()});
     }
-    mutate("id", "BBBBBBBBBBBBBBBBBBBBBB");
-    mutate("apis", Json::Value(Json::arrayValue));
-    mutate("apis", "*");
-    Json::Value badList(Json::arrayValue);
-    badList.append("a*b");
-    mutate("methods", badList);
-    mutate("expires", "never");
-    mutate("user", "");
-    mutate("secret", "short");
-
+    for (const std::string& text : JsonVariants(doc, changes)) {
+        bad.push_back(text);
+    }
     for (const std::string& text : bad) {
-        {
-            std::ofstream out(File(id), std::ios::binary | std::ios::trunc);
-            out << text;
-        }
+        WriteFile(File(id), text, 0600);
         EXPECT_EQ(-1, Grant(token, "VELA.Demo", "get")) << text;
         EXPECT_EQ(text, ReadText(File(id)));
     }

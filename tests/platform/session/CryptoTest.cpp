@@ -6,26 +6,15 @@
 // the openssl command-line tool, AES-GCM with libcrypto's encryption calls
 // (opened here with dlopen, since this program must not link libcrypto) and
 // one vector computed once with another implementation.
-#include <gtest/gtest.h>
-
-#include <openssl/evp.h>  // types only: this program does not link libcrypto
-
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <dlfcn.h>
-#include <fstream>
+#include <openssl/evp.h>  // types only: this program does not link libcrypto
 #include <sstream>
-#include <string>
-#include <sys/stat.h>
-#include <unistd.h>
-#include <vector>
 
 #include "platform/session/CryptoTestUtil.h"
 #include "support/JsonLiteral.h"
-#include "support/TestSupport.h"
-#include "vela/cgi.h"
-#include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
 #include "webapi/JsonUtil.h"
 
@@ -33,12 +22,9 @@ namespace {
 
 using namespace VELA::Test;
 
-const std::vector<std::string> kOaepSha256 = {"-pkeyopt", "rsa_padding_mode:oaep", "-pkeyopt", "rsa_oaep_md:sha256",
-                                              "-pkeyopt", "rsa_mgf1_md:sha256"};
-
 bool LibcryptoMapped()
 {
-    return ReadFile("/proc/self/maps").find("libcrypto") != std::string::npos;
+    return ReadText("/proc/self/maps").find("libcrypto") != std::string::npos;
 }
 
 // ---- The probe: this program started again as a fresh process ------------
@@ -72,22 +58,6 @@ int LinesWith(const std::string& text, const std::string& needle)
         n += line.find(needle) != std::string::npos ? 1 : 0;
     }
     return n;
-}
-
-std::string Base64(const std::string& in)
-{
-    static const char abc[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-    std::string out;
-    for (size_t i = 0; i < in.size(); i += 3) {
-        unsigned v = static_cast<unsigned char>(in[i]) << 16;
-        if (i + 1 < in.size()) v |= static_cast<unsigned char>(in[i + 1]) << 8;
-        if (i + 2 < in.size()) v |= static_cast<unsigned char>(in[i + 2]);
-        out += abc[v >> 18];
-        out += abc[(v >> 12) & 63];
-        out += i + 1 < in.size() ? abc[(v >> 6) & 63] : '=';
-        out += i + 2 < in.size() ? abc[v & 63] : '=';
-    }
-    return out;
 }
 
 // AES-256-GCM encryption with libcrypto's own encryption calls: IV |
@@ -142,7 +112,7 @@ std::string FlipBit(std::string s, size_t byte)
 
 // A key pair made by the openssl tool, put in place as an administrator
 // would; the tests that are not about creating keys share it.
-class Crypto : public ::testing::Test {
+class Crypto : public RootTest {
 protected:
     static const std::string& SuiteKey()
     {
@@ -151,31 +121,19 @@ protected:
         return key;
     }
 
-    Crypto() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::System::RootReset(); }
-    ~Crypto() override { VELA::System::RootReset(); }
-
     void SetUp() override
     {
-        ASSERT_EQ(0, system(("mkdir -p -m 0700 " + KeyDir()).c_str()));
-        WriteFile(KeyDir() + "/param_rsa.pem", SuiteKey());
+        ASSERT_EQ(0, system(("mkdir -p -m 0700 " + In("/var/lib/vela/keys")).c_str()));
+        WriteFile(In("/var/lib/vela/keys/param_rsa.pem"), SuiteKey(), 0600);
         ASSERT_EQ(0, VelaCgiPublicKeyPEM(pem_));
-        WriteFile(root_.Path() + "/pub.pem", pem_);
+        WriteFile(In("/pub.pem"), pem_);
     }
-
-    std::string KeyDir() const { return root_.Path() + "/var/lib/vela/keys"; }
 
     // base64 of `plain` encrypted to the server key by the openssl tool.
     std::string Encrypt(const std::string& plain, const std::vector<std::string>& opts = kOaepSha256,
                         const std::string& pub = "")
     {
-        WriteFile(root_.Path() + "/plain", plain);
-        std::vector<std::string> argv = {"openssl", "pkeyutl", "-encrypt", "-pubin", "-inkey",
-                                         pub.empty() ? root_.Path() + "/pub.pem" : pub,
-                                         "-in", root_.Path() + "/plain", "-out", root_.Path() + "/ct"};
-        argv.insert(argv.end(), opts.begin(), opts.end());
-        const Ran ran = RunTool(argv);
-        EXPECT_TRUE(Exited0(ran)) << ran.err;
-        return Base64(ReadFile(root_.Path() + "/ct"));
+        return OpensslEncrypt(root_.Path(), pub.empty() ? In("/pub.pem") : pub, plain, opts);
     }
 
     // The probe run in a fresh process with `getParam`.
@@ -186,8 +144,6 @@ protected:
         return RunTool({"/proc/self/exe", "--gtest_filter=-*"}, env);
     }
 
-    TempDir root_;
-    ScopedEnv env_;
     std::string pem_;
 };
 
@@ -197,7 +153,8 @@ const char kIv[] = "iv-12-bytes!";
 TEST_F(Crypto, CipherTextRoundTrip)
 {
     const std::string plain = "api=VELA.Test&method=login&account=alice&passwd=p%40ss+w0rd%26";
-    std::string text = Encrypt(plain);
+    const std::string ct = Encrypt(plain);
+    std::string text = ct;
     ASSERT_EQ(512u, text.size());  // 384 bytes: the 3072-bit key
     ASSERT_EQ(0, VelaCgiDecryptParam(text));
     EXPECT_EQ(plain, text);
@@ -206,11 +163,8 @@ TEST_F(Crypto, CipherTextRoundTrip)
     text = Encrypt(longest);
     ASSERT_EQ(0, VelaCgiDecryptParam(text));
     EXPECT_EQ(longest, text);
-}
 
-TEST_F(Crypto, CipherTextThroughRequest)
-{
-    const std::string ct = Encrypt("api=VELA.Test&method=login&account=alice&passwd=p%40ss+w0rd%26");
+    // Through a request: the parameters take the place of the member.
     VELA::APIRequest r(J(R"({"getParam": {"__cIpHeRtExT": ")" + ct + R"(", "version": "1"}})"));
     EXPECT_EQ("alice", r.GetParam("account", "").asString());
     EXPECT_EQ("p@ss w0rd&", r.GetParam("passwd", "").asString());
@@ -277,9 +231,10 @@ TEST_F(Crypto, DamagedAesInputFailsCleanly)
         EXPECT_EQ("", out);
     }
     std::string out;
-    EXPECT_FALSE(VELA::CredRequestUtil::GetDecryptAESString("0123456789abcdefghijklmnopqrstuw", good, out));
-    EXPECT_FALSE(VELA::CredRequestUtil::GetDecryptAESString(std::string(kKey, 31), good, out));
-    EXPECT_FALSE(VELA::CredRequestUtil::GetDecryptAESString(std::string(kKey) + "x", good, out));
+    for (const std::string& key : {std::string("0123456789abcdefghijklmnopqrstuw"), std::string(kKey, 31),
+                                   std::string(kKey) + "x"}) {
+        EXPECT_FALSE(VELA::CredRequestUtil::GetDecryptAESString(key, good, out)) << key;
+    }
     EXPECT_FALSE(VELA::CredRequestUtil::GetDecryptAESString(kKey, Base64(GcmSeal(kKey, kIv, std::string("a=1\0b", 5))), out));
     EXPECT_TRUE(VELA::CredRequestUtil::GetDecryptAESString(kKey, good, out));
 
@@ -334,22 +289,21 @@ TEST_F(Crypto, TokenKeyRules)
     EXPECT_EQ(-1, VELACloudServiceHubtokenGenerateToken(std::string(5000, 'A').c_str(), key, sizeof(key)));
 }
 
-TEST_F(Crypto, PlainRequestNeverLoadsLibcrypto)
+// Only a request that decrypts loads libcrypto; junk in the encrypted members
+// is refused before anything is loaded.
+TEST_F(Crypto, OnlyDecryptingRequestsLoadLibcrypto)
 {
-    Ran ran = Probe(R"({"api": "VELA.Test", "name": "plain value"})");
-    ASSERT_TRUE(Exited0(ran)) << ran.err;
-    EXPECT_EQ("name=plain value\nlibcrypto=0\n", ran.out);
-
-    // Junk in the encrypted members is refused before anything is loaded.
-    ran = Probe(R"({"__cIpHeRtExT": "AAAA", "__nEkOtReHpIc": "x", "__tXeTrEhPiC": "y", "name": "n"})");
-    EXPECT_EQ("name=n\nlibcrypto=0\n", ran.out) << ran.err;
-}
-
-TEST_F(Crypto, DecryptingRequestLoadsLibcrypto)
-{
-    const Ran ran = Probe(R"({"__cIpHeRtExT": ")" + Encrypt("name=secret+value") + R"("})");
-    ASSERT_TRUE(Exited0(ran)) << ran.err;
-    EXPECT_EQ("name=secret value\nlibcrypto=1\n", ran.out);
+    const std::pair<std::string, std::string> cases[] = {
+        {R"({"api": "VELA.Test", "name": "plain value"})", "name=plain value\nlibcrypto=0\n"},
+        {R"({"__cIpHeRtExT": "AAAA", "__nEkOtReHpIc": "x", "__tXeTrEhPiC": "y", "name": "n"})",
+         "name=n\nlibcrypto=0\n"},
+        {R"({"__cIpHeRtExT": ")" + Encrypt("name=secret+value") + R"("})", "name=secret value\nlibcrypto=1\n"},
+    };
+    for (const auto& c : cases) {
+        const Ran ran = Probe(c.first);
+        EXPECT_TRUE(Exited0(ran)) << ran.err;
+        EXPECT_EQ(c.second, ran.out) << ran.err;
+    }
 }
 
 TEST_F(Crypto, MissingLibraryFailsClosed)
@@ -363,12 +317,12 @@ TEST_F(Crypto, MissingLibraryFailsClosed)
     EXPECT_EQ(1, LinesWith(ran.err, "encrypted parameters unavailable: cannot load libcrypto.so.3")) << ran.err;
 
     // A library without the functions: any other library will do.
-    const std::string maps = ReadFile("/proc/self/maps");
+    const std::string maps = ReadText("/proc/self/maps");
     const size_t name = maps.find("libjsoncpp");
     ASSERT_NE(std::string::npos, name);
     const size_t start = maps.rfind(' ', name) + 1;
     const std::string jsoncpp = maps.substr(start, maps.find('\n', name) - start);
-    WriteFile(libs.Path() + "/libcrypto.so.3", ReadFile(jsoncpp), 0755);
+    WriteFile(libs.Path() + "/libcrypto.so.3", ReadText(jsoncpp), 0755);
     ran = Probe(getParam, {{"LD_LIBRARY_PATH", libs.Path()}, {"VELA_CRYPTO_PROBE_PUBKEY", "1"}});
     EXPECT_EQ(0, ran.out.find("name=\npubkey=-1\n")) << ran.out << ran.err;
     EXPECT_EQ(1, LinesWith(ran.err, "encrypted parameters unavailable: libcrypto.so.3 lacks OPENSSL_cleanse")) << ran.err;

@@ -1,43 +1,14 @@
-// Helpers of the encrypted-parameter tests: files with their modes, and
-// tools (the openssl command, this program itself) run as child processes.
+// Helpers of the encrypted-parameter tests: tools (the openssl command, this
+// program itself) run as child processes, keys and ciphertexts made by the
+// openssl command.
 #pragma once
 
-#include <gtest/gtest.h>
-
 #include <fcntl.h>
-#include <fstream>
-#include <sstream>
-#include <string>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-#include <utility>
-#include <vector>
 
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 
 namespace VELA {
 namespace Test {
-
-inline std::string ReadFile(const std::string& path)
-{
-    std::ifstream in(path, std::ios::binary);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
-}
-
-inline void WriteFile(const std::string& path, const std::string& data, mode_t mode = 0600)
-{
-    std::ofstream(path, std::ios::binary | std::ios::trunc) << data;
-    ASSERT_EQ(0, chmod(path.c_str(), mode));
-}
-
-inline mode_t Mode(const std::string& path)
-{
-    struct stat st;
-    return lstat(path.c_str(), &st) == 0 ? (st.st_mode & 07777) : 0;
-}
 
 struct Ran {
     int status = -1;
@@ -71,8 +42,8 @@ inline Ran RunTool(const std::vector<std::string>& argv, const std::vector<std::
     }
     Ran ran;
     if (pid > 0 && waitpid(pid, &ran.status, 0) == pid) {
-        ran.out = ReadFile(out);
-        ran.err = ReadFile(err);
+        ran.out = ReadText(out);
+        ran.err = ReadText(err);
     }
     return ran;
 }
@@ -89,7 +60,40 @@ inline std::string OpensslKey(const TempDir& dir, const std::string& name, int b
                                      "rsa_keygen_bits:" + std::to_string(bits), "-out", path};
     argv.insert(argv.end(), extra.begin(), extra.end());
     EXPECT_TRUE(Exited0(RunTool(argv))) << name;
-    return ReadFile(path);
+    return ReadText(path);
+}
+
+inline std::string Base64(const std::string& in)
+{
+    static const char abc[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+    std::string out;
+    for (size_t i = 0; i < in.size(); i += 3) {
+        unsigned v = static_cast<unsigned char>(in[i]) << 16;
+        if (i + 1 < in.size()) v |= static_cast<unsigned char>(in[i + 1]) << 8;
+        if (i + 2 < in.size()) v |= static_cast<unsigned char>(in[i + 2]);
+        out += abc[v >> 18];
+        out += abc[(v >> 12) & 63];
+        out += i + 1 < in.size() ? abc[(v >> 6) & 63] : '=';
+        out += i + 2 < in.size() ? abc[v & 63] : '=';
+    }
+    return out;
+}
+
+inline const std::vector<std::string> kOaepSha256 = {"-pkeyopt", "rsa_padding_mode:oaep", "-pkeyopt",
+                                                     "rsa_oaep_md:sha256", "-pkeyopt", "rsa_mgf1_md:sha256"};
+
+// base64 of `plain` encrypted by the openssl tool to the public key in the
+// PEM file `pub` with the options `opts`, made in `dir`.
+inline std::string OpensslEncrypt(const std::string& dir, const std::string& pub, const std::string& plain,
+                                  const std::vector<std::string>& opts = kOaepSha256)
+{
+    WriteFile(dir + "/plain", plain);
+    std::vector<std::string> argv = {"openssl", "pkeyutl", "-encrypt", "-pubin", "-inkey", pub,
+                                     "-in", dir + "/plain", "-out", dir + "/ct"};
+    argv.insert(argv.end(), opts.begin(), opts.end());
+    const Ran ran = RunTool(argv);
+    EXPECT_TRUE(Exited0(ran)) << ran.err;
+    return Base64(ReadText(dir + "/ct"));
 }
 
 }  // namespace Test

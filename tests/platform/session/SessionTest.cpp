@@ -1,81 +1,45 @@
 // Login sessions against real files under a temporary VELA_ROOT: every
 // verdict of VelaCgiIsAuthorizedEx, hostile ids, corrupt files, clock steps,
 // concurrent processes, and the calls that read the same session.
-#include <gtest/gtest.h>
 
-#include "platform/StateRootTest.h"
-
-#include <cerrno>
 #include <cstring>
-#include <dirent.h>
-#include <fstream>
-#include <map>
 #include <pwd.h>
-#include <sstream>
-#include <string>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-#include <vector>
 
-#include "support/TestSupport.h"
-#include "vela/cgi.h"
-#include "vela/session.h"
-#include "vela/vlibc.h"
+#include "platform/PlatformTest.h"
 #include "vela/webapiutil.h"
 
 namespace {
 
-using VELA::Test::LogCapture;
-using VELA::Test::ReadText;
-using VELA::Test::ScopedEnv;
-using VELA::Test::TempDir;
-
+using namespace VELA::Test;
+using VELA::Session::Options;
+using Handle = CgiHandle;
 
 const char kClient[] = "192.0.2.7";
+const char kAbsent[] = "AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA";
 
-// Every path under `dir` with its type, size and modification time, so a test
-// can tell that a call touched nothing.
-void Snapshot(const std::string& dir, std::map<std::string, std::string>& out)
+// The default options with `field` set to `value`.
+template <typename T, typename V>
+Options With(T Options::*field, V value)
 {
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        return;
-    }
-    while (struct dirent* ent = readdir(d)) {
-        const std::string name = ent->d_name;
-        if (name == "." || name == "..") {
-            continue;
-        }
-        const std::string path = dir + "/" + name;
-        struct stat st;
-        if (lstat(path.c_str(), &st) != 0) {
-            continue;
-        }
-        std::ostringstream facts;
-        facts << std::oct << st.st_mode << std::dec << " " << st.st_size << " " << st.st_mtim.tv_sec << "."
-              << st.st_mtim.tv_nsec;
-        out[path] = facts.str();
-        if (S_ISDIR(st.st_mode)) {
-            Snapshot(path, out);
-        }
-    }
-    closedir(d);
+    Options options;
+    options.*field = value;
+    return options;
 }
 
-struct Handle {
-    Handle() { EXPECT_EQ(0, VelaCgiInit("test", &ctx)); }
-    ~Handle() { VelaCgiFree(ctx); }
-    VELACGI_CTX* ctx = nullptr;
-};
+Options Timed(int idleTimeout, int lifetime = 0)
+{
+    Options options = With(&Options::idleTimeout, idleTimeout);
+    options.lifetime = lifetime;
+    return options;
+}
 
 class SessionTest : public StateRootTest {
 protected:
-    std::string Dir() const { return root_.Path() + "/run/vela/sessions"; }
+    std::string Dir() const { return In("/run/vela/sessions"); }
     std::string File(const std::string& sid) const { return Dir() + "/" + sid; }
 
-    std::string Create(const VELA::Session::Options& options = VELA::Session::Options(), const char* user = "root",
-                       const char* ip = kClient, std::string* token = nullptr)
+    std::string Create(const Options& options = Options(), const char* user = "root", const char* ip = kClient,
+                       std::string* token = nullptr)
     {
         std::string sid;
         std::string tok;
@@ -101,16 +65,11 @@ protected:
         return doc;
     }
 
-    void Write(const std::string& sid, const Json::Value& doc)
-    {
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(File(sid), doc, 0600));
-    }
-
     void Edit(const std::string& sid, const char* key, const Json::Value& value)
     {
         Json::Value doc = Read(sid);
         doc[key] = value;
-        Write(sid, doc);
+        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(File(sid), doc, 0600));
     }
 
     ScopedEnv remote_{"REMOTE_ADDR", kClient};
@@ -124,29 +83,19 @@ protected:
 
 TEST_F(SessionTest, CreateRefusesBadInput)
 {
-    std::string sid = "stale";
-    std::string token = "stale";
+    std::string sid = "stale", token = "stale";
     EXPECT_EQ(-1, VELA::Session::Create("vela-no-such-user", kClient, nullptr, sid, token));
-    EXPECT_TRUE(sid.empty());
-    EXPECT_TRUE(token.empty());
+    EXPECT_TRUE(sid.empty() && token.empty());
     EXPECT_TRUE(log_.Contains("no user \"vela-no-such-user\""));
     EXPECT_EQ(-1, VELA::Session::Create(nullptr, kClient, nullptr, sid, token));
     EXPECT_EQ(-1, VELA::Session::Create("", kClient, nullptr, sid, token));
     EXPECT_EQ(-1, VELA::Session::Create("../root", kClient, nullptr, sid, token));
     EXPECT_EQ(-1, VELA::Session::Create("root", "999.1.1.1", nullptr, sid, token));
     EXPECT_EQ(-1, VELA::Session::Create("root", "192.0.2.7\n", nullptr, sid, token));
-    VELA::Session::Options options;
-    options.lang = "EN";
-    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
-    options = VELA::Session::Options();
-    options.idleTimeout = VELA_SESSION_IDLE_MAX + 1;
-    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
-    options = VELA::Session::Options();
-    options.lifetime = -5;
-    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
-    options = VELA::Session::Options();
-    options.app = "a\nb";
-    EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    for (const Options& options : {With(&Options::lang, "EN"), Timed(VELA_SESSION_IDLE_MAX + 1), Timed(0, -5),
+                                   With(&Options::app, "a\nb")}) {
+        EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
+    }
     std::vector<VELA::Session::Record> list;
     ASSERT_EQ(0, VELA::Session::List(list));
     EXPECT_TRUE(list.empty());
@@ -154,8 +103,7 @@ TEST_F(SessionTest, CreateRefusesBadInput)
 
 TEST_F(SessionTest, CreateAndCheckValidSession)
 {
-    VELA::Session::Options options;
-    options.idleTimeout = 600;
+    Options options = Timed(600);
     options.app = "VELA.Demo";
     options.webapi = "demo";
     options.lang = "ger";
@@ -163,11 +111,8 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
     for (char c : sid) {
         EXPECT_TRUE(isalnum(static_cast<unsigned char>(c)) || c == '-' || c == '_') << sid;
     }
-    struct stat st;
-    ASSERT_EQ(0, stat(Dir().c_str(), &st));
-    EXPECT_EQ(0700u, st.st_mode & 0777);
-    ASSERT_EQ(0, stat(File(sid).c_str(), &st));
-    EXPECT_EQ(0600u, st.st_mode & 0777);
+    EXPECT_EQ(0700u, Mode(Dir()));
+    EXPECT_EQ(0600u, Mode(File(sid)));
 
     const Json::Value doc = Read(sid);
     EXPECT_EQ("root", doc["user"].asString());
@@ -209,8 +154,7 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
     EXPECT_STREQ("ger", info.lang);
 
     // A refusal on the same handle clears what the valid check filled.
-    ASSERT_EQ(AUTH_RESULT_NO_SESSION,
-              VelaCgiIsAuthorizedEx(h.ctx, "AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA", user, sizeof(user), &info, 0));
+    ASSERT_EQ(AUTH_RESULT_NO_SESSION, VelaCgiIsAuthorizedEx(h.ctx, kAbsent, user, sizeof(user), &info, 0));
     EXPECT_STREQ("", user);
     EXPECT_STREQ("", VelaCgiGetSessionFile(h.ctx));
     EXPECT_EQ(0, VelaCgiGetTimeout(h.ctx));
@@ -225,9 +169,7 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
 
 TEST_F(SessionTest, IdleTimeoutAndLifetime)
 {
-    VELA::Session::Options options;
-    options.idleTimeout = 100;
-    options.lifetime = 250;
+    const Options options = Timed(100, 250);
     const std::string sid = Create(options);
 
     Now() += 100;  // exactly the idle timeout: still valid, and refreshed
@@ -255,10 +197,8 @@ TEST_F(SessionTest, IdleTimeoutAndLifetime)
 
 TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
 {
-    VELA::Session::Options options;
-    options.idleTimeout = 100;
-    const std::string polled = Create(options);
-    const std::string used = Create(options);
+    const std::string polled = Create(Timed(100));
+    const std::string used = Create(Timed(100));
 
     for (int i = 0; i < 3; ++i) {
         Now() += 60;
@@ -275,9 +215,7 @@ TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
 
 TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
 {
-    VELA::Session::Options options;
-    options.idleTimeout = 100;
-    const std::string sid = Create(options);
+    const std::string sid = Create(Timed(100));
     Edit(sid, "lastUse", Json::Int64(kStart + 1000000));  // the clock went back
 
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
@@ -286,7 +224,7 @@ TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
     EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
 
     // A check without refresh still pulls the future back to now.
-    const std::string polled = Create(options);
+    const std::string polled = Create(Timed(100));
     Edit(polled, "lastUse", Json::Int64(Now() + 1000000));
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(polled, VELACGI_AUTH_NO_REFRESH));
     EXPECT_EQ(Now(), Read(polled)["lastUse"].asInt64());
@@ -296,10 +234,7 @@ TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
 
 TEST_F(SessionTest, CreationInTheFutureStartsTheLifetimeNow)
 {
-    VELA::Session::Options options;
-    options.idleTimeout = 100;
-    options.lifetime = 200;
-    const std::string sid = Create(options);
+    const std::string sid = Create(Timed(100, 200));
     Edit(sid, "created", Json::Int64(kStart + 1000000));
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
     EXPECT_EQ(kStart, Read(sid)["created"].asInt64());
@@ -313,14 +248,12 @@ TEST_F(SessionTest, CreationInTheFutureStartsTheLifetimeNow)
 
 TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
 {
-    const std::string absent = "AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA";
-    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(absent));  // no directory yet
+    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(kAbsent));  // no directory yet
     const std::string sid = Create();
     // Files a path traversal could reach, inside and outside the state tree.
     std::ofstream(root_.Path() + "/x") << "outside";
     std::ofstream(root_.Path() + "/run/vela/x") << "outside";
-    std::map<std::string, std::string> before;
-    Snapshot(root_.Path(), before);
+    const auto before = Tree(root_.Path());
 
     char nul[33];
     memcpy(nul, sid.c_str(), 33);
@@ -329,7 +262,7 @@ TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
     std::string slashes = "../../../../../../../../../../../x";
     slashes.resize(32, 'a');
     const std::vector<std::string> hostile = {
-        absent, "", ".", "..", "../x", "../../x", "/etc/passwd", ".lock", std::string(10000, 'A'), sid + "A",
+        kAbsent, "", ".", "..", "../x", "../../x", "/etc/passwd", ".lock", std::string(10000, 'A'), sid + "A",
         sid.substr(0, 31), binary, slashes, sid.substr(0, 31) + "/", sid.substr(0, 31) + ".",
         std::string(31, 'A') + "=", "A%2e%2eAAAAAAAAAAAAAAAAAAAAAAAAAA", std::string(32, ' '),
     };
@@ -344,9 +277,7 @@ TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
     EXPECT_EQ(-2, VELA::Session::Remove(nullptr));
     EXPECT_TRUE(log_.Contains("malformed session id"));
 
-    std::map<std::string, std::string> after;
-    Snapshot(root_.Path(), after);
-    EXPECT_EQ(before, after);
+    EXPECT_EQ(before, Tree(root_.Path()));
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid, VELACGI_AUTH_NO_REFRESH));
 }
 
@@ -361,48 +292,24 @@ TEST_F(SessionTest, CorruptFilesAreNoSessionAndStayAsTheyAre)
     for (size_t len = 0; len < good.size() - 1; len += 5) {
         bad.push_back(good.substr(0, len));  // truncated
     }
-    bad.push_back("garbage");
-    bad.push_back("[]");
-    bad.push_back("null");
-    bad.push_back(good + "trailing");
-    bad.push_back(std::string(20000, ' ') + good);  // larger than a session file may be
-    auto mutate = [&](const char* key, const Json::Value& value) {
-        Json::Value changed = doc;
-        if (value.isNull()) {
-            changed.removeMember(key);
-        } else {
-            changed[key] = value;
-        }
-        Json::StreamWriterBuilder builder;
-        bad.push_back(Json::writeString(builder, changed));
-    };
+    bad.insert(bad.end(), {"garbage", "[]", "null", good + "trailing",
+                           std::string(20000, ' ') + good});  // the last larger than a session file may be
+    std::vector<std::pair<std::string, Json::Value>> changes = {
+        {"version", 2}, {"id", "BBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBB"}, {"user", 5}, {"user", ""},
+        {"user", std::string("ro\0ot", 5)}, {"created", "1700000000"}, {"created", -1}, {"lastUse", 1.5},
+        {"idleTimeout", 0}, {"idleTimeout", Json::Int64(VELA_SESSION_IDLE_MAX) + 1}, {"lifetime", -3},
+        {"clientIP", "not an address"}, {"skipIP", 1}, {"lang", "english"}, {"tokenProtect", "true"},
+        {"token", "short"}, {"app", std::string(300, 'a')}};
     for (const char* key : {"version", "id", "user", "created", "lastUse", "idleTimeout", "lifetime", "clientIP",
                             "skipIP", "app", "webapi", "lang", "tokenProtect", "token"}) {
-        mutate(key, Json::Value());  // missing
+        changes.push_back({key, Json::Value()});  // missing
     }
-    mutate("version", 2);
-    mutate("id", "BBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBB");
-    mutate("user", 5);
-    mutate("user", "");
-    mutate("user", std::string("ro\0ot", 5));
-    mutate("created", "1700000000");
-    mutate("created", -1);
-    mutate("lastUse", 1.5);
-    mutate("idleTimeout", 0);
-    mutate("idleTimeout", Json::Int64(VELA_SESSION_IDLE_MAX) + 1);
-    mutate("lifetime", -3);
-    mutate("clientIP", "not an address");
-    mutate("skipIP", 1);
-    mutate("lang", "english");
-    mutate("tokenProtect", "true");
-    mutate("token", "short");
-    mutate("app", std::string(300, 'a'));
+    for (const std::string& text : JsonVariants(doc, changes)) {
+        bad.push_back(text);
+    }
 
     for (const std::string& text : bad) {
-        {
-            std::ofstream out(File(sid), std::ios::binary | std::ios::trunc);
-            out << text;
-        }
+        WriteFile(File(sid), text, 0600);
         EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(sid)) << text;
         EXPECT_EQ(-1, VelaCgiUIDGet(sid.c_str(), "root")) << text;
         EXPECT_EQ(text, ReadText(File(sid))) << "the file was rewritten";
@@ -452,19 +359,14 @@ TEST_F(SessionTest, ClientAddressMustMatch)
         EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid, 0, h.ctx));
         EXPECT_STREQ("0", VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));  // the session's own flag
     }
-    {
-        ScopedEnv none("REMOTE_ADDR", nullptr);
-        EXPECT_EQ(AUTH_RESULT_IP_MISMATCH, Check(sid));
-    }
-    {
-        ScopedEnv mapped("REMOTE_ADDR", "::ffff:192.0.2.7");
-        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    for (const auto& peer : {std::make_pair(static_cast<const char*>(nullptr), AUTH_RESULT_IP_MISMATCH),
+                             std::make_pair("::ffff:192.0.2.7", AUTH_RESULT_AUTHORIZED)}) {
+        ScopedEnv remote("REMOTE_ADDR", peer.first);
+        EXPECT_EQ(peer.second, Check(sid)) << (peer.first ? peer.first : "no address");
     }
 
-    VELA::Session::Options options;
-    options.skipIP = true;
-    const std::string roaming = Create(options);
-    const std::string unbound = Create(VELA::Session::Options(), "root", "");
+    const std::string roaming = Create(With(&Options::skipIP, true));
+    const std::string unbound = Create(Options(), "root", "");
     ScopedEnv other("REMOTE_ADDR", "2001:db8::1");
     Handle h;
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(roaming, 0, h.ctx));
@@ -477,11 +379,9 @@ TEST_F(SessionTest, ClientAddressMustMatch)
 
 TEST_F(SessionTest, AntiForgeryToken)
 {
-    VELA::Session::Options options;
-    options.tokenProtect = true;
-    std::string token;
+    const Options options = With(&Options::tokenProtect, true);
+    std::string token, otherToken;
     const std::string sid = Create(options, "root", kClient, &token);
-    std::string otherToken;
     const std::string other = Create(options, "root", kClient, &otherToken);
 
     EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
@@ -492,55 +392,40 @@ TEST_F(SessionTest, AntiForgeryToken)
         EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
         EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
     }
-    {
-        ScopedEnv prefix("HTTP_X_VELA_TOKEN", token.substr(0, 31).c_str());
-        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
+    std::string encoded;
+    for (char c : token) {
+        char hex[4];
+        snprintf(hex, sizeof(hex), "%%%02X", static_cast<unsigned char>(c));
+        encoded += hex;
     }
-    {
-        ScopedEnv longer("HTTP_X_VELA_TOKEN", (token + "x").c_str());
-        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
-    }
-    {
-        ScopedEnv right("HTTP_X_VELA_TOKEN", token.c_str());
-        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(other));
-    }
-    {
-        ScopedEnv query("QUERY_STRING", ("api=VELA.Demo&VelaToken=" + token + "&method=get").c_str());
-        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-    }
-    {
-        std::string encoded;
-        for (char c : token) {
-            char hex[4];
-            snprintf(hex, sizeof(hex), "%%%02X", static_cast<unsigned char>(c));
-            encoded += hex;
+    const struct {
+        std::string header, query;  // "": not sent
+        int verdict;
+    } cases[] = {
+        {token.substr(0, 31), "", AUTH_RESULT_TOKEN_MISSING},
+        {token + "x", "", AUTH_RESULT_TOKEN_MISSING},
+        {token, "", AUTH_RESULT_AUTHORIZED},
+        {"", "api=VELA.Demo&VelaToken=" + token + "&method=get", AUTH_RESULT_AUTHORIZED},
+        {"", "Vela%54oken=" + encoded, AUTH_RESULT_AUTHORIZED},
+        {"", "XVelaToken=" + token + "&VelaTokenX=" + token, AUTH_RESULT_TOKEN_MISSING},
+    };
+    for (const auto& c : cases) {
+        ScopedEnv header("HTTP_X_VELA_TOKEN", c.header.empty() ? nullptr : c.header.c_str());
+        ScopedEnv query("QUERY_STRING", c.query.empty() ? nullptr : c.query.c_str());
+        EXPECT_EQ(c.verdict, Check(sid)) << c.header << c.query;
+        if (c.header == token) {
+            EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(other));
         }
-        ScopedEnv query("QUERY_STRING", ("Vela%54oken=" + encoded).c_str());
-        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-    }
-    {
-        ScopedEnv query("QUERY_STRING", ("XVelaToken=" + token + "&VelaTokenX=" + token).c_str());
-        EXPECT_EQ(AUTH_RESULT_TOKEN_MISSING, Check(sid));
     }
 
     // Token protection is a property of the session.
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create()));
     Handle h;
-    {
-        ScopedEnv cookie("HTTP_COOKIE", ("id=" + sid).c_str());
+    for (const auto& cookie : {std::make_pair("id=" + sid, 1), std::make_pair("id=" + Create(), 0),
+                               std::make_pair(std::string("id=../x"), 0)}) {
+        ScopedEnv env("HTTP_COOKIE", cookie.first.c_str());
         ASSERT_EQ(0, VelaCgiLoadInCookies(h.ctx));
-        EXPECT_EQ(1, VelaCgiIsTokenEnable(h.ctx));
-    }
-    {
-        ScopedEnv cookie("HTTP_COOKIE", ("id=" + Create()).c_str());
-        ASSERT_EQ(0, VelaCgiLoadInCookies(h.ctx));
-        EXPECT_EQ(0, VelaCgiIsTokenEnable(h.ctx));
-    }
-    {
-        ScopedEnv cookie("HTTP_COOKIE", "id=../x");
-        ASSERT_EQ(0, VelaCgiLoadInCookies(h.ctx));
-        EXPECT_EQ(0, VelaCgiIsTokenEnable(h.ctx));
+        EXPECT_EQ(cookie.second, VelaCgiIsTokenEnable(h.ctx)) << cookie.first;
     }
     EXPECT_EQ(0, VelaCgiIsTokenEnable(nullptr));
 }
@@ -555,7 +440,7 @@ TEST_F(SessionTest, UserOfTheSession)
 
     struct passwd* nobody = getpwnam("nobody");
     ASSERT_NE(nullptr, nobody);
-    const std::string nsid = Create(VELA::Session::Options(), "nobody");
+    const std::string nsid = Create(Options(), "nobody");
     EXPECT_EQ(static_cast<int>(nobody->pw_uid), VelaCgiUIDGet(nsid.c_str(), "nobody"));
 
     // A session whose user has gone away is no session.
@@ -567,15 +452,11 @@ TEST_F(SessionTest, UserOfTheSession)
 
 TEST_F(SessionTest, ListRemovePurge)
 {
-    VELA::Session::Options shortIdle;
-    shortIdle.idleTimeout = 60;
-    const std::string a = Create(shortIdle);
+    const std::string a = Create(Timed(60));
     Now() += 1;
-    const std::string b = Create(VELA::Session::Options(), "nobody", "2001:db8::1");
+    const std::string b = Create(Options(), "nobody", "2001:db8::1");
     Now() += 1;
-    VELA::Session::Options longIdle;
-    longIdle.idleTimeout = 7200;
-    const std::string c = Create(longIdle);
+    const std::string c = Create(Timed(7200));
     std::ofstream(Dir() + "/not-a-session") << "x";
 
     std::vector<VELA::Session::Record> list;
@@ -616,27 +497,18 @@ TEST_F(SessionTest, LanguageFromSessionOrHeader)
         return std::string(buf);
     };
     EXPECT_EQ("enu", lang(nullptr));
-    EXPECT_EQ("enu", lang(""));
-    EXPECT_EQ("ger", lang("de-DE,de;q=0.9,en;q=0.8"));
-    EXPECT_EQ("jpn", lang("fr;q=0.5, ja;q=0.9"));
-    EXPECT_EQ("fra", lang("fr;q=0.5, ja;q=0.5"));  // a tie goes to the first
-    EXPECT_EQ("cht", lang("zh-TW"));
-    EXPECT_EQ("cht", lang("zh-Hant-HK"));
-    EXPECT_EQ("chs", lang("zh-CN"));
-    EXPECT_EQ("chs", lang("zh"));
-    EXPECT_EQ("ptb", lang("pt-BR"));
-    EXPECT_EQ("ptg", lang("pt-PT"));
-    EXPECT_EQ("enu", lang("en-GB"));
-    EXPECT_EQ("ger", lang("xx-YY, *;q=0.9, de;q=0.1"));
-    EXPECT_EQ("ger", lang("en;q=0, de"));
-    EXPECT_EQ("enu", lang("de;q=1.5"));
-    EXPECT_EQ("enu", lang("de;level=1"));
-    EXPECT_EQ("enu", lang(";;;,,,=q;"));
-    EXPECT_EQ("enu", lang(("de," + std::string(5000, 'a')).c_str()));
+    const std::pair<std::string, const char*> headers[] = {
+        {"", "enu"}, {"de-DE,de;q=0.9,en;q=0.8", "ger"}, {"fr;q=0.5, ja;q=0.9", "jpn"},
+        {"fr;q=0.5, ja;q=0.5", "fra"},  // a tie goes to the first
+        {"zh-TW", "cht"}, {"zh-Hant-HK", "cht"}, {"zh-CN", "chs"}, {"zh", "chs"}, {"pt-BR", "ptb"}, {"pt-PT", "ptg"},
+        {"en-GB", "enu"}, {"xx-YY, *;q=0.9, de;q=0.1", "ger"}, {"en;q=0, de", "ger"}, {"de;q=1.5", "enu"},
+        {"de;level=1", "enu"}, {";;;,,,=q;", "enu"}, {"de," + std::string(5000, 'a'), "enu"},
+    };
+    for (const auto& header : headers) {
+        EXPECT_EQ(header.second, lang(header.first.c_str())) << header.first.substr(0, 40);
+    }
 
-    VELA::Session::Options options;
-    options.lang = "fra";
-    ASSERT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create(options), 0, h.ctx));
+    ASSERT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create(With(&Options::lang, "fra")), 0, h.ctx));
     EXPECT_EQ("fra", lang("de"));
     ASSERT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create(), 0, h.ctx));  // no language in the session
     EXPECT_EQ("ger", lang("de"));
@@ -653,33 +525,18 @@ TEST_F(SessionTest, LanguageFromSessionOrHeader)
 TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
 {
     const std::string sid = Create();
-    const int kProcesses = 8;
     const int kChecks = 50;
-    std::vector<pid_t> children;
-    for (int p = 0; p < kProcesses; ++p) {
-        const pid_t pid = fork();
-        ASSERT_GE(pid, 0);
-        if (pid == 0) {
-            int failures = 0;
-            for (int i = 0; i < kChecks; ++i) {
-                Now() = kStart + i;  // every check has a new time to write
-                char user[493];
-                if (VelaCgiIsAuthorizedEx(nullptr, sid.c_str(), user, sizeof(user), nullptr, 0) !=
-                        AUTH_RESULT_AUTHORIZED ||
-                    strcmp(user, "root") != 0) {
-                    ++failures;
-                }
-            }
-            _exit(failures > 100 ? 100 : failures);
+    const std::vector<int> failures = InChildren(8, [&](int) {
+        int failed = 0;
+        for (int i = 0; i < kChecks; ++i) {
+            Now() = kStart + i;  // every check has a new time to write
+            char user[493];
+            const int verdict = VelaCgiIsAuthorizedEx(nullptr, sid.c_str(), user, sizeof(user), nullptr, 0);
+            failed += verdict != AUTH_RESULT_AUTHORIZED || strcmp(user, "root") != 0 ? 1 : 0;
         }
-        children.push_back(pid);
-    }
-    for (pid_t pid : children) {
-        int status = 0;
-        ASSERT_EQ(pid, waitpid(pid, &status, 0));
-        ASSERT_TRUE(WIFEXITED(status));
-        EXPECT_EQ(0, WEXITSTATUS(status)) << "failed checks in process " << pid;
-    }
+        return failed;
+    });
+    EXPECT_EQ(std::vector<int>(8, 0), failures) << "failed checks per process";
     const Json::Value doc = Read(sid);
     EXPECT_EQ(sid, doc["id"].asString());
     EXPECT_GE(doc["lastUse"].asInt64(), kStart);
@@ -688,10 +545,7 @@ TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
 
     // No temporary file is left behind.
-    std::map<std::string, std::string> files;
-    Snapshot(Dir(), files);
-    for (const auto& entry : files) {
-        const std::string name = entry.first.substr(Dir().size() + 1);
+    for (const std::string& name : DirEntries(Dir())) {
         EXPECT_TRUE(name == sid || name == ".lock") << name;
     }
 }
@@ -702,36 +556,26 @@ TEST_F(SessionTest, RemovalWinsOverConcurrentRefresh)
 {
     for (int round = 0; round < 5; ++round) {
         const std::string sid = Create();
-        std::vector<pid_t> children;
-        for (int p = 0; p < 4; ++p) {
-            const pid_t pid = fork();
-            ASSERT_GE(pid, 0);
-            if (pid == 0) {
-                bool removed = false;
-                for (int i = 1; i <= 200; ++i) {
-                    Now() = kStart + i;
-                    const int verdict = Check(sid);
-                    if (verdict == AUTH_RESULT_NO_SESSION) {
-                        removed = true;
-                    } else if (verdict != AUTH_RESULT_AUTHORIZED || removed) {
-                        _exit(1);
-                    }
+        Children children(4, [&](int) {
+            bool removed = false;
+            for (int i = 1; i <= 200; ++i) {
+                Now() = kStart + i;
+                const int verdict = Check(sid);
+                if (verdict == AUTH_RESULT_NO_SESSION) {
+                    removed = true;
+                } else if (verdict != AUTH_RESULT_AUTHORIZED || removed) {
+                    return 1;
                 }
-                _exit(0);
             }
-            children.push_back(pid);
-        }
+            return 0;
+        });
         // Remove once the children are refreshing (bounded wait, not a timing
         // assertion: removing earlier only makes the round less interesting).
         for (int i = 0; i < 2000 && Read(sid)["lastUse"].asInt64() == kStart; ++i) {
             usleep(1000);
         }
         EXPECT_EQ(0, VELA::Session::Remove(sid.c_str()));
-        for (pid_t pid : children) {
-            int status = 0;
-            ASSERT_EQ(pid, waitpid(pid, &status, 0));
-            EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "a check passed after the removal";
-        }
+        EXPECT_EQ(std::vector<int>(4, 0), children.Wait()) << "a check passed after the removal";
         struct stat st;
         EXPECT_NE(0, lstat(File(sid).c_str(), &st)) << "the session came back";
     }

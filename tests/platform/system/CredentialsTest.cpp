@@ -1,42 +1,35 @@
 // Identity switches, checked on a real unprivileged account in a forked
 // child (the test process keeps root). Needs root: skipped otherwise.
-#include <gtest/gtest.h>
 
 #include <algorithm>
 #include <cstdio>
 #include <grp.h>
 #include <regex>
-#include <string>
-#include <sys/stat.h>
-#include <unistd.h>
-#include <vector>
 
 #include "platform/IdentityTestUtil.h"
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 #include "vela/log.h"
 #include "vela/user.h"
-#include "vela/vlibc.h"
 
 namespace {
 
 using VELA::Test::InChild;
-
-std::string Ids()
-{
-    uid_t r, e, s;
-    gid_t rg, eg, sg;
-    getresuid(&r, &e, &s);
-    getresgid(&rg, &eg, &sg);
-    char buf[128];
-    snprintf(buf, sizeof(buf), "uid %d/%d/%d gid %d/%d/%d", (int)r, (int)e, (int)s, (int)rg, (int)eg, (int)sg);
-    return buf;
-}
 
 std::string Want(uid_t r, uid_t e, uid_t s, gid_t rg, gid_t eg, gid_t sg)
 {
     char buf[128];
     snprintf(buf, sizeof(buf), "uid %d/%d/%d gid %d/%d/%d", (int)r, (int)e, (int)s, (int)rg, (int)eg, (int)sg);
     return buf;
+}
+
+// The real, effective and saved ids of the process, as Want writes them.
+std::string Ids()
+{
+    uid_t r, e, s;
+    gid_t rg, eg, sg;
+    getresuid(&r, &e, &s);
+    getresgid(&rg, &eg, &sg);
+    return Want(r, e, s, rg, eg, sg);
 }
 
 std::vector<gid_t> Groups()
@@ -59,7 +52,7 @@ void Check(std::string& errors, bool ok, const std::string& what)
     }
 }
 
-class Credentials : public ::testing::Test {
+class Credentials : public RootTest {
 protected:
     void SetUp() override
     {
@@ -194,14 +187,8 @@ TEST_F(Credentials, UnknownAndHostileNamesChangeNothing)
 // The owner and group of the file, with the path resolved under the root.
 TEST_F(Credentials, ExecutableOwnerAndGroup)
 {
-    VELA::Test::TempDir root;
-    VELA::Test::ScopedEnv env("VELA_ROOT", root.Path().c_str());
-    VELA::System::RootReset();
-    const std::string lib = root.Path() + "/check.so";
-    FILE* f = fopen(lib.c_str(), "w");
-    ASSERT_NE(nullptr, f);
-    fclose(f);
-    ASSERT_EQ(0, chown(lib.c_str(), account_.uid, account_.suppGid));
+    VELA::Test::WriteFile(In("/check.so"), "");
+    ASSERT_EQ(0, chown(In("/check.so").c_str(), account_.uid, account_.suppGid));
 
     const VELA::Test::TestAccount& a = account_;
     EXPECT_EQ("", InChild([&] {
@@ -217,7 +204,6 @@ TEST_F(Credentials, ExecutableOwnerAndGroup)
         Check(errors, setresuid(0, 0, 0) == 0, "cannot return to root");
         return errors;
     }));
-    VELA::System::RootReset();
 }
 
 }  // namespace

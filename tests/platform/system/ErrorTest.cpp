@@ -1,10 +1,8 @@
 // The last-error record of the process.
-#include <gtest/gtest.h>
-
 #include <cerrno>
 #include <cstring>
-#include <string>
 
+#include "platform/PlatformTest.h"
 #include "vela/sysfile.h"
 
 namespace {

@@ -1,16 +1,10 @@
 // File helpers of the platform: opening a path without following any
 // symbolic link on it.
-#include <gtest/gtest.h>
-
 #include <cerrno>
 #include <fcntl.h>
-#include <fstream>
-#include <string>
-#include <sys/stat.h>
-#include <unistd.h>
 
+#include "platform/PlatformTest.h"
 #include "platform/system/FileUtil.h"
-#include "support/TestSupport.h"
 
 namespace {
 
@@ -21,14 +15,9 @@ TEST(FileUtil, OpenNoSymlinksRefusesEveryLinkOnThePath)
     VELA::Test::TempDir root;
     const std::string files = root.Path() + "/files";
     ASSERT_EQ(0, mkdir(files.c_str(), 0755));
+    VELA::Test::MakeLinkTree(files);
     const std::string target = files + "/target.txt";
-    std::ofstream(target) << "secret";
-    ASSERT_EQ(0, mkdir((files + "/dir").c_str(), 0755));
     const std::string inDir = files + "/dir/in.txt";
-    std::ofstream(inDir) << "in";
-    ASSERT_EQ(0, symlink(target.c_str(), (files + "/last").c_str()));
-    ASSERT_EQ(0, symlink((files + "/dir").c_str(), (files + "/middle").c_str()));
-    ASSERT_EQ(0, symlink("dir", (files + "/relative").c_str()));
 
     using VELA::System::NoSymlinkResolve;
     struct Case {

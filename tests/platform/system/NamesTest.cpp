@@ -1,9 +1,5 @@
 // RFC 1123 host and domain names and address types.
-#include <gtest/gtest.h>
-
-#include <string>
-
-#include "vela/vlibc.h"
+#include "platform/PlatformTest.h"
 
 namespace {
 

@@ -1,46 +1,30 @@
 // Preference directories of users and groups.
-#include <gtest/gtest.h>
 
 #include <grp.h>
 #include <pwd.h>
-#include <string>
-#include <sys/stat.h>
-#include <unistd.h>
 
-#include "support/TestSupport.h"
-#include "vela/vlibc.h"
+#include "platform/PlatformTest.h"
 
 namespace {
 
-class Preference : public ::testing::Test {
+class Preference : public RootTest {
 protected:
-    Preference() : env_("VELA_ROOT", root_.Path().c_str()) { VELA::System::RootReset(); }
-    ~Preference() override { VELA::System::RootReset(); }
-
-    bool Exists(const std::string& relative)
-    {
-        struct stat st;
-        return lstat((root_.Path() + relative).c_str(), &st) == 0;
-    }
-
-    VELA::Test::TempDir root_;
-    VELA::Test::ScopedEnv env_;
+    bool Exists(const std::string& relative) { return access(In(relative).c_str(), F_OK) == 0; }
 };
 
 TEST_F(Preference, CreatesPrivateDirectory)
 {
     char buf[4096];
     ASSERT_EQ(0, VELAUserPreferenceDirGet("alice", buf, sizeof(buf)));
-    const std::string want = root_.Path() + "/var/lib/vela/preference/user/alice";
+    const std::string want = In("/var/lib/vela/preference/user/alice");
     EXPECT_EQ(want, buf);
     struct stat st;
     ASSERT_EQ(0, lstat(want.c_str(), &st));
-    EXPECT_TRUE(S_ISDIR(st.st_mode));
-    EXPECT_EQ(0700u, st.st_mode & 07777);
+    EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 0700), st.st_mode & (S_IFMT | 07777));
 
     ASSERT_EQ(0, VELAUserPreferenceDirGet("alice", buf, sizeof(buf)));  // existing is fine
     ASSERT_EQ(0, VELAGroupPreferenceDirGet("staff team", buf, sizeof(buf)));
-    EXPECT_EQ(root_.Path() + "/var/lib/vela/preference/group/staff team", buf);
+    EXPECT_EQ(In("/var/lib/vela/preference/group/staff team"), buf);
 }
 
 TEST_F(Preference, HostileNamesCreateNothing)
@@ -60,7 +44,7 @@ TEST_F(Preference, HostileNamesCreateNothing)
 
 TEST_F(Preference, SmallBufferAndSymlinkLeaf)
 {
-    const std::string want = root_.Path() + "/var/lib/vela/preference/user/bob";
+    const std::string want = In("/var/lib/vela/preference/user/bob");
     char buf[512];
     EXPECT_EQ(-1, VELAUserPreferenceDirGet("bob", buf, want.size()));  // no room for the NUL
     EXPECT_FALSE(Exists("/var"));
@@ -69,9 +53,8 @@ TEST_F(Preference, SmallBufferAndSymlinkLeaf)
     EXPECT_EQ(want, buf);
 
     // A symbolic link planted as the leaf is refused, not followed.
-    const std::string elsewhere = root_.Path() + "/elsewhere";
-    ASSERT_EQ(0, mkdir(elsewhere.c_str(), 0755));
-    ASSERT_EQ(0, symlink(elsewhere.c_str(), (root_.Path() + "/var/lib/vela/preference/user/eve").c_str()));
+    ASSERT_EQ(0, mkdir(In("/elsewhere").c_str(), 0755));
+    ASSERT_EQ(0, symlink(In("/elsewhere").c_str(), In("/var/lib/vela/preference/user/eve").c_str()));
     EXPECT_EQ(-1, VELAUserPreferenceDirGet("eve", buf, sizeof(buf)));
 }
 

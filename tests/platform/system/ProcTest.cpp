@@ -1,15 +1,9 @@
 // Process creation: the plain fork and the detached double fork.
-#include <gtest/gtest.h>
-
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
-#include <fstream>
-#include <string>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 #include "vela/sysfile.h"
 
 namespace {

@@ -1,10 +1,6 @@
 // The system root: VELA_ROOT, read once, and the paths resolved under it.
-#include <gtest/gtest.h>
-
-#include <string>
-
-#include "support/TestSupport.h"
-#include "vela/vlibc.h"
+#include "platform/PlatformTest.h"
+#include "vela/sysfile.h"
 
 namespace {
 
@@ -15,6 +11,7 @@ TEST(Root, DefaultAndTrailingSlashes)
         VELA::System::RootReset();
         EXPECT_EQ("/", VELA::System::Root());
         EXPECT_EQ("/etc/velainfo.conf", VELA::System::Path("/etc/velainfo.conf"));
+        EXPECT_EQ(1, VLIBCFileExist("/proc/self/status"));  // a path of the system, used as it is
     }
     {
         VELA::Test::ScopedEnv env("VELA_ROOT", "/tmp/r//");

@@ -1,11 +1,8 @@
 // ASCII case, the checked decimal parser every number from outside goes
 // through, CONTENT_LENGTH and the checked names.
-#include <gtest/gtest.h>
-
 #include <climits>
-#include <string>
 
-#include "vela/vlibc.h"
+#include "platform/PlatformTest.h"
 
 namespace {
 

@@ -1,90 +1,39 @@
 // Key=value files, files and directories, and locks.
-#include <gtest/gtest.h>
 
-#include <cerrno>
-#include <cstdio>
 #include <cstdlib>
-#include <cstring>
-#include <dirent.h>
 #include <fcntl.h>
-#include <string>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-#include <vector>
 
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 #include "vela/sysfile.h"
-#include "vela/vlibc.h"
 
 namespace {
 
-std::string ReadAll(const std::string& path)
-{
-    std::string out;
-    FILE* f = fopen(path.c_str(), "rb");
-    if (f == nullptr) {
-        return "<missing>";
-    }
-    char buf[4096];
-    size_t n;
-    while ((n = fread(buf, 1, sizeof(buf), f)) > 0) {
-        out.append(buf, n);
-    }
-    fclose(f);
-    return out;
-}
-
-void WriteFile(const std::string& path, const std::string& text)
-{
-    FILE* f = fopen(path.c_str(), "wb");
-    ASSERT_NE(nullptr, f) << path;
-    fwrite(text.data(), 1, text.size(), f);
-    fclose(f);
-}
-
-mode_t ModeOf(const std::string& path)
-{
-    struct stat st;
-    return stat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
-}
-
-using VELA::Test::DirEntries;
+using namespace VELA::Test;
 
 // A system root with etc/; a second directory stands for the rest of the
 // machine, which nothing may touch.
-class SysFile : public ::testing::Test {
+class SysFile : public RootTest {
 protected:
-    SysFile() : env_("VELA_ROOT", root_.Path().c_str())
-    {
-        VELA::System::RootReset();
-        mkdir((root_.Path() + "/etc").c_str(), 0755);
-    }
-    ~SysFile() override { VELA::System::RootReset(); }
+    SysFile() { mkdir(In("/etc").c_str(), 0755); }
 
-    std::string In(const std::string& relative) const { return root_.Path() + relative; }
-
-    VELA::Test::TempDir root_;
-    VELA::Test::TempDir outside_;
-    VELA::Test::ScopedEnv env_;
+    TempDir outside_;
 };
 
 TEST_F(SysFile, SetReplacesOneLineAndKeepsTheRest)
 {
     const std::string file = In("/etc/velainfo.conf");
-    WriteFile(file,
-              "# comment\nmodel=\"X1\"\n\nenable_data_collect=\"no\"\nother=plain\nenable_data_collect=\"maybe\"");
-    ASSERT_EQ(0, chmod(file.c_str(), 0640));
+    WriteFile(file, "# comment\nmodel=\"X1\"\n\nenable_data_collect=\"no\"\nother=plain\nenable_data_collect=\"maybe\"",
+              0640);
 
     EXPECT_EQ(1, VLIBCFileCheckKeyValue("/etc/velainfo.conf", "enable_data_collect", "maybe", 0));  // last wins
     ASSERT_EQ(0, VLIBCINFOSetKeyValue("enable_data_collect", "yes"));
-    EXPECT_EQ("# comment\nmodel=\"X1\"\n\nenable_data_collect=\"yes\"\nother=plain\n", ReadAll(file));
+    EXPECT_EQ("# comment\nmodel=\"X1\"\n\nenable_data_collect=\"yes\"\nother=plain\n", ReadText(file));
     ASSERT_EQ(0, VLIBCINFOSetKeyValue("new.key-1", " a \"quoted\" value\t"));
     char buf[64];
     ASSERT_EQ(1, VLIBCINFOGetKeyValue("new.key-1", buf, sizeof(buf)));
     EXPECT_STREQ(" a \"quoted\" value\t", buf);
 
-    EXPECT_EQ(0640u, ModeOf(file));
+    EXPECT_EQ(0640u, Mode(file));
     EXPECT_EQ(1, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", "yes", 0));  // already under the root
     EXPECT_EQ(0, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", "YES", 0));
     EXPECT_EQ(1, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", "YES", VLIBC_KV_NOCASE));
@@ -96,7 +45,7 @@ TEST_F(SysFile, SetReplacesOneLineAndKeepsTheRest)
     EXPECT_EQ(0, VLIBCFileGetKeyValue("/etc/none.conf", "a", buf, sizeof(buf)));
     EXPECT_EQ(VLIBC_ERR_NOT_FOUND, VLIBCErrGet());
     ASSERT_EQ(0, VLIBCFileSetKeyValue("/etc/new.conf", "a", ""));  // created
-    EXPECT_EQ("a=\"\"\n", ReadAll(In("/etc/new.conf")));
+    EXPECT_EQ("a=\"\"\n", ReadText(In("/etc/new.conf")));
 }
 
 TEST_F(SysFile, InvalidKeysAndValuesAreRefused)
@@ -113,7 +62,7 @@ TEST_F(SysFile, InvalidKeysAndValuesAreRefused)
     }
     EXPECT_EQ(-1, VLIBCINFOSetKeyValue(nullptr, "x"));
     EXPECT_EQ(-1, VLIBCINFOSetKeyValue("a", nullptr));
-    EXPECT_EQ("a=\"1\"\n", ReadAll(file));
+    EXPECT_EQ("a=\"1\"\n", ReadText(file));
     EXPECT_EQ(std::vector<std::string>{"velainfo.conf"}, DirEntries(In("/etc")));  // no temporary file left
 }
 
@@ -136,7 +85,7 @@ TEST_F(SysFile, CorruptOrTruncatedFilesAreNotUsedNorRewritten)
         EXPECT_EQ(VLIBC_ERR_CORRUPT, VLIBCErrGet());
         EXPECT_EQ(0, VLIBCFileCheckKeyValue("/etc/velainfo.conf", "a", "1", 0));
         EXPECT_EQ(-1, VLIBCINFOSetKeyValue("a", "2"));
-        EXPECT_EQ(text, ReadAll(file));
+        EXPECT_EQ(text, ReadText(file));
     }
     WriteFile(file, std::string(1024 * 1024 + 1, '#'));
     EXPECT_EQ(0, VLIBCFileCheckKeyValue("/etc/velainfo.conf", "a", "1", 0));
@@ -164,9 +113,9 @@ TEST_F(SysFile, LinksOutOfTheRootAreNotFollowed)
     EXPECT_EQ(-1, VELAFSMkdirP("/etc/dir", 0, 1, (uid_t)-1, (gid_t)-1, 0777));  // reset through a link
     EXPECT_EQ(-1, VELAFSMkdirP("/etc/../../escape", 0, 0, (uid_t)-1, (gid_t)-1, 0755));
 
-    EXPECT_EQ("a=\"1\"\n", ReadAll(victim));
+    EXPECT_EQ("a=\"1\"\n", ReadText(victim));
     EXPECT_EQ(std::vector<std::string>{"victim"}, DirEntries(outside_.Path()));
-    EXPECT_EQ(0700u, ModeOf(outside_.Path()));
+    EXPECT_EQ(0700u, Mode(outside_.Path()));
 }
 
 TEST_F(SysFile, MkdirPCreatesParentsWithExactModes)
@@ -175,14 +124,14 @@ TEST_F(SysFile, MkdirPCreatesParentsWithExactModes)
     EXPECT_EQ(0, VELAFSMkdirP("/var/spool/webapi", 0, 0, (uid_t)-1, (gid_t)-1, 0751));
     EXPECT_EQ(0, VELAFSMkdirP("/a//b/./c/", 1, 0, (uid_t)-1, (gid_t)-1, 0711));
     umask(old);
-    EXPECT_EQ(0755u, ModeOf(In("/var")));
-    EXPECT_EQ(0751u, ModeOf(In("/var/spool/webapi")));
-    EXPECT_EQ(0711u, ModeOf(In("/a/b")));
+    EXPECT_EQ(0755u, Mode(In("/var")));
+    EXPECT_EQ(0751u, Mode(In("/var/spool/webapi")));
+    EXPECT_EQ(0711u, Mode(In("/a/b")));
     // An existing directory keeps its mode unless asked.
     EXPECT_EQ(0, VELAFSMkdirP("/var/spool/webapi", 0, 0, (uid_t)-1, (gid_t)-1, 0700));
-    EXPECT_EQ(0751u, ModeOf(In("/var/spool/webapi")));
+    EXPECT_EQ(0751u, Mode(In("/var/spool/webapi")));
     EXPECT_EQ(0, VELAFSMkdirP("/var/spool/webapi", 0, 1, (uid_t)-1, (gid_t)-1, 0700));
-    EXPECT_EQ(0700u, ModeOf(In("/var/spool/webapi")));
+    EXPECT_EQ(0700u, Mode(In("/var/spool/webapi")));
 
     WriteFile(In("/etc/file"), "");
     EXPECT_EQ(-1, VELAFSMkdirP("/etc/file/sub", 0, 0, (uid_t)-1, (gid_t)-1, 0755));
@@ -232,20 +181,17 @@ TEST_F(SysFile, UnlockRefusesWhatIsNotALockHandle)
 // Another process holds the lock: the wait ends with a failure.
 TEST_F(SysFile, LockWaitIsBounded)
 {
-    int ready[2];
-    int release[2];
+    int ready[2], release[2];
     ASSERT_EQ(0, pipe(ready));
     ASSERT_EQ(0, pipe(release));
-    const pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
+    Children holder(1, [&](int) {
         int handle = -1;
         const char ok = VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 5, &handle) == 0 ? 'y' : 'n';
         (void)!write(ready[1], &ok, 1);
         char c;
         (void)!read(release[0], &c, 1);  // hold the lock until told
-        _exit(0);
-    }
+        return 0;
+    });
     char ok = 0;
     ASSERT_EQ(1, read(ready[0], &ok, 1));
     ASSERT_EQ('y', ok);
@@ -257,8 +203,7 @@ TEST_F(SysFile, LockWaitIsBounded)
     EXPECT_EQ(-1, VLIBCFileLockTimeByFile("/etc/counter.lock", 0, 0, &handle));  // shared waits too
 
     (void)!write(release[1], "x", 1);
-    int status = 0;
-    ASSERT_EQ(pid, waitpid(pid, &status, 0));
+    ASSERT_EQ(std::vector<int>{0}, holder.Wait());
     ASSERT_EQ(0, VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 0, &handle));  // free again
     EXPECT_EQ(0, VLIBCFileUnlockByFile(handle));
     for (int fd : {ready[0], ready[1], release[0], release[1]}) {
@@ -271,40 +216,30 @@ TEST_F(SysFile, LockedCounterLosesNoUpdate)
 {
     constexpr int kProcesses = 8;
     constexpr int kRounds = 200;
-    std::vector<pid_t> children;
-    for (int p = 0; p < kProcesses; ++p) {
-        const pid_t pid = fork();
-        ASSERT_GE(pid, 0);
-        if (pid == 0) {
-            for (int i = 0; i < kRounds; ++i) {
-                int handle = -1;
-                while (VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 2, &handle) != 0) {
-                    if (VLIBCErrGet() != VLIBC_ERR_TIMEOUT) {
-                        _exit(1);
-                    }
-                }
-                char buf[32];
-                const int found = VLIBCFileGetKeyValue("/etc/counter", "count", buf, sizeof(buf));
-                if (found < 0) {
-                    _exit(2);
-                }
-                const long next = (found == 1 ? strtol(buf, nullptr, 10) : 0) + 1;
-                if (VLIBCFileSetKeyValue("/etc/counter", "count", std::to_string(next).c_str()) != 0) {
-                    _exit(3);
-                }
-                if (VLIBCFileUnlockByFile(handle) != 0) {
-                    _exit(4);
+    const std::vector<int> codes = InChildren(kProcesses, [](int) {
+        for (int i = 0; i < kRounds; ++i) {
+            int handle = -1;
+            while (VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 2, &handle) != 0) {
+                if (VLIBCErrGet() != VLIBC_ERR_TIMEOUT) {
+                    return 1;
                 }
             }
-            _exit(0);
+            char buf[32];
+            const int found = VLIBCFileGetKeyValue("/etc/counter", "count", buf, sizeof(buf));
+            if (found < 0) {
+                return 2;
+            }
+            const long next = (found == 1 ? strtol(buf, nullptr, 10) : 0) + 1;
+            if (VLIBCFileSetKeyValue("/etc/counter", "count", std::to_string(next).c_str()) != 0) {
+                return 3;
+            }
+            if (VLIBCFileUnlockByFile(handle) != 0) {
+                return 4;
+            }
         }
-        children.push_back(pid);
-    }
-    for (pid_t pid : children) {
-        int status = -1;
-        ASSERT_EQ(pid, waitpid(pid, &status, 0));
-        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
-    }
+        return 0;
+    });
+    EXPECT_EQ(std::vector<int>(kProcesses, 0), codes);
     char buf[32];
     ASSERT_EQ(1, VLIBCFileGetKeyValue("/etc/counter", "count", buf, sizeof(buf)));
     EXPECT_EQ(std::to_string(kProcesses * kRounds), buf);

@@ -1,9 +1,5 @@
 // The string table.
-#include <gtest/gtest.h>
-
-#include <string>
-
-#include "vela/vlibc.h"
+#include "platform/PlatformTest.h"
 #include "vela/webapiutil.h"
 
 namespace {

@@ -1,44 +1,12 @@
 // Users, administrators and application privileges.
-#include <gtest/gtest.h>
-
-#include <cstdio>
 #include <grp.h>
 #include <pwd.h>
-#include <string>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include "platform/IdentityTestUtil.h"
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 #include "vela/user.h"
-#include "vela/vlibc.h"
 
 namespace {
-
-void WriteFile(const std::string& path, const std::string& text)
-{
-    FILE* f = fopen(path.c_str(), "w");
-    ASSERT_NE(nullptr, f) << path;
-    fwrite(text.data(), 1, text.size(), f);
-    fclose(f);
-}
-
-// A system root with etc/vela/ for the configuration files.
-class UserRoot : public ::testing::Test {
-protected:
-    UserRoot() : env_("VELA_ROOT", root_.Path().c_str())
-    {
-        VELA::System::RootReset();
-        mkdir((root_.Path() + "/etc").c_str(), 0755);
-        mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
-    }
-    ~UserRoot() override { VELA::System::RootReset(); }
-
-    void Conf(const std::string& name, const std::string& text) { WriteFile(root_.Path() + "/etc/vela/" + name, text); }
-
-    VELA::Test::TempDir root_;
-    VELA::Test::ScopedEnv env_;
-};
 
 TEST(UserLookup, HostileNamesAreRefused)
 {
@@ -63,6 +31,9 @@ TEST(UserLookup, RecordsComeFromNss)
     PVELAUSER user = nullptr;
     ASSERT_EQ(0, VELAUserGetByUID(0, &user));
     EXPECT_STREQ(getpwuid(0)->pw_name, user->szName);
+    VELAUserFree(user);
+    ASSERT_EQ(0, VELAUserGetByName(getpwuid(0)->pw_name, &user));
+    EXPECT_EQ(0u, user->uid);
     VELAUserFree(user);
     uid_t uid = 1;
     gid_t gid = 1;
@@ -101,7 +72,7 @@ TEST(UserLookup, SystemIsTheSuperuserOnlyAsRunAsName)
 
 // Privileges of an ordinary existing account ("nobody", primary group
 // "nogroup" on Debian); no root needed.
-class UserAppPriv : public UserRoot {
+class UserAppPriv : public RootTest {
 protected:
     void SetUp() override
     {
@@ -113,17 +84,15 @@ protected:
     }
 };
 
-TEST_F(UserAppPriv, MissingOrCorruptFileLeavesAdministratorsOnly)
+TEST_F(UserAppPriv, UsersGroupsAndAddresses)
 {
+    // A missing or corrupt file leaves the administrators only.
     EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Photo", "10.0.0.1"));
     EXPECT_EQ(1, VLIBAppPrivUserHas("root", "VELA.Photo", "10.0.0.1"));
     Conf("app_privileges.json", R"({"applications": {"VELA.Photo": {"users": ["nobody"]})");  // cut short
     EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Photo", "10.0.0.1"));
     EXPECT_EQ(1, VLIBAppPrivUserHas("root", "VELA.Photo", nullptr));
-}
 
-TEST_F(UserAppPriv, UsersGroupsAndAddresses)
-{
     Conf("app_privileges.json", R"({"applications": {
         "VELA.Users": {"users": ["nobody"]},
         "VELA.Groups": {"groups": ["vela-no-such-group", "nogroup"]},
@@ -151,7 +120,7 @@ TEST_F(UserAppPriv, UsersGroupsAndAddresses)
 }
 
 // Membership of the administrators group on a real account. Needs root.
-class UserAdminGroup : public UserRoot {
+class UserAdminGroup : public RootTest {
 protected:
     void SetUp() override
     {
@@ -176,6 +145,11 @@ protected:
 TEST_F(UserAdminGroup, MembershipFollowsTheConfiguredGroup)
 {
     const char* user = account_.user.c_str();
+    // A supplementary group grants an application.
+    Conf("app_privileges.json", "{\"applications\": {\"VELA.Team\": {\"groups\": [\"" + account_.supp + "\"]}}}");
+    EXPECT_EQ(1, VLIBAppPrivUserHas(user, "VELA.Team", "10.0.0.1"));
+    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Team", "10.0.0.1"));
+
     Conf("webapi.conf", "# test\ntrusted_proxies=\"127.0.0.1\"\nadmin_group=\"" + admins_ + "\"\n");
     EXPECT_EQ(0, VLIBGroupIsAdminGroupMem(user, 0));
     EXPECT_EQ(1, VLIBGroupIsAdminGroupMem("root", 0));
@@ -201,13 +175,6 @@ TEST_F(UserAdminGroup, MembershipFollowsTheConfiguredGroup)
         EXPECT_EQ(0, VLIBAppPrivUserHas(user, "VELA.Any", "10.0.0.1")) << bad;
         EXPECT_EQ(1, VLIBGroupIsAdminGroupMem("root", 0)) << bad;
     }
-}
-
-TEST_F(UserAdminGroup, SupplementaryGroupGrantsApplication)
-{
-    Conf("app_privileges.json", "{\"applications\": {\"VELA.Team\": {\"groups\": [\"" + account_.supp + "\"]}}}");
-    EXPECT_EQ(1, VLIBAppPrivUserHas(account_.user.c_str(), "VELA.Team", "10.0.0.1"));
-    EXPECT_EQ(0, VLIBAppPrivUserHas("nobody", "VELA.Team", "10.0.0.1"));
 }
 
 }  // namespace

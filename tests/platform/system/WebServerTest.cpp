@@ -1,17 +1,11 @@
 // Web-server restart: the signal reaches only a process that the pid file
 // names and that carries the configured name.
-#include <gtest/gtest.h>
 
 #include <csignal>
-#include <fstream>
-#include <string>
+#include <memory>
 #include <sys/prctl.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include "platform/StateRootTest.h"
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 #include "vela/webserver.h"
 
 namespace {
@@ -24,69 +18,56 @@ class Child {
 public:
     explicit Child(const char* name)
     {
-        sigset_t usr1;
+        sigset_t usr1, old;
         sigemptyset(&usr1);
         sigaddset(&usr1, SIGUSR1);
-        sigprocmask(SIG_BLOCK, &usr1, &old_);
+        sigprocmask(SIG_BLOCK, &usr1, &old);
         int ready[2];
-        int go[2];
         EXPECT_EQ(0, pipe(ready));
-        EXPECT_EQ(0, pipe(go));
-        pid_ = fork();
-        if (pid_ == 0) {
-            close(ready[0]);
-            close(go[1]);  // else the read below never sees the parent's close
+        EXPECT_EQ(0, pipe(go_));
+        child_.reset(new VELA::Test::Children(1, [&](int) {
+            close(go_[1]);  // else the read below never sees the parent's close
             if (name != nullptr) {
                 prctl(PR_SET_NAME, name, 0, 0, 0);
             }
             char c = 'r';
             (void)!write(ready[1], &c, 1);
-            (void)!read(go[0], &c, 1);
+            (void)!read(go_[0], &c, 1);
             sigset_t pending;
             sigpending(&pending);
-            _exit(sigismember(&pending, SIGUSR1) ? 1 : 0);
-        }
-        sigprocmask(SIG_SETMASK, &old_, nullptr);
+            return sigismember(&pending, SIGUSR1) ? 1 : 0;
+        }));
+        sigprocmask(SIG_SETMASK, &old, nullptr);
         close(ready[1]);
-        close(go[0]);
+        close(go_[0]);
         char c;
         EXPECT_EQ(1, read(ready[0], &c, 1));
         close(ready[0]);
-        go_ = go[1];
     }
-    pid_t Pid() const { return pid_; }
+    pid_t Pid() const { return child_->Pid(0); }
     // True when the child saw SIGUSR1 pending.
     bool Finish()
     {
-        close(go_);
-        int status = 0;
-        waitpid(pid_, &status, 0);
-        return WIFEXITED(status) && WEXITSTATUS(status) == 1;
+        close(go_[1]);
+        return child_->Wait() == std::vector<int>{1};
     }
 
 private:
-    pid_t pid_;
-    int go_;
-    sigset_t old_;
+    int go_[2];
+    std::unique_ptr<VELA::Test::Children> child_;
 };
 
-class WebServer : public StateRootTest {
+class WebServer : public RootTest {
 protected:
-    void SetUp() override
+    WebServer()
     {
-        StateRootTest::SetUp();
-        mkdir((root_.Path() + "/etc").c_str(), 0755);
-        mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
-        mkdir((root_.Path() + "/run").c_str(), 0755);
-        Conf(std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/test.pid\"\n");
+        mkdir(In("/run").c_str(), 0755);
+        Conf("webapi.conf", std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/test.pid\"\n");
     }
-    void Conf(const std::string& text) { std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << text; }
     void PidFile(const std::string& text, mode_t mode = 0644)
     {
-        const std::string path = root_.Path() + "/run/test.pid";
-        unlink(path.c_str());
-        std::ofstream(path) << text;
-        chmod(path.c_str(), mode);
+        unlink(In("/run/test.pid").c_str());
+        VELA::Test::WriteFile(In("/run/test.pid"), text, mode);
     }
     bool Restart()
     {
@@ -115,11 +96,9 @@ TEST_F(WebServer, RefusesUntrustworthyPidFilesAndConfiguration)
 {
     Child server(kServerName);
     const std::string pid = std::to_string(server.Pid());
-    pid_t gone = fork();
-    if (gone == 0) {
-        _exit(0);
-    }
-    waitpid(gone, nullptr, 0);
+    VELA::Test::Children goneChild(1, [](int) { return 0; });
+    const pid_t gone = goneChild.Pid(0);
+    goneChild.Wait();
 
     for (const std::string& text : {std::string(""), std::string("abc"), std::string("0"), std::string("1"),
                                     std::string("-5"), pid + " 7", "+" + pid, std::to_string(gone)}) {
@@ -129,16 +108,15 @@ TEST_F(WebServer, RefusesUntrustworthyPidFilesAndConfiguration)
     PidFile(pid, 0666);  // anyone could have written it
     EXPECT_FALSE(Restart());
     PidFile(pid);
-    const std::string link = root_.Path() + "/run/link.pid";
-    ASSERT_EQ(0, symlink((root_.Path() + "/run/test.pid").c_str(), link.c_str()));
-    Conf(std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/link.pid\"\n");
+    ASSERT_EQ(0, symlink(In("/run/test.pid").c_str(), In("/run/link.pid").c_str()));
+    Conf("webapi.conf", std::string("httpd_name=\"") + kServerName + "\"\nhttpd_pidfile=\"/run/link.pid\"\n");
     EXPECT_FALSE(Restart());
     for (const char* bad : {"httpd_name=\"a/b\"\nhttpd_pidfile=\"/run/test.pid\"\n",
                             "httpd_name=\"velatesthttpd\"\nhttpd_pidfile=\"run/test.pid\"\n",
                             "httpd_name=\"velatesthttpd\"\nhttpd_pidfile=\"/run/../run/test.pid\"\n",
                             "httpd_name=\"velatesthttpd\"\nhttpd_pidfile=\"/run/test.pid\"\nhttpd_restart_signal=KILL\n",
                             "httpd_name=\"unterminated\n"}) {
-        Conf(bad);
+        Conf("webapi.conf", bad);
         velaw3::Engine engine;
         EXPECT_FALSE(engine.IsValid()) << bad;
         EXPECT_FALSE(velaw3::TARN(engine).RestartService()) << bad;

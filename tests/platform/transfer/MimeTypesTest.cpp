@@ -1,14 +1,6 @@
 // MIME types of file names: the system's table, else the built-in one.
-#include <gtest/gtest.h>
-
-#include <fstream>
-#include <string>
-#include <sys/stat.h>
-
-#include "platform/StateRootTest.h"
-#include "support/TestSupport.h"
+#include "platform/PlatformTest.h"
 #include "vela/httpoutput.h"
-#include "vela/vlibc.h"
 
 namespace {
 

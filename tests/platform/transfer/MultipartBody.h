@@ -2,17 +2,11 @@
 // that look like delimiters, and the reader run over a memfd or a pipe.
 #pragma once
 
-#include <gtest/gtest.h>
-
-#include <string>
 #include <sys/mman.h>
 #include <thread>
-#include <unistd.h>
-#include <utility>
-#include <vector>
 
+#include "platform/PlatformTest.h"
 #include "vela/upload.h"
-#include "vela/vlibc.h"
 
 namespace VELA {
 namespace Test {
@@ -21,14 +15,9 @@ inline const char kBoundary[] = "----VelaFormBoundary7MA4YWxk";
 inline const std::string kType = std::string("multipart/form-data; boundary=") + kBoundary;
 
 struct Part {
-    Part(std::string n, std::string c) : name(std::move(n)), content(std::move(c)) {}
-    Part(std::string n, std::string c, std::string f, bool file)
-        : name(std::move(n)), content(std::move(c)), fileName(std::move(f)), isFile(file)
-    {
-    }
     std::string name;
     std::string content;
-    std::string fileName;
+    std::string fileName = "";
     bool isFile = false;  // false: a plain field
 };
 

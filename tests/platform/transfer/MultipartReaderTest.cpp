@@ -1,14 +1,9 @@
 // The multipart/form-data parser behind the upload calls: delimiters across
 // the edges of its buffer, the Content-Type and its boundary.
-#include <gtest/gtest.h>
-
 #include <cstring>
-#include <string>
-#include <unistd.h>
 
 #include "platform/transfer/MultipartBody.h"
 #include "platform/transfer/MultipartReader.h"
-#include "support/TestSupport.h"
 #include "vela/upload.h"
 
 namespace {

@@ -1,54 +1,33 @@
 // Private upload directories (vela/uploaddir.h): made, used and removed;
 // which base directories are trusted; removal when a signal ends the
 // request; the sweep of directories left by processes that are gone.
-#include <gtest/gtest.h>
 
-#include <algorithm>
 #include <chrono>
 #include <climits>
 #include <csignal>
 #include <cstdlib>
 #include <fcntl.h>
-#include <string>
 #include <sys/file.h>
-#include <sys/mman.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
 #include <thread>
-#include <unistd.h>
-#include <vector>
 
-#include "support/TestSupport.h"
+#include "platform/transfer/MultipartBody.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
 #include "vela/upload.h"
 #include "vela/uploaddir.h"
-#include "vela/vlibc.h"
 
 namespace {
 
 using namespace VELA::Transfer;
+using namespace VELA::Test;
 
-using VELA::Test::DirEntries;
-using VELA::Test::LogCapture;
-using VELA::Test::ReadText;
-using VELA::Test::TempDir;
-
-const char kType[] = "multipart/form-data; boundary=XyZ";
-const std::string kFileHead = "--XyZ\r\nContent-Disposition: form-data; name=\"f\"; filename=\"a.bin\"\r\n\r\n";
+// The start of a body whose file part is still coming.
+const std::string kFileHead = std::string("--") + kBoundary + "\r\n" + PartHead({"f", "", "a.bin", true});
 
 mode_t ModeOf(const std::string& path)
 {
     struct stat st;
     return lstat(path.c_str(), &st) == 0 ? st.st_mode : 0;
-}
-
-void WriteFile(const std::string& path, const std::string& text)
-{
-    FILE* f = fopen(path.c_str(), "w");
-    ASSERT_NE(nullptr, f) << path;
-    fputs(text.c_str(), f);
-    fclose(f);
 }
 
 // Sets the modification time of `path` to `age` seconds ago.
@@ -72,23 +51,9 @@ bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 // Stores one upload with the multipart reader into `dir`; its stored path.
 std::string Store(const std::string& dir, const std::string& content)
 {
-    const std::string body = kFileHead + content + "\r\n--XyZ--\r\n";
-    const int fd = memfd_create("body", MFD_CLOEXEC);
-    EXPECT_EQ(static_cast<ssize_t>(body.size()), write(fd, body.data(), body.size()));
-    lseek(fd, 0, SEEK_SET);
-    UploadReader* reader = nullptr;
-    PVLIBCSZHASH fields = VLIBCSzHashAlloc(4);
-    PVLIBCSZHASH files = VLIBCSzHashAlloc(4);
-    std::string stored;
-    if (UploadReaderOpen(fd, body.size(), kType, &reader) == 1 &&
-        UploadReadAll(reader, fields, files, dir.c_str(), 0, nullptr) == 1) {
-        stored = VLIBCSzHashGetValue(files, "f");
-    }
-    UploadReaderFree(reader);
-    VLIBCSzHashFree(fields);
-    VLIBCSzHashFree(files);
-    close(fd);
-    return stored;
+    Result r;
+    ReadAllText(Body({{"f", content, "a.bin", true}}), dir, r);
+    return r.rc == 1 ? r.File("f") : "";
 }
 
 }  // namespace
@@ -119,14 +84,7 @@ TEST(UploadDir, MadeOncePrivateAndRemovedWithItsFiles)
     // A child that inherited the handlers dies of the signal without
     // touching its parent's directory.
     ASSERT_EQ(0, UploadCleanupOnExit());
-    const pid_t child = fork();
-    if (child == 0) {
-        raise(SIGTERM);
-        _exit(0);
-    }
-    int status = 0;
-    ASSERT_EQ(child, waitpid(child, &status, 0));
-    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGTERM) << status;
+    EXPECT_EQ(std::vector<int>{128 + SIGTERM}, InChildren(1, [](int) { return raise(SIGTERM); }));
     EXPECT_EQ("data", ReadText(stored));
 
     EXPECT_EQ(0, UploadDirRemove());
@@ -167,13 +125,9 @@ TEST(UploadDir, OnlyTrustedBasesAreUsed)
     EXPECT_EQ(0, UploadBaseUsable(shared.c_str()));
     ASSERT_EQ(0, chown(shared.c_str(), 0, 0));
     ASSERT_EQ(0, chmod(shared.c_str(), 0777));
-    const pid_t child = fork();
-    if (child == 0) {
-        _exit(setresuid(65534, 65534, 65534) == 0 && UploadBaseUsable(shared.c_str()) == 0 ? 0 : 1);
-    }
-    int status = 0;
-    ASSERT_EQ(child, waitpid(child, &status, 0));
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+    EXPECT_EQ(std::vector<int>{0}, InChildren(1, [&](int) {
+                  return setresuid(65534, 65534, 65534) == 0 && UploadBaseUsable(shared.c_str()) == 0 ? 0 : 1;
+              }));
     EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 0777), ModeOf(shared));
 }
 
@@ -193,26 +147,19 @@ TEST(UploadDir, SignalsAndExitRemoveAPartialUpload)
         TempDir base;
         int in[2];
         ASSERT_EQ(0, pipe(in));
-        const pid_t child = fork();
-        if (child == 0) {
+        Children child(1, [&](int) {
             close(in[1]);
             if (c.ignored != 0) {
                 signal(c.ignored, SIG_IGN);
             }
             char path[PATH_MAX];
-            UploadReader* reader = nullptr;
-            PVLIBCSZHASH fields = VLIBCSzHashAlloc(4);
-            PVLIBCSZHASH files = VLIBCSzHashAlloc(4);
-            if (UploadCleanupOnExit() != 0 || UploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 ||
-                UploadReaderOpen(in[0], 1ULL << 30, kType, &reader) != 1) {
-                _exit(2);
+            if (UploadCleanupOnExit() != 0 || UploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2) {
+                return 2;
             }
-            UploadReadAll(reader, fields, files, path, 0, nullptr);  // waits for the rest of the body
-            UploadReaderFree(reader);
-            VLIBCSzHashFree(fields);
-            VLIBCSzHashFree(files);
+            Result r;
+            ReadAll(in[0], 1ULL << 30, kType, path, r);  // waits for the rest of the body
             exit(3);
-        }
+        });
         close(in[0]);
         const std::string part = kFileHead + std::string(256 * 1024, 'p');
         ASSERT_EQ(static_cast<ssize_t>(part.size()), write(in[1], part.data(), part.size()));
@@ -230,18 +177,13 @@ TEST(UploadDir, SignalsAndExitRemoveAPartialUpload)
             std::this_thread::sleep_for(std::chrono::milliseconds(10));
         }
         ASSERT_TRUE(stored);
-        if (c.ignored != 0) {
-            kill(child, c.ignored);
-        }
-        if (c.sig != 0) {
-            kill(child, c.sig);
+        for (int sig : {c.ignored, c.sig}) {
+            if (sig != 0) {
+                kill(child.Pid(0), sig);
+            }
         }
         close(in[1]);
-        int status = 0;
-        ASSERT_EQ(child, waitpid(child, &status, 0));
-        EXPECT_TRUE(c.sig != 0 ? WIFSIGNALED(status) && WTERMSIG(status) == c.sig
-                               : WIFEXITED(status) && WEXITSTATUS(status) == 3)
-            << status;
+        EXPECT_EQ(std::vector<int>{c.sig != 0 ? 128 + c.sig : 3}, child.Wait());
         EXPECT_TRUE(DirEntries(base.Path()).empty());
     }
 }
@@ -259,29 +201,27 @@ TEST(UploadDir, ReaperRemovesWhatRootStoredAfterTheDrop)
         TempDir base;
         int ready[2];
         ASSERT_EQ(0, pipe(ready));
-        const pid_t child = fork();
-        if (child == 0) {
+        Children child(1, [&](int) {
             char path[PATH_MAX];
             if (UploadDirGet(base.Path().c_str(), path, sizeof(path)) != 2 || Store(path, "root's").empty() ||
                 UploadDirReaper() != 1 || setresgid(65534, 65534, 65534) != 0 ||
                 setresuid(65534, 65534, 65534) != 0) {
-                _exit(2);
+                return 2;
             }
             if (!killed) {
-                _exit(UploadDirRemove());
+                return UploadDirRemove();
             }
             (void)!write(ready[1], "r", 1);
             pause();
-        }
+            return 0;
+        });
         close(ready[1]);
         char c;
         if (killed && read(ready[0], &c, 1) == 1) {
-            kill(child, SIGKILL);
+            kill(child.Pid(0), SIGKILL);
         }
         close(ready[0]);
-        int status = 0;
-        ASSERT_EQ(child, waitpid(child, &status, 0));
-        EXPECT_TRUE(killed ? WIFSIGNALED(status) : WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+        EXPECT_EQ(std::vector<int>{killed ? 128 + SIGKILL : 0}, child.Wait());
         for (int i = 0; i < 500 && !DirEntries(base.Path()).empty(); ++i) {
             std::this_thread::sleep_for(std::chrono::milliseconds(10));
         }

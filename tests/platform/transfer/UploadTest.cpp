@@ -1,22 +1,13 @@
 // The upload calls (vela/upload.h): bodies fed through memfds and pipes,
 // files stored in a fresh directory.
-#include <gtest/gtest.h>
 
 #include <cstring>
 #include <fcntl.h>
-#include <string>
-#include <sys/mman.h>
 #include <sys/resource.h>
-#include <sys/stat.h>
 #include <thread>
-#include <utility>
-#include <unistd.h>
-#include <vector>
 
 #include "platform/transfer/MultipartBody.h"
-#include "support/TestSupport.h"
 #include "vela/upload.h"
-#include "vela/vlibc.h"
 
 namespace {
 
@@ -58,26 +49,25 @@ TEST(UploadRead, FieldsAndFilesFromOneForm)
         EXPECT_EQ("second file", ReadText(second));
         for (const std::string& path : {first, second}) {
             EXPECT_EQ(dir.Path() + "/upload-", path.substr(0, dir.Path().size() + 8));
-            struct stat st;
-            ASSERT_EQ(0, stat(path.c_str(), &st));
-            EXPECT_EQ(0600u, st.st_mode & 0777);
+            EXPECT_EQ(0600u, Mode(path));
             unlink(path.c_str());
         }
         EXPECT_TRUE(DirEntries(dir.Path()).empty());
     }
 }
 
-unsigned long long g_progressCalls;
-unsigned long long g_progressDone;
-unsigned long long g_progressTotal;
-bool g_progressMonotonic;
+// What the progress callback was told.
+struct {
+    unsigned long long calls = 0, done = 0, total = 0;
+    bool monotonic = true;
+} g_progress;
 
 void OnProgress(unsigned long long done, unsigned long long total)
 {
-    g_progressMonotonic = g_progressMonotonic && done >= g_progressDone && done <= total;
-    ++g_progressCalls;
-    g_progressDone = done;
-    g_progressTotal = total;
+    g_progress.monotonic = g_progress.monotonic && done >= g_progress.done && done <= total;
+    ++g_progress.calls;
+    g_progress.done = done;
+    g_progress.total = total;
 }
 
 long PeakRssKiB()
@@ -114,8 +104,6 @@ TEST(UploadRead, LargeFileStreamsInBoundedMemory)
         close(fds[1]);
     });
     const long before = PeakRssKiB();
-    g_progressCalls = g_progressDone = g_progressTotal = 0;
-    g_progressMonotonic = true;
     Result r;
     ReadAll(fds[0], length, kType, dir.Path(), r, &OnProgress);
     const long grown = PeakRssKiB() - before;
@@ -123,10 +111,10 @@ TEST(UploadRead, LargeFileStreamsInBoundedMemory)
     writer.join();
     ASSERT_EQ(1, r.rc);
     EXPECT_LT(grown, 8 * 1024) << "peak RSS grew by " << grown << " KiB";
-    EXPECT_TRUE(g_progressMonotonic);
-    EXPECT_EQ(length, g_progressDone);
-    EXPECT_EQ(length, g_progressTotal);
-    EXPECT_LE(g_progressCalls, length / 4096);
+    EXPECT_TRUE(g_progress.monotonic);
+    EXPECT_EQ(length, g_progress.done);
+    EXPECT_EQ(length, g_progress.total);
+    EXPECT_LE(g_progress.calls, length / 4096);
 
     const int in = open(r.File("big").c_str(), O_RDONLY);
     ASSERT_GE(in, 0);
