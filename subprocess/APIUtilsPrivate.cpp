@@ -7,6 +7,7 @@
 #include <string>
 #include <unistd.h>
 
+#include "platform/system/FileUtil.h"
 #include "vela/log.h"
 #include "webapi/APIUtils.h"
 #include "webapi/JsonUtil.h"
@@ -14,25 +15,6 @@
 namespace VELA {
 
 namespace {
-
-// write() until all `len` bytes are gone; false on an error or a closed
-// reader. A pipe takes at most its buffer at once, so a large document
-// goes in several writes while the reader drains it.
-bool WriteAll(int fd, const char* data, size_t len)
-{
-    while (len > 0) {
-        const ssize_t n = write(fd, data, len);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return false;
-        }
-        data += n;
-        len -= static_cast<size_t>(n);
-    }
-    return true;
-}
 
 // read() until `len` bytes arrived or end of file; the count that arrived,
 // or -1 on an error before any byte.
@@ -116,10 +98,12 @@ bool Pipe::WriteJson(const Json::Value& value)
         return false;
     }
     const uint32_t len = static_cast<uint32_t>(text.size());
-    if (fds_[1] < 0 || !WriteAll(fds_[1], reinterpret_cast<const char*>(&len), sizeof(len))) {
+    if (fds_[1] < 0 || !System::WriteAll(fds_[1], reinterpret_cast<const char*>(&len), sizeof(len))) {
         return false;
     }
-    return WriteAll(fds_[1], text.data(), text.size());
+    // A document above the pipe's buffer goes in several writes while the
+    // reader drains it.
+    return System::WriteAll(fds_[1], text.data(), text.size());
 }
 
 int Pipe::Read(char* buf, int size)
