@@ -29,6 +29,7 @@
 #include "dispatcher/ResolvedCall.h"
 #include "dispatcher/Road.h"
 #include "subprocess/CompoundHandler.h"
+#include "subprocess/Detach.h"
 #include "subprocess/ExecHandler.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
@@ -271,74 +272,6 @@ Json::Value APIRunner::GetResponse()
     body["httpd_restart"] = response_->GetHttpdRestart();
     return body;
 }
-
-namespace {
-
-bool IsPipeOrSocket(int fd)
-{
-    struct stat st;
-    return fstat(fd, &st) == 0 && (S_ISFIFO(st.st_mode) || S_ISSOCK(st.st_mode));
-}
-
-// The descriptors of this process above standard error.
-std::vector<int> OpenDescriptors()
-{
-    std::vector<int> fds;
-    DIR* dir = opendir("/proc/self/fd");
-    if (dir == nullptr) {
-        const long max = sysconf(_SC_OPEN_MAX);
-        for (int fd = 3; fd < (max > 0 && max < 65536 ? max : 65536); ++fd) {
-            if (fcntl(fd, F_GETFD) >= 0) {
-                fds.push_back(fd);
-            }
-        }
-        return fds;
-    }
-    for (struct dirent* entry; (entry = readdir(dir)) != nullptr;) {
-        char* end = nullptr;
-        const long fd = strtol(entry->d_name, &end, 10);
-        if (end != entry->d_name && *end == '\0' && fd > 2 && fd != dirfd(dir) && fd <= INT_MAX) {
-            fds.push_back(static_cast<int>(fd));
-        }
-    }
-    closedir(dir);
-    return fds;
-}
-
-// In the after-reply child: lets go of every descriptor the web server may
-// be waiting on, since a CGI answer ends only when every process holding
-// its write end has closed it. Standard input and output go to /dev/null,
-// standard error too when it is a pipe or a socket (a log file stays), and
-// every other inherited pipe or socket is closed; the system log's socket
-// goes with them and is opened again by the next line logged.
-void LetGoOfTheReply()
-{
-    const int null = open("/dev/null", O_RDWR);
-    for (int fd = STDIN_FILENO; fd <= STDERR_FILENO; ++fd) {
-        if (fd == STDERR_FILENO && !IsPipeOrSocket(fd)) {
-            continue;
-        }
-        if (null < 0) {
-            close(fd);
-        } else if (null != fd) {
-            dup2(null, fd);
-        }
-    }
-    if (null > STDERR_FILENO) {
-        close(null);
-    }
-    closelog();
-    for (int fd : OpenDescriptors()) {
-        if (IsPipeOrSocket(fd)) {
-            close(fd);
-        }
-    }
-    if (ProcessLogIdent()[0] != '\0') {
-        openlog(ProcessLogIdent(), LOG_CONS | LOG_PID, LOG_USER);
-    }
-}
-
-}  // namespace
 
 void APIRunner::HandleCallback(APIResponse* resp)
 {

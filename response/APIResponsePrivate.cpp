@@ -4,6 +4,7 @@
 #include <cstring>
 #include <sstream>
 
+#include "polling/TaskAccess.h"
 #include "response/Cookie.h"
 #include "vela/log.h"
 #include "webapi/APIRequest.h"
@@ -61,8 +62,19 @@ void APIResponsePrivate::SetError(int code, const Json::Value& details)
 
 void APIResponsePrivate::UpdatePollingTask(const Json::Value& body)
 {
-    VELA_LOG(LOG_DEBUG, "polling task records are not available yet; body of task [%s] not recorded",
-             request_ ? request_->GetPollingTaskId().c_str() : "");
+    if (!task_) {
+        task_.reset(new TARN::Task(request_->GetEnv("task_user").asString(), request_->GetEnv("task_id").asString()));
+    }
+    TaskAccess access;
+    if (!access.Ok() || !task_->beginUpdate()) {
+        VELA_LOG_ERR("cannot record the answer of task [%s]", request_->GetPollingTaskId().c_str());
+        return;
+    }
+    task_->setProperty("body", body);
+    task_->setProperty("task_run", true);
+    if (!task_->endUpdate()) {
+        VELA_LOG_ERR("cannot record the answer of task [%s]", request_->GetPollingTaskId().c_str());
+    }
 }
 
 Json::Value APIResponsePrivate::GetBody() const

@@ -9,9 +9,11 @@
 
 #include <json/json.h>
 #include <ctime>
+#include <memory>
 #include <string>
 
 #include "base/APIBase.h"
+#include "vela/task.h"
 #include "webapi/APIResponse.h"
 
 namespace VELA {
@@ -64,15 +66,16 @@ private:
     // present (0 when it is not an integer), else now.
     time_t CookieReferenceTime() const;
 
-    // Where a polling task's record receives the body it answered (the
-    // record's "body" = `body`, "task_run" = true, inside one update). The
-    // task records are not available yet, so for now this only says so.
+    // A polling task's record receives the body it answered (the record's
+    // "body" = `body`, "task_run" = true, inside one update).
     void UpdatePollingTask(const Json::Value& body);
 
     APIRequest* request_;
     APIResponse* owner_;
     int errorCode_ = 0;
     APICallbackList callbacks_;
+    // The polling task this response answers for, made on first use.
+    std::unique_ptr<TARN::Task> task_;
 };
 
 }  // namespace VELA
