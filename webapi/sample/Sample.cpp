@@ -14,6 +14,8 @@
 //           idle session alive); answers the login user and the session's
 //           idle timeout in seconds
 //   upload, download  (Transfer.cpp) a multipart form in, a file out
+//   checksum, taskstatus, taskstop, tasklist  (Tasks.cpp) a background task
+//           with progress, and its status, stop and listing
 #include <json/json.h>
 #include <string>
 #include <unistd.h>
@@ -25,6 +27,7 @@
 #include "webapi/APITable.h"
 #include "webapi/APIValidator.h"
 
+#include "Tasks.h"
 #include "Transfer.h"
 
 #define HANDLER_EXPORT extern "C" __attribute__((visibility("default")))
@@ -169,6 +172,10 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Sample", 1, "status", Guarded<Status>},
     {"VELA.Sample", 1, "upload", Guarded<Sample::Upload>},
     {"VELA.Sample", 1, "download", Guarded<Sample::Download>},
+    {"VELA.Sample", 1, "checksum", Guarded<Sample::Checksum>},
+    {"VELA.Sample", 1, "taskstatus", Guarded<Sample::TaskStatus>},
+    {"VELA.Sample", 1, "taskstop", Guarded<Sample::TaskStop>},
+    {"VELA.Sample", 1, "tasklist", Guarded<Sample::TaskList>},
     {"VELA.Sample.Echo", 1, "echo", Guarded<Echo>},
     {nullptr, 0, nullptr, nullptr},
 };

@@ -12,6 +12,7 @@
 // volumes) and direct output give the same answers. The file is opened
 // once, without following links, and its descriptor is handed over.
 #include "Transfer.h"
+#include "Cksum.h"
 
 #include <cerrno>
 #include <cstdint>
@@ -40,44 +41,6 @@ using VELA::APIResponse;
 
 constexpr int kSampleFailure = 1001;
 const char kDownloadFolder[] = "/sample";
-
-// CRC of POSIX cksum (polynomial 0x04C11DB7, most significant bit first,
-// the length appended in as few bytes as it needs, least significant
-// first, the result complemented): what `cksum` prints first.
-class PosixCksum {
-public:
-    PosixCksum()
-    {
-        for (uint32_t i = 0; i < 256; ++i) {
-            uint32_t c = i << 24;
-            for (int bit = 0; bit < 8; ++bit) {
-                c = (c & 0x80000000u) != 0 ? (c << 1) ^ 0x04C11DB7u : c << 1;
-            }
-            table_[i] = c;
-        }
-    }
-    void Add(const unsigned char* p, size_t n)
-    {
-        for (size_t i = 0; i < n; ++i) {
-            Byte(p[i]);
-        }
-        length_ += n;
-    }
-    uint32_t Finish()
-    {
-        for (unsigned long long n = length_; n != 0; n >>= 8) {
-            Byte(static_cast<unsigned char>(n & 0xff));
-        }
-        return ~crc_;
-    }
-    unsigned long long Length() const { return length_; }
-
-private:
-    void Byte(unsigned char b) { crc_ = (crc_ << 8) ^ table_[((crc_ >> 24) ^ b) & 0xff]; }
-    uint32_t table_[256];
-    uint32_t crc_ = 0;
-    unsigned long long length_ = 0;
-};
 
 // Size and cksum of the stored file `path`; false when it cannot be read.
 bool Checksum(const std::string& path, unsigned long long& size, uint32_t& crc)
