@@ -208,6 +208,37 @@ void ChecksumWork(APIRequest* req, APIResponse* resp, void* data)
     resp->SetSuccess(result);
 }
 
+// A parameter given as JSON or as form text: true/false, or a number in
+// [0, max]. -1 when it is neither.
+int Flag(APIRequest* req, const char* name)
+{
+    const Json::Value v = req->GetParam(name);
+    if (v.isNull()) {
+        return 0;
+    }
+    if (v.isBool() || v == "true" || v == "false") {
+        return (v.isBool() ? v.asBool() : v == "true") ? 1 : 0;
+    }
+    return -1;
+}
+
+int Number(APIRequest* req, const char* name, int max)
+{
+    const Json::Value v = req->GetParam(name);
+    if (v.isNull()) {
+        return 0;
+    }
+    if (v.isIntegral()) {
+        return v.asLargestInt() >= 0 && v.asLargestInt() <= max ? static_cast<int>(v.asLargestInt()) : -1;
+    }
+    const std::string text = v.isString() ? v.asString() : "";
+    if (text.empty() || text.size() > 9 || text.find_first_not_of("0123456789") != std::string::npos) {
+        return -1;
+    }
+    const int n = std::stoi(text);
+    return n <= max ? n : -1;
+}
+
 void AnswerPollingError(APIResponse* resp, const APIPolling& polling)
 {
     resp->SetError(polling.GetError() != 0 ? polling.GetError() : WEBAPI_ERR_NO_RESPONSE);
@@ -219,10 +250,9 @@ void Checksum(APIRequest* req, APIResponse* resp)
 {
     VELA::APIParameter<std::string> path = req->GetAndCheckString("path", APIRequest::OPTIONAL, IsFolderPath);
     VELA::APIParameter<std::string> share = req->GetAndCheckString("share", APIRequest::OPTIONAL);
-    VELA::APIParameter<bool> autoRemove = req->GetAndCheckBool("auto_remove", APIRequest::OPTIONAL);
-    VELA::APIParameter<int> pace = req->GetAndCheckInt(
-        "pace_ms", APIRequest::OPTIONAL, [](int const& ms) { return ms >= 0 && ms <= kMaxPaceMs; });
-    if (path.IsInvalid() || share.IsInvalid() || autoRemove.IsInvalid() || pace.IsInvalid()) {
+    const int autoRemove = Flag(req, "auto_remove");
+    const int pace = Number(req, "pace_ms", kMaxPaceMs);
+    if (path.IsInvalid() || share.IsInvalid() || autoRemove < 0 || pace < 0) {
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
         return;
     }
@@ -239,12 +269,12 @@ void Checksum(APIRequest* req, APIResponse* resp)
     if (path.IsSet() && !path.Get().empty()) {
         job.root += "/" + path.Get();
     }
-    job.paceMs = pace.IsSet() ? pace.Get() : 0;
+    job.paceMs = pace;
 
     APIPolling polling(req);
     polling.SetPrefixAttr("cksum-");
     if ((share.IsSet() && !polling.SetGroupAttr(share.Get())) ||
-        !polling.SetRemoveAttr(autoRemove.IsSet() && autoRemove.Get())) {
+        !polling.SetRemoveAttr(autoRemove == 1)) {
         AnswerPollingError(resp, polling);
         return;
     }
@@ -267,13 +297,13 @@ void TaskStatus(APIRequest* req, APIResponse* resp)
 void TaskStop(APIRequest* req, APIResponse* resp)
 {
     VELA::APIParameter<std::string> id = req->GetAndCheckString("task_id", APIRequest::REQUIRED);
-    VELA::APIParameter<bool> remove = req->GetAndCheckBool("remove", APIRequest::OPTIONAL);
-    if (id.IsInvalid() || remove.IsInvalid()) {
+    const int remove = Flag(req, "remove");
+    if (id.IsInvalid() || remove < 0) {
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
         return;
     }
     APIPolling polling(req);
-    if (!polling.Stop(id.Get(), remove.IsSet() && remove.Get())) {
+    if (!polling.Stop(id.Get(), remove == 1)) {
         AnswerPollingError(resp, polling);
         return;
     }
@@ -282,19 +312,17 @@ void TaskStop(APIRequest* req, APIResponse* resp)
 
 void TaskList(APIRequest* req, APIResponse* resp)
 {
-    VELA::APIParameter<bool> finish = req->GetAndCheckBool("finish", APIRequest::OPTIONAL);
-    if (finish.IsInvalid()) {
+    const int finish = Flag(req, "finish");
+    if (finish < 0) {
         resp->SetError(WEBAPI_ERR_BAD_REQUEST);
         return;
     }
     Json::Value filter(Json::objectValue);
-    for (const char* key : {"group", "method"}) {
-        if (req->HasParam(key)) {
-            filter[key] = req->GetParam(key);
-        }
+    if (req->HasParam("group")) {
+        filter["group"] = req->GetParam("group");
     }
-    if (finish.IsSet()) {
-        filter["finish"] = finish.Get();
+    if (req->HasParam("finish")) {
+        filter["finish"] = finish == 1;
     }
     APIPolling polling(req);
     Json::Value out;

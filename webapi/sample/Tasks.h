@@ -17,7 +17,7 @@ void Checksum(VELA::APIRequest* req, VELA::APIResponse* resp);
 void TaskStatus(VELA::APIRequest* req, VELA::APIResponse* resp);
 // "taskstop": stops "task_id" ("remove": also remove its record).
 void TaskStop(VELA::APIRequest* req, VELA::APIResponse* resp);
-// "tasklist": the requester's tasks of this API ("group", "finish", "method").
+// "tasklist": the requester's tasks of this API ("group", "finish").
 void TaskList(VELA::APIRequest* req, VELA::APIResponse* resp);
 
 }  // namespace Sample
