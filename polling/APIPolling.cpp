@@ -41,6 +41,7 @@ const Json::ArrayIndex kMaxStatusIds = 256;
 struct TaskSettings {
     long long maxRunning = 8;        // running tasks one user may have
     long long keepSeconds = 604800;  // finished tasks are kept this long
+    long long maxKept = 256;         // records of one owner at most
 };
 
 TaskSettings LoadTaskSettings()
@@ -50,6 +51,7 @@ TaskSettings LoadTaskSettings()
     if (System::ReadKeyValueFile(kConfPath, lines) > 0) {
         System::NumberSetting(lines, kConfPath, "task_max_running", 1, 10000, settings.maxRunning);
         System::NumberSetting(lines, kConfPath, "task_keep_seconds", 0, 315360000, settings.keepSeconds);
+        System::NumberSetting(lines, kConfPath, "task_max_kept", 1, 100000, settings.maxKept);
     }
     return settings;
 }
@@ -118,6 +120,30 @@ void ReapLostWorker(TARN::Task& task)
                      static_cast<int>(task.getCreatePid()));
     }
     task.endUpdate();
+}
+
+// Housekeeping of one owner's records: finished tasks older than the
+// keeping time go, and the oldest finished ones while the owner has more
+// records than it may keep (running tasks are never removed).
+void Housekeep(const std::string& owner, const TaskSettings& settings)
+{
+    TARN::TaskMgr::removeFinished(owner, settings.keepSeconds);
+    const std::vector<std::string> ids = TARN::TaskMgr::getAllTaskId(owner);
+    if (static_cast<long long>(ids.size()) < settings.maxKept) {
+        return;
+    }
+    std::vector<std::pair<long long, std::string>> finished;
+    for (const std::string& id : ids) {
+        TARN::Task task(owner, id);
+        if (task.reload() && task.isFinished()) {
+            finished.emplace_back(task.getFinishedAt(), id);
+        }
+    }
+    std::sort(finished.begin(), finished.end());
+    long long excess = static_cast<long long>(ids.size()) - settings.maxKept + 1;
+    for (auto it = finished.begin(); it != finished.end() && excess > 0; ++it, --excess) {
+        TARN::Task(owner, it->second).remove();
+    }
 }
 
 bool DoKill(pid_t pid)
@@ -277,7 +303,7 @@ bool APIPolling::Start(APIResponse* resp, void (*work)(APIRequest*, APIResponse*
         return false;
     }
     const TaskSettings settings = LoadTaskSettings();
-    TARN::TaskMgr::removeFinished(owner, settings.keepSeconds);
+    Housekeep(owner, settings);
     long long running = 0;
     for (const std::string& o : {user, std::string(TARN::TaskUtil::kUsersOwner), std::string(TARN::TaskUtil::kAdminOwner)}) {
         for (const std::string& id : TARN::TaskMgr::getAllTaskId(o)) {
@@ -589,7 +615,7 @@ bool APIPolling::List(const std::string& api, const Json::Value& filter, Json::V
     const TaskSettings settings = LoadTaskSettings();
     std::vector<std::pair<long long, Json::Value>> found;
     for (const std::string& owner : owners) {
-        TARN::TaskMgr::removeFinished(owner, settings.keepSeconds);
+        Housekeep(owner, settings);
         for (const std::string& id : TARN::TaskMgr::getAllTaskId(owner)) {
             TARN::Task task(owner, id);
             if (!task.reload()) {

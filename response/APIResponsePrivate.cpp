@@ -7,6 +7,7 @@
 #include "polling/TaskAccess.h"
 #include "response/Cookie.h"
 #include "vela/log.h"
+#include "webapi/APIError.h"
 #include "webapi/APIRequest.h"
 
 namespace VELA {
@@ -72,8 +73,20 @@ void APIResponsePrivate::UpdatePollingTask(const Json::Value& body)
     }
     task_->setProperty("body", body);
     task_->setProperty("task_run", true);
-    if (!task_->endUpdate()) {
-        VELA_LOG_ERR("cannot record the answer of task [%s]", request_->GetPollingTaskId().c_str());
+    if (task_->endUpdate()) {
+        return;
+    }
+    VELA_LOG_ERR("cannot record the answer of task [%s]", request_->GetPollingTaskId().c_str());
+    // An answer too large for the record: the status says so instead of
+    // showing an older answer as the last one.
+    Json::Value failed(Json::objectValue);
+    failed["success"] = false;
+    failed["error"]["code"] = WEBAPI_ERR_NO_RESPONSE;
+    failed["error"]["errors"]["reason"] = "the answer could not be recorded";
+    if (task_->beginUpdate()) {
+        task_->setProperty("body", failed);
+        task_->setProperty("task_run", true);
+        task_->endUpdate();
     }
 }
 

@@ -95,6 +95,13 @@ bool EnsureOwnerDir(const std::string& owner)
 
 bool WriteRecord(const std::string& path, const Json::Value& record)
 {
+    // A record that could not be read back is never written.
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "";
+    if (Json::writeString(builder, record).size() >= kMaxRecord) {
+        VELA_LOG_ERR("task record %s would be larger than %zu bytes; not written", path.c_str(), kMaxRecord);
+        return false;
+    }
     // Task state does not need to outlive a crash of the machine: the
     // workers do not either. The rename still never shows a partial record.
     return VELA::System::WriteJsonAtomic(path, record, 0600, false);

@@ -3,6 +3,7 @@
 // status, stop and list, a crashed worker.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <csignal>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -186,18 +187,26 @@ TEST_F(APIPollingTest, GroupAttributes)
     EXPECT_EQ(polling.GetError(), WEBAPI_ERR_POLLING_NO_ADMIN_PERMISSION);
 }
 
-TEST_F(APIPollingTest, RunningTasksOfOneUserAreBounded)
+TEST_F(APIPollingTest, RunningAndKeptTasksAreBounded)
 {
-    Conf("webapi.conf", "task_max_running=1\n");
+    Conf("webapi.conf", "task_max_running=1\ntask_max_kept=3\n");
+    // Finished tasks beyond what an owner may keep go, the oldest first.
+    std::vector<std::string> finished;
+    for (int i = 0; i < 3; ++i) {
+        finished.push_back(Task("alice"));
+        TARN::Task task("alice", finished.back().substr(6));
+        ASSERT_TRUE(task.finish(false));
+    }
     // A task that is still starting (no worker yet) counts as running.
-    const std::string id = TARN::TaskUtil::getUniqueID("alice", "t-");
-    TARN::Task held("alice", id);
-    ASSERT_TRUE(held.setProperty("user", "alice"));
+    const std::string starting = TARN::TaskUtil::getUniqueID("alice", "t-");
+    ASSERT_TRUE(TARN::Task("alice", starting).setProperty("user", "alice"));
     APIPolling polling(&alice_);
     APIResponse resp(&alice_);
     EXPECT_FALSE(polling.Start(&resp, Reports, nullptr));
     EXPECT_EQ(resp.GetError(), WEBAPI_ERR_COMPOUND_OR_FORK);
-    EXPECT_EQ(TARN::TaskMgr::getAllTaskId("alice").size(), 1u);
+    const std::vector<std::string> left = TARN::TaskMgr::getAllTaskId("alice");
+    EXPECT_EQ(left.size(), 2u);
+    EXPECT_TRUE(std::find(left.begin(), left.end(), starting) != left.end());
 }
 
 }  // namespace
