@@ -297,8 +297,10 @@ bool APIPolling::Start(APIResponse* resp, void (*work)(APIRequest*, APIResponse*
         return false;
     }
 
-    TaskAccess access;
-    if (!access.Ok()) {
+    // Held for the records only: released before the fork, so the worker
+    // runs as the handler does.
+    std::unique_ptr<TaskAccess> access(new TaskAccess);
+    if (!access->Ok()) {
         VELA_LOG_ERR("Failed to set property.");
         return false;
     }
@@ -354,9 +356,11 @@ bool APIPolling::Start(APIResponse* resp, void (*work)(APIRequest*, APIResponse*
 
     // The worker is detached (its parent exits at once), so it is never a
     // zombie of this process, and it outlives the web server's request.
+    access.reset();
     const pid_t pid = VLIBCProcForkEx(VLIBC_FORK_DETACH | VLIBC_FORK_DEFAULT_SIGNALS);
     if (pid < 0) {
         const int err = errno;
+        TaskAccess recordAccess;
         task.remove();
         VELA_LOG_ERR("Failed to fork(). %s", strerror(err));
         resp->SetError(WEBAPI_ERR_COMPOUND_OR_FORK);
@@ -385,6 +389,7 @@ bool APIPolling::Start(APIResponse* resp, void (*work)(APIRequest*, APIResponse*
     }
     // The pid is recorded here as well: a worker that dies before it
     // records itself is then still seen as gone.
+    access.reset(new TaskAccess);
     task.setCreatePid(pid);
     task.waitForDataReady("task_run", kFirstReportSeconds);
     Json::Value answer(Json::objectValue);

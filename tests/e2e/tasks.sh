@@ -17,6 +17,7 @@ echo /vol1 >"$ROOT/etc/vela/volumes.conf"
 printf 'one\n' >"$ROOT/vol1/small/a.txt"
 head -c 100000 /dev/urandom >"$ROOT/vol1/small/sub/b.bin"
 ln -s /etc/shadow "$ROOT/vol1/small/link"
+printf 'root only\n' >"$ROOT/vol1/small/secret" && chmod 0600 "$ROOT/vol1/small/secret"
 head -c 4000000 /dev/urandom >"$ROOT/vol1/big/c.bin"
 srv_serve
 
@@ -48,11 +49,12 @@ wait_for() {
 }
 code_is() { expect "$1" '"success":false' "\"code\":$2"; }
 
-# ---- A task runs to its end: progress, then every file's cksum, links skipped.
+# ---- A task runs to its end: progress, then every file's cksum, links
+# skipped; the worker reads as its user, so a root-only file stays unread.
 ID=$(start "$NOBODY" "path=small")
 case "$ID" in nobody/cksum-*) ;; *) fail "task id: $ID ($(head -c 300 "$TMP/body"))" ;; esac
 wait_for "$NOBODY" "$ID" 'a["data"]["finish"]'
-expect "finished task" '"success":true' '"files":2' '"percent":100' '"description":"done"' '"method":"checksum"'
+expect "finished task" '"success":true' '"files":3' '"error":"unreadable","path":"secret"' '"percent":100' '"description":"done"' '"method":"checksum"'
 want=$(cksum <"$ROOT/vol1/small/sub/b.bin" | cut -d' ' -f1)
 [ "$(field '[f["cksum"] for f in a["data"]["data"]["list"] if f["path"]=="sub/b.bin"][0]')" = "$want" ] ||
   fail "cksum of sub/b.bin differs from cksum(1): $(head -c 600 "$TMP/body")"
