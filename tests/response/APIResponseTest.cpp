@@ -3,6 +3,8 @@
 
 #include "response/APIResponsePrivate.h"
 #include "support/TestSupport.h"
+#include "vela/task.h"
+#include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 
@@ -54,16 +56,33 @@ TEST(APIResponseBody, FreshThenErrorThenSuccessReplacesWholeBody)
     EXPECT_EQ(Obj("success", true), resp.GetBody());
 }
 
-TEST(APIResponseBody, PollingTaskAnswerReachesTheHookOnly)
+TEST(APIResponseBody, PollingTaskAnswersGoIntoItsRecord)
 {
-    Json::Value env = Obj("task_id", "7");
+    VELA::Test::TempDir root;
+    VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
+    VELA::System::RootReset();
+    const std::string id = TARN::TaskUtil::getUniqueID("admin", "t-");
+    Json::Value env = Obj("task_id", id);
     env["task_user"] = "admin";
     APIRequest req = MakeRequest(env);
     APIResponse resp(&req);
-    VELA::Test::LogCapture log;
+    TARN::Task task("admin", id);
     resp.SetSuccess(Obj("n", 1));
-    EXPECT_TRUE(log.Contains("polling task records are not available yet"));
-    EXPECT_EQ(Json::Value(true), resp.GetBody()["success"]);
+    ASSERT_TRUE(task.reload());
+    EXPECT_EQ(1, task.getProperty("body")["data"]["n"].asInt());
+    EXPECT_TRUE(task.getBoolProperty("task_run", false));
+    resp.SetError(1001);
+    ASSERT_TRUE(task.reload());
+    EXPECT_EQ(1001, task.getProperty("body")["error"]["code"].asInt());
+    EXPECT_EQ(Json::Value(false), resp.GetBody()["success"]);
+
+    // A removed record is not made again by a later answer.
+    ASSERT_TRUE(task.remove());
+    VELA::Test::LogCapture log;
+    resp.SetSuccess();
+    EXPECT_TRUE(log.Contains("cannot record the answer of task"));
+    EXPECT_FALSE(TARN::TaskUtil::checkTaskExists("admin", id));
+    VELA::System::RootReset();
 }
 
 TEST(APIResponseHeader, LineBreaksAndEmptyNamesAreRefusedServerError)
