@@ -65,11 +65,21 @@ protected:
         return doc;
     }
 
-    void Edit(const std::string& sid, const char* key, const Json::Value& value)
+    void Edit(const std::string& sid, const char* key, const Json::Value& value) { EditJson(File(sid), key, value); }
+
+    // Checks `sid` once per step, after the clock moved by the step's seconds.
+    struct Step {
+        long long advance;
+        int verdict;
+        int flags = 0;
+    };
+    void Steps(const std::string& sid, std::initializer_list<Step> steps)
     {
-        Json::Value doc = Read(sid);
-        doc[key] = value;
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(File(sid), doc, 0600));
+        int i = 0;
+        for (const Step& step : steps) {
+            Now() += step.advance;
+            EXPECT_EQ(step.verdict, Check(sid, step.flags)) << "step " << i++ << " at " << Now() - kStart;
+        }
     }
 
     ScopedEnv remote_{"REMOTE_ADDR", kClient};
@@ -115,15 +125,10 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
     EXPECT_EQ(0600u, Mode(File(sid)));
 
     const Json::Value doc = Read(sid);
-    EXPECT_EQ("root", doc["user"].asString());
-    EXPECT_EQ(sid, doc["id"].asString());
-    EXPECT_EQ(kStart, doc["created"].asInt64());
-    EXPECT_EQ(kStart, doc["lastUse"].asInt64());
-    EXPECT_EQ(600, doc["idleTimeout"].asInt());
-    EXPECT_EQ(VELA_SESSION_LIFETIME_DEFAULT, doc["lifetime"].asInt());
-    EXPECT_EQ(kClient, doc["clientIP"].asString());
-    EXPECT_FALSE(doc["skipIP"].asBool());
-    EXPECT_EQ("ger", doc["lang"].asString());
+    ExpectMembers(doc, {{"user", "root"}, {"id", sid}, {"created", Json::Int64(kStart)},
+                        {"lastUse", Json::Int64(kStart)}, {"idleTimeout", 600},
+                        {"lifetime", VELA_SESSION_LIFETIME_DEFAULT}, {"clientIP", kClient}, {"skipIP", false},
+                        {"lang", "ger"}});
     EXPECT_EQ(32u, doc["token"].asString().size());
 
     EXPECT_NE(sid, Create());
@@ -169,81 +174,52 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
 
 TEST_F(SessionTest, IdleTimeoutAndLifetime)
 {
-    const Options options = Timed(100, 250);
-    const std::string sid = Create(options);
-
-    Now() += 100;  // exactly the idle timeout: still valid, and refreshed
-    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    const std::string sid = Create(Timed(100, 250));
+    Steps(sid, {{100, AUTH_RESULT_AUTHORIZED}});  // exactly the idle timeout: still valid, and refreshed
     EXPECT_EQ(Now(), Read(sid)["lastUse"].asInt64());
-    Now() += 100;
-    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-    Now() += 51;  // 251 seconds after the login: the lifetime has passed
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
+    Steps(sid, {{100, AUTH_RESULT_AUTHORIZED}, {51, AUTH_RESULT_TIMEOUT}});  // 251 s on: past the lifetime
 
-    const std::string idle = Create(options);
-    Now() += 101;
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(idle));
+    const std::string idle = Create(Timed(100, 250));
+    Steps(idle, {{101, AUTH_RESULT_TIMEOUT}});
     EXPECT_EQ(Now() - 101, Read(idle)["lastUse"].asInt64());  // a timed-out check refreshes nothing
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(idle));
+    Steps(idle, {{0, AUTH_RESULT_TIMEOUT}});
 
-    // Times far in the past.
-    const std::string unused = Create();
-    Edit(unused, "lastUse", Json::Int64(0));
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(unused));
-    const std::string old = Create();
-    Edit(old, "created", Json::Int64(0));
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(old));
+    for (const char* key : {"lastUse", "created"}) {  // far in the past
+        const std::string old = Create();
+        Edit(old, key, Json::Int64(0));
+        EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(old)) << key;
+    }
 }
 
 TEST_F(SessionTest, CheckWithoutRefreshLetsTheSessionTimeOut)
 {
     const std::string polled = Create(Timed(100));
     const std::string used = Create(Timed(100));
-
     for (int i = 0; i < 3; ++i) {
         Now() += 60;
-        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(used));
-        if (i == 0) {
-            EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(polled, VELACGI_AUTH_NO_REFRESH));
-            EXPECT_EQ(kStart, Read(polled)["lastUse"].asInt64());
-        } else {
-            EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(polled, VELACGI_AUTH_NO_REFRESH));
-        }
+        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(used)) << i;
+        EXPECT_EQ(i == 0 ? AUTH_RESULT_AUTHORIZED : AUTH_RESULT_TIMEOUT, Check(polled, VELACGI_AUTH_NO_REFRESH)) << i;
     }
+    EXPECT_EQ(kStart, Read(polled)["lastUse"].asInt64());
     EXPECT_EQ(Now(), Read(used)["lastUse"].asInt64());
 }
 
-TEST_F(SessionTest, LastUseInTheFutureCountsAsNow)
+// The clock went back: a last use in the future counts as now, with a
+// refresh or without, and a creation in the future starts the lifetime now.
+TEST_F(SessionTest, TimesInTheFutureCountAsNow)
 {
-    const std::string sid = Create(Timed(100));
-    Edit(sid, "lastUse", Json::Int64(kStart + 1000000));  // the clock went back
-
-    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-    EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
-    Now() += 101;
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
-
-    // A check without refresh still pulls the future back to now.
-    const std::string polled = Create(Timed(100));
-    Edit(polled, "lastUse", Json::Int64(Now() + 1000000));
-    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(polled, VELACGI_AUTH_NO_REFRESH));
-    EXPECT_EQ(Now(), Read(polled)["lastUse"].asInt64());
-    Now() += 101;
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(polled, VELACGI_AUTH_NO_REFRESH));
-}
-
-TEST_F(SessionTest, CreationInTheFutureStartsTheLifetimeNow)
-{
-    const std::string sid = Create(Timed(100, 200));
-    Edit(sid, "created", Json::Int64(kStart + 1000000));
-    EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
-    EXPECT_EQ(kStart, Read(sid)["created"].asInt64());
-    for (int i = 0; i < 2; ++i) {
-        Now() += 90;
-        EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
+    for (int flags : {0, VELACGI_AUTH_NO_REFRESH}) {
+        const std::string sid = Create(Timed(100));
+        Edit(sid, "lastUse", Json::Int64(Now() + 1000000));
+        Steps(sid, {{0, AUTH_RESULT_AUTHORIZED, flags}});
+        EXPECT_EQ(Now(), Read(sid)["lastUse"].asInt64());
+        Steps(sid, {{101, AUTH_RESULT_TIMEOUT, flags}});
     }
-    Now() += 90;
-    EXPECT_EQ(AUTH_RESULT_TIMEOUT, Check(sid));
+    const std::string sid = Create(Timed(100, 200));
+    Edit(sid, "created", Json::Int64(Now() + 1000000));
+    Steps(sid, {{0, AUTH_RESULT_AUTHORIZED}});
+    EXPECT_EQ(Now(), Read(sid)["created"].asInt64());
+    Steps(sid, {{90, AUTH_RESULT_AUTHORIZED}, {90, AUTH_RESULT_AUTHORIZED}, {90, AUTH_RESULT_TIMEOUT}});
 }
 
 TEST_F(SessionTest, UnknownAndHostileIdsTouchNothing)
@@ -294,17 +270,15 @@ TEST_F(SessionTest, CorruptFilesAreNoSessionAndStayAsTheyAre)
     }
     bad.insert(bad.end(), {"garbage", "[]", "null", good + "trailing",
                            std::string(20000, ' ') + good});  // the last larger than a session file may be
-    std::vector<std::pair<std::string, Json::Value>> changes = {
+    const std::vector<std::pair<std::string, Json::Value>> changes = {
         {"version", 2}, {"id", "BBBBBBBBBBBBBBBBBBBBBBBBBBBBBBBB"}, {"user", 5}, {"user", ""},
         {"user", std::string("ro\0ot", 5)}, {"created", "1700000000"}, {"created", -1}, {"lastUse", 1.5},
         {"idleTimeout", 0}, {"idleTimeout", Json::Int64(VELA_SESSION_IDLE_MAX) + 1}, {"lifetime", -3},
         {"clientIP", "not an address"}, {"skipIP", 1}, {"lang", "english"}, {"tokenProtect", "true"},
         {"token", "short"}, {"app", std::string(300, 'a')}};
-    for (const char* key : {"version", "id", "user", "created", "lastUse", "idleTimeout", "lifetime", "clientIP",
-                            "skipIP", "app", "webapi", "lang", "tokenProtect", "token"}) {
-        changes.push_back({key, Json::Value()});  // missing
-    }
-    for (const std::string& text : JsonVariants(doc, changes)) {
+    for (const std::string& text : JsonVariants(doc, changes, {"version", "id", "user", "created", "lastUse",
+                                                               "idleTimeout", "lifetime", "clientIP", "skipIP", "app",
+                                                               "webapi", "lang", "tokenProtect", "token"})) {
         bad.push_back(text);
     }
 
@@ -571,9 +545,7 @@ TEST_F(SessionTest, RemovalWinsOverConcurrentRefresh)
         });
         // Remove once the children are refreshing (bounded wait, not a timing
         // assertion: removing earlier only makes the round less interesting).
-        for (int i = 0; i < 2000 && Read(sid)["lastUse"].asInt64() == kStart; ++i) {
-            usleep(1000);
-        }
+        WaitUntil([&] { return Read(sid)["lastUse"].asInt64() != kStart; }, 2000, 1000);
         EXPECT_EQ(0, VELA::Session::Remove(sid.c_str()));
         EXPECT_EQ(std::vector<int>(4, 0), children.Wait()) << "a check passed after the removal";
         struct stat st;
