@@ -193,10 +193,7 @@ inline bool WaitUntil(const std::function<bool()>& done, int tries = 500, usecon
     return done();
 }
 
-struct Ran {
-    int status = -1;
-    std::string out, err;
-};
+struct Ran { int status = -1; std::string out, err; };
 
 // Runs argv[0] from PATH (or /proc/self/exe) with `env` added; its output
 // goes through files, so nothing can block on a full pipe.

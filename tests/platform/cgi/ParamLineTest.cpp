@@ -20,10 +20,7 @@ TEST(ParamLine, PlainLinesUnchanged)
 
 TEST(ParamLine, MalformedLinesRefused)
 {
-    const struct {
-        std::string line;
-        const char* logged;
-    } cases[] = {
+    const struct { std::string line; const char* logged; } cases[] = {
         {"a=%", "percent-encoding at offset 2"},
         {"a=%4", "percent-encoding"},
         {"a=%4g&b=1", "percent-encoding"},

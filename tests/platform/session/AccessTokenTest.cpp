@@ -73,11 +73,7 @@ TEST_F(AccessTokenTest, CreateWritesPrivateFile)
 TEST_F(AccessTokenTest, PatternsSelectApiAndMethod)
 {
     const std::string token = Create({"VELA.Demo.*", "VELA.Exact"}, {"get*", "list"});
-    const struct {
-        const char* api;
-        const char* method;
-        int rc;
-    } cases[] = {
+    const struct { const char* api; const char* method; int rc; } cases[] = {
         {"VELA.Demo.Test", "get", 0}, {"VELA.Demo.Test", "getInfo", 0}, {"VELA.Exact", "list", 0},
         {"VELA.Demo", "get", -3},  // the prefix includes the "."
         {"VELA.Exact2", "get", -3}, {"VELA.Other.Test", "get", -3},

@@ -23,13 +23,7 @@ constexpr int kBlocked = VELA_LOGIN_GUARD_BLOCKED;
 // One step of a script: 'F' a login whose password check fails, 'S' one that
 // succeeds, 'T' one only begun; `verdict` is what the guard's Begin answers,
 // `advance` the seconds the clock moves before the step.
-struct Step {
-    char what;
-    const char* account;
-    const char* ip;
-    int verdict;
-    long long advance = 0;
-};
+struct Step { char what; const char* account; const char* ip; int verdict; long long advance = 0; };
 
 class LoginGuard : public StateRootTest {
 protected:

@@ -88,11 +88,7 @@ TEST_F(ServerKey, UnusableKeyFailsClosedAndIsKeptAsIs)
     const std::string good = OpensslKey(keys, "good.pem", 2048);
     ASSERT_EQ(0, system(("mkdir -p -m 0700 " + KeyDir()).c_str()));
     const std::string priv = KeyDir() + "/param_rsa.pem";
-    const struct {
-        std::string content;
-        mode_t mode;
-        const char* log;
-    } cases[] = {
+    const struct { std::string content; mode_t mode; const char* log; } cases[] = {
         {"garbage", 0600, "cannot read the private key"},
         {weak, 0600, "is not an RSA key of 2048"},
         {locked, 0600, "cannot read the private key"},

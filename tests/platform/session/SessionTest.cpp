@@ -68,11 +68,7 @@ protected:
     void Edit(const std::string& sid, const char* key, const Json::Value& value) { EditJson(File(sid), key, value); }
 
     // Checks `sid` once per step, after the clock moved by the step's seconds.
-    struct Step {
-        long long advance;
-        int verdict;
-        int flags = 0;
-    };
+    struct Step { long long advance; int verdict; int flags = 0; };
     void Steps(const std::string& sid, std::initializer_list<Step> steps)
     {
         int i = 0;
@@ -372,10 +368,7 @@ TEST_F(SessionTest, AntiForgeryToken)
         snprintf(hex, sizeof(hex), "%%%02X", static_cast<unsigned char>(c));
         encoded += hex;
     }
-    const struct {
-        std::string header, query;  // "": not sent
-        int verdict;
-    } cases[] = {
+    const struct { std::string header, query; int verdict; } cases[] = {  // "": not sent
         {token.substr(0, 31), "", AUTH_RESULT_TOKEN_MISSING},
         {token + "x", "", AUTH_RESULT_TOKEN_MISSING},
         {token, "", AUTH_RESULT_AUTHORIZED},

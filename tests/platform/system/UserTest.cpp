@@ -100,11 +100,7 @@ TEST_F(UserAppPriv, UsersGroupsAndAddresses)
         "VELA.Odd": {"users": "nobody", "groups": [7], "allow_from": "10.0.0.0/8"},
         "VELA.Others": {"users": ["root2", "nobodyx"], "groups": ["root"]}
     }})");
-    const struct {
-        const char* app;
-        const char* ip;
-        int has;
-    } cases[] = {
+    const struct { const char* app; const char* ip; int has; } cases[] = {
         {"VELA.Users", nullptr, 1}, {"VELA.Groups", "", 1}, {"VELA.Others", "10.0.0.7", 0},
         {"VELA.Unlisted", "10.0.0.7", 0}, {"VELA.Odd", "10.0.0.7", 0},  // wrong types grant nothing
         {"VELA.Nowhere", "10.0.0.7", 0}, {"VELA/Users", nullptr, 0}, {"VELA.Lan", "192.168.1.200", 1},

@@ -156,11 +156,8 @@ TEST_F(HttpOutput, StreamsWithoutALength)
     // Larger than a pipe's buffer and than the copy buffer.
     const std::string data = Pattern(2 * 1024 * 1024 + 5);
     ScopedEnv range("HTTP_RANGE", "bytes=0-9");
-    const struct {
-        const char* what;
-        int domain;  // -1: a pipe
-        bool nonBlocking;
-    } kinds[] = {{"pipe", -1, false}, {"non-blocking pipe", -1, true}, {"socket", AF_UNIX, false}};
+    const struct { const char* what; int domain; bool nonBlocking; } kinds[] = {  // domain -1: a pipe
+        {"pipe", -1, false}, {"non-blocking pipe", -1, true}, {"socket", AF_UNIX, false}};
     for (const auto& kind : kinds) {
         int fds[2];
         ASSERT_EQ(0, kind.domain < 0 ? pipe(fds) : socketpair(kind.domain, SOCK_STREAM, 0, fds)) << kind.what;
@@ -204,12 +201,7 @@ TEST_F(HttpOutput, SingleRanges)
 {
     const std::string data = Pattern(1000);
     const std::string path = Write("r.bin", data);
-    struct Case {
-        const char* range;
-        int status;  // 200, 206 or 416
-        size_t first, last;
-    };
-    const Case cases[] = {
+    const struct { const char* range; int status; size_t first, last; } cases[] = {  // status 200, 206 or 416
         {"bytes=10-19", 206, 10, 19},   {"bytes=990-", 206, 990, 999},   {"bytes=-5", 206, 995, 999},
         {"bytes=-5000", 206, 0, 999},   {"bytes=900-5000", 206, 900, 999}, {" BYTES=0-0 ", 206, 0, 0},
         {"bytes=1000-", 416, 0, 0},     {"bytes=-0", 416, 0, 0},
@@ -217,7 +209,7 @@ TEST_F(HttpOutput, SingleRanges)
         {"bytes=5-1", 200, 0, 999},     {"bytes=0-1,5-6", 200, 0, 999},  {"bytes=abc", 200, 0, 999},
         {"items=0-1", 200, 0, 999},     {"bytes=1-2x", 200, 0, 999},     {"bytes=", 200, 0, 999},
     };
-    for (const Case& c : cases) {
+    for (const auto& c : cases) {
         ScopedEnv range("HTTP_RANGE", c.range);
         const Reply r = Send(path, "text/plain");
         EXPECT_TRUE(r.ok && r.complete) << c.range;
@@ -375,10 +367,7 @@ TEST_F(HttpOutput, RefusesLinksAndWhatIsNotARegularFile)
         EXPECT_EQ(-1, HTTPFileOutputer::OpenForOutput(path)) << path;
         EXPECT_EQ(EINVAL, errno) << path;
     }
-    const struct {
-        const char* logged;  // a log line the refusal writes, or null
-        std::function<bool()> call;
-    } calls[] = {
+    const struct { const char* logged; std::function<bool()> call; } calls[] = {  // logged: a line it logs, or null
         {"symbolic link", [&] { return out_.Output(files_ + "/last", ""); }},
         {"symbolic link", [&] { return out_.Output(files_ + "/middle/in.txt", ""); }},
         {"symbolic link", [&] { return out_.Output(files_ + "/relative/in.txt", ""); }},
@@ -417,11 +406,7 @@ TEST_F(HttpOutput, RefusesLinksAndWhatIsNotARegularFile)
 TEST_F(HttpOutput, DispositionNamesAreSafe)
 {
     const std::string path = Write("data", "x");
-    struct Case {
-        std::string name;
-        std::string value;  // "" when no header is expected
-    };
-    const Case cases[] = {
+    const std::pair<std::string, std::string> cases[] = {  // the name and the header, "" for none
         {"report.pdf", "attachment; filename=\"report.pdf\"; filename*=UTF-8''report.pdf"},
         {"a\"b\r\nc;d.txt", "attachment; filename=\"a_b__c;d.txt\"; filename*=UTF-8''a%22b__c%3Bd.txt"},
         {"r\xc3\xa9sum\xc3\xa9 100%.txt",
@@ -435,10 +420,10 @@ TEST_F(HttpOutput, DispositionNamesAreSafe)
     };
     FILE* file = fopen(path.c_str(), "r");
     ASSERT_NE(nullptr, file);
-    for (const Case& c : cases) {
-        const Reply r = ToFile([&] { return out_.Output(file, c.name, ""); });
+    for (const auto& [name, value] : cases) {
+        const Reply r = ToFile([&] { return out_.Output(file, name, ""); });
         EXPECT_TRUE(r.ok);
-        EXPECT_EQ(c.value, r.Header("Content-Disposition"));
+        EXPECT_EQ(value, r.Header("Content-Disposition"));
         EXPECT_EQ("x", r.body);
     }
     fclose(file);

@@ -137,11 +137,9 @@ TEST(UploadDir, OnlyTrustedBasesAreUsed)
 // the body ends early and the process calls exit().
 TEST(UploadDir, SignalsAndExitRemoveAPartialUpload)
 {
-    const struct {
-        int sig;
-        int ignored;  // ignored before the handlers are installed, sent first
-    } cases[] = {{SIGTERM, 0}, {SIGPIPE, 0}, {SIGHUP, 0},       {SIGINT, 0},
-                 {SIGALRM, 0}, {SIGXCPU, 0}, {SIGTERM, SIGHUP}, {0, 0}};
+    // `ignored`: ignored before the handlers are installed, sent first.
+    const struct { int sig, ignored; } cases[] = {{SIGTERM, 0}, {SIGPIPE, 0}, {SIGHUP, 0},       {SIGINT, 0},
+                                                  {SIGALRM, 0}, {SIGXCPU, 0}, {SIGTERM, SIGHUP}, {0, 0}};
     for (const auto& c : cases) {
         SCOPED_TRACE(c.sig);
         TempDir base;
