@@ -36,13 +36,6 @@ protected:
         return VelaAccessTokenGrant(token.c_str(), api, method, user_, sizeof(user_));
     }
 
-    void Edit(const std::string& id, const char* key, const Json::Value& value)
-    {
-        Json::Value doc;
-        ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(File(id), doc));
-        doc[key] = value;
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(File(id), doc, 0600));
-    }
 
     LogCapture log_;
     char user_[493];
@@ -58,9 +51,8 @@ TEST_F(AccessTokenTest, CreateWritesPrivateFile)
 
     Json::Value doc;
     ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(File(id), doc));
-    EXPECT_EQ("root", doc["user"].asString());
-    EXPECT_EQ(token.substr(VELA_TOKEN_ID_LEN + 1), doc["secret"].asString());
-    EXPECT_EQ(kStart + 3600, doc["expires"].asInt64());
+    ExpectMembers(doc, {{"user", "root"}, {"secret", token.substr(VELA_TOKEN_ID_LEN + 1)},
+                        {"expires", Json::Int64(kStart + 3600)}});
     EXPECT_EQ(2u, doc["methods"].size());
 
     std::string other;
@@ -119,7 +111,7 @@ TEST_F(AccessTokenTest, UserMustStillExist)
     const std::string token = Create({"*"}, {"*"}, 0, "nobody", &id);
     EXPECT_EQ(0, Grant(token, "VELA.Demo", "get"));
     EXPECT_STREQ("nobody", user_);
-    Edit(id, "user", "vela-no-such-user");  // the user was deleted
+    EditJson(File(id), "user", "vela-no-such-user");  // the user was deleted
     EXPECT_EQ(-4, Grant(token, "VELA.Demo", "get"));
     EXPECT_STREQ("", user_);
 
@@ -199,10 +191,8 @@ TEST_F(AccessTokenTest, CorruptFilesGrantNothing)
         {"id", "BBBBBBBBBBBBBBBBBBBBBB"}, {"apis", Json::Value(Json::arrayValue)}, {"apis", "*"},
         {"methods", Json::Value(Json::arrayValue)}, {"expires", "never"}, {"user", ""}, {"secret", "short"}};
     changes[3].second.append("a*b");
-    for (const char* key : {"version", "id", "secret", "user", "apis", "methods", "created", "expires"}) {
-        changes.push_back({key, Json::Value()});
-    }
-    for (const std::string& text : JsonVariants(doc, changes)) {
+    for (const std::string& text : JsonVariants(doc, changes, {"version", "id", "secret", "user", "apis", "methods",
+                                                               "created", "expires"})) {
         bad.push_back(text);
     }
     for (const std::string& text : bad) {

@@ -11,7 +11,6 @@
 #include <cstring>
 #include <dlfcn.h>
 #include <openssl/evp.h>  // types only: this program does not link libcrypto
-#include <sstream>
 
 #include "platform/session/CryptoTestUtil.h"
 #include "support/JsonLiteral.h"
@@ -50,12 +49,12 @@ bool LibcryptoMapped()
     _exit(0);
 }();
 
-int LinesWith(const std::string& text, const std::string& needle)
+// How often `needle` occurs in `text`.
+int Count(const std::string& text, const std::string& needle)
 {
     int n = 0;
-    std::istringstream in(text);
-    for (std::string line; std::getline(in, line);) {
-        n += line.find(needle) != std::string::npos ? 1 : 0;
+    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) {
+        ++n;
     }
     return n;
 }
@@ -314,7 +313,7 @@ TEST_F(Crypto, MissingLibraryFailsClosed)
     // Two calls need the library; the reason is logged once.
     Ran ran = Probe(getParam, {{"LD_LIBRARY_PATH", libs.Path()}, {"VELA_CRYPTO_PROBE_PUBKEY", "1"}});
     EXPECT_EQ("name=\npubkey=-1\nlibcrypto=0\n", ran.out) << ran.err;
-    EXPECT_EQ(1, LinesWith(ran.err, "encrypted parameters unavailable: cannot load libcrypto.so.3")) << ran.err;
+    EXPECT_EQ(1, Count(ran.err, "encrypted parameters unavailable: cannot load libcrypto.so.3")) << ran.err;
 
     // A library without the functions: any other library will do.
     const std::string maps = ReadText("/proc/self/maps");
@@ -325,7 +324,7 @@ TEST_F(Crypto, MissingLibraryFailsClosed)
     WriteFile(libs.Path() + "/libcrypto.so.3", ReadText(jsoncpp), 0755);
     ran = Probe(getParam, {{"LD_LIBRARY_PATH", libs.Path()}, {"VELA_CRYPTO_PROBE_PUBKEY", "1"}});
     EXPECT_EQ(0, ran.out.find("name=\npubkey=-1\n")) << ran.out << ran.err;
-    EXPECT_EQ(1, LinesWith(ran.err, "encrypted parameters unavailable: libcrypto.so.3 lacks OPENSSL_cleanse")) << ran.err;
+    EXPECT_EQ(1, Count(ran.err, "encrypted parameters unavailable: libcrypto.so.3 lacks OPENSSL_cleanse")) << ran.err;
 }
 
 }  // namespace

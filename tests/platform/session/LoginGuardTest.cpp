@@ -285,23 +285,17 @@ class LoginSettings : public RootTest {};
 TEST_F(LoginSettings, ReadFromWebapiConf)
 {
     VELA::Session::LoginSettings s;
+    const auto fields = [&s] {
+        return std::vector<int>{s.maxFailures, s.windowMinutes, s.blockMinutes, s.maxRecords, s.idleTimeout, s.lifetime};
+    };
     VELA::Session::LoginSettingsLoad(&s);  // no file: the defaults
-    EXPECT_EQ(5, s.maxFailures);
-    EXPECT_EQ(10, s.windowMinutes);
-    EXPECT_EQ(15, s.blockMinutes);
-    EXPECT_EQ(10000, s.maxRecords);
-    EXPECT_EQ(0, s.idleTimeout);
+    EXPECT_EQ((std::vector<int>{5, 10, 15, 10000, 0, 0}), fields());
 
     Conf("webapi.conf", "login_max_failures=\"7\"\nlogin_window_minutes=\"0\"\nlogin_block_minutes=\"-3\"\n"
                         "login_guard_max_records=\"250\"\nsession_idle_timeout=\"600\"\nsession_lifetime=\"12h\"\n");
     VELA::Test::LogCapture log;
     VELA::Session::LoginSettingsLoad(&s);
-    EXPECT_EQ(7, s.maxFailures);
-    EXPECT_EQ(10, s.windowMinutes);
-    EXPECT_EQ(15, s.blockMinutes);
-    EXPECT_EQ(250, s.maxRecords);
-    EXPECT_EQ(600, s.idleTimeout);
-    EXPECT_EQ(0, s.lifetime);
+    EXPECT_EQ((std::vector<int>{7, 10, 15, 250, 600, 0}), fields());
     EXPECT_TRUE(log.Contains("login_window_minutes=\"0\" is not a number from 1 to 10080"));
     EXPECT_TRUE(log.Contains("session_lifetime=\"12h\""));
 }

@@ -42,20 +42,17 @@ TEST_F(ServerKey, CreatedOnFirstUseWithPrivateModes)
 
 TEST_F(ServerKey, ConcurrentFirstUseEndsWithOneKeyPair)
 {
-    int gate[2];
-    ASSERT_EQ(0, pipe(gate));
+    const Gate gate;
     Children children(4, [&](int i) {
-        close(gate[1]);
-        char c;
-        while (read(gate[0], &c, 1) > 0) {
-        }
+        gate.Wait();
         std::string pem;
         const int rc = VelaCgiPublicKeyPEM(pem);
         std::ofstream(In("/child" + std::to_string(i))) << pem;
         return rc == 0 ? 0 : 1;
     });
-    close(gate[0]);
-    close(gate[1]);  // all children start at once
+    for (int i = 0; i < 4; ++i) {
+        gate.Post();  // all children start at once
+    }
     EXPECT_EQ(std::vector<int>(4, 0), children.Wait());
     const std::string onDisk = ReadText(KeyDir() + "/param_rsa.pub.pem");
     ASSERT_FALSE(onDisk.empty());

@@ -107,9 +107,7 @@ TEST(Proc, PlainForkFlushesBuffersAndIsReapedByTheCaller)
     ASSERT_EQ(pid, waitpid(pid, &status, 0));
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 7);
     fclose(f);
-    std::ifstream in(path);
-    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    EXPECT_EQ("once", text);
+    EXPECT_EQ("once", VELA::Test::ReadText(path));
 }
 
 TEST(Proc, UnknownFlagsCreateNoProcess)

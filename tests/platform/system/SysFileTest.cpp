@@ -34,10 +34,12 @@ TEST_F(SysFile, SetReplacesOneLineAndKeepsTheRest)
     EXPECT_STREQ(" a \"quoted\" value\t", buf);
 
     EXPECT_EQ(0640u, Mode(file));
-    EXPECT_EQ(1, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", "yes", 0));  // already under the root
-    EXPECT_EQ(0, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", "YES", 0));
-    EXPECT_EQ(1, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", "YES", VLIBC_KV_NOCASE));
-    EXPECT_EQ(0, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", "yes", 0x80));
+    // A path already under the root is used as it is; unknown flags match nothing.
+    const struct { const char* value; int flags, match; } checks[] = {
+        {"yes", 0, 1}, {"YES", 0, 0}, {"YES", VLIBC_KV_NOCASE, 1}, {"yes", 0x80, 0}};
+    for (const auto& c : checks) {
+        EXPECT_EQ(c.match, VLIBCFileCheckKeyValue(file.c_str(), "enable_data_collect", c.value, c.flags)) << c.value;
+    }
     EXPECT_EQ(-1, VLIBCFileGetKeyValue(file.c_str(), "new.key-1", buf, 5));  // does not fit
     EXPECT_EQ(0, VLIBCFileGetKeyValue(file.c_str(), "absent", buf, sizeof(buf)));
     EXPECT_STREQ("", buf);
@@ -181,20 +183,14 @@ TEST_F(SysFile, UnlockRefusesWhatIsNotALockHandle)
 // Another process holds the lock: the wait ends with a failure.
 TEST_F(SysFile, LockWaitIsBounded)
 {
-    int ready[2], release[2];
-    ASSERT_EQ(0, pipe(ready));
-    ASSERT_EQ(0, pipe(release));
+    const Gate ready, release;
     Children holder(1, [&](int) {
         int handle = -1;
-        const char ok = VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 5, &handle) == 0 ? 'y' : 'n';
-        (void)!write(ready[1], &ok, 1);
-        char c;
-        (void)!read(release[0], &c, 1);  // hold the lock until told
+        ready.Post(VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 5, &handle) == 0 ? 'y' : 'n');
+        release.Wait();  // hold the lock until told
         return 0;
     });
-    char ok = 0;
-    ASSERT_EQ(1, read(ready[0], &ok, 1));
-    ASSERT_EQ('y', ok);
+    ASSERT_EQ('y', ready.Wait());
 
     int handle = 7;
     EXPECT_EQ(-1, VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 1, &handle));
@@ -202,13 +198,10 @@ TEST_F(SysFile, LockWaitIsBounded)
     EXPECT_EQ(VLIBC_ERR_TIMEOUT, VLIBCErrGet());
     EXPECT_EQ(-1, VLIBCFileLockTimeByFile("/etc/counter.lock", 0, 0, &handle));  // shared waits too
 
-    (void)!write(release[1], "x", 1);
+    release.Post();
     ASSERT_EQ(std::vector<int>{0}, holder.Wait());
     ASSERT_EQ(0, VLIBCFileLockTimeByFile("/etc/counter.lock", 1, 0, &handle));  // free again
     EXPECT_EQ(0, VLIBCFileUnlockByFile(handle));
-    for (int fd : {ready[0], ready[1], release[0], release[1]}) {
-        close(fd);
-    }
 }
 
 // Processes incrementing one counter under the lock lose no update.
