@@ -21,15 +21,10 @@ TEST(ParamLine, PlainLinesUnchanged)
 TEST(ParamLine, MalformedLinesRefused)
 {
     const struct { std::string line; const char* logged; } cases[] = {
-        {"a=%", "percent-encoding at offset 2"},
-        {"a=%4", "percent-encoding"},
-        {"a=%4g&b=1", "percent-encoding"},
-        {"a=%g4", "percent-encoding"},
-        {"a=1\n", "control byte 0x0a at offset 3"},
-        {std::string("a\0b", 3), "control byte 0x00"},
-        {"a=\x7f", "control byte 0x7f"},
-        {std::string(VELACGI_MAX_PARAM_LINE + 1, 'a'), "more than"},
-        {"__cIpHeRtExT=not-base64", "does not decrypt"},
+        {"a=%", "percent-encoding at offset 2"}, {"a=%4", "percent-encoding"}, {"a=%4g&b=1", "percent-encoding"},
+        {"a=%g4", "percent-encoding"}, {"a=1\n", "control byte 0x0a at offset 3"},
+        {std::string("a\0b", 3), "control byte 0x00"}, {"a=\x7f", "control byte 0x7f"},
+        {std::string(VELACGI_MAX_PARAM_LINE + 1, 'a'), "more than"}, {"__cIpHeRtExT=not-base64", "does not decrypt"},
     };
     for (const auto& c : cases) {
         LogCapture log;

@@ -68,8 +68,7 @@ TEST_F(AccessTokenTest, PatternsSelectApiAndMethod)
     const struct { const char* api; const char* method; int rc; } cases[] = {
         {"VELA.Demo.Test", "get", 0}, {"VELA.Demo.Test", "getInfo", 0}, {"VELA.Exact", "list", 0},
         {"VELA.Demo", "get", -3},  // the prefix includes the "."
-        {"VELA.Exact2", "get", -3}, {"VELA.Other.Test", "get", -3},
-        {"vela.demo.test", "get", -3},  // case-sensitive
+        {"VELA.Exact2", "get", -3}, {"VELA.Other.Test", "get", -3}, {"vela.demo.test", "get", -3},  // case-sensitive
         {"VELA.Demo.Test", "set", -3}, {"VELA.Demo.Test", "Get", -3}, {"VELA.Demo.Test", "listAll", -3},
         {"", "get", -3}, {"VELA.Demo.../x", "get", -3}, {"VELA.Demo.Test", nullptr, -3},
     };

@@ -221,8 +221,7 @@ TEST_F(Crypto, DamagedAesInputFailsCleanly)
         "@@@@" + good.substr(4),
         good.substr(0, 40) + "\n" + good.substr(40),
         good.substr(0, good.size() - 1),  // padding cut off
-        NonCanonical(good),
-        std::string(1024 * 1024 + 4, 'A'),
+        NonCanonical(good), std::string(1024 * 1024 + 4, 'A'),
     };
     for (const std::string& cipher : bad) {
         std::string out = "stale";
@@ -252,13 +251,10 @@ TEST_F(Crypto, DamagedCipherTextFailsCleanly)
     const std::string bad[] = {
         good.substr(0, 100) + (good[100] == 'A' ? "B" : "A") + good.substr(101),  // flipped bits
         good.substr(0, good.size() - 4),                                          // truncated
-        "",
-        "not base64!",
-        std::string(4100, 'A'),
+        "", "not base64!", std::string(4100, 'A'),
         Encrypt("name=x", {"-pkeyopt", "rsa_padding_mode:oaep"}),  // OAEP with SHA-1
         Encrypt("name=x", {}),                                     // PKCS #1 v1.5
-        Encrypt("name=x", kOaepSha256, other.Path() + "/other.pub"),
-        Encrypt(std::string("name=x\0y", 8)),
+        Encrypt("name=x", kOaepSha256, other.Path() + "/other.pub"), Encrypt(std::string("name=x\0y", 8)),
     };
     for (const std::string& cipher : bad) {
         std::string text = cipher;

@@ -86,10 +86,8 @@ TEST_F(ServerKey, UnusableKeyFailsClosedAndIsKeptAsIs)
     ASSERT_EQ(0, system(("mkdir -p -m 0700 " + KeyDir()).c_str()));
     const std::string priv = KeyDir() + "/param_rsa.pem";
     const struct { std::string content; mode_t mode; const char* log; } cases[] = {
-        {"garbage", 0600, "cannot read the private key"},
-        {weak, 0600, "is not an RSA key of 2048"},
-        {locked, 0600, "cannot read the private key"},
-        {good, 0640, "have mode 0600"},
+        {"garbage", 0600, "cannot read the private key"}, {weak, 0600, "is not an RSA key of 2048"},
+        {locked, 0600, "cannot read the private key"}, {good, 0640, "have mode 0600"},
     };
     for (const auto& c : cases) {
         WriteFile(priv, c.content, c.mode);

@@ -369,8 +369,7 @@ TEST_F(SessionTest, AntiForgeryToken)
         encoded += hex;
     }
     const struct { std::string header, query; int verdict; } cases[] = {  // "": not sent
-        {token.substr(0, 31), "", AUTH_RESULT_TOKEN_MISSING},
-        {token + "x", "", AUTH_RESULT_TOKEN_MISSING},
+        {token.substr(0, 31), "", AUTH_RESULT_TOKEN_MISSING}, {token + "x", "", AUTH_RESULT_TOKEN_MISSING},
         {token, "", AUTH_RESULT_AUTHORIZED},
         {"", "api=VELA.Demo&VelaToken=" + token + "&method=get", AUTH_RESULT_AUTHORIZED},
         {"", "Vela%54oken=" + encoded, AUTH_RESULT_AUTHORIZED},

@@ -204,8 +204,7 @@ TEST_F(HttpOutput, SingleRanges)
     const struct { const char* range; int status; size_t first, last; } cases[] = {  // status 200, 206 or 416
         {"bytes=10-19", 206, 10, 19},   {"bytes=990-", 206, 990, 999},   {"bytes=-5", 206, 995, 999},
         {"bytes=-5000", 206, 0, 999},   {"bytes=900-5000", 206, 900, 999}, {" BYTES=0-0 ", 206, 0, 0},
-        {"bytes=1000-", 416, 0, 0},     {"bytes=-0", 416, 0, 0},
-        {"bytes=99999999999999999999999-", 416, 0, 0},
+        {"bytes=1000-", 416, 0, 0},     {"bytes=-0", 416, 0, 0}, {"bytes=99999999999999999999999-", 416, 0, 0},
         {"bytes=5-1", 200, 0, 999},     {"bytes=0-1,5-6", 200, 0, 999},  {"bytes=abc", 200, 0, 999},
         {"items=0-1", 200, 0, 999},     {"bytes=1-2x", 200, 0, 999},     {"bytes=", 200, 0, 999},
     };
@@ -298,12 +297,10 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     mkdir((dir + "/open").c_str(), 0755);
     chmod((dir + "/open").c_str(), 0777);
     std::vector<std::string> streamed = {
-        place(dir + "/others", 0777, 0644, getuid()),
-        place(dir + "/sticky", 01777, 0644, getuid()),
+        place(dir + "/others", 0777, 0644, getuid()), place(dir + "/sticky", 01777, 0644, getuid()),
         place(dir + "/group", 0775, 0644, getuid()),
         place(dir + "/open/deeper", 0755, 0644, getuid()),  // an ancestor others may write to
-        place(dir + "/file-others", 0755, 0666, getuid()),
-        place(dir + "/file-group", 0755, 0664, getuid()),
+        place(dir + "/file-others", 0755, 0666, getuid()), place(dir + "/file-group", 0755, 0664, getuid()),
         dir + "/evil\r\nX-Injected: 1",
     };
     std::ofstream(streamed.back()) << "content";
@@ -378,11 +375,9 @@ TEST_F(HttpOutput, RefusesLinksAndWhatIsNotARegularFile)
         {nullptr, [&] { return out_.Output(static_cast<FILE*>(nullptr), "n", ""); }},
         {nullptr, [&] { return out_.Output(dirStream, "n", ""); }},
         {nullptr, [&] { return out_.Output(writeOnly, "n", ""); }},
-        {nullptr, [&] { return out_.Output(dirFd, "n", ""); }},
-        {nullptr, [&] { return out_.Output(fifoFd, "n", ""); }},
+        {nullptr, [&] { return out_.Output(dirFd, "n", ""); }}, {nullptr, [&] { return out_.Output(fifoFd, "n", ""); }},
         {nullptr, [&] { return out_.Output(fileno(writeOnly), "n", ""); }},
-        {nullptr, [&] { return out_.Output(pathFd, "n", ""); }},
-        {nullptr, [&] { return out_.Output(-1, "n", ""); }},
+        {nullptr, [&] { return out_.Output(pathFd, "n", ""); }}, {nullptr, [&] { return out_.Output(-1, "n", ""); }},
     };
     for (size_t i = 0; i < sizeof(calls) / sizeof(calls[0]); ++i) {
         VELA::Test::LogCapture log;

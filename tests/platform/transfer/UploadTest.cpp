@@ -24,10 +24,8 @@ TEST(UploadRead, FieldsAndFilesFromOneForm)
     const std::string body =
         "preamble to ignore\r\n" +
         Body({{"api", "VELA.Demo.Upload"},
-              {"note", "two\r\nlines"},
-              {"file", binary, "C:\\Users\\me\\photo.jpg", true},
-              {"file", "second file", "../x", true},
-              {"empty", "", "", true},  // a file input left empty: skipped
+              {"note", "two\r\nlines"}, {"file", binary, "C:\\Users\\me\\photo.jpg", true},
+              {"file", "second file", "../x", true}, {"empty", "", "", true},  // a file input left empty: skipped
               {"tail", ""}}) +
         "epilogue\r\n";
     for (int viaPipe = 0; viaPipe < 2; ++viaPipe) {
