@@ -12,7 +12,6 @@ namespace {
 
 using namespace VELA::Test;
 using VELA::Session::Options;
-using Handle = CgiHandle;
 
 const char kClient[] = "192.0.2.7";
 const char kAbsent[] = "AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA";
@@ -41,8 +40,7 @@ protected:
     std::string Create(const Options& options = Options(), const char* user = "root", const char* ip = kClient,
                        std::string* token = nullptr)
     {
-        std::string sid;
-        std::string tok;
+        std::string sid, tok;
         EXPECT_EQ(0, VELA::Session::Create(user, ip, &options, sid, tok));
         EXPECT_EQ(32u, sid.size());
         EXPECT_EQ(32u, tok.size());
@@ -93,11 +91,11 @@ TEST_F(SessionTest, CreateRefusesBadInput)
     EXPECT_EQ(-1, VELA::Session::Create("vela-no-such-user", kClient, nullptr, sid, token));
     EXPECT_TRUE(sid.empty() && token.empty());
     EXPECT_TRUE(log_.Contains("no user \"vela-no-such-user\""));
-    EXPECT_EQ(-1, VELA::Session::Create(nullptr, kClient, nullptr, sid, token));
-    EXPECT_EQ(-1, VELA::Session::Create("", kClient, nullptr, sid, token));
-    EXPECT_EQ(-1, VELA::Session::Create("../root", kClient, nullptr, sid, token));
-    EXPECT_EQ(-1, VELA::Session::Create("root", "999.1.1.1", nullptr, sid, token));
-    EXPECT_EQ(-1, VELA::Session::Create("root", "192.0.2.7\n", nullptr, sid, token));
+    const std::pair<const char*, const char*> bad[] = {
+        {nullptr, kClient}, {"", kClient}, {"../root", kClient}, {"root", "999.1.1.1"}, {"root", "192.0.2.7\n"}};
+    for (const auto& [user, ip] : bad) {
+        EXPECT_EQ(-1, VELA::Session::Create(user, ip, nullptr, sid, token)) << (user ? user : "null") << " " << ip;
+    }
     for (const Options& options : {With(&Options::lang, "EN"), Timed(VELA_SESSION_IDLE_MAX + 1), Timed(0, -5),
                                    With(&Options::app, "a\nb")}) {
         EXPECT_EQ(-1, VELA::Session::Create("root", kClient, &options, sid, token));
@@ -129,7 +127,7 @@ TEST_F(SessionTest, CreateAndCheckValidSession)
 
     EXPECT_NE(sid, Create());
 
-    Handle h;
+    CgiHandle h;
     EXPECT_STREQ("fallback", VelaCgiGetOption(h.ctx, VELACGI_OPT_TIMEOUT, "fallback"));
     EXPECT_EQ(nullptr, VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));
     EXPECT_STREQ("", VelaCgiGetSessionFile(h.ctx));
@@ -289,25 +287,15 @@ TEST_F(SessionTest, CorruptFilesAreNoSessionAndStayAsTheyAre)
     const std::string other = Create();
     ASSERT_EQ(0, rename(File(other).c_str(), File(sid).c_str()));
     EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(sid));
-}
 
-TEST_F(SessionTest, OnlyRegularFilesOfOursAreRead)
-{
-    const std::string target = Create();
-    const std::string link = Create();
-    ASSERT_EQ(0, unlink(File(link).c_str()));
-    ASSERT_EQ(0, symlink(File(target).c_str(), File(link).c_str()));
-    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(link));
-
-    const std::string fifo = Create();
-    ASSERT_EQ(0, unlink(File(fifo).c_str()));
-    ASSERT_EQ(0, mkfifo(File(fifo).c_str(), 0600));
-    EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(fifo));  // and does not block
-
-    if (geteuid() == 0) {
-        const std::string foreign = Create();
-        ASSERT_EQ(0, chown(File(foreign).c_str(), 65534, 65534));
-        EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(foreign));
+    // Only regular files of ours are read: no link, no FIFO (and no wait for
+    // its writer), no file of another user.
+    const std::string target = Create(), link = Create(), fifo = Create(), foreign = Create();
+    ASSERT_FALSE(unlink(File(link).c_str()) || symlink(File(target).c_str(), File(link).c_str()));
+    ASSERT_FALSE(unlink(File(fifo).c_str()) || mkfifo(File(fifo).c_str(), 0600));
+    ASSERT_EQ(0, geteuid() == 0 ? chown(File(foreign).c_str(), 65534, 65534) : unlink(File(foreign).c_str()));
+    for (const std::string& id : {link, fifo, foreign}) {
+        EXPECT_EQ(AUTH_RESULT_NO_SESSION, Check(id)) << id;
     }
 }
 
@@ -324,7 +312,7 @@ TEST_F(SessionTest, ClientAddressMustMatch)
         EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());  // a refused check keeps nothing alive
 
         // The method may exempt itself from the address check.
-        Handle h;
+        CgiHandle h;
         ASSERT_EQ(0, VelaCgiSetSkipCheckIP(h.ctx, 1));
         EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid, 0, h.ctx));
         EXPECT_STREQ("0", VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));  // the session's own flag
@@ -338,7 +326,7 @@ TEST_F(SessionTest, ClientAddressMustMatch)
     const std::string roaming = Create(With(&Options::skipIP, true));
     const std::string unbound = Create(Options(), "root", "");
     ScopedEnv other("REMOTE_ADDR", "2001:db8::1");
-    Handle h;
+    CgiHandle h;
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(roaming, 0, h.ctx));
     EXPECT_EQ(1, VelaCgiGetSkipCheckIP(h.ctx));
     EXPECT_STREQ("1", VelaCgiGetOption(h.ctx, VELACGI_OPT_SKIP_IP, nullptr));
@@ -386,7 +374,7 @@ TEST_F(SessionTest, AntiForgeryToken)
 
     // Token protection is a property of the session.
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(Create()));
-    Handle h;
+    CgiHandle h;
     for (const auto& cookie : {std::make_pair("id=" + sid, 1), std::make_pair("id=" + Create(), 0),
                                std::make_pair(std::string("id=../x"), 0)}) {
         ScopedEnv env("HTTP_COOKIE", cookie.first.c_str());
@@ -455,7 +443,7 @@ TEST_F(SessionTest, ListRemovePurge)
 
 TEST_F(SessionTest, LanguageFromSessionOrHeader)
 {
-    Handle h;
+    CgiHandle h;
     char buf[4];
     auto lang = [&](const char* header) {
         ScopedEnv env("HTTP_ACCEPT_LANGUAGE", header);

@@ -60,35 +60,21 @@ TEST_F(Preference, SmallBufferAndSymlinkLeaf)
 
 TEST_F(Preference, OwnedByTheUserWhenRoot)
 {
-    if (geteuid() != 0) {
-        GTEST_SKIP() << "chown needs root";
+    const struct passwd* pw = getpwnam("nobody");
+    const struct group* gr = getgrnam("nogroup");
+    if (geteuid() != 0 || pw == nullptr || gr == nullptr) {
+        GTEST_SKIP() << "chown needs root, and the user nobody and group nogroup";
     }
-    struct passwd* pw = getpwnam("nobody");
-    if (pw == nullptr) {
-        GTEST_SKIP() << "no user nobody";
-    }
-    const uid_t uid = pw->pw_uid;
-    const gid_t gid = pw->pw_gid;
-    char buf[4096];
-    ASSERT_EQ(0, VELAUserPreferenceDirGet("nobody", buf, sizeof(buf)));
-    struct stat st;
-    ASSERT_EQ(0, stat(buf, &st));
-    EXPECT_EQ(uid, st.st_uid);
-    EXPECT_EQ(gid, st.st_gid);
-
-    // Unknown names stay owned by root.
-    ASSERT_EQ(0, VELAUserPreferenceDirGet("no-such-user-xyz", buf, sizeof(buf)));
-    ASSERT_EQ(0, stat(buf, &st));
-    EXPECT_EQ(0u, st.st_uid);
-
-    struct group* gr = getgrnam("nogroup");
-    if (gr != nullptr) {
-        const gid_t groupId = gr->gr_gid;
-        ASSERT_EQ(0, VELAGroupPreferenceDirGet("nogroup", buf, sizeof(buf)));
-        ASSERT_EQ(0, stat(buf, &st));
-        EXPECT_EQ(0u, st.st_uid);
-        EXPECT_EQ(groupId, st.st_gid);
-    }
+    const std::pair<uid_t, gid_t> user(pw->pw_uid, pw->pw_gid), group(0, gr->gr_gid);
+    const auto owner = [](int (*get)(const char*, char*, size_t), const char* name) {
+        char buf[4096];
+        struct stat st;
+        EXPECT_EQ(0, get(name, buf, sizeof(buf))) << name;
+        return stat(buf, &st) == 0 ? std::make_pair(st.st_uid, st.st_gid) : std::make_pair(uid_t(-1), gid_t(-1));
+    };
+    EXPECT_EQ(user, owner(VELAUserPreferenceDirGet, "nobody"));
+    EXPECT_EQ(0u, owner(VELAUserPreferenceDirGet, "no-such-user-xyz").first);  // unknown names stay root's
+    EXPECT_EQ(group, owner(VELAGroupPreferenceDirGet, "nogroup"));
 }
 
 }  // namespace
