@@ -18,8 +18,7 @@ protected:
     std::string Create(const std::vector<std::string>& apis, const std::vector<std::string>& methods,
                        long long lifetime = 0, const char* user = "root", std::string* id = nullptr)
     {
-        std::string token;
-        std::string tid;
+        std::string token, tid;
         EXPECT_EQ(0, VelaAccessTokenCreate(user, apis, methods, lifetime, token, tid));
         EXPECT_EQ(static_cast<size_t>(VELA_TOKEN_LEN), token.size());
         EXPECT_EQ(tid, token.substr(0, VELA_TOKEN_ID_LEN));
@@ -35,7 +34,6 @@ protected:
         user_[1] = '\0';
         return VelaAccessTokenGrant(token.c_str(), api, method, user_, sizeof(user_));
     }
-
 
     LogCapture log_;
     char user_[493];
@@ -114,31 +112,27 @@ TEST_F(AccessTokenTest, UserMustStillExist)
     EXPECT_EQ(-4, Grant(token, "VELA.Demo", "get"));
     EXPECT_STREQ("", user_);
 
-    std::string tok = "stale";
-    std::string tid = "stale";
+    std::string tok = "stale", tid = "stale";
     EXPECT_EQ(-1, VelaAccessTokenCreate("vela-no-such-user", {"*"}, {"*"}, 0, tok, tid));
-    EXPECT_TRUE(tok.empty());
-    EXPECT_TRUE(tid.empty());
+    EXPECT_TRUE(tok.empty() && tid.empty());
     EXPECT_TRUE(log_.Contains("no user \"vela-no-such-user\""));
 }
 
 TEST_F(AccessTokenTest, CreateRefusesBadInput)
 {
-    std::string token;
-    std::string id;
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {}, {"get"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"VELA.Demo"}, {}, 0, token, id));
+    std::string token, id;
     for (const char* bad : {"", "a*b", "*x", "**", "a b", "../x", "VELA/Demo", "a\n"}) {
         EXPECT_EQ(-1, VelaAccessTokenCreate("root", {bad}, {"get"}, 0, token, id)) << bad;
         EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"VELA.Demo"}, {bad}, 0, token, id)) << bad;
         EXPECT_FALSE(VelaAccessTokenIsPattern(bad)) << bad;
     }
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {std::string(129, 'a')}, {"get"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", std::vector<std::string>(33, "a"), {"get"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"*"}, {"*"}, -1, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"*"}, {"*"}, VELA_TOKEN_LIFETIME_MAX + 1, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate(nullptr, {"*"}, {"*"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("a/b", {"*"}, {"*"}, 0, token, id));
+    const struct { const char* user; std::vector<std::string> apis, methods; long long lifetime; } bad[] = {
+        {"root", {}, {"get"}, 0}, {"root", {"VELA.Demo"}, {}, 0}, {"root", {std::string(129, 'a')}, {"get"}, 0},
+        {"root", std::vector<std::string>(33, "a"), {"get"}, 0}, {"root", {"*"}, {"*"}, -1},
+        {"root", {"*"}, {"*"}, VELA_TOKEN_LIFETIME_MAX + 1}, {nullptr, {"*"}, {"*"}, 0}, {"a/b", {"*"}, {"*"}, 0}};
+    for (size_t i = 0; i < sizeof(bad) / sizeof(bad[0]); ++i) {
+        EXPECT_EQ(-1, VelaAccessTokenCreate(bad[i].user, bad[i].apis, bad[i].methods, bad[i].lifetime, token, id)) << i;
+    }
     EXPECT_TRUE(token.empty());
     EXPECT_TRUE(DirEntries(Dir()).empty());
 }
