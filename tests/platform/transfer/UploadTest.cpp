@@ -26,8 +26,7 @@ TEST(UploadRead, FieldsAndFilesFromOneForm)
         Body({{"api", "VELA.Demo.Upload"},
               {"note", "two\r\nlines"}, {"file", binary, "C:\\Users\\me\\photo.jpg", true},
               {"file", "second file", "../x", true}, {"empty", "", "", true},  // a file input left empty: skipped
-              {"tail", ""}}) +
-        "epilogue\r\n";
+              {"tail", ""}}) + "epilogue\r\n";
     for (int viaPipe = 0; viaPipe < 2; ++viaPipe) {
         SCOPED_TRACE(viaPipe ? "pipe with small writes" : "memfd");
         Result r;
@@ -38,17 +37,13 @@ TEST(UploadRead, FieldsAndFilesFromOneForm)
             ReadAllText(body, dir.Path(), r);
         }
         ASSERT_EQ(1, r.rc);
-        EXPECT_EQ("VELA.Demo.Upload", r.Field("api"));
-        EXPECT_EQ("two\r\nlines", r.Field("note"));
-        EXPECT_EQ("", r.Field("tail"));
-        EXPECT_EQ("photo.jpg", r.Field("file_name"));
-        EXPECT_EQ("x", r.Field("file_2_name"));
+        EXPECT_EQ((std::map<std::string, std::string>{{"api", "VELA.Demo.Upload"}, {"note", "two\r\nlines"},
+                                                      {"tail", ""}, {"file_name", "photo.jpg"}, {"file_2_name", "x"}}),
+                  r.Fields());
         EXPECT_EQ(2, VLIBCSzHashCount(r.files));  // "empty" stored nothing
-        const std::string first = r.File("file");
-        const std::string second = r.File("file_2");
-        EXPECT_EQ(binary, ReadText(first));
-        EXPECT_EQ("second file", ReadText(second));
-        for (const std::string& path : {first, second}) {
+        EXPECT_EQ(binary, ReadText(r.File("file")));
+        EXPECT_EQ("second file", ReadText(r.File("file_2")));
+        for (const std::string& path : {r.File("file"), r.File("file_2")}) {
             EXPECT_EQ(dir.Path() + "/upload-", path.substr(0, dir.Path().size() + 8));
             EXPECT_EQ(0600u, Mode(path));
             unlink(path.c_str());
@@ -206,8 +201,7 @@ TEST(UploadRead, StepByStep)
     UploadReader* reader = nullptr;
     ASSERT_EQ(1, UploadReaderOpen(fd, body.size(), kType.c_str(), &reader));
     char path[4096];
-    EXPECT_EQ(VELA_UPLOAD_ERR_STATE, UploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), nullptr,
-                                                    nullptr));
+    EXPECT_EQ(VELA_UPLOAD_ERR_STATE, UploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), nullptr, nullptr));
     Result r;
     ASSERT_EQ(1, UploadReadFields(reader, r.fields, nullptr));
     EXPECT_EQ("A", r.Field("api"));
@@ -221,8 +215,7 @@ TEST(UploadRead, StepByStep)
     // ReadAll picks up the rest and reports the whole body.
     Result all;
     ASSERT_EQ(1, UploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 0, nullptr));
-    EXPECT_EQ("A", all.Field("api"));
-    EXPECT_EQ("B", all.Field("after"));
+    EXPECT_EQ((std::map<std::string, std::string>{{"api", "A"}, {"doc_name", "d.txt"}, {"after", "B"}}), all.Fields());
     EXPECT_EQ(path, all.File("doc"));
     EXPECT_EQ(body.size(), UploadConsumed(reader));
     UploadReaderFree(reader);
