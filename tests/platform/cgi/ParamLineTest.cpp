@@ -1,8 +1,7 @@
 // VelaCgiDetectAndDecryptParamLine: plain lines pass unchanged, malformed
-// ones are refused, a line encrypted as a whole is decrypted.
-#include "platform/session/CryptoTestUtil.h"
+// ones are refused (a line encrypted as a whole: CryptoTest.cpp).
+#include "platform/PlatformTest.h"
 #include "support/LinearTime.h"
-#include "vela/webapiutil.h"
 
 using VELA::Test::LogCapture;
 
@@ -46,36 +45,4 @@ TEST(ParamLine, CheckTakesLinearTime)
     for (const char* piece : {"&", "%41&", "__cIpHeRtExT=&"}) {
         VELA::Test::ExpectLinear("VelaCgiDetectAndDecryptParamLine", line, piece);
     }
-}
-
-class ParamLineCipher : public RootTest {
-protected:
-    // base64 of `plain` encrypted to the server key by the openssl tool.
-    std::string Encrypt(const std::string& plain)
-    {
-        std::string pem;
-        EXPECT_EQ(0, VelaCgiPublicKeyPEM(pem));
-        VELA::Test::WriteFile(In("/pub.pem"), pem);
-        return VELA::Test::OpensslEncrypt(root_.Path(), In("/pub.pem"), plain);
-    }
-};
-
-TEST_F(ParamLineCipher, WholeLineDecryptedAndChecked)
-{
-    const std::string plain = "api=VELA.Sample&name=a%20b";
-    const std::string b64 = Encrypt(plain);
-    ASSERT_FALSE(b64.empty());
-
-    for (const std::string& value : {b64, VELA::WebAPIUtil::URLEncode(b64)}) {
-        std::string line = "__cIpHeRtExT=" + value;
-        EXPECT_TRUE(VelaCgiDetectAndDecryptParamLine(line));
-        EXPECT_EQ(plain, line);
-    }
-
-    std::string broken = "__cIpHeRtExT=" + Encrypt("name=%zz");
-    const std::string before = broken;
-    LogCapture log;
-    EXPECT_FALSE(VelaCgiDetectAndDecryptParamLine(broken));
-    EXPECT_EQ(before, broken);
-    EXPECT_TRUE(log.Contains("decrypted parameter line refused"));
 }

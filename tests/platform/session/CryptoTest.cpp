@@ -323,4 +323,24 @@ TEST_F(Crypto, MissingLibraryFailsClosed)
     EXPECT_EQ(1, Count(ran.err, "encrypted parameters unavailable: libcrypto.so.3 lacks OPENSSL_cleanse")) << ran.err;
 }
 
+// A parameter line encrypted as a whole is decrypted, then checked as a
+// plain one is (ParamLineTest.cpp).
+TEST_F(Crypto, WholeParamLineDecryptedAndChecked)
+{
+    const std::string plain = "api=VELA.Sample&name=a%20b";
+    const std::string b64 = Encrypt(plain);
+    for (const std::string& value : {b64, VELA::WebAPIUtil::URLEncode(b64)}) {
+        std::string line = "__cIpHeRtExT=" + value;
+        EXPECT_TRUE(VelaCgiDetectAndDecryptParamLine(line));
+        EXPECT_EQ(plain, line);
+    }
+
+    std::string broken = "__cIpHeRtExT=" + Encrypt("name=%zz");
+    const std::string before = broken;
+    LogCapture log;
+    EXPECT_FALSE(VelaCgiDetectAndDecryptParamLine(broken));
+    EXPECT_EQ(before, broken);
+    EXPECT_TRUE(log.Contains("decrypted parameter line refused"));
+}
+
 }  // namespace
