@@ -56,7 +56,8 @@ TEST_F(SysFile, InvalidKeysAndValuesAreRefused)
     WriteFile(file, "a=\"1\"\n");
     const std::string longKey(129, 'k');
     const std::string longValue(4097, 'v');
-    for (const char* key : {"", "a=b", "a\nb", "a b", "#a", "a\"", "a/b", longKey.c_str(), static_cast<const char*>(nullptr)}) {
+    for (const char* key :
+         {"", "a=b", "a\nb", "a b", "#a", "a\"", "a/b", longKey.c_str(), static_cast<const char*>(nullptr)}) {
         EXPECT_EQ(-1, VLIBCINFOSetKeyValue(key, "x")) << (key ? key : "null");
     }
     for (const char* value : {"x\ny", "x\rb", "x\x01", longValue.c_str(), static_cast<const char*>(nullptr)}) {
