@@ -230,10 +230,10 @@ TEST(UploadDir, SweepTakesOnlyStaleUnlockedDirectoriesOfOurs)
     MakeAged(b, "vela-upload-stalestale22", old);
     ASSERT_EQ(0, symlink((elsewhere.Path() + "/precious").c_str(), (b + "/vela-upload-stalestale22/ln").c_str()));
     Age(b + "/vela-upload-stalestale22", old);
-    MakeAged(b, "vela-upload-livelivelive", old);
     MakeAged(b, "vela-upload-freshfresh22", 0);
-    MakeAged(b, "vela-upload-short", old);
-    MakeAged(b, "other-upload-stalestale", old);
+    for (const char* name : {"vela-upload-livelivelive", "vela-upload-short", "other-upload-stalestale"}) {
+        MakeAged(b, name, old);
+    }
     MakeAged(elsewhere.Path(), "target", old);
     ASSERT_EQ(0, symlink((elsewhere.Path() + "/target").c_str(), (b + "/vela-upload-linklinklink").c_str()));
     WriteFile(b + "/vela-upload-filefilefile", "a file");
