@@ -104,12 +104,18 @@ TEST_F(LoginGuard, LimitPerAddressForAnyAccount)
          {'T', "b4", "2001:db8:1:3::1", kAllow}});
 }
 
-TEST_F(LoginGuard, FailuresLeaveTheWindow)
+// Failures leave the window; attempts in progress count against the limit.
+TEST_F(LoginGuard, FailuresLeaveTheWindowAttemptsInProgressCount)
 {
     // After the second step the first failure is older than 10 minutes.
     Run({{'F', "carol", "192.0.2.1", kAllow}, {'F', "carol", "192.0.2.1", kAllow, 6 * 60},
          {'F', "carol", "192.0.2.1", kAllow, 4 * 60 + 1}, {'F', "carol", "192.0.2.1", kAllow},
          {'T', "carol", "192.0.2.1", kBlocked}});
+
+    // Three checks started and not finished: a fourth gets no check, and
+    // waits until the oldest leaves the window.
+    Run({{'T', "frank", "192.0.2.2", kAllow}, {'T', "frank", "192.0.2.2", kAllow, 60},
+         {'T', "frank", "192.0.2.2", kAllow, 60}, {'T', "frank", "192.0.2.2", kBlocked, 60, 7 * 60}});
 }
 
 TEST_F(LoginGuard, BlockEndsAndStartsAfresh)
@@ -135,14 +141,6 @@ TEST_F(LoginGuard, SuccessClearsItsOwnPairOnly)
     const Step mistyped = {'F', "daemon", "192.0.2.2", kAllow}, elsewhere = {'F', "daemon", "192.0.2.3", kAllow};
     Run({mistyped, mistyped, elsewhere, {'S', "daemon", "192.0.2.2", kAllow}, mistyped, mistyped, mistyped,
          {'T', "daemon", "192.0.2.2", kBlocked}, elsewhere, elsewhere, {'T', "x", "192.0.2.3", kBlocked}});
-}
-
-TEST_F(LoginGuard, AttemptsInProgressCountAgainstTheLimit)
-{
-    // Three checks started and not finished: a fourth gets no check, and
-    // waits until the oldest leaves the window.
-    Run({{'T', "frank", "192.0.2.1", kAllow}, {'T', "frank", "192.0.2.1", kAllow, 60},
-         {'T', "frank", "192.0.2.1", kAllow, 60}, {'T', "frank", "192.0.2.1", kBlocked, 60, 7 * 60}});
 }
 
 TEST_F(LoginGuard, RecordsAreHashedPrivateFiles)

@@ -99,7 +99,7 @@ TEST(Names, HostnamesDomainsAndAddressTypes)
     }
 }
 
-TEST(SzHash, InsertionOrderAndReplaceInPlace)
+TEST(SzHash, InsertionOrderReplaceInPlaceAndBadArguments)
 {
     PVLIBCSZHASH hash = VLIBCSzHashAlloc(0);
     ASSERT_NE(nullptr, hash);
@@ -120,11 +120,9 @@ TEST(SzHash, InsertionOrderAndReplaceInPlace)
     EXPECT_EQ(3u, obj.size());
     EXPECT_EQ("3", obj["b"].asString());
     VLIBCSzHashFree(hash);
-}
 
-TEST(SzHash, NullArgumentsAndHugeSizeHint)
-{
-    PVLIBCSZHASH hash = VLIBCSzHashAlloc(-5);
+    // Null arguments, and a size hint that is no allocation size.
+    hash = VLIBCSzHashAlloc(-5);
     ASSERT_NE(nullptr, hash);
     EXPECT_EQ(-1, VLIBCSzHashSetValue(hash, nullptr, "v"));
     EXPECT_EQ(-1, VLIBCSzHashSetValue(hash, "k", nullptr));
@@ -133,7 +131,7 @@ TEST(SzHash, NullArgumentsAndHugeSizeHint)
     EXPECT_EQ(0, VLIBCSzHashCount(hash));
     VLIBCSzHashFree(hash);
 
-    hash = VLIBCSzHashAlloc(0x7fffffff);  // a hint, not an allocation size
+    hash = VLIBCSzHashAlloc(0x7fffffff);
     ASSERT_NE(nullptr, hash);
     for (int i = 0; i < 1000; ++i) {
         ASSERT_EQ(0, VLIBCSzHashSetValue(hash, std::to_string(i).c_str(), "x"));

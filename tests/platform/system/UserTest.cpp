@@ -7,7 +7,7 @@
 
 namespace {
 
-TEST(UserLookup, HostileNamesAreRefused)
+TEST(UserLookup, HostileNamesAreRefusedAndRecordsComeFromNss)
 {
     uid_t uid = 1;
     gid_t gid = 1;
@@ -23,10 +23,8 @@ TEST(UserLookup, HostileNamesAreRefused)
     EXPECT_EQ(-1, VLIBGroupIsAdminGroupMem("root", 1));  // unknown flags
     EXPECT_EQ(1, VELAUserNameIsValid("CORP\\bob"));
     EXPECT_EQ(1, VELAUserNameIsValid("bob@realm"));
-}
 
-TEST(UserLookup, RecordsComeFromNss)
-{
+    // The records come from NSS.
     PVELAUSER user = nullptr;
     ASSERT_EQ(0, VELAUserGetByUID(0, &user));
     EXPECT_STREQ(getpwuid(0)->pw_name, user->szName);
@@ -34,8 +32,6 @@ TEST(UserLookup, RecordsComeFromNss)
     ASSERT_EQ(0, VELAUserGetByName(getpwuid(0)->pw_name, &user));
     EXPECT_EQ(0u, user->uid);
     VELAUserFree(user);
-    uid_t uid = 1;
-    gid_t gid = 1;
     EXPECT_EQ(-1, VELAUserGetUGID("vela-no-such-user-x", &uid, &gid));
     EXPECT_EQ(-1, VELAUserGetByName("vela-no-such-user-x", &user));
     EXPECT_EQ(nullptr, user);
