@@ -108,10 +108,8 @@ TEST_F(RemoteIP, OnlyConfiguredAddressesAreProxies)
     for (const char* peer : {"192.0.2.11", "bogus", "", "192.0.2.10 ", static_cast<const char*>(nullptr)}) {
         EXPECT_EQ(0, VelaCgiIsTrustedProxy(peer)) << (peer ? peer : "null");
     }
-}
 
-TEST_F(RemoteIP, BufferSize)
-{
+    // The address must fit the caller's buffer.
     ScopedEnv r("REMOTE_ADDR", "203.0.113.9");
     ScopedEnv f("HTTP_X_FORWARDED_FOR", nullptr);
     char buf[12];

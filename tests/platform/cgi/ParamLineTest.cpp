@@ -5,7 +5,7 @@
 
 using VELA::Test::LogCapture;
 
-TEST(ParamLine, PlainLinesUnchanged)
+TEST(ParamLine, PlainLinesUnchangedMalformedOnesRefused)
 {
     for (std::string line : {"", "a=1&b=%41%4a+c", "&&==&x", "n=\xc3\xa9t\xc3\xa9", "k=%00",
                              "__cIpHeRtExT", "x=1&__cIpHeRtExT=QUJD"}) {
@@ -15,10 +15,8 @@ TEST(ParamLine, PlainLinesUnchanged)
     }
     std::string longest(VELACGI_MAX_PARAM_LINE, 'a');
     EXPECT_TRUE(VelaCgiDetectAndDecryptParamLine(longest));
-}
 
-TEST(ParamLine, MalformedLinesRefused)
-{
+    // Malformed lines are refused as they are, with the reason logged.
     const struct { std::string line; const char* logged; } cases[] = {
         {"a=%", "percent-encoding at offset 2"}, {"a=%4", "percent-encoding"}, {"a=%4g&b=1", "percent-encoding"},
         {"a=%g4", "percent-encoding"}, {"a=1\n", "control byte 0x0a at offset 3"},

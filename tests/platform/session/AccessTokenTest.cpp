@@ -102,7 +102,7 @@ TEST_F(AccessTokenTest, Expiry)
     EXPECT_EQ(-1, Grant(token, "VELA.Demo", "get"));
 }
 
-TEST_F(AccessTokenTest, UserMustStillExist)
+TEST_F(AccessTokenTest, UserMustStillExistAndFitTheBuffer)
 {
     std::string id;
     const std::string token = Create({"*"}, {"*"}, 0, "nobody", &id);
@@ -116,6 +116,16 @@ TEST_F(AccessTokenTest, UserMustStillExist)
     EXPECT_EQ(-1, VelaAccessTokenCreate("vela-no-such-user", {"*"}, {"*"}, 0, tok, tid));
     EXPECT_TRUE(tok.empty() && tid.empty());
     EXPECT_TRUE(log_.Contains("no user \"vela-no-such-user\""));
+
+    // The user name must fit the caller's buffer.
+    const std::string all = Create({"*"}, {"*"});
+    char small[4] = "xx";
+    EXPECT_EQ(-5, VelaAccessTokenGrant(all.c_str(), "VELA.Demo", "get", small, sizeof(small)));
+    EXPECT_STREQ("", small);
+    EXPECT_EQ(-5, VelaAccessTokenGrant(all.c_str(), "VELA.Demo", "get", nullptr, 493));
+    char exact[5];
+    EXPECT_EQ(0, VelaAccessTokenGrant(all.c_str(), "VELA.Demo", "get", exact, sizeof(exact)));
+    EXPECT_STREQ("root", exact);
 }
 
 TEST_F(AccessTokenTest, CreateRefusesBadInput)
@@ -224,18 +234,6 @@ TEST_F(AccessTokenTest, ListAndRevoke)
     EXPECT_EQ(-1, Grant(b, "VELA.Demo.X", "list"));
     ASSERT_EQ(0, VelaAccessTokenList(list));
     EXPECT_TRUE(list.empty());
-}
-
-TEST_F(AccessTokenTest, UserBuffer)
-{
-    const std::string token = Create({"*"}, {"*"});
-    char small[4] = "xx";
-    EXPECT_EQ(-5, VelaAccessTokenGrant(token.c_str(), "VELA.Demo", "get", small, sizeof(small)));
-    EXPECT_STREQ("", small);
-    EXPECT_EQ(-5, VelaAccessTokenGrant(token.c_str(), "VELA.Demo", "get", nullptr, 493));
-    char exact[5];
-    EXPECT_EQ(0, VelaAccessTokenGrant(token.c_str(), "VELA.Demo", "get", exact, sizeof(exact)));
-    EXPECT_STREQ("root", exact);
 }
 
 }  // namespace

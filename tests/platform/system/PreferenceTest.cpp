@@ -12,22 +12,9 @@ protected:
     bool Exists(const std::string& relative) { return access(In(relative).c_str(), F_OK) == 0; }
 };
 
-TEST_F(Preference, CreatesPrivateDirectory)
-{
-    char buf[4096];
-    ASSERT_EQ(0, VELAUserPreferenceDirGet("alice", buf, sizeof(buf)));
-    const std::string want = In("/var/lib/vela/preference/user/alice");
-    EXPECT_EQ(want, buf);
-    struct stat st;
-    ASSERT_EQ(0, lstat(want.c_str(), &st));
-    EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 0700), st.st_mode & (S_IFMT | 07777));
-
-    ASSERT_EQ(0, VELAUserPreferenceDirGet("alice", buf, sizeof(buf)));  // existing is fine
-    ASSERT_EQ(0, VELAGroupPreferenceDirGet("staff team", buf, sizeof(buf)));
-    EXPECT_EQ(In("/var/lib/vela/preference/group/staff team"), buf);
-}
-
-TEST_F(Preference, HostileNamesCreateNothing)
+// Names and buffers are checked before any path is made; a valid name gets a
+// private directory, a symbolic link planted as the leaf is refused.
+TEST_F(Preference, PrivateDirectoryOnlyForValidNames)
 {
     char buf[4096];
     const std::string longName(256, 'a');
@@ -36,23 +23,22 @@ TEST_F(Preference, HostileNamesCreateNothing)
         EXPECT_EQ(-1, VELAGroupPreferenceDirGet(name, buf, sizeof(buf))) << name;
     }
     EXPECT_EQ(-1, VELAUserPreferenceDirGet(nullptr, buf, sizeof(buf)));
-    EXPECT_FALSE(Exists("/var"));  // validation ran before any path was made
+    const std::string bob = In("/var/lib/vela/preference/user/bob");
+    EXPECT_EQ(-1, VELAUserPreferenceDirGet("bob", buf, bob.size()));  // no room for the NUL
+    EXPECT_EQ(-1, VELAUserPreferenceDirGet("bob", nullptr, 0));
+    EXPECT_FALSE(Exists("/var"));
 
+    ASSERT_EQ(0, VELAUserPreferenceDirGet("bob", buf, bob.size() + 1));
+    EXPECT_EQ(bob, buf);
+    struct stat st;
+    ASSERT_EQ(0, lstat(bob.c_str(), &st));
+    EXPECT_EQ(static_cast<mode_t>(S_IFDIR | 0700), st.st_mode & (S_IFMT | 07777));
+    ASSERT_EQ(0, VELAUserPreferenceDirGet("bob", buf, sizeof(buf)));  // existing is fine
+    ASSERT_EQ(0, VELAGroupPreferenceDirGet("staff team", buf, sizeof(buf)));
+    EXPECT_EQ(In("/var/lib/vela/preference/group/staff team"), buf);
     ASSERT_EQ(0, VELAUserPreferenceDirGet(std::string(255, 'a').c_str(), buf, sizeof(buf)));
     ASSERT_EQ(0, VELAUserPreferenceDirGet("..a", buf, sizeof(buf)));
-}
 
-TEST_F(Preference, SmallBufferAndSymlinkLeaf)
-{
-    const std::string want = In("/var/lib/vela/preference/user/bob");
-    char buf[512];
-    EXPECT_EQ(-1, VELAUserPreferenceDirGet("bob", buf, want.size()));  // no room for the NUL
-    EXPECT_FALSE(Exists("/var"));
-    EXPECT_EQ(-1, VELAUserPreferenceDirGet("bob", nullptr, 0));
-    ASSERT_EQ(0, VELAUserPreferenceDirGet("bob", buf, want.size() + 1));
-    EXPECT_EQ(want, buf);
-
-    // A symbolic link planted as the leaf is refused, not followed.
     ASSERT_EQ(0, mkdir(In("/elsewhere").c_str(), 0755));
     ASSERT_EQ(0, symlink(In("/elsewhere").c_str(), In("/var/lib/vela/preference/user/eve").c_str()));
     EXPECT_EQ(-1, VELAUserPreferenceDirGet("eve", buf, sizeof(buf)));

@@ -89,10 +89,8 @@ TEST(Proc, PlainForkFlushesBuffersAndIsReapedByTheCaller)
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 7);
     fclose(f);
     EXPECT_EQ("once", VELA::Test::ReadText(path));
-}
 
-TEST(Proc, UnknownFlagsCreateNoProcess)
-{
+    // Unknown flags create no process.
     errno = 0;
     EXPECT_EQ(-1, VLIBCProcForkEx(0x100));
     EXPECT_EQ(EINVAL, errno);
