@@ -109,7 +109,7 @@ TEST(WebAPIUtil, WriteJsonFileAtomic)
     }
 }
 
-TEST(WebAPIUtil, QueryStringPairs)
+TEST(WebAPIUtil, QueryStringPairsAndCookiePieces)
 {
     Json::Value out;
     ASSERT_TRUE(strPairToJsonObj("a=1&b=x%20y+z&flag&=skip&&c=%zz&d=k=v", out, true, true));
@@ -125,10 +125,8 @@ TEST(WebAPIUtil, QueryStringPairs)
     Json::Value empty;
     ASSERT_TRUE(strPairToJsonObj("", empty, true, true));
     EXPECT_TRUE(empty.isObject());
-}
 
-TEST(WebAPIUtil, ParseToArraySplitsCookieHeaders)
-{
+    // Cookie headers split into their pieces.
     EXPECT_EQ(J(R"(["id=abc", "lang=en%20US", "broken", "", "k=a=b", ""])"),
               ParseToArray("id=abc; lang=en%20US;broken;\t;k=a=b;", ";"));
     EXPECT_EQ(J(R"([" a", "b"])"), ParseToArray(" a, b", ", "));  // multi-byte separator; leading blank kept
