@@ -29,7 +29,8 @@ inline std::string InChild(const std::function<std::string()>& body)
         out << body();
         return out ? 0 : 1;
     });
-    return ReadText(report) + (codes == std::vector<int>{0} ? "" : " [child died, status " + std::to_string(codes[0]) + "]");
+    const bool died = codes != std::vector<int>{0};
+    return ReadText(report) + (died ? " [child died, status " + std::to_string(codes[0]) + "]" : "");
 }
 
 // An unprivileged system user vela-t-<pid> with its own primary group and

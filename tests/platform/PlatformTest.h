@@ -197,7 +197,8 @@ struct Ran { int status = -1; std::string out, err; };
 
 // Runs argv[0] from PATH (or /proc/self/exe) with `env` added; its output
 // goes through files, so nothing can block on a full pipe.
-inline Ran RunTool(const std::vector<std::string>& argv, const std::vector<std::pair<std::string, std::string>>& env = {})
+inline Ran RunTool(const std::vector<std::string>& argv,
+                   const std::vector<std::pair<std::string, std::string>>& env = {})
 {
     TempDir io;
     const std::string out = io.Path() + "/out", err = io.Path() + "/err";

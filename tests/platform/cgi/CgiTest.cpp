@@ -102,7 +102,8 @@ TEST_F(RemoteIP, ConfiguredProxyTakesRightmostUntrusted)
 TEST_F(RemoteIP, OnlyConfiguredAddressesAreProxies)
 {
     Conf("webapi.conf", "# proxies\nother=\"x\"\ntrusted_proxies=\"192.0.2.10 2001:db8::10 bogus\"\n");
-    Expect({{"192.0.2.10", "203.0.113.9", "203.0.113.9"}, {"2001:db8:0:0::10", "203.0.113.9, 192.0.2.10", "203.0.113.9"},
+    Expect({{"192.0.2.10", "203.0.113.9", "203.0.113.9"},
+            {"2001:db8:0:0::10", "203.0.113.9, 192.0.2.10", "203.0.113.9"},
             {"127.0.0.1", "203.0.113.9", "127.0.0.1"}});
     EXPECT_EQ(1, VelaCgiIsTrustedProxy("::ffff:192.0.2.10"));
     for (const char* peer : {"192.0.2.11", "bogus", "", "192.0.2.10 ", static_cast<const char*>(nullptr)}) {

@@ -56,7 +56,8 @@ protected:
             int wait = -1;
             const int got = s.what == 'T' ? VELA::Session::LoginGuardBegin(&settings_, s.account, s.ip, &wait)
                                           : Fail(s.account, s.ip, s.what == 'S');
-            const std::string what = "step " + std::to_string(i) + ": " + s.what + " " + (s.account ? s.account : "null");
+            const std::string what =
+                "step " + std::to_string(i) + ": " + s.what + " " + (s.account ? s.account : "null");
             EXPECT_EQ(s.verdict, got) << what << " from " << s.ip;
             EXPECT_TRUE(s.wait < 0 || s.wait == wait) << what << ": waits " << wait << ", not " << s.wait;
         }
@@ -260,7 +261,8 @@ TEST_F(LoginSettings, ReadFromWebapiConf)
 {
     VELA::Session::LoginSettings s;
     const auto fields = [&s] {
-        return std::vector<int>{s.maxFailures, s.windowMinutes, s.blockMinutes, s.maxRecords, s.idleTimeout, s.lifetime};
+        return std::vector<int>{s.maxFailures, s.windowMinutes, s.blockMinutes,
+                                s.maxRecords,  s.idleTimeout,   s.lifetime};
     };
     VELA::Session::LoginSettingsLoad(&s);  // no file: the defaults
     EXPECT_EQ((std::vector<int>{5, 10, 15, 10000, 0, 0}), fields());

@@ -18,9 +18,9 @@ using VELA::System::ParseDecimal;
 TEST(Strings, ParseDecimal)
 {
     long long out = 42;
-    for (const std::string& bad : std::initializer_list<std::string>{"", "-", "+1", " 1", "1 ", "1e0", "1.0", "0x1",
-                                                                     std::string("1\0", 2), "1a", "--1",
-                                                                     "9223372036854775808", "99999999999999999999999"}) {
+    const std::string bads[] = {"",   "-",  "+1",  "0x1", " 1", "1 ", "1e0", "1.0", std::string("1\0", 2),
+                                "1a", "--1", "9223372036854775808", "99999999999999999999999"};
+    for (const std::string& bad : bads) {
         EXPECT_FALSE(ParseDecimal(bad, LLONG_MIN, LLONG_MAX, out)) << bad;
         EXPECT_EQ(42, out);
     }

@@ -34,7 +34,8 @@ TEST(FileUtil, OpenNoSymlinksRefusesEveryLinkOnThePath)
         for (NoSymlinkResolve how : {NoSymlinkResolve::kAuto, NoSymlinkResolve::kWalk}) {
             errno = 0;
             const int fd = VELA::System::OpenNoSymlinks(path, O_RDONLY, how);
-            EXPECT_EQ(want, fd < 0 ? errno : 0) << path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
+            EXPECT_EQ(want, fd < 0 ? errno : 0)
+                << path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
             if (fd >= 0) {
                 char byte = 0;
                 EXPECT_EQ(1, read(fd, &byte, 1));

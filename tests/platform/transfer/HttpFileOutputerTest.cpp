@@ -218,7 +218,8 @@ TEST_F(HttpOutput, SingleRanges)
         const std::string part = data.substr(c.first, c.last - c.first + 1);
         const std::string sent = "bytes " + std::to_string(c.first) + "-" + std::to_string(c.last) + "/1000";
         ExpectHeaders(r, {{"Status", c.status == 206 ? "206 Partial Content" : ""},
-                          {"Content-Range", c.status == 206 ? sent : ""}, {"Content-Length", std::to_string(part.size())}},
+                          {"Content-Range", c.status == 206 ? sent : ""},
+                          {"Content-Length", std::to_string(part.size())}},
                       c.range);
         EXPECT_TRUE(r.body == part) << c.range;
     }
@@ -275,7 +276,8 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     for (const auto& call : byServer) {
         const Reply r = ToFile(call);
         EXPECT_TRUE(r.ok && r.complete);
-        ExpectHeaders(r, {{"X-Sendfile", expected}, {"Content-Type", "text/plain"}, {"X-Content-Type-Options", "nosniff"},
+        ExpectHeaders(r, {{"X-Sendfile", expected}, {"Content-Type", "text/plain"},
+                          {"X-Content-Type-Options", "nosniff"},
                           {"Content-Disposition", "attachment; filename=\"a b_c.txt\"; filename*=UTF-8''a%20b%25c.txt"},
                           {"Content-Length", ""}});
         EXPECT_EQ("", r.body);
