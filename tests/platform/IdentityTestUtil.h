@@ -3,81 +3,34 @@
 // its own identity whatever the code under test does.
 #pragma once
 
-#include <fcntl.h>
 #include <functional>
 #include <grp.h>
 #include <pwd.h>
 #include <string>
-#include <sys/wait.h>
-#include <unistd.h>
 #include <vector>
+
+#include "platform/PlatformTest.h"
 
 namespace VELA {
 namespace Test {
 
 // Runs a program (no shell), its output discarded. True when it exits 0.
-inline bool RunProgram(const std::vector<std::string>& args)
-{
-    std::vector<char*> argv;
-    for (const std::string& a : args) {
-        argv.push_back(const_cast<char*>(a.c_str()));
-    }
-    argv.push_back(nullptr);
-    const pid_t pid = fork();
-    if (pid < 0) {
-        return false;
-    }
-    if (pid == 0) {
-        const int devnull = open("/dev/null", O_WRONLY);
-        if (devnull >= 0) {
-            dup2(devnull, 1);
-            dup2(devnull, 2);
-        }
-        execv(argv[0], argv.data());
-        _exit(127);
-    }
-    int status = 0;
-    while (waitpid(pid, &status, 0) < 0) {
-        if (errno != EINTR) {
-            return false;
-        }
-    }
-    return WIFEXITED(status) && WEXITSTATUS(status) == 0;
-}
+inline bool RunProgram(const std::vector<std::string>& args) { return Exited0(RunTool(args)); }
 
 // Runs `body` in a forked child and returns what it returned ("" means every
-// check passed), or a description of how the child died.
+// check passed), or a description of how the child died. The report file is
+// opened before `body` runs, so the child may give up its identity.
 inline std::string InChild(const std::function<std::string()>& body)
 {
-    int fds[2];
-    if (pipe(fds) != 0) {
-        return "pipe failed";
-    }
-    const pid_t pid = fork();
-    if (pid < 0) {
-        return "fork failed";
-    }
-    if (pid == 0) {
-        close(fds[0]);
-        const std::string out = body();
-        (void)!write(fds[1], out.data(), out.size());  // short reports: one write
-        _exit(0);
-    }
-    close(fds[1]);
-    std::string out;
-    char buf[4096];
-    ssize_t n;
-    while ((n = read(fds[0], buf, sizeof(buf))) > 0 || (n < 0 && errno == EINTR)) {
-        out.append(buf, n > 0 ? static_cast<size_t>(n) : 0);
-    }
-    close(fds[0]);
-    int status = 0;
-    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
-    }
-    if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-        out += " [child died, status " + std::to_string(status) + "]";
-    }
-    return out;
+    TempDir io;
+    const std::string report = io.Path() + "/report";
+    const std::vector<int> codes = InChildren(1, [&](int) {
+        std::ofstream out(report, std::ios::binary);
+        out << body();
+        return out ? 0 : 1;
+    });
+    const bool died = codes != std::vector<int>{0};
+    return ReadText(report) + (died ? " [child died, status " + std::to_string(codes[0]) + "]" : "");
 }
 
 // An unprivileged system user vela-t-<pid> with its own primary group and
@@ -118,3 +71,23 @@ struct TestAccount {
 
 }  // namespace Test
 }  // namespace VELA
+
+// A fresh root and a test account (TestAccount); skipped without root.
+class AccountTest : public RootTest {
+protected:
+    void SetUp() override
+    {
+        if (geteuid() != 0) {
+            GTEST_SKIP() << "test accounts need root";
+        }
+        ASSERT_TRUE(account_.Create()) << "useradd/groupadd failed";
+    }
+    void TearDown() override
+    {
+        if (geteuid() == 0) {
+            account_.Remove();
+        }
+    }
+
+    VELA::Test::TestAccount account_;
+};

@@ -1,10 +1,12 @@
 // Helpers shared by the platform tests (their fixtures: StateRootTest.h):
-// files with their modes, directory listings, children forked to run a piece
-// of the test, and the CGI handle.
+// files with their modes, directory listings, JSON files edited in place,
+// children forked to run a piece of the test, programs run with their output
+// kept, and the CGI handle.
 #pragma once
 
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
 #include <fstream>
 #include <functional>
 #include <json/json.h>
@@ -20,6 +22,7 @@
 #include "platform/StateRootTest.h"
 #include "support/TestSupport.h"
 #include "vela/cgi.h"
+#include "vela/webapiutil.h"
 
 namespace VELA {
 namespace Test {
@@ -65,11 +68,15 @@ inline std::map<std::string, std::string> Tree(const std::string& dir)
     return out;
 }
 
-// `doc` as JSON text once for each change of `changes`: the key set to the
-// value, or removed when the value is null.
+// `doc` as JSON text once for each change of `changes` (the key set to the
+// value, or removed when the value is null) and once without each of `removed`.
 inline std::vector<std::string> JsonVariants(const Json::Value& doc,
-                                             const std::vector<std::pair<std::string, Json::Value>>& changes)
+                                             std::vector<std::pair<std::string, Json::Value>> changes,
+                                             const std::vector<std::string>& removed = {})
 {
+    for (const std::string& key : removed) {
+        changes.push_back({key, Json::Value()});
+    }
     std::vector<std::string> out;
     for (const auto& change : changes) {
         Json::Value changed = doc;
@@ -81,6 +88,23 @@ inline std::vector<std::string> JsonVariants(const Json::Value& doc,
         out.push_back(Json::writeString(Json::StreamWriterBuilder(), changed));
     }
     return out;
+}
+
+// Expects each member of `want` in `doc`, of the same type and value.
+inline void ExpectMembers(const Json::Value& doc, std::initializer_list<std::pair<const char*, Json::Value>> want)
+{
+    for (const auto& member : want) {
+        EXPECT_EQ(member.second, doc[member.first]) << member.first;
+    }
+}
+
+// Sets `key` of the JSON file at `path` to `value`, the way the code writes it.
+inline void EditJson(const std::string& path, const std::string& key, const Json::Value& value)
+{
+    Json::Value doc;
+    ASSERT_TRUE(WebAPIUtil::ReadJsonFile(path, doc)) << path;
+    doc[key] = value;
+    ASSERT_TRUE(WebAPIUtil::WriteJsonFileAtomic(path, doc, 0600)) << path;
 }
 
 // In the existing directory `files`: target.txt ("secret"), dir/in.txt
@@ -134,6 +158,78 @@ private:
 };
 
 inline std::vector<int> InChildren(int n, const std::function<int(int)>& body) { return Children(n, body).Wait(); }
+
+// A pipe that makes one process wait for another: Wait() gives the byte the
+// other side posted, 0 once no writer is left.
+class Gate {
+public:
+    Gate() { EXPECT_EQ(0, pipe(fds_)); }
+    ~Gate()
+    {
+        close(fds_[0]);
+        close(fds_[1]);
+    }
+    void Post(char c = 'y') const { (void)!write(fds_[1], &c, 1); }
+    char Wait() const
+    {
+        char c = 0;
+        return read(fds_[0], &c, 1) == 1 ? c : 0;
+    }
+
+private:
+    int fds_[2];
+};
+
+// Polls `done` every `micros`, at most `tries` times (a bound on the wait,
+// not a timing assertion). True once it holds.
+inline bool WaitUntil(const std::function<bool()>& done, int tries = 500, useconds_t micros = 10000)
+{
+    for (int i = 0; i < tries; ++i) {
+        if (done()) {
+            return true;
+        }
+        usleep(micros);
+    }
+    return done();
+}
+
+struct Ran { int status = -1; std::string out, err; };
+
+// Runs argv[0] from PATH (or /proc/self/exe) with `env` added; its output
+// goes through files, so nothing can block on a full pipe.
+inline Ran RunTool(const std::vector<std::string>& argv,
+                   const std::vector<std::pair<std::string, std::string>>& env = {})
+{
+    TempDir io;
+    const std::string out = io.Path() + "/out", err = io.Path() + "/err";
+    pid_t pid = fork();
+    if (pid == 0) {
+        int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+        int e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+        int in = open("/dev/null", O_RDONLY);
+        if (o < 0 || e < 0 || in < 0 || dup2(o, 1) < 0 || dup2(e, 2) < 0 || dup2(in, 0) < 0) {
+            _exit(126);
+        }
+        for (const auto& kv : env) {
+            setenv(kv.first.c_str(), kv.second.c_str(), 1);
+        }
+        std::vector<char*> args;
+        for (const auto& a : argv) {
+            args.push_back(const_cast<char*>(a.c_str()));
+        }
+        args.push_back(nullptr);
+        execvp(args[0], args.data());
+        _exit(127);
+    }
+    Ran ran;
+    if (pid > 0 && waitpid(pid, &ran.status, 0) == pid) {
+        ran.out = ReadText(out);
+        ran.err = ReadText(err);
+    }
+    return ran;
+}
+
+inline bool Exited0(const Ran& ran) { return WIFEXITED(ran.status) && WEXITSTATUS(ran.status) == 0; }
 
 struct CgiHandle {
     CgiHandle() { EXPECT_EQ(0, VelaCgiInit("test", &ctx)); }

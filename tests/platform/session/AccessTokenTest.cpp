@@ -18,8 +18,7 @@ protected:
     std::string Create(const std::vector<std::string>& apis, const std::vector<std::string>& methods,
                        long long lifetime = 0, const char* user = "root", std::string* id = nullptr)
     {
-        std::string token;
-        std::string tid;
+        std::string token, tid;
         EXPECT_EQ(0, VelaAccessTokenCreate(user, apis, methods, lifetime, token, tid));
         EXPECT_EQ(static_cast<size_t>(VELA_TOKEN_LEN), token.size());
         EXPECT_EQ(tid, token.substr(0, VELA_TOKEN_ID_LEN));
@@ -36,14 +35,6 @@ protected:
         return VelaAccessTokenGrant(token.c_str(), api, method, user_, sizeof(user_));
     }
 
-    void Edit(const std::string& id, const char* key, const Json::Value& value)
-    {
-        Json::Value doc;
-        ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(File(id), doc));
-        doc[key] = value;
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(File(id), doc, 0600));
-    }
-
     LogCapture log_;
     char user_[493];
 };
@@ -58,9 +49,8 @@ TEST_F(AccessTokenTest, CreateWritesPrivateFile)
 
     Json::Value doc;
     ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(File(id), doc));
-    EXPECT_EQ("root", doc["user"].asString());
-    EXPECT_EQ(token.substr(VELA_TOKEN_ID_LEN + 1), doc["secret"].asString());
-    EXPECT_EQ(kStart + 3600, doc["expires"].asInt64());
+    ExpectMembers(doc, {{"user", "root"}, {"secret", token.substr(VELA_TOKEN_ID_LEN + 1)},
+                        {"expires", Json::Int64(kStart + 3600)}});
     EXPECT_EQ(2u, doc["methods"].size());
 
     std::string other;
@@ -73,15 +63,10 @@ TEST_F(AccessTokenTest, CreateWritesPrivateFile)
 TEST_F(AccessTokenTest, PatternsSelectApiAndMethod)
 {
     const std::string token = Create({"VELA.Demo.*", "VELA.Exact"}, {"get*", "list"});
-    const struct {
-        const char* api;
-        const char* method;
-        int rc;
-    } cases[] = {
+    const struct { const char* api; const char* method; int rc; } cases[] = {
         {"VELA.Demo.Test", "get", 0}, {"VELA.Demo.Test", "getInfo", 0}, {"VELA.Exact", "list", 0},
         {"VELA.Demo", "get", -3},  // the prefix includes the "."
-        {"VELA.Exact2", "get", -3}, {"VELA.Other.Test", "get", -3},
-        {"vela.demo.test", "get", -3},  // case-sensitive
+        {"VELA.Exact2", "get", -3}, {"VELA.Other.Test", "get", -3}, {"vela.demo.test", "get", -3},  // case-sensitive
         {"VELA.Demo.Test", "set", -3}, {"VELA.Demo.Test", "Get", -3}, {"VELA.Demo.Test", "listAll", -3},
         {"", "get", -3}, {"VELA.Demo.../x", "get", -3}, {"VELA.Demo.Test", nullptr, -3},
     };
@@ -117,41 +102,47 @@ TEST_F(AccessTokenTest, Expiry)
     EXPECT_EQ(-1, Grant(token, "VELA.Demo", "get"));
 }
 
-TEST_F(AccessTokenTest, UserMustStillExist)
+TEST_F(AccessTokenTest, UserMustStillExistAndFitTheBuffer)
 {
     std::string id;
     const std::string token = Create({"*"}, {"*"}, 0, "nobody", &id);
     EXPECT_EQ(0, Grant(token, "VELA.Demo", "get"));
     EXPECT_STREQ("nobody", user_);
-    Edit(id, "user", "vela-no-such-user");  // the user was deleted
+    EditJson(File(id), "user", "vela-no-such-user");  // the user was deleted
     EXPECT_EQ(-4, Grant(token, "VELA.Demo", "get"));
     EXPECT_STREQ("", user_);
 
-    std::string tok = "stale";
-    std::string tid = "stale";
+    std::string tok = "stale", tid = "stale";
     EXPECT_EQ(-1, VelaAccessTokenCreate("vela-no-such-user", {"*"}, {"*"}, 0, tok, tid));
-    EXPECT_TRUE(tok.empty());
-    EXPECT_TRUE(tid.empty());
+    EXPECT_TRUE(tok.empty() && tid.empty());
     EXPECT_TRUE(log_.Contains("no user \"vela-no-such-user\""));
+
+    // The user name must fit the caller's buffer.
+    const std::string all = Create({"*"}, {"*"});
+    char small[4] = "xx";
+    EXPECT_EQ(-5, VelaAccessTokenGrant(all.c_str(), "VELA.Demo", "get", small, sizeof(small)));
+    EXPECT_STREQ("", small);
+    EXPECT_EQ(-5, VelaAccessTokenGrant(all.c_str(), "VELA.Demo", "get", nullptr, 493));
+    char exact[5];
+    EXPECT_EQ(0, VelaAccessTokenGrant(all.c_str(), "VELA.Demo", "get", exact, sizeof(exact)));
+    EXPECT_STREQ("root", exact);
 }
 
 TEST_F(AccessTokenTest, CreateRefusesBadInput)
 {
-    std::string token;
-    std::string id;
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {}, {"get"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"VELA.Demo"}, {}, 0, token, id));
+    std::string token, id;
     for (const char* bad : {"", "a*b", "*x", "**", "a b", "../x", "VELA/Demo", "a\n"}) {
         EXPECT_EQ(-1, VelaAccessTokenCreate("root", {bad}, {"get"}, 0, token, id)) << bad;
         EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"VELA.Demo"}, {bad}, 0, token, id)) << bad;
         EXPECT_FALSE(VelaAccessTokenIsPattern(bad)) << bad;
     }
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {std::string(129, 'a')}, {"get"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", std::vector<std::string>(33, "a"), {"get"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"*"}, {"*"}, -1, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("root", {"*"}, {"*"}, VELA_TOKEN_LIFETIME_MAX + 1, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate(nullptr, {"*"}, {"*"}, 0, token, id));
-    EXPECT_EQ(-1, VelaAccessTokenCreate("a/b", {"*"}, {"*"}, 0, token, id));
+    const struct { const char* user; std::vector<std::string> apis, methods; long long lifetime; } bad[] = {
+        {"root", {}, {"get"}, 0}, {"root", {"VELA.Demo"}, {}, 0}, {"root", {std::string(129, 'a')}, {"get"}, 0},
+        {"root", std::vector<std::string>(33, "a"), {"get"}, 0}, {"root", {"*"}, {"*"}, -1},
+        {"root", {"*"}, {"*"}, VELA_TOKEN_LIFETIME_MAX + 1}, {nullptr, {"*"}, {"*"}, 0}, {"a/b", {"*"}, {"*"}, 0}};
+    for (size_t i = 0; i < sizeof(bad) / sizeof(bad[0]); ++i) {
+        EXPECT_EQ(-1, VelaAccessTokenCreate(bad[i].user, bad[i].apis, bad[i].methods, bad[i].lifetime, token, id)) << i;
+    }
     EXPECT_TRUE(token.empty());
     EXPECT_TRUE(DirEntries(Dir()).empty());
 }
@@ -203,10 +194,8 @@ TEST_F(AccessTokenTest, CorruptFilesGrantNothing)
         {"id", "BBBBBBBBBBBBBBBBBBBBBB"}, {"apis", Json::Value(Json::arrayValue)}, {"apis", "*"},
         {"methods", Json::Value(Json::arrayValue)}, {"expires", "never"}, {"user", ""}, {"secret", "short"}};
     changes[3].second.append("a*b");
-    for (const char* key : {"version", "id", "secret", "user", "apis", "methods", "created", "expires"}) {
-        changes.push_back({key, Json::Value()});
-    }
-    for (const std::string& text : JsonVariants(doc, changes)) {
+    for (const std::string& text : JsonVariants(doc, changes, {"version", "id", "secret", "user", "apis", "methods",
+                                                               "created", "expires"})) {
         bad.push_back(text);
     }
     for (const std::string& text : bad) {
@@ -245,18 +234,6 @@ TEST_F(AccessTokenTest, ListAndRevoke)
     EXPECT_EQ(-1, Grant(b, "VELA.Demo.X", "list"));
     ASSERT_EQ(0, VelaAccessTokenList(list));
     EXPECT_TRUE(list.empty());
-}
-
-TEST_F(AccessTokenTest, UserBuffer)
-{
-    const std::string token = Create({"*"}, {"*"});
-    char small[4] = "xx";
-    EXPECT_EQ(-5, VelaAccessTokenGrant(token.c_str(), "VELA.Demo", "get", small, sizeof(small)));
-    EXPECT_STREQ("", small);
-    EXPECT_EQ(-5, VelaAccessTokenGrant(token.c_str(), "VELA.Demo", "get", nullptr, 493));
-    char exact[5];
-    EXPECT_EQ(0, VelaAccessTokenGrant(token.c_str(), "VELA.Demo", "get", exact, sizeof(exact)));
-    EXPECT_STREQ("root", exact);
 }
 
 }  // namespace

@@ -11,7 +11,6 @@
 #include <cstring>
 #include <dlfcn.h>
 #include <openssl/evp.h>  // types only: this program does not link libcrypto
-#include <sstream>
 
 #include "platform/session/CryptoTestUtil.h"
 #include "support/JsonLiteral.h"
@@ -50,12 +49,12 @@ bool LibcryptoMapped()
     _exit(0);
 }();
 
-int LinesWith(const std::string& text, const std::string& needle)
+// How often `needle` occurs in `text`.
+int Count(const std::string& text, const std::string& needle)
 {
     int n = 0;
-    std::istringstream in(text);
-    for (std::string line; std::getline(in, line);) {
-        n += line.find(needle) != std::string::npos ? 1 : 0;
+    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) {
+        ++n;
     }
     return n;
 }
@@ -173,7 +172,7 @@ TEST_F(Crypto, CipherTextRoundTrip)
     EXPECT_FALSE(r.HasParam("__cIpHeRtExT"));
 }
 
-TEST_F(Crypto, AesPairRoundTrip)
+TEST_F(Crypto, AesPairRoundTripAndKnownAnswer)
 {
     const std::string token = Encrypt(kKey);
     char key[33];
@@ -196,14 +195,10 @@ TEST_F(Crypto, AesPairRoundTrip)
     ASSERT_TRUE(nested.isObject());
     EXPECT_EQ("nested", nested.get("name", "").asString());
     EXPECT_FALSE(r.HasParam("__nEkOtReHpIc") || r.HasParam("__tXeTrEhPiC"));
-}
 
-TEST_F(Crypto, AesKnownAnswer)
-{
-    // Computed with another AES-GCM implementation.
-    const char cipher[] = "AAECAwQFBgcICQoLw3cszO/A4P0GcNSixIOSZSkm9vTuK2MCEiNvrTCEwAKptWZaltQj96E2xSN8+3etfbFQUowtz0M=";
-    std::string out;
-    ASSERT_TRUE(VELA::CredRequestUtil::GetDecryptAESString("Vela-test-key-0123456789abcdefgh", cipher, out));
+    // A known answer, computed with another AES-GCM implementation.
+    const char known[] = "AAECAwQFBgcICQoLw3cszO/A4P0GcNSixIOSZSkm9vTuK2MCEiNvrTCEwAKptWZaltQj96E2xSN8+3etfbFQUowtz0M=";
+    ASSERT_TRUE(VELA::CredRequestUtil::GetDecryptAESString("Vela-test-key-0123456789abcdefgh", known, out));
     EXPECT_EQ("api=VELA.Test&method=set&name=K%C3%A4the", out);
 }
 
@@ -222,8 +217,7 @@ TEST_F(Crypto, DamagedAesInputFailsCleanly)
         "@@@@" + good.substr(4),
         good.substr(0, 40) + "\n" + good.substr(40),
         good.substr(0, good.size() - 1),  // padding cut off
-        NonCanonical(good),
-        std::string(1024 * 1024 + 4, 'A'),
+        NonCanonical(good), std::string(1024 * 1024 + 4, 'A'),
     };
     for (const std::string& cipher : bad) {
         std::string out = "stale";
@@ -253,13 +247,10 @@ TEST_F(Crypto, DamagedCipherTextFailsCleanly)
     const std::string bad[] = {
         good.substr(0, 100) + (good[100] == 'A' ? "B" : "A") + good.substr(101),  // flipped bits
         good.substr(0, good.size() - 4),                                          // truncated
-        "",
-        "not base64!",
-        std::string(4100, 'A'),
+        "", "not base64!", std::string(4100, 'A'),
         Encrypt("name=x", {"-pkeyopt", "rsa_padding_mode:oaep"}),  // OAEP with SHA-1
         Encrypt("name=x", {}),                                     // PKCS #1 v1.5
-        Encrypt("name=x", kOaepSha256, other.Path() + "/other.pub"),
-        Encrypt(std::string("name=x\0y", 8)),
+        Encrypt("name=x", kOaepSha256, other.Path() + "/other.pub"), Encrypt(std::string("name=x\0y", 8)),
     };
     for (const std::string& cipher : bad) {
         std::string text = cipher;
@@ -291,7 +282,7 @@ TEST_F(Crypto, TokenKeyRules)
 
 // Only a request that decrypts loads libcrypto; junk in the encrypted members
 // is refused before anything is loaded.
-TEST_F(Crypto, OnlyDecryptingRequestsLoadLibcrypto)
+TEST_F(Crypto, OnlyDecryptingRequestsLoadLibcryptoAndFailClosedWithoutIt)
 {
     const std::pair<std::string, std::string> cases[] = {
         {R"({"api": "VELA.Test", "name": "plain value"})", "name=plain value\nlibcrypto=0\n"},
@@ -304,17 +295,15 @@ TEST_F(Crypto, OnlyDecryptingRequestsLoadLibcrypto)
         EXPECT_TRUE(Exited0(ran)) << ran.err;
         EXPECT_EQ(c.second, ran.out) << ran.err;
     }
-}
 
-TEST_F(Crypto, MissingLibraryFailsClosed)
-{
+    // Without a usable libcrypto the decryption fails closed.
     const std::string getParam = R"({"__cIpHeRtExT": ")" + Encrypt("name=secret") + R"("})";
     TempDir libs;
     WriteFile(libs.Path() + "/libcrypto.so.3", "not a library");
     // Two calls need the library; the reason is logged once.
     Ran ran = Probe(getParam, {{"LD_LIBRARY_PATH", libs.Path()}, {"VELA_CRYPTO_PROBE_PUBKEY", "1"}});
     EXPECT_EQ("name=\npubkey=-1\nlibcrypto=0\n", ran.out) << ran.err;
-    EXPECT_EQ(1, LinesWith(ran.err, "encrypted parameters unavailable: cannot load libcrypto.so.3")) << ran.err;
+    EXPECT_EQ(1, Count(ran.err, "encrypted parameters unavailable: cannot load libcrypto.so.3")) << ran.err;
 
     // A library without the functions: any other library will do.
     const std::string maps = ReadText("/proc/self/maps");
@@ -325,7 +314,27 @@ TEST_F(Crypto, MissingLibraryFailsClosed)
     WriteFile(libs.Path() + "/libcrypto.so.3", ReadText(jsoncpp), 0755);
     ran = Probe(getParam, {{"LD_LIBRARY_PATH", libs.Path()}, {"VELA_CRYPTO_PROBE_PUBKEY", "1"}});
     EXPECT_EQ(0, ran.out.find("name=\npubkey=-1\n")) << ran.out << ran.err;
-    EXPECT_EQ(1, LinesWith(ran.err, "encrypted parameters unavailable: libcrypto.so.3 lacks OPENSSL_cleanse")) << ran.err;
+    EXPECT_EQ(1, Count(ran.err, "encrypted parameters unavailable: libcrypto.so.3 lacks OPENSSL_cleanse")) << ran.err;
+}
+
+// A parameter line encrypted as a whole is decrypted, then checked as a
+// plain one is (ParamLineTest.cpp).
+TEST_F(Crypto, WholeParamLineDecryptedAndChecked)
+{
+    const std::string plain = "api=VELA.Sample&name=a%20b";
+    const std::string b64 = Encrypt(plain);
+    for (const std::string& value : {b64, VELA::WebAPIUtil::URLEncode(b64)}) {
+        std::string line = "__cIpHeRtExT=" + value;
+        EXPECT_TRUE(VelaCgiDetectAndDecryptParamLine(line));
+        EXPECT_EQ(plain, line);
+    }
+
+    std::string broken = "__cIpHeRtExT=" + Encrypt("name=%zz");
+    const std::string before = broken;
+    LogCapture log;
+    EXPECT_FALSE(VelaCgiDetectAndDecryptParamLine(broken));
+    EXPECT_EQ(before, broken);
+    EXPECT_TRUE(log.Contains("decrypted parameter line refused"));
 }
 
 }  // namespace

@@ -1,57 +1,11 @@
-// Helpers of the encrypted-parameter tests: tools (the openssl command, this
-// program itself) run as child processes, keys and ciphertexts made by the
+// Helpers of the encrypted-parameter tests: keys and ciphertexts made by the
 // openssl command.
 #pragma once
-
-#include <fcntl.h>
 
 #include "platform/PlatformTest.h"
 
 namespace VELA {
 namespace Test {
-
-struct Ran {
-    int status = -1;
-    std::string out, err;
-};
-
-// Runs argv[0] from PATH (or /proc/self/exe) with `env` added; its output
-// goes through files, so nothing can block on a full pipe.
-inline Ran RunTool(const std::vector<std::string>& argv, const std::vector<std::pair<std::string, std::string>>& env = {})
-{
-    TempDir io;
-    const std::string out = io.Path() + "/out", err = io.Path() + "/err";
-    pid_t pid = fork();
-    if (pid == 0) {
-        int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int in = open("/dev/null", O_RDONLY);
-        if (o < 0 || e < 0 || in < 0 || dup2(o, 1) < 0 || dup2(e, 2) < 0 || dup2(in, 0) < 0) {
-            _exit(126);
-        }
-        for (const auto& kv : env) {
-            setenv(kv.first.c_str(), kv.second.c_str(), 1);
-        }
-        std::vector<char*> args;
-        for (const auto& a : argv) {
-            args.push_back(const_cast<char*>(a.c_str()));
-        }
-        args.push_back(nullptr);
-        execvp(args[0], args.data());
-        _exit(127);
-    }
-    Ran ran;
-    if (pid > 0 && waitpid(pid, &ran.status, 0) == pid) {
-        ran.out = ReadText(out);
-        ran.err = ReadText(err);
-    }
-    return ran;
-}
-
-inline bool Exited0(const Ran& ran)
-{
-    return WIFEXITED(ran.status) && WEXITSTATUS(ran.status) == 0;
-}
 
 inline std::string OpensslKey(const TempDir& dir, const std::string& name, int bits, const std::vector<std::string>& extra = {})
 {

@@ -22,14 +22,9 @@ constexpr int kBlocked = VELA_LOGIN_GUARD_BLOCKED;
 
 // One step of a script: 'F' a login whose password check fails, 'S' one that
 // succeeds, 'T' one only begun; `verdict` is what the guard's Begin answers,
-// `advance` the seconds the clock moves before the step.
-struct Step {
-    char what;
-    const char* account;
-    const char* ip;
-    int verdict;
-    long long advance = 0;
-};
+// `advance` the seconds the clock moves before the step, `wait` the seconds
+// Begin tells to wait (-1: not checked).
+struct Step { char what; const char* account; const char* ip; int verdict; long long advance = 0; int wait = -1; };
 
 class LoginGuard : public StateRootTest {
 protected:
@@ -41,26 +36,15 @@ protected:
         settings_.blockMinutes = 15;
     }
 
-    // Begin, then the password check fails. The result of Begin.
-    int Fail(const char* account, const char* ip)
+    // Begin, then the password check fails (or with `ok` succeeds). The
+    // result of Begin.
+    int Fail(const char* account, const char* ip, bool ok = false)
     {
         const int verdict = VELA::Session::LoginGuardBegin(&settings_, account, ip, nullptr);
-        if (verdict == VELA_LOGIN_GUARD_ALLOW) {
-            VELA::Session::LoginGuardFailed(&settings_, account, ip, "Authentication failure");
-        }
-        return verdict;
-    }
-    // Begin alone; `wait` receives the seconds to wait.
-    int Try(const char* account, const char* ip, int* wait = nullptr)
-    {
-        return VELA::Session::LoginGuardBegin(&settings_, account, ip, wait);
-    }
-    // Begin and Succeeded: a login with the right password.
-    int Succeed(const char* account, const char* ip)
-    {
-        const int verdict = VELA::Session::LoginGuardBegin(&settings_, account, ip, nullptr);
-        if (verdict == VELA_LOGIN_GUARD_ALLOW) {
+        if (verdict == VELA_LOGIN_GUARD_ALLOW && ok) {
             EXPECT_EQ(0, VELA::Session::LoginGuardSucceeded(&settings_, account, ip));
+        } else if (verdict == VELA_LOGIN_GUARD_ALLOW) {
+            VELA::Session::LoginGuardFailed(&settings_, account, ip, "Authentication failure");
         }
         return verdict;
     }
@@ -69,9 +53,13 @@ protected:
         for (size_t i = 0; i < steps.size(); ++i) {
             const Step& s = steps[i];
             Now() += s.advance;
-            const int got = s.what == 'F' ? Fail(s.account, s.ip) : s.what == 'S' ? Succeed(s.account, s.ip)
-                                                                                     : Try(s.account, s.ip);
-            EXPECT_EQ(s.verdict, got) << "step " << i << ": " << s.what << " " << s.account << " from " << s.ip;
+            int wait = -1;
+            const int got = s.what == 'T' ? VELA::Session::LoginGuardBegin(&settings_, s.account, s.ip, &wait)
+                                          : Fail(s.account, s.ip, s.what == 'S');
+            const std::string what =
+                "step " + std::to_string(i) + ": " + s.what + " " + (s.account ? s.account : "null");
+            EXPECT_EQ(s.verdict, got) << what << " from " << s.ip;
+            EXPECT_TRUE(s.wait < 0 || s.wait == wait) << what << ": waits " << wait << ", not " << s.wait;
         }
     }
     std::string GuardDir() const { return In("/run/vela/login-guard"); }
@@ -97,11 +85,8 @@ TEST_F(LoginGuard, OwnerIsNeverLockedOutByOtherAddresses)
         EXPECT_EQ(kAllow, Fail("daemon", "192.0.2.66")) << i;
         EXPECT_EQ(kAllow, Fail("DAEMON", ("198.51.100." + std::to_string(i)).c_str())) << i;
     }
-    int wait = 0;
-    EXPECT_EQ(kBlocked, Try("daemon", "192.0.2.66", &wait));
-    EXPECT_EQ(15 * 60, wait);
-    EXPECT_EQ(kAllow, Succeed("daemon", "203.0.113.5"));
-    EXPECT_EQ(kAllow, Try("daemon", "198.51.100.0"));  // one failure there only
+    Run({{'T', "daemon", "192.0.2.66", kBlocked, 0, 15 * 60}, {'S', "daemon", "203.0.113.5", kAllow},
+         {'T', "daemon", "198.51.100.0", kAllow}});  // one failure there only
     // Accounts ignore ASCII case; the count is logged once it reaches the limit.
     EXPECT_EQ(LOG_AUTHPRIV | LOG_NOTICE,
               log.PriorityOf({"failures for account \"daemon\" reached 3", "the last from 192.0.2.66"}));
@@ -120,29 +105,28 @@ TEST_F(LoginGuard, LimitPerAddressForAnyAccount)
          {'T', "b4", "2001:db8:1:3::1", kAllow}});
 }
 
-TEST_F(LoginGuard, FailuresLeaveTheWindow)
+// Failures leave the window; attempts in progress count against the limit.
+TEST_F(LoginGuard, FailuresLeaveTheWindowAttemptsInProgressCount)
 {
     // After the second step the first failure is older than 10 minutes.
     Run({{'F', "carol", "192.0.2.1", kAllow}, {'F', "carol", "192.0.2.1", kAllow, 6 * 60},
          {'F', "carol", "192.0.2.1", kAllow, 4 * 60 + 1}, {'F', "carol", "192.0.2.1", kAllow},
          {'T', "carol", "192.0.2.1", kBlocked}});
+
+    // Three checks started and not finished: a fourth gets no check, and
+    // waits until the oldest leaves the window.
+    Run({{'T', "frank", "192.0.2.2", kAllow}, {'T', "frank", "192.0.2.2", kAllow, 60},
+         {'T', "frank", "192.0.2.2", kAllow, 60}, {'T', "frank", "192.0.2.2", kBlocked, 60, 7 * 60}});
 }
 
 TEST_F(LoginGuard, BlockEndsAndStartsAfresh)
 {
     const Step fail = {'F', "dave", "192.0.2.1", kAllow};
-    Run({fail, fail, fail});
-    Now() += 15 * 60 - 1;
-    int wait = 0;
-    EXPECT_EQ(kBlocked, Try("dave", "192.0.2.1", &wait));
-    EXPECT_EQ(1, wait);
-    // The failures before the block are forgotten: a full series again.
-    Run({{'F', "dave", "192.0.2.1", kAllow, 1}, fail, fail, {'T', "dave", "192.0.2.1", kBlocked}});
-
-    // The clock went back a day: the block still ends at most 15 minutes on.
-    Now() -= 86400;
-    EXPECT_EQ(kBlocked, Try("dave", "192.0.2.1", &wait));
-    EXPECT_EQ(15 * 60, wait);
+    Run({fail, fail, fail, {'T', "dave", "192.0.2.1", kBlocked, 15 * 60 - 1, 1},
+         // The failures before the block are forgotten: a full series again.
+         {'F', "dave", "192.0.2.1", kAllow, 1}, fail, fail, {'T', "dave", "192.0.2.1", kBlocked},
+         // The clock went back a day: the block still ends at most 15 minutes on.
+         {'T', "dave", "192.0.2.1", kBlocked, -86400, 15 * 60}});
 }
 
 // A success clears the failures of its own (account, address) pair and no
@@ -160,18 +144,6 @@ TEST_F(LoginGuard, SuccessClearsItsOwnPairOnly)
          {'T', "daemon", "192.0.2.2", kBlocked}, elsewhere, elsewhere, {'T', "x", "192.0.2.3", kBlocked}});
 }
 
-TEST_F(LoginGuard, AttemptsInProgressCountAgainstTheLimit)
-{
-    // Three checks started and not finished: a fourth gets no check, and
-    // waits until the oldest leaves the window.
-    Run({{'T', "frank", "192.0.2.1", kAllow}, {'T', "frank", "192.0.2.1", kAllow, 60},
-         {'T', "frank", "192.0.2.1", kAllow, 60}});
-    Now() += 60;
-    int wait = 0;
-    EXPECT_EQ(kBlocked, Try("frank", "192.0.2.1", &wait));
-    EXPECT_EQ(7 * 60, wait);
-}
-
 TEST_F(LoginGuard, RecordsAreHashedPrivateFiles)
 {
     settings_.maxFailures = 10;
@@ -181,10 +153,9 @@ TEST_F(LoginGuard, RecordsAreHashedPrivateFiles)
           longName, std::string("daemon")}) {
         EXPECT_EQ(kAllow, Fail(account.c_str(), "")) << account;
     }
-    EXPECT_EQ(VELA_LOGIN_GUARD_ERROR, Try(std::string(VELA_LOGIN_ACCOUNT_MAX + 1, 'x').c_str(), "192.0.2.1"));
-    EXPECT_EQ(VELA_LOGIN_GUARD_ERROR, Try("", "192.0.2.1"));
-    EXPECT_EQ(VELA_LOGIN_GUARD_ERROR, Try(nullptr, "192.0.2.1"));
-    EXPECT_EQ(VELA_LOGIN_GUARD_ERROR, Try("x", "../etc"));
+    const std::string tooLong(VELA_LOGIN_ACCOUNT_MAX + 1, 'x');
+    Run({{'T', tooLong.c_str(), "192.0.2.1", VELA_LOGIN_GUARD_ERROR}, {'T', "", "192.0.2.1", VELA_LOGIN_GUARD_ERROR},
+         {'T', nullptr, "192.0.2.1", VELA_LOGIN_GUARD_ERROR}, {'T', "x", "../etc", VELA_LOGIN_GUARD_ERROR}});
 
     EXPECT_EQ(0700u, VELA::Test::Mode(GuardDir()));
     EXPECT_EQ(std::vector<std::string>({"run"}), DirEntries(root_.Path()));
@@ -226,9 +197,7 @@ TEST_F(LoginGuard, ExpiredRecordsArePurgedAndTheStoreIsBounded)
     ASSERT_EQ(kAllow, Fail("x", "198.51.100.2"));
     // Full: an untracked address with no account to count on is refused
     // until the earliest record expires (192.0.2.99, nine minutes on).
-    int wait = 0;
-    EXPECT_EQ(kBlocked, Try("x", "203.0.113.1", &wait));
-    EXPECT_EQ(9 * 60, wait);
+    Run({{'T', "x", "203.0.113.1", kBlocked, 0, 9 * 60}});
     // An existing account counts on its own record: three failures from
     // untracked addresses, then they are refused; a tracked address still
     // decides by its own count, and the blocked one stays blocked.
@@ -279,7 +248,7 @@ TEST_F(LoginGuard, ParallelProcessesCountExactly)
     const std::vector<int> started = VELA::Test::InChildren(kChildren, [this](int) {
         int n = 0;
         for (int i = 0; i < 3; ++i) {
-            n += Try("heidi", "192.0.2.9") == kAllow ? 1 : 0;
+            n += VELA::Session::LoginGuardBegin(&settings_, "heidi", "192.0.2.9", nullptr) == kAllow ? 1 : 0;
         }
         return n;
     });
@@ -291,23 +260,18 @@ class LoginSettings : public RootTest {};
 TEST_F(LoginSettings, ReadFromWebapiConf)
 {
     VELA::Session::LoginSettings s;
+    const auto fields = [&s] {
+        return std::vector<int>{s.maxFailures, s.windowMinutes, s.blockMinutes,
+                                s.maxRecords,  s.idleTimeout,   s.lifetime};
+    };
     VELA::Session::LoginSettingsLoad(&s);  // no file: the defaults
-    EXPECT_EQ(5, s.maxFailures);
-    EXPECT_EQ(10, s.windowMinutes);
-    EXPECT_EQ(15, s.blockMinutes);
-    EXPECT_EQ(10000, s.maxRecords);
-    EXPECT_EQ(0, s.idleTimeout);
+    EXPECT_EQ((std::vector<int>{5, 10, 15, 10000, 0, 0}), fields());
 
     Conf("webapi.conf", "login_max_failures=\"7\"\nlogin_window_minutes=\"0\"\nlogin_block_minutes=\"-3\"\n"
                         "login_guard_max_records=\"250\"\nsession_idle_timeout=\"600\"\nsession_lifetime=\"12h\"\n");
     VELA::Test::LogCapture log;
     VELA::Session::LoginSettingsLoad(&s);
-    EXPECT_EQ(7, s.maxFailures);
-    EXPECT_EQ(10, s.windowMinutes);
-    EXPECT_EQ(15, s.blockMinutes);
-    EXPECT_EQ(250, s.maxRecords);
-    EXPECT_EQ(600, s.idleTimeout);
-    EXPECT_EQ(0, s.lifetime);
+    EXPECT_EQ((std::vector<int>{7, 10, 15, 250, 600, 0}), fields());
     EXPECT_TRUE(log.Contains("login_window_minutes=\"0\" is not a number from 1 to 10080"));
     EXPECT_TRUE(log.Contains("session_lifetime=\"12h\""));
 }

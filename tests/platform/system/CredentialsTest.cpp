@@ -7,7 +7,6 @@
 #include <regex>
 
 #include "platform/IdentityTestUtil.h"
-#include "platform/PlatformTest.h"
 #include "vela/log.h"
 #include "vela/user.h"
 
@@ -32,86 +31,71 @@ std::string Ids()
     return Want(r, e, s, rg, eg, sg);
 }
 
-std::vector<gid_t> Groups()
+bool HasGroup(gid_t g)
 {
     std::vector<gid_t> groups(static_cast<size_t>(getgroups(0, nullptr)));
     groups.resize(static_cast<size_t>(getgroups(static_cast<int>(groups.size()), groups.data())));
-    return groups;
-}
-
-bool Has(const std::vector<gid_t>& groups, gid_t g)
-{
     return std::find(groups.begin(), groups.end(), g) != groups.end();
 }
 
-// Appends `what` to `errors` when `ok` is false.
-void Check(std::string& errors, bool ok, const std::string& what)
-{
-    if (!ok) {
-        errors += what + "; ";
+// The checks that failed in a child, "what; " each; a check gives back `ok`.
+struct Errors {
+    std::string text;
+    bool operator()(bool ok, const std::string& what)
+    {
+        text += ok ? "" : what + "; ";
+        return ok;
     }
-}
+};
 
-class Credentials : public RootTest {
+class Credentials : public AccountTest {
 protected:
-    void SetUp() override
+    // Runs `checks` in a forked child: "" when every check held.
+    static std::string InChildChecks(const std::function<void(Errors&)>& checks)
     {
-        if (geteuid() != 0) {
-            GTEST_SKIP() << "identity switches need root";
-        }
-        ASSERT_TRUE(account_.Create()) << "useradd/groupadd failed";
-    }
-    void TearDown() override
-    {
-        if (geteuid() == 0) {
-            account_.Remove();
-        }
+        return InChild([&] {
+            Errors check;
+            checks(check);
+            return check.text;
+        });
     }
 
-    VELA::Test::TestAccount account_;
+    const VELA::Test::TestAccount& a = account_;
 };
 
 TEST_F(Credentials, SwitchDropsRootForGood)
 {
-    const VELA::Test::TestAccount& a = account_;
-    EXPECT_EQ("", InChild([&] {
-        std::string errors;
-        if (!ResetCredentialsByName(a.user.c_str(), false)) {
-            return std::string("switch failed");
+    EXPECT_EQ("", InChildChecks([&](Errors& check) {
+        if (check(ResetCredentialsByName(a.user.c_str(), false), "switch failed")) {
+            check(Ids() == Want(a.uid, a.uid, a.uid, a.gid, a.gid, a.gid), "ids " + Ids());
+            check(HasGroup(a.suppGid), "supplementary group missing");
+            check(!HasGroup(0), "root group kept");
+            check(setresuid(0, 0, 0) != 0, "could return to root");
+            check(setgroups(0, nullptr) != 0, "could change groups");
         }
-        Check(errors, Ids() == Want(a.uid, a.uid, a.uid, a.gid, a.gid, a.gid), "ids " + Ids());
-        const std::vector<gid_t> groups = Groups();
-        Check(errors, Has(groups, a.suppGid), "supplementary group missing");
-        Check(errors, !Has(groups, 0), "root group kept");
-        Check(errors, setresuid(0, 0, 0) != 0, "could return to root");
-        Check(errors, setgroups(0, nullptr) != 0, "could change groups");
-        return errors;
     }));
 }
 
 TEST_F(Credentials, GrantableKeepsTheWayBack)
 {
-    const VELA::Test::TestAccount& a = account_;
-    EXPECT_EQ("", InChild([&] {
-        std::string errors;
-        if (!ResetCredentialsByName(a.user.c_str(), true)) {
-            return std::string("switch failed");
+    EXPECT_EQ("", InChildChecks([&](Errors& check) {
+        if (!check(ResetCredentialsByName(a.user.c_str(), true), "switch failed")) {
+            return;
         }
-        Check(errors, Ids() == Want(a.uid, a.uid, 0, a.gid, a.gid, a.gid), "ids " + Ids());
-        Check(errors, Has(Groups(), a.suppGid), "supplementary group missing");
-        Check(errors, setresuid(0, 0, 0) == 0 && geteuid() == 0, "cannot return to root");
+        check(Ids() == Want(a.uid, a.uid, 0, a.gid, a.gid, a.gid), "ids " + Ids());
+        check(HasGroup(a.suppGid), "supplementary group missing");
+        check(setresuid(0, 0, 0) == 0 && geteuid() == 0, "cannot return to root");
         // And back again; the account named "system" is no way to root (it
         // is refused without such an account); the run-as "system" is the
         // superuser with root's groups.
-        Check(errors, ResetCredentialsByName(a.user.c_str(), true), "second switch failed");
-        Check(errors, Ids() == Want(a.uid, a.uid, 0, a.gid, a.gid, a.gid), "ids after second switch " + Ids());
+        check(ResetCredentialsByName(a.user.c_str(), true), "second switch failed");
+        check(Ids() == Want(a.uid, a.uid, 0, a.gid, a.gid, a.gid), "ids after second switch " + Ids());
         if (ResetCredentialsByName("system", true)) {
-            Check(errors, geteuid() != 0, "the account name system switched to root");
+            check(geteuid() != 0, "the account name system switched to root");
         }
-        Check(errors, ResetCredentialsForRunAs("system", false), "switch to system failed");
-        Check(errors, Ids() == Want(0, 0, 0, 0, 0, 0), "ids as system " + Ids());
-        Check(errors, !Has(Groups(), a.suppGid), "user's group kept");
-        return errors;
+        check(ResetCredentialsForRunAs("system", false), "switch to system failed");
+        check(Ids() == Want(0, 0, 0, 0, 0, 0), "ids as system " + Ids());
+        check(!HasGroup(a.suppGid), "user's group kept");
     }));
 }
 
@@ -119,7 +103,6 @@ TEST_F(Credentials, GrantableKeepsTheWayBack)
 // forms; a refused regain of root is logged with the ERROR form.
 TEST_F(Credentials, LogsEverySwitch)
 {
-    const VELA::Test::TestAccount& a = account_;
     const std::string lines = InChild([&] {
         std::string out;
         VELA::System::LogSetSink([](int prio, const char* line, void* arg) {
@@ -148,39 +131,34 @@ TEST_F(Credentials, LogsEverySwitch)
 // nothing; root carrying another group still has its groups reset.
 TEST_F(Credentials, SystemFromPlainRootIsAlreadyDone)
 {
-    const VELA::Test::TestAccount& a = account_;
-    EXPECT_EQ("", InChild([&] {
-        std::string errors;
+    EXPECT_EQ("", InChildChecks([&](Errors& check) {
         const gid_t zero = 0;
-        Check(errors, setgroups(1, &zero) == 0 && setresgid(0, 0, 0) == 0, "cannot become plain root");
+        check(setgroups(1, &zero) == 0 && setresgid(0, 0, 0) == 0, "cannot become plain root");
         std::string lines;
         VELA::System::LogSetSink([](int, const char* line, void* arg) { *static_cast<std::string*>(arg) += line; },
                                  &lines);
-        Check(errors, ResetCredentialsForRunAs("system", false), "plain root refused");
-        Check(errors, lines.empty(), "logged: " + lines);
+        check(ResetCredentialsForRunAs("system", false), "plain root refused");
+        check(lines.empty(), "logged: " + lines);
         const gid_t extra[] = {0, a.suppGid};
-        Check(errors, setgroups(2, extra) == 0, "cannot add a group");
-        Check(errors, ResetCredentialsForRunAs("system", false), "root with a group refused");
-        Check(errors, !Has(Groups(), a.suppGid), "extra group kept");
-        Check(errors, lines.find("WARNING: setresgid(0, 0, 0)") != std::string::npos, "no switch logged: " + lines);
+        check(setgroups(2, extra) == 0, "cannot add a group");
+        check(ResetCredentialsForRunAs("system", false), "root with a group refused");
+        check(!HasGroup(a.suppGid), "extra group kept");
+        check(lines.find("WARNING: setresgid(0, 0, 0)") != std::string::npos, "no switch logged: " + lines);
         VELA::System::LogSetSink(nullptr, nullptr);
-        return errors;
     }));
 }
 
 TEST_F(Credentials, UnknownAndHostileNamesChangeNothing)
 {
-    EXPECT_EQ("", InChild([] {
-        std::string errors;
+    EXPECT_EQ("", InChildChecks([](Errors& check) {
         const std::string before = Ids();
         const std::string longName(256, 'a');
         for (const char* name : {"vela-no-such-user-x", "", "a/b", "a:b", "a\nb", "..", longName.c_str()}) {
-            Check(errors, !ResetCredentialsByName(name, true), std::string("accepted ") + name);
-            Check(errors, !ResetCredentialsForRunAs(name, true), std::string("run-as accepted ") + name);
+            check(!ResetCredentialsByName(name, true), std::string("accepted ") + name);
+            check(!ResetCredentialsForRunAs(name, true), std::string("run-as accepted ") + name);
         }
-        Check(errors, !ResetCredentialsByName(nullptr, true), "accepted null");
-        Check(errors, Ids() == before && geteuid() == 0, "ids changed: " + Ids());
-        return errors;
+        check(!ResetCredentialsByName(nullptr, true), "accepted null");
+        check(Ids() == before && geteuid() == 0, "ids changed: " + Ids());
     }));
 }
 
@@ -188,21 +166,16 @@ TEST_F(Credentials, UnknownAndHostileNamesChangeNothing)
 TEST_F(Credentials, ExecutableOwnerAndGroup)
 {
     VELA::Test::WriteFile(In("/check.so"), "");
-    ASSERT_EQ(0, chown(In("/check.so").c_str(), account_.uid, account_.suppGid));
-
-    const VELA::Test::TestAccount& a = account_;
-    EXPECT_EQ("", InChild([&] {
-        std::string errors;
-        Check(errors, !InitCredentialsByExecutable("/", 1), "accepted a directory");
-        Check(errors, !InitCredentialsByExecutable("/missing.so", 1), "accepted a missing file");
-        Check(errors, geteuid() == 0, "failed calls changed the ids");
-        if (!InitCredentialsByExecutable("/check.so", 1)) {
-            return errors + "switch failed";
+    ASSERT_EQ(0, chown(In("/check.so").c_str(), a.uid, a.suppGid));
+    EXPECT_EQ("", InChildChecks([&](Errors& check) {
+        check(!InitCredentialsByExecutable("/", 1), "accepted a directory");
+        check(!InitCredentialsByExecutable("/missing.so", 1), "accepted a missing file");
+        check(geteuid() == 0, "failed calls changed the ids");
+        if (check(InitCredentialsByExecutable("/check.so", 1), "switch failed")) {
+            check(Ids() == Want(a.uid, a.uid, 0, a.suppGid, a.suppGid, a.suppGid), "ids " + Ids());
+            check(HasGroup(a.gid), "owner's own group missing");
+            check(setresuid(0, 0, 0) == 0, "cannot return to root");
         }
-        Check(errors, Ids() == Want(a.uid, a.uid, 0, a.suppGid, a.suppGid, a.suppGid), "ids " + Ids());
-        Check(errors, Has(Groups(), a.gid), "owner's own group missing");
-        Check(errors, setresuid(0, 0, 0) == 0, "cannot return to root");
-        return errors;
     }));
 }
 

@@ -20,34 +20,22 @@ TEST(FileUtil, OpenNoSymlinksRefusesEveryLinkOnThePath)
     const std::string inDir = files + "/dir/in.txt";
 
     using VELA::System::NoSymlinkResolve;
-    struct Case {
-        std::string path;
-        int err;  // 0: opens
-    };
-    const Case cases[] = {
-        {inDir, 0},
-        {files + "/dir/../dir/./in.txt", 0},
-        {files + "//dir///in.txt", 0},
+    const std::pair<std::string, int> cases[] = {  // the path and its errno, 0 when it opens
+        {inDir, 0}, {files + "/dir/../dir/./in.txt", 0}, {files + "//dir///in.txt", 0},
         {"files/dir/in.txt", 0},  // relative to the working directory
-        {files + "/last", ELOOP},
-        {files + "/middle/in.txt", ELOOP},
-        {"files/relative/in.txt", ELOOP},
-        {files + "/middle/../target.txt", ELOOP},
-        {files + "/dir/in.txt/", ENOTDIR},
-        {target + "/x", ENOTDIR},
-        {files + "/missing/x", ENOENT},
-        {"", EINVAL},
-        {std::string(5000, 'a'), ENAMETOOLONG},
+        {files + "/last", ELOOP}, {files + "/middle/in.txt", ELOOP}, {"files/relative/in.txt", ELOOP},
+        {files + "/middle/../target.txt", ELOOP}, {files + "/dir/in.txt/", ENOTDIR}, {target + "/x", ENOTDIR},
+        {files + "/missing/x", ENOENT}, {"", EINVAL}, {std::string(5000, 'a'), ENAMETOOLONG},
     };
     char cwd[4096];
     ASSERT_NE(nullptr, getcwd(cwd, sizeof(cwd)));
     ASSERT_EQ(0, chdir(root.Path().c_str()));
-    for (const Case& c : cases) {
+    for (const auto& [path, want] : cases) {
         for (NoSymlinkResolve how : {NoSymlinkResolve::kAuto, NoSymlinkResolve::kWalk}) {
             errno = 0;
-            const int fd = VELA::System::OpenNoSymlinks(c.path, O_RDONLY, how);
-            const int err = fd < 0 ? errno : 0;
-            EXPECT_EQ(c.err, err) << c.path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
+            const int fd = VELA::System::OpenNoSymlinks(path, O_RDONLY, how);
+            EXPECT_EQ(want, fd < 0 ? errno : 0)
+                << path.substr(0, 80) << (how == NoSymlinkResolve::kWalk ? " (walk)" : "");
             if (fd >= 0) {
                 char byte = 0;
                 EXPECT_EQ(1, read(fd, &byte, 1));

@@ -25,7 +25,7 @@ protected:
     std::string mounted_;
 };
 
-TEST_F(Volume, NoneConfiguredMeansNoVolume)
+TEST_F(Volume, NoneConfiguredMeansNoVolumeElseTheFirstWithRoom)
 {
     VOLUME_INFO info;
     EXPECT_EQ(0, VolumeAvailGet(1, &info, 0, VOLUME_AVAIL_WRITABLE));
@@ -36,13 +36,10 @@ TEST_F(Volume, NoneConfiguredMeansNoVolume)
     EXPECT_EQ(-1, VolumeAvailGet(1, nullptr, 0, 0));
     EXPECT_EQ(-1, VolumeAvailGet(1, &info, 0, 0x2));
     EXPECT_EQ(-1, VolumeAvailGet(ULLONG_MAX, &info, 1, 0));  // the sum overflows
-}
 
-TEST_F(Volume, FirstListedWithRoomWins)
-{
+    // The first listed with room wins.
     Conf("notadir", "");
     Conf("volumes.conf", "relative/path\n/volume1/../..\n/missing\n/etc/vela/notadir\n  /volume2  \n/volume1\n");
-    VOLUME_INFO info;
     ASSERT_EQ(1, VolumeAvailGet(1, &info, 0, VOLUME_AVAIL_WRITABLE));
     EXPECT_EQ(In("/volume2"), info.szMountPath);
     EXPECT_GT(info.ullFreeBytes, 0u);

@@ -22,38 +22,29 @@ public:
         sigemptyset(&usr1);
         sigaddset(&usr1, SIGUSR1);
         sigprocmask(SIG_BLOCK, &usr1, &old);
-        int ready[2];
-        EXPECT_EQ(0, pipe(ready));
-        EXPECT_EQ(0, pipe(go_));
-        child_.reset(new VELA::Test::Children(1, [&](int) {
-            close(go_[1]);  // else the read below never sees the parent's close
+        child_ = std::make_unique<VELA::Test::Children>(1, [&](int) {
             if (name != nullptr) {
                 prctl(PR_SET_NAME, name, 0, 0, 0);
             }
-            char c = 'r';
-            (void)!write(ready[1], &c, 1);
-            (void)!read(go_[0], &c, 1);
+            ready_.Post();
+            go_.Wait();
             sigset_t pending;
             sigpending(&pending);
             return sigismember(&pending, SIGUSR1) ? 1 : 0;
-        }));
+        });
         sigprocmask(SIG_SETMASK, &old, nullptr);
-        close(ready[1]);
-        close(go_[0]);
-        char c;
-        EXPECT_EQ(1, read(ready[0], &c, 1));
-        close(ready[0]);
+        EXPECT_EQ('y', ready_.Wait());
     }
     pid_t Pid() const { return child_->Pid(0); }
     // True when the child saw SIGUSR1 pending.
     bool Finish()
     {
-        close(go_[1]);
+        go_.Post();
         return child_->Wait() == std::vector<int>{1};
     }
 
 private:
-    int go_[2];
+    const VELA::Test::Gate ready_, go_;
     std::unique_ptr<VELA::Test::Children> child_;
 };
 

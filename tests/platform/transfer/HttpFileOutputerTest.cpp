@@ -8,6 +8,7 @@
 #include <fcntl.h>
 #include <iostream>
 #include <poll.h>
+#include <regex>
 #include <sys/socket.h>
 
 #include "platform/PlatformTest.h"
@@ -19,38 +20,33 @@ namespace {
 using VELA::HTTP::FileOutputerHelper;
 using VELA::Test::ScopedEnv;
 
+// What an output call wrote, split at the empty line after the headers.
 struct Reply {
-    bool ok = false;
-    std::string head;  // the header block without its empty line
-    std::string body;
-    bool complete = false;  // the empty line was there
-
+    Reply(bool ok, const std::string& out) : ok(ok), complete(out.find("\r\n\r\n") != std::string::npos)
+    {
+        head = complete ? out.substr(0, out.find("\r\n\r\n") + 2) : out;
+        body = complete ? out.substr(head.size() + 2) : "";
+    }
     // The value of header `name`, "" when absent.
     std::string Header(const std::string& name) const
     {
-        const std::string key = name + ": ";
-        size_t pos = 0;
-        while (pos < head.size()) {
-            size_t end = head.find("\r\n", pos);
-            end = end == std::string::npos ? head.size() : end;
-            if (head.compare(pos, key.size(), key) == 0) {
-                return head.substr(pos + key.size(), end - pos - key.size());
-            }
-            pos = end + 2;
-        }
-        return "";
+        std::smatch m;
+        return std::regex_search(head, m, std::regex("(^|\r\n)" + name + ": ([^\r]*)")) ? m[2].str() : "";
     }
+
+    bool ok;
+    bool complete;     // the empty line was there
+    std::string head;  // the header block without its empty line
+    std::string body;
 };
 
-Reply Split(bool ok, const std::string& out)
+// Expects each header of `want` in `r`, "" for one that must be absent.
+void ExpectHeaders(const Reply& r, std::initializer_list<std::pair<const char*, std::string>> want,
+                   const std::string& what = "")
 {
-    Reply r;
-    r.ok = ok;
-    const size_t end = out.find("\r\n\r\n");
-    r.complete = end != std::string::npos;
-    r.head = r.complete ? out.substr(0, end + 2) : out;
-    r.body = r.complete ? out.substr(end + 4) : "";
-    return r;
+    for (const auto& header : want) {
+        EXPECT_EQ(header.second, r.Header(header.first)) << what << ": " << header.first;
+    }
 }
 
 // Runs `fn` in a child whose standard output is a pipe read by this
@@ -70,7 +66,7 @@ Reply ThroughPipe(const std::function<bool()>& fn)
         out.append(buf, static_cast<size_t>(n));
     }
     close(fds[0]);
-    return Split(child.Wait() == std::vector<int>{0}, out);
+    return Reply(child.Wait() == std::vector<int>{0}, out);
 }
 
 std::string Pattern(size_t size)
@@ -82,19 +78,17 @@ std::string Pattern(size_t size)
     return data;
 }
 
-class HttpOutput : public StateRootTest {
+class HttpOutput : public RootTest {
 protected:
-    void SetUp() override
+    HttpOutput()
     {
-        StateRootTest::SetUp();
         FileOutputerHelper::SetFastOutputEnabled(true);
         mkdir(files_.c_str(), 0755);
     }
     std::string Write(const std::string& name, const std::string& data)
     {
-        const std::string path = files_ + "/" + name;
-        std::ofstream(path, std::ios::binary) << data;
-        return path;
+        VELA::Test::WriteFile(files_ + "/" + name, data);
+        return files_ + "/" + name;
     }
     // Runs `fn` with standard output on a new file opened with `flags` (extra
     // open flags), in this process.
@@ -111,7 +105,7 @@ protected:
         fflush(stdout);
         dup2(saved, 1);
         close(saved);
-        return Split(ok, VELA::Test::ReadText(path));
+        return Reply(ok, VELA::Test::ReadText(path));
     }
     // The file at `path` sent with the MIME type `type`.
     Reply Send(const std::string& path, const char* type = "")
@@ -140,19 +134,15 @@ TEST_F(HttpOutput, WholeFileThroughPipeFileAndAppendOnlyFile)
     for (const Reply& r : {ThroughPipe(send), ToFile(send), ToFile(send, O_APPEND)}) {
         EXPECT_TRUE(r.ok);
         EXPECT_EQ(0u, r.head.find("X-From-Cout: 1\r\nX-From-Stdio: 2\r\n"));
-        EXPECT_EQ("application/x-test", r.Header("Content-Type"));
-        EXPECT_EQ(std::to_string(data.size()), r.Header("Content-Length"));
-        EXPECT_EQ("bytes", r.Header("Accept-Ranges"));
-        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options"));
-        EXPECT_EQ("", r.Header("Status"));
+        ExpectHeaders(r, {{"Content-Type", "application/x-test"}, {"Content-Length", std::to_string(data.size())},
+                          {"Accept-Ranges", "bytes"}, {"X-Content-Type-Options", "nosniff"}, {"Status", ""}});
         EXPECT_TRUE(r.body == data) << "body of " << r.body.size() << " bytes differs";
     }
 
     ScopedEnv head("REQUEST_METHOD", "HEAD");
     const Reply r = Send(path);
     EXPECT_TRUE(r.ok && r.complete);
-    EXPECT_EQ(std::to_string(data.size()), r.Header("Content-Length"));
-    EXPECT_EQ("application/octet-stream", r.Header("Content-Type"));
+    ExpectHeaders(r, {{"Content-Length", std::to_string(data.size())}, {"Content-Type", "application/octet-stream"}});
     EXPECT_EQ("", r.body);
 }
 
@@ -164,11 +154,8 @@ TEST_F(HttpOutput, StreamsWithoutALength)
     // Larger than a pipe's buffer and than the copy buffer.
     const std::string data = Pattern(2 * 1024 * 1024 + 5);
     ScopedEnv range("HTTP_RANGE", "bytes=0-9");
-    const struct {
-        const char* what;
-        int domain;  // -1: a pipe
-        bool nonBlocking;
-    } kinds[] = {{"pipe", -1, false}, {"non-blocking pipe", -1, true}, {"socket", AF_UNIX, false}};
+    const struct { const char* what; int domain; bool nonBlocking; } kinds[] = {  // domain -1: a pipe
+        {"pipe", -1, false}, {"non-blocking pipe", -1, true}, {"socket", AF_UNIX, false}};
     for (const auto& kind : kinds) {
         int fds[2];
         ASSERT_EQ(0, kind.domain < 0 ? pipe(fds) : socketpair(kind.domain, SOCK_STREAM, 0, fds)) << kind.what;
@@ -189,13 +176,11 @@ TEST_F(HttpOutput, StreamsWithoutALength)
         fclose(stream);
         writer.Wait();
         EXPECT_TRUE(r.ok) << kind.what;
-        EXPECT_EQ("application/x-tar", r.Header("Content-Type")) << kind.what;
-        EXPECT_EQ("attachment; filename=\"made.tar\"; filename*=UTF-8''made.tar", r.Header("Content-Disposition"));
-        EXPECT_EQ("none", r.Header("Accept-Ranges")) << kind.what;
-        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options")) << kind.what;
-        for (const char* absent : {"Content-Length", "Status", "Content-Range", "Last-Modified"}) {
-            EXPECT_EQ("", r.Header(absent)) << kind.what << ": " << absent;
-        }
+        ExpectHeaders(r, {{"Content-Type", "application/x-tar"},
+                          {"Content-Disposition", "attachment; filename=\"made.tar\"; filename*=UTF-8''made.tar"},
+                          {"Accept-Ranges", "none"}, {"X-Content-Type-Options", "nosniff"}, {"Content-Length", ""},
+                          {"Status", ""}, {"Content-Range", ""}, {"Last-Modified", ""}},
+                      kind.what);
         EXPECT_TRUE(r.body == data.substr(1)) << kind.what << ": body of " << r.body.size() << " bytes differs";
     }
 
@@ -206,8 +191,7 @@ TEST_F(HttpOutput, StreamsWithoutALength)
     const Reply r = ToFile([&] { return out_.Output(stream, "", ""); });
     pclose(stream);
     EXPECT_TRUE(r.ok && r.complete);
-    EXPECT_EQ("application/octet-stream", r.Header("Content-Type"));
-    EXPECT_EQ("", r.Header("Content-Length"));
+    ExpectHeaders(r, {{"Content-Type", "application/octet-stream"}, {"Content-Length", ""}});
     EXPECT_EQ("", r.body);
 }
 
@@ -215,35 +199,28 @@ TEST_F(HttpOutput, SingleRanges)
 {
     const std::string data = Pattern(1000);
     const std::string path = Write("r.bin", data);
-    struct Case {
-        const char* range;
-        int status;  // 200, 206 or 416
-        size_t first, last;
-    };
-    const Case cases[] = {
+    const struct { const char* range; int status; size_t first, last; } cases[] = {  // status 200, 206 or 416
         {"bytes=10-19", 206, 10, 19},   {"bytes=990-", 206, 990, 999},   {"bytes=-5", 206, 995, 999},
         {"bytes=-5000", 206, 0, 999},   {"bytes=900-5000", 206, 900, 999}, {" BYTES=0-0 ", 206, 0, 0},
-        {"bytes=1000-", 416, 0, 0},     {"bytes=-0", 416, 0, 0},
-        {"bytes=99999999999999999999999-", 416, 0, 0},
+        {"bytes=1000-", 416, 0, 0},     {"bytes=-0", 416, 0, 0}, {"bytes=99999999999999999999999-", 416, 0, 0},
         {"bytes=5-1", 200, 0, 999},     {"bytes=0-1,5-6", 200, 0, 999},  {"bytes=abc", 200, 0, 999},
         {"items=0-1", 200, 0, 999},     {"bytes=1-2x", 200, 0, 999},     {"bytes=", 200, 0, 999},
     };
-    for (const Case& c : cases) {
+    for (const auto& c : cases) {
         ScopedEnv range("HTTP_RANGE", c.range);
         const Reply r = Send(path, "text/plain");
         EXPECT_TRUE(r.ok && r.complete) << c.range;
         if (c.status == 416) {
-            EXPECT_EQ("416 Range Not Satisfiable", r.Header("Status")) << c.range;
-            EXPECT_EQ("bytes */1000", r.Header("Content-Range")) << c.range;
+            ExpectHeaders(r, {{"Status", "416 Range Not Satisfiable"}, {"Content-Range", "bytes */1000"}}, c.range);
             EXPECT_EQ("", r.body) << c.range;
             continue;
         }
         const std::string part = data.substr(c.first, c.last - c.first + 1);
-        EXPECT_EQ(c.status == 206 ? "206 Partial Content" : "", r.Header("Status")) << c.range;
-        EXPECT_EQ(c.status == 206 ? "bytes " + std::to_string(c.first) + "-" + std::to_string(c.last) + "/1000" : "",
-                  r.Header("Content-Range"))
-            << c.range;
-        EXPECT_EQ(std::to_string(part.size()), r.Header("Content-Length")) << c.range;
+        const std::string sent = "bytes " + std::to_string(c.first) + "-" + std::to_string(c.last) + "/1000";
+        ExpectHeaders(r, {{"Status", c.status == 206 ? "206 Partial Content" : ""},
+                          {"Content-Range", c.status == 206 ? sent : ""},
+                          {"Content-Length", std::to_string(part.size())}},
+                      c.range);
         EXPECT_TRUE(r.body == part) << c.range;
     }
 
@@ -259,38 +236,21 @@ TEST_F(HttpOutput, SingleRanges)
     EXPECT_EQ("bytes */0", Send(Write("empty", "")).Header("Content-Range"));
 }
 
-// A directory only root may change, the place where X-Sendfile may be used at
-// all, whatever the checkout's place: /run when it is root's alone (the
-// checkout may sit below /tmp, which anyone may write to), else the build
-// directory.
-const char* ServerOnlyBase()
-{
-    struct stat st;
-    if (geteuid() == 0 && stat("/run", &st) == 0 && st.st_uid == 0 && (st.st_mode & 022) == 0) {
-        return "/run";
-    }
-    return getenv("VELA_TEST_BINARY_DIR");
-}
-
-class ServerOnlyDir {
-public:
-    ServerOnlyDir() : base_("TMPDIR", ServerOnlyBase()), dir_() { chmod(dir_.Path().c_str(), 0755); }
-    const std::string& Path() const { return dir_.Path(); }
-
-private:
-    ScopedEnv base_;
-    VELA::Test::TempDir dir_;
-};
-
 TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
 {
+    // X-Sendfile may be used at all only below a directory only root may
+    // change: /run when it is root's alone (the checkout may sit below /tmp,
+    // which anyone may write to), else the build directory.
     ASSERT_NE(nullptr, getenv("VELA_TEST_BINARY_DIR")) << "run through CTest";
-    ServerOnlyDir safe;
+    struct stat st;
+    const bool run = geteuid() == 0 && stat("/run", &st) == 0 && st.st_uid == 0 && (st.st_mode & 022) == 0;
+    ScopedEnv base("TMPDIR", run ? "/run" : getenv("VELA_TEST_BINARY_DIR"));
+    const VELA::Test::TempDir safe;
     const std::string dir = safe.Path();
+    chmod(dir.c_str(), 0755);
     mkdir((dir + "/sub").c_str(), 0755);
     const std::string path = dir + "/a b%c.txt";
-    std::ofstream(path) << "content";
-    chmod(path.c_str(), 0644);
+    VELA::Test::WriteFile(path, "content");
     ASSERT_FALSE(FileOutputerHelper::IsFastOutputEnabled());  // nothing configured
 
     Conf("webapi.conf", "xsendfile=\"YES\"\n");
@@ -316,11 +276,10 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     for (const auto& call : byServer) {
         const Reply r = ToFile(call);
         EXPECT_TRUE(r.ok && r.complete);
-        EXPECT_EQ(expected, r.Header("X-Sendfile"));
-        EXPECT_EQ("text/plain", r.Header("Content-Type"));
-        EXPECT_EQ("nosniff", r.Header("X-Content-Type-Options"));
-        EXPECT_EQ("attachment; filename=\"a b_c.txt\"; filename*=UTF-8''a%20b%25c.txt", r.Header("Content-Disposition"));
-        EXPECT_EQ("", r.Header("Content-Length"));
+        ExpectHeaders(r, {{"X-Sendfile", expected}, {"Content-Type", "text/plain"},
+                          {"X-Content-Type-Options", "nosniff"},
+                          {"Content-Disposition", "attachment; filename=\"a b_c.txt\"; filename*=UTF-8''a%20b%25c.txt"},
+                          {"Content-Length", ""}});
         EXPECT_EQ("", r.body);
     }
     close(fd);
@@ -331,20 +290,17 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
         mkdir(folder.c_str(), 0755);
         chmod(folder.c_str(), folderMode);
         const std::string file = folder + "/f.txt";
-        std::ofstream(file) << "content";
-        chmod(file.c_str(), fileMode);
+        VELA::Test::WriteFile(file, "content", fileMode);
         EXPECT_EQ(0, owner == getuid() ? 0 : chown(folder.c_str(), owner, static_cast<gid_t>(-1)));
         return file;
     };
     mkdir((dir + "/open").c_str(), 0755);
     chmod((dir + "/open").c_str(), 0777);
     std::vector<std::string> streamed = {
-        place(dir + "/others", 0777, 0644, getuid()),
-        place(dir + "/sticky", 01777, 0644, getuid()),
+        place(dir + "/others", 0777, 0644, getuid()), place(dir + "/sticky", 01777, 0644, getuid()),
         place(dir + "/group", 0775, 0644, getuid()),
         place(dir + "/open/deeper", 0755, 0644, getuid()),  // an ancestor others may write to
-        place(dir + "/file-others", 0755, 0666, getuid()),
-        place(dir + "/file-group", 0755, 0664, getuid()),
+        place(dir + "/file-others", 0755, 0666, getuid()), place(dir + "/file-group", 0755, 0664, getuid()),
         dir + "/evil\r\nX-Injected: 1",
     };
     std::ofstream(streamed.back()) << "content";
@@ -355,38 +311,39 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
         VELA::Test::LogCapture log;
         const Reply r = Send(file, "text/plain");
         EXPECT_TRUE(r.ok) << file;
-        EXPECT_EQ("", r.Header("X-Sendfile")) << file;
-        EXPECT_EQ("", r.Header("X-Injected")) << file;
-        EXPECT_EQ("7", r.Header("Content-Length")) << file;
+        ExpectHeaders(r, {{"X-Sendfile", ""}, {"X-Injected", ""}, {"Content-Length", "7"}}, file);
         EXPECT_EQ("content", r.body) << file;
         EXPECT_TRUE(log.Contains("X-Sendfile not used")) << file;
     }
 
-    // A descriptor whose path was swapped for a link after the open: its
-    // own file goes out, streamed, and the link's target never does.
+    // Streamed as well: a descriptor whose path was swapped for a link
+    // after the open (its own file goes out, never the link's target), a
+    // stream, and any file once the helper is switched off.
     const std::string swapped = dir + "/swapped.txt";
-    std::ofstream(swapped) << "mine";
+    VELA::Test::WriteFile(swapped, "mine");
     const int mine = open(swapped.c_str(), O_RDONLY);
     ASSERT_GE(mine, 0);
     ASSERT_EQ(0, symlink(path.c_str(), (dir + "/link").c_str()));
     ASSERT_EQ(0, rename((dir + "/link").c_str(), swapped.c_str()));
-    const Reply kept = ToFile([&] { return out_.Output(mine, "swapped.txt", ""); });
-    close(mine);
-    EXPECT_EQ("", kept.Header("X-Sendfile"));
-    EXPECT_EQ("mine", kept.body);
-
     FILE* file = fopen(path.c_str(), "r");
     ASSERT_NE(nullptr, file);
-    const Reply stream = ToFile([&] { return out_.Output(file, "f", ""); });
+    const std::pair<std::function<bool()>, std::string> direct[] = {
+        {[&] { return out_.Output(mine, "swapped.txt", ""); }, "mine"},
+        {[&] { return out_.Output(file, "f", ""); }, "content"},
+        {[&] {
+             FileOutputerHelper::SetFastOutputEnabled(false);
+             return !FileOutputerHelper::IsFastOutputEnabled() && out_.Output(path, "");
+         },
+         "content"},
+    };
+    for (const auto& [call, body] : direct) {
+        const Reply r = ToFile(call);
+        EXPECT_TRUE(r.ok) << body;
+        ExpectHeaders(r, {{"X-Sendfile", ""}}, body);
+        EXPECT_EQ(body, r.body);
+    }
+    close(mine);
     fclose(file);
-    EXPECT_EQ("", stream.Header("X-Sendfile"));
-    EXPECT_EQ("content", stream.body);
-
-    FileOutputerHelper::SetFastOutputEnabled(false);
-    EXPECT_FALSE(FileOutputerHelper::IsFastOutputEnabled());
-    const Reply direct = Send(path);
-    EXPECT_EQ("", direct.Header("X-Sendfile"));
-    EXPECT_EQ("content", direct.body);
 }
 
 // What is not a regular file is refused before anything is written, and so
@@ -410,32 +367,25 @@ TEST_F(HttpOutput, RefusesLinksAndWhatIsNotARegularFile)
         EXPECT_EQ(-1, HTTPFileOutputer::OpenForOutput(path)) << path;
         EXPECT_EQ(EINVAL, errno) << path;
     }
-    const struct {
-        const char* logged;  // a log line the refusal writes, or null
-        std::function<bool()> call;
-    } calls[] = {
-        {"symbolic link", [&] { return out_.Output(files_ + "/last", ""); }},
-        {"symbolic link", [&] { return out_.Output(files_ + "/middle/in.txt", ""); }},
-        {"symbolic link", [&] { return out_.Output(files_ + "/relative/in.txt", ""); }},
-        {nullptr, [&] { return out_.Output(files_, ""); }},
-        {nullptr, [&] { return out_.Output(fifo, ""); }},  // must not wait for a writer
-        {nullptr, [&] { return out_.Output(files_ + "/missing", ""); }},
-        {nullptr, [&] { return out_.Output(std::string("a\0b", 3), ""); }},
-        {nullptr, [&] { return out_.Output(static_cast<FILE*>(nullptr), "n", ""); }},
-        {nullptr, [&] { return out_.Output(dirStream, "n", ""); }},
-        {nullptr, [&] { return out_.Output(writeOnly, "n", ""); }},
-        {nullptr, [&] { return out_.Output(dirFd, "n", ""); }},
-        {nullptr, [&] { return out_.Output(fifoFd, "n", ""); }},
-        {nullptr, [&] { return out_.Output(fileno(writeOnly), "n", ""); }},
-        {nullptr, [&] { return out_.Output(pathFd, "n", ""); }},
-        {nullptr, [&] { return out_.Output(-1, "n", ""); }},
-    };
-    for (size_t i = 0; i < sizeof(calls) / sizeof(calls[0]); ++i) {
+    // Each call with what it must log ("": nothing in particular). The FIFO
+    // must not make it wait for a writer.
+    std::vector<std::pair<std::string, std::function<bool()>>> calls;
+    for (const std::string& path : {files_ + "/last", files_ + "/middle/in.txt", files_ + "/relative/in.txt", files_,
+                                    fifo, files_ + "/missing", std::string("a\0b", 3)}) {
+        calls.push_back({calls.size() < 3 ? "symbolic link" : "", [this, path] { return out_.Output(path, ""); }});
+    }
+    for (FILE* stream : {static_cast<FILE*>(nullptr), dirStream, writeOnly}) {
+        calls.push_back({"", [this, stream] { return out_.Output(stream, "n", ""); }});
+    }
+    for (int fd : {dirFd, fifoFd, fileno(writeOnly), pathFd, -1}) {
+        calls.push_back({"", [this, fd] { return out_.Output(fd, "n", ""); }});
+    }
+    for (size_t i = 0; i < calls.size(); ++i) {
         VELA::Test::LogCapture log;
-        const Reply r = ToFile(calls[i].call);
+        const Reply r = ToFile(calls[i].second);
         EXPECT_FALSE(r.ok) << "call " << i;
         EXPECT_EQ("", r.head) << "call " << i;
-        EXPECT_TRUE(calls[i].logged == nullptr || log.Contains(calls[i].logged)) << "call " << i;
+        EXPECT_TRUE(calls[i].first.empty() || log.Contains(calls[i].first)) << "call " << i;
     }
     fclose(dirStream);
     fclose(writeOnly);
@@ -452,11 +402,7 @@ TEST_F(HttpOutput, RefusesLinksAndWhatIsNotARegularFile)
 TEST_F(HttpOutput, DispositionNamesAreSafe)
 {
     const std::string path = Write("data", "x");
-    struct Case {
-        std::string name;
-        std::string value;  // "" when no header is expected
-    };
-    const Case cases[] = {
+    const std::pair<std::string, std::string> cases[] = {  // the name and the header, "" for none
         {"report.pdf", "attachment; filename=\"report.pdf\"; filename*=UTF-8''report.pdf"},
         {"a\"b\r\nc;d.txt", "attachment; filename=\"a_b__c;d.txt\"; filename*=UTF-8''a%22b__c%3Bd.txt"},
         {"r\xc3\xa9sum\xc3\xa9 100%.txt",
@@ -470,10 +416,10 @@ TEST_F(HttpOutput, DispositionNamesAreSafe)
     };
     FILE* file = fopen(path.c_str(), "r");
     ASSERT_NE(nullptr, file);
-    for (const Case& c : cases) {
-        const Reply r = ToFile([&] { return out_.Output(file, c.name, ""); });
+    for (const auto& [name, value] : cases) {
+        const Reply r = ToFile([&] { return out_.Output(file, name, ""); });
         EXPECT_TRUE(r.ok);
-        EXPECT_EQ(c.value, r.Header("Content-Disposition"));
+        EXPECT_EQ(value, r.Header("Content-Disposition"));
         EXPECT_EQ("x", r.body);
     }
     fclose(file);
@@ -500,6 +446,28 @@ TEST_F(HttpOutput, ClientGoneIsAFailureNotACrash)
                   return !ok && !sigismember(&mask, SIGPIPE) && !sigismember(&pending, SIGPIPE) ? 2 : 1;
               }));
     close(fds[1]);
+}
+
+// The MIME type of a file name: the system's table, else the built-in one.
+TEST_F(HttpOutput, MimeTypesFromTheSystemFileThenBuiltIn)
+{
+    mkdir(In("/etc").c_str(), 0755);
+    VELA::Test::WriteFile(In("/etc/mime.types"), "# comment png\n\ntext/x-test\t\ttst TSX\napplication/pdf pdf\n"
+                                                 "  image/png png\nno-slash abc\ntext/second tst\n");
+    EXPECT_EQ("text/x-test", HTTPFileOutputer::GetMimeType("a.tst"));
+    EXPECT_EQ("text/x-test", HTTPFileOutputer::GetMimeType("/x/A.TsX"));
+    EXPECT_EQ("application/pdf", HTTPFileOutputer::GetMimeType("archive.tar.PDF"));
+    EXPECT_EQ("image/png", HTTPFileOutputer::GetMimeType("p.png"));
+    for (const char* unknown : {"x.abc", "noext", "dir.pdf/file", "trailing.", "x.zip"}) {
+        EXPECT_EQ("application/octet-stream", HTTPFileOutputer::GetMimeType(unknown)) << unknown;
+    }
+
+    VELA::Test::TempDir bare;
+    ScopedEnv root("VELA_ROOT", bare.Path().c_str());
+    VELA::System::RootReset();
+    EXPECT_EQ("application/zip", HTTPFileOutputer::GetMimeType("x.zip"));
+    EXPECT_EQ("text/html", HTTPFileOutputer::GetMimeType("INDEX.HTML"));
+    EXPECT_EQ("application/octet-stream", HTTPFileOutputer::GetMimeType("a.tst"));
 }
 
 }  // namespace

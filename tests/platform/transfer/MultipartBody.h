@@ -2,6 +2,7 @@
 // that look like delimiters, and the reader run over a memfd or a pipe.
 #pragma once
 
+#include <map>
 #include <sys/mman.h>
 #include <thread>
 
@@ -71,14 +72,20 @@ struct Result {
         VLIBCSzHashFree(fields);
         VLIBCSzHashFree(files);
     }
-    std::string Field(const char* k) const
+    std::string Field(const char* k) const { return Get(fields, k); }
+    std::string File(const char* k) const { return Get(files, k); }
+    // Every field, name and value.
+    std::map<std::string, std::string> Fields() const
     {
-        const char* v = VLIBCSzHashGetValue(fields, k);
-        return v ? v : "<none>";
+        std::map<std::string, std::string> out;
+        for (int i = 0; i < VLIBCSzHashCount(fields); ++i) {
+            out[VLIBCSzHashKeyAt(fields, i)] = VLIBCSzHashValueAt(fields, i);
+        }
+        return out;
     }
-    std::string File(const char* k) const
+    static std::string Get(PVLIBCSZHASH hash, const char* k)
     {
-        const char* v = VLIBCSzHashGetValue(files, k);
+        const char* v = VLIBCSzHashGetValue(hash, k);
         return v ? v : "<none>";
     }
 };

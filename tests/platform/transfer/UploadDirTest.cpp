@@ -2,13 +2,11 @@
 // which base directories are trusted; removal when a signal ends the
 // request; the sweep of directories left by processes that are gone.
 
-#include <chrono>
 #include <climits>
 #include <csignal>
 #include <cstdlib>
 #include <fcntl.h>
 #include <sys/file.h>
-#include <thread>
 
 #include "platform/transfer/MultipartBody.h"
 #include "vela/log.h"
@@ -137,11 +135,9 @@ TEST(UploadDir, OnlyTrustedBasesAreUsed)
 // the body ends early and the process calls exit().
 TEST(UploadDir, SignalsAndExitRemoveAPartialUpload)
 {
-    const struct {
-        int sig;
-        int ignored;  // ignored before the handlers are installed, sent first
-    } cases[] = {{SIGTERM, 0}, {SIGPIPE, 0}, {SIGHUP, 0},       {SIGINT, 0},
-                 {SIGALRM, 0}, {SIGXCPU, 0}, {SIGTERM, SIGHUP}, {0, 0}};
+    // `ignored`: ignored before the handlers are installed, sent first.
+    const struct { int sig, ignored; } cases[] = {{SIGTERM, 0}, {SIGPIPE, 0}, {SIGHUP, 0},       {SIGINT, 0},
+                                                  {SIGALRM, 0}, {SIGXCPU, 0}, {SIGTERM, SIGHUP}, {0, 0}};
     for (const auto& c : cases) {
         SCOPED_TRACE(c.sig);
         TempDir base;
@@ -164,19 +160,17 @@ TEST(UploadDir, SignalsAndExitRemoveAPartialUpload)
         const std::string part = kFileHead + std::string(256 * 1024, 'p');
         ASSERT_EQ(static_cast<ssize_t>(part.size()), write(in[1], part.data(), part.size()));
         // Wait until the partial file is there, then end the process.
-        bool stored = false;
-        for (int i = 0; i < 500 && !stored; ++i) {
+        ASSERT_TRUE(WaitUntil([&] {
             const std::vector<std::string> dirs = DirEntries(base.Path());
-            if (dirs.size() == 1) {
-                for (const std::string& f : DirEntries(base.Path() + "/" + dirs[0])) {
-                    struct stat st;
-                    stored = stored || (stat((base.Path() + "/" + dirs[0] + "/" + f).c_str(), &st) == 0 &&
-                                        st.st_size > 0);
+            const std::string dir = base.Path() + "/" + (dirs.size() == 1 ? dirs[0] : "");
+            struct stat st;
+            for (const std::string& f : dirs.size() == 1 ? DirEntries(dir) : std::vector<std::string>()) {
+                if (stat((dir + "/" + f).c_str(), &st) == 0 && st.st_size > 0) {
+                    return true;
                 }
             }
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        ASSERT_TRUE(stored);
+            return false;
+        }));
         for (int sig : {c.ignored, c.sig}) {
             if (sig != 0) {
                 kill(child.Pid(0), sig);
@@ -222,10 +216,7 @@ TEST(UploadDir, ReaperRemovesWhatRootStoredAfterTheDrop)
         }
         close(ready[0]);
         EXPECT_EQ(std::vector<int>{killed ? 128 + SIGKILL : 0}, child.Wait());
-        for (int i = 0; i < 500 && !DirEntries(base.Path()).empty(); ++i) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        EXPECT_TRUE(DirEntries(base.Path()).empty());
+        EXPECT_TRUE(WaitUntil([&] { return DirEntries(base.Path()).empty(); }));
     }
 }
 
@@ -239,10 +230,10 @@ TEST(UploadDir, SweepTakesOnlyStaleUnlockedDirectoriesOfOurs)
     MakeAged(b, "vela-upload-stalestale22", old);
     ASSERT_EQ(0, symlink((elsewhere.Path() + "/precious").c_str(), (b + "/vela-upload-stalestale22/ln").c_str()));
     Age(b + "/vela-upload-stalestale22", old);
-    MakeAged(b, "vela-upload-livelivelive", old);
     MakeAged(b, "vela-upload-freshfresh22", 0);
-    MakeAged(b, "vela-upload-short", old);
-    MakeAged(b, "other-upload-stalestale", old);
+    for (const char* name : {"vela-upload-livelivelive", "vela-upload-short", "other-upload-stalestale"}) {
+        MakeAged(b, name, old);
+    }
     MakeAged(elsewhere.Path(), "target", old);
     ASSERT_EQ(0, symlink((elsewhere.Path() + "/target").c_str(), (b + "/vela-upload-linklinklink").c_str()));
     WriteFile(b + "/vela-upload-filefilefile", "a file");

@@ -1,12 +1,15 @@
-// The upload calls (vela/upload.h): bodies fed through memfds and pipes,
-// files stored in a fresh directory.
+// The upload calls (vela/upload.h) and the multipart/form-data parser
+// behind them: bodies fed through memfds and pipes, files stored in a fresh
+// directory, delimiters across the edges of the parser's buffer, the
+// Content-Type and its boundary.
 
 #include <cstring>
-#include <fcntl.h>
 #include <sys/resource.h>
 #include <thread>
 
+#include "platform/system/FileUtil.h"
 #include "platform/transfer/MultipartBody.h"
+#include "platform/transfer/MultipartReader.h"
 #include "vela/upload.h"
 
 namespace {
@@ -21,12 +24,9 @@ TEST(UploadRead, FieldsAndFilesFromOneForm)
     const std::string body =
         "preamble to ignore\r\n" +
         Body({{"api", "VELA.Demo.Upload"},
-              {"note", "two\r\nlines"},
-              {"file", binary, "C:\\Users\\me\\photo.jpg", true},
-              {"file", "second file", "../x", true},
-              {"empty", "", "", true},  // a file input left empty: skipped
-              {"tail", ""}}) +
-        "epilogue\r\n";
+              {"note", "two\r\nlines"}, {"file", binary, "C:\\Users\\me\\photo.jpg", true},
+              {"file", "second file", "../x", true}, {"empty", "", "", true},  // a file input left empty: skipped
+              {"tail", ""}}) + "epilogue\r\n";
     for (int viaPipe = 0; viaPipe < 2; ++viaPipe) {
         SCOPED_TRACE(viaPipe ? "pipe with small writes" : "memfd");
         Result r;
@@ -37,17 +37,13 @@ TEST(UploadRead, FieldsAndFilesFromOneForm)
             ReadAllText(body, dir.Path(), r);
         }
         ASSERT_EQ(1, r.rc);
-        EXPECT_EQ("VELA.Demo.Upload", r.Field("api"));
-        EXPECT_EQ("two\r\nlines", r.Field("note"));
-        EXPECT_EQ("", r.Field("tail"));
-        EXPECT_EQ("photo.jpg", r.Field("file_name"));
-        EXPECT_EQ("x", r.Field("file_2_name"));
+        EXPECT_EQ((std::map<std::string, std::string>{{"api", "VELA.Demo.Upload"}, {"note", "two\r\nlines"},
+                                                      {"tail", ""}, {"file_name", "photo.jpg"}, {"file_2_name", "x"}}),
+                  r.Fields());
         EXPECT_EQ(2, VLIBCSzHashCount(r.files));  // "empty" stored nothing
-        const std::string first = r.File("file");
-        const std::string second = r.File("file_2");
-        EXPECT_EQ(binary, ReadText(first));
-        EXPECT_EQ("second file", ReadText(second));
-        for (const std::string& path : {first, second}) {
+        EXPECT_EQ(binary, ReadText(r.File("file")));
+        EXPECT_EQ("second file", ReadText(r.File("file_2")));
+        for (const std::string& path : {r.File("file"), r.File("file_2")}) {
             EXPECT_EQ(dir.Path() + "/upload-", path.substr(0, dir.Path().size() + 8));
             EXPECT_EQ(0600u, Mode(path));
             unlink(path.c_str());
@@ -82,24 +78,18 @@ long PeakRssKiB()
 TEST(UploadRead, LargeFileStreamsInBoundedMemory)
 {
     TempDir dir;
-    const size_t kSize = 64u << 20;
+    std::string content(64u << 20, '\0');
+    for (size_t i = 0; i < content.size(); ++i) {
+        content[i] = static_cast<char>((i * 2654435761u) >> 13);
+    }
     const std::string head = std::string("--") + kBoundary + "\r\n" + PartHead({"big", "", "big.bin", true});
     const std::string tail = std::string("\r\n--") + kBoundary + "--\r\n";
-    const unsigned long long length = head.size() + kSize + tail.size();
+    const unsigned long long length = head.size() + content.size() + tail.size();
     int fds[2];
     ASSERT_EQ(0, pipe(fds));
-    auto byteAt = [](size_t i) { return static_cast<char>((i * 2654435761u) >> 13); };
     std::thread writer([&] {
-        std::string chunk(1 << 16, '\0');
-        bool ok = write(fds[1], head.data(), head.size()) == static_cast<ssize_t>(head.size());
-        for (size_t pos = 0; ok && pos < kSize; pos += chunk.size()) {
-            for (size_t i = 0; i < chunk.size(); ++i) {
-                chunk[i] = byteAt(pos + i);
-            }
-            ok = write(fds[1], chunk.data(), chunk.size()) == static_cast<ssize_t>(chunk.size());
-        }
-        if (ok) {
-            ok = write(fds[1], tail.data(), tail.size()) == static_cast<ssize_t>(tail.size());
+        for (const std::string* piece : std::initializer_list<const std::string*>{&head, &content, &tail}) {
+            VELA::System::WriteAll(fds[1], piece->data(), piece->size());
         }
         close(fds[1]);
     });
@@ -115,21 +105,7 @@ TEST(UploadRead, LargeFileStreamsInBoundedMemory)
     EXPECT_EQ(length, g_progress.done);
     EXPECT_EQ(length, g_progress.total);
     EXPECT_LE(g_progress.calls, length / 4096);
-
-    const int in = open(r.File("big").c_str(), O_RDONLY);
-    ASSERT_GE(in, 0);
-    std::vector<char> buf(1 << 20);
-    size_t pos = 0;
-    bool same = true;
-    for (ssize_t n; (n = read(in, buf.data(), buf.size())) > 0;) {
-        for (ssize_t i = 0; i < n && same; ++i) {
-            same = buf[i] == byteAt(pos + i);
-        }
-        pos += n;
-    }
-    close(in);
-    EXPECT_TRUE(same);
-    EXPECT_EQ(kSize, pos);
+    EXPECT_TRUE(ReadText(r.File("big")) == content) << "the stored file differs";
 }
 
 // Every malformed body fails with its code, removes the files the call
@@ -148,12 +124,7 @@ TEST(UploadRead, BadBodiesLeaveNothingBehind)
     for (int i = 0; i < 17; ++i) {
         manyLines += "X-Pad: 1\r\n";
     }
-    const struct {
-        const char* what;
-        std::string body;
-        long long lengthDelta;
-        int code;
-    } cases[] = {
+    const struct { const char* what; std::string body; long long lengthDelta; int code; } cases[] = {
         {"input shorter than CONTENT_LENGTH", good, 10, VELA_UPLOAD_ERR_TRUNCATED},
         {"CONTENT_LENGTH cuts the close delimiter", good, -8, VELA_UPLOAD_ERR_SYNTAX},
         {"no close delimiter", open + "\r\n", 0, VELA_UPLOAD_ERR_SYNTAX},
@@ -194,19 +165,9 @@ TEST(UploadRead, BadBodiesLeaveNothingBehind)
 
 TEST(UploadRead, ClientFileNamesAreReducedOrRefused)
 {
-    const struct {
-        std::string sent;
-        const char* stored;  // client's base name kept, null: refused
-    } cases[] = {
-        {"../x", "x"},
-        {"a/b", "b"},
-        {"..\\..\\windows\\evil.dll", "evil.dll"},
-        {"..", nullptr},
-        {"a/..", nullptr},
-        {"dir/", nullptr},
-        {std::string("a\0b", 3), nullptr},
-        {"tab\there", nullptr},
-        {std::string(256, 'n'), nullptr},
+    const struct { std::string sent; const char* stored; } cases[] = {  // the base name kept, null: refused
+        {"../x", "x"}, {"a/b", "b"}, {"..\\..\\windows\\evil.dll", "evil.dll"}, {"..", nullptr}, {"a/..", nullptr},
+        {"dir/", nullptr}, {std::string("a\0b", 3), nullptr}, {"tab\there", nullptr}, {std::string(256, 'n'), nullptr},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.sent);
@@ -240,8 +201,7 @@ TEST(UploadRead, StepByStep)
     UploadReader* reader = nullptr;
     ASSERT_EQ(1, UploadReaderOpen(fd, body.size(), kType.c_str(), &reader));
     char path[4096];
-    EXPECT_EQ(VELA_UPLOAD_ERR_STATE, UploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), nullptr,
-                                                    nullptr));
+    EXPECT_EQ(VELA_UPLOAD_ERR_STATE, UploadReadFile(reader, dir.Path().c_str(), path, sizeof(path), nullptr, nullptr));
     Result r;
     ASSERT_EQ(1, UploadReadFields(reader, r.fields, nullptr));
     EXPECT_EQ("A", r.Field("api"));
@@ -255,8 +215,7 @@ TEST(UploadRead, StepByStep)
     // ReadAll picks up the rest and reports the whole body.
     Result all;
     ASSERT_EQ(1, UploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 0, nullptr));
-    EXPECT_EQ("A", all.Field("api"));
-    EXPECT_EQ("B", all.Field("after"));
+    EXPECT_EQ((std::map<std::string, std::string>{{"api", "A"}, {"doc_name", "d.txt"}, {"after", "B"}}), all.Fields());
     EXPECT_EQ(path, all.File("doc"));
     EXPECT_EQ(body.size(), UploadConsumed(reader));
     UploadReaderFree(reader);
@@ -271,6 +230,60 @@ TEST(UploadRead, StepByStep)
     EXPECT_EQ(VELA_UPLOAD_ERR_ARGUMENT, UploadReadAll(reader, all.fields, all.files, dir.Path().c_str(), 1, nullptr));
     UploadReaderFree(reader);
     close(badFd);
+}
+
+// The delimiter that ends a file lands on every position across the edge of
+// the reader's buffer.
+TEST(MultipartReader, DelimiterAcrossBufferEdges)
+{
+    TempDir dir;
+    const std::string head = std::string("--") + kBoundary + "\r\n" + PartHead({"f", "", "a.bin", true});
+    const size_t dlen = strlen(kBoundary) + 4;
+    const size_t edge = kMultipartBufferSize - head.size();
+    for (size_t size = edge - dlen - 2; size <= edge + 2; ++size) {
+        std::string content(size, '\r');
+        for (size_t i = 0; i < size; i += 7) {
+            content[i] = static_cast<char>('a' + i % 26);
+        }
+        Result r;
+        ReadAllText(Body({{"f", content, "a.bin", true}}), dir.Path(), r);
+        ASSERT_EQ(1, r.rc) << size;
+        ASSERT_EQ(content, ReadText(r.File("f"))) << size;
+        unlink(r.File("f").c_str());
+    }
+}
+
+TEST(MultipartReader, ContentTypeAndBoundary)
+{
+    const std::string b70(70, 'b');
+    const struct { std::string type, boundary; } cases[] = {  // boundary empty: refused
+        {"Multipart/Form-Data; charset=utf-8; BOUNDARY=" + b70, b70},
+        {"multipart/form-data; boundary=\"a b:c/d=e?\"", "a b:c/d=e?"}, {"multipart/form-data;boundary=x", "x"},
+        {"multipart/form-data; boundary=" + b70 + "b", ""}, {"multipart/form-data; boundary=\"ends in space \"", ""},
+        {"multipart/form-data; boundary=\"bad@char\"", ""}, {"multipart/form-data; boundary=\"\"", ""},
+        {"multipart/form-data; boundary=a; boundary=a", ""}, {"multipart/form-data", ""},
+        {"multipart/mixed; boundary=x", ""}, {"application/x-www-form-urlencoded", ""},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.type);
+        std::string boundary;
+        EXPECT_EQ(!c.boundary.empty(), ParseMultipartContentType(c.type.c_str(), boundary));
+        EXPECT_EQ(c.boundary, boundary);
+    }
+    UploadReader* reader = nullptr;
+    EXPECT_EQ(VELA_UPLOAD_ERR_CONTENT_TYPE, UploadReaderOpen(0, 10, "text/plain", &reader));
+    EXPECT_EQ(VELA_UPLOAD_ERR_NO_BODY, UploadReaderOpen(0, 0, kType.c_str(), &reader));
+    EXPECT_EQ(nullptr, reader);
+
+    // A quoted boundary with blanks works end to end, padding after it too.
+    TempDir dir;
+    const std::string body = "--a b\t \r\nContent-Disposition: form-data; name=\"k\"\r\n\r\nv\r\n--a b--";
+    const int fd = MemFd(body);
+    Result r;
+    ReadAll(fd, body.size(), "multipart/form-data; boundary=\"a b\"", dir.Path(), r);
+    close(fd);
+    EXPECT_EQ(1, r.rc);
+    EXPECT_EQ("v", r.Field("k"));
 }
 
 }  // namespace
