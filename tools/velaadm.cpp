@@ -465,15 +465,19 @@ bool SignalWorker(const TARN::Task& task, bool& signalled, std::string& problem)
 {
     signalled = false;
     const pid_t pid = task.getCreatePid();
-    if (pid <= 0) {
-        return true;
+    if (pid <= 0 || !task.isWorkerAlive()) {
+        return true;  // none recorded, or gone already
     }
     const int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+    if (pidfd < 0 && errno == ESRCH) {
+        return true;
+    }
     if (pidfd < 0 && errno != ENOSYS) {
-        return true;  // ESRCH: gone already
+        problem = "cannot reach the worker " + std::to_string(pid) + ": " + strerror(errno);
+        return false;
     }
     long rc = 0;
-    if (task.isWorkerAlive()) {
+    if (task.isWorkerAlive()) {  // again, now that the process is pinned
         rc = pidfd >= 0 ? syscall(SYS_pidfd_send_signal, pidfd, SIGTERM, nullptr, 0)
                         : static_cast<long>(kill(pid, SIGTERM));
         signalled = rc == 0;
