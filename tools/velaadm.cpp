@@ -1,15 +1,20 @@
-// velaadm: administration of login sessions and access tokens, and the
-// server's public key. Works on the state under VELA_ROOT ("/" by default).
+// velaadm: administration of login sessions, access tokens and background
+// tasks, and the server's public key. Works on the state under VELA_ROOT
+// ("/" by default).
 //
 // Exit status: 0 success, 1 the operation failed, 2 a usage error.
 #include <cerrno>
 #include <climits>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <json/json.h>
+#include <memory>
 #include <string>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <syslog.h>
 #include <unistd.h>
 #include <vector>
@@ -18,6 +23,7 @@
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/session.h"
+#include "vela/task.h"
 #include "vela/token.h"
 
 namespace {
@@ -41,6 +47,15 @@ const char kUsage[] =
     "        (default 2592000, 30 days).\n"
     "  token list\n"
     "  token revoke <id>\n"
+    "  task list [--owner OWNER]\n"
+    "        One line per background task: its id OWNER/ID, state (running,\n"
+    "        finished, or lost when its worker ended without finishing it),\n"
+    "        creation time, API and method, progress.\n"
+    "  task show <OWNER/ID>\n"
+    "        Prints the task's whole record (JSON).\n"
+    "  task stop <OWNER/ID> [--remove]\n"
+    "        Sends SIGTERM to the task's worker when it still runs and marks the\n"
+    "        task finished; --remove deletes its record instead.\n"
     "  pubkey\n"
     "        Prints the server's public key for encrypted parameters (PEM).\n"
     "\n"
@@ -316,6 +331,193 @@ int TokenRevoke(int argc, char** argv)
     return 0;
 }
 
+// Text from a task record for one column: printable ASCII only (anything
+// else shows as "?", so a record cannot drive the terminal), at most `max`
+// bytes; "-" when it is not a string or empty.
+std::string Column(const Json::Value& value, size_t max)
+{
+    if (!value.isString() || value.asString().empty()) {
+        return "-";
+    }
+    std::string out = value.asString();
+    if (out.size() > max) {
+        out.resize(max - 3);
+        out += "...";
+    }
+    for (char& c : out) {
+        if (c < 0x20 || c > 0x7e) {
+            c = '?';
+        }
+    }
+    return out;
+}
+
+// Splits "OWNER/ID" at its first "/". False unless both parts are valid
+// names of a task.
+bool ParseTaskId(const std::string& full, std::string& owner, std::string& id)
+{
+    const size_t slash = full.find('/');
+    if (slash == std::string::npos) {
+        return false;
+    }
+    owner = full.substr(0, slash);
+    id = full.substr(slash + 1);
+    return TARN::TaskUtil::isValidOwner(owner) && TARN::TaskUtil::isValidId(id);
+}
+
+const char kBadTaskId[] =
+    "invalid task id: OWNER/ID expected (OWNER a user name, @administrators or @users; ID letters, digits, "
+    "'.', '_' and '-')";
+
+// The task named by the one positional argument, read. Its exit status on
+// failure (usage or missing task), 0 when `task` is loaded.
+int OpenTask(const Args& args, const char* action, std::unique_ptr<TARN::Task>& task)
+{
+    if (args.positional.size() != 1) {
+        return Usage((std::string("task ") + action + " needs exactly one task id").c_str());
+    }
+    std::string owner;
+    std::string id;
+    if (!ParseTaskId(args.positional[0], owner, id)) {
+        return Usage(kBadTaskId);
+    }
+    task.reset(new TARN::Task(owner, id));
+    if (!task->reload()) {
+        return TARN::TaskUtil::checkTaskExists(owner, id) ? Fail("cannot read the record of task " + owner + "/" + id)
+                                                           : Fail("no task " + owner + "/" + id);
+    }
+    return 0;
+}
+
+int TaskList(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {"--owner"}, {}, args, problem)) {
+        return Usage(problem.c_str());
+    }
+    if (!args.positional.empty()) {
+        return Usage("task list takes no positional arguments");
+    }
+    std::vector<std::string> owners;
+    for (const auto& opt : args.options) {
+        if (!TARN::TaskUtil::isValidOwner(opt.second)) {
+            return Usage("invalid owner for --owner: a user name, @administrators or @users");
+        }
+        owners.push_back(opt.second);
+    }
+    if (owners.empty()) {
+        owners = TARN::TaskMgr::getAllOwners();
+    }
+    printf("%-48s  %-8s  %-20s  %-40s  %s\n", "ID", "STATE", "CREATED", "API / METHOD", "PROGRESS");
+    for (const std::string& owner : owners) {
+        for (const std::string& id : TARN::TaskMgr::getAllTaskId(owner)) {
+            TARN::Task task(owner, id);
+            if (!task.reload()) {
+                continue;  // removed meanwhile, or not a record (logged)
+            }
+            const char* state = "running";
+            if (task.isFinished()) {
+                state = "finished";
+            } else if (task.getCreatePid() > 0 && !task.isWorkerAlive()) {
+                state = "lost";
+            }
+            const Json::Value info = task.getProperty("info");
+            const Json::Value progress = task.getProperty("progress");
+            std::string percent = "-";
+            if (progress.isObject() && progress["percent"].isInt()) {
+                percent = std::to_string(progress["percent"].asInt()) + "%";
+            }
+            const std::string apiMethod = info.isObject() ? Column(info["api"], 64) + " / " + Column(info["method"], 64)
+                                                          : std::string("-");
+            printf("%-48s  %-8s  %-20s  %-40s  %s\n", (owner + "/" + id).c_str(), state,
+                   FormatTime(task.getCreated()).c_str(), apiMethod.c_str(), percent.c_str());
+        }
+    }
+    return 0;
+}
+
+int TaskShow(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {}, {}, args, problem)) {
+        return Usage(problem.c_str());
+    }
+    std::unique_ptr<TARN::Task> task;
+    const int rc = OpenTask(args, "show", task);
+    if (rc != 0) {
+        return rc;
+    }
+    // Control characters and anything outside ASCII come out escaped.
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "  ";
+    builder["emitUTF8"] = false;
+    printf("%s\n", Json::writeString(builder, task->getRecord()).c_str());
+    return 0;
+}
+
+// SIGTERM to the task's worker when it still runs as recorded. The pidfd
+// pins the process before the check, so a pid that ends and is reused
+// meanwhile is never signalled. False (with `problem`) when the signal
+// could not be sent to a worker that runs.
+bool SignalWorker(const TARN::Task& task, bool& signalled, std::string& problem)
+{
+    signalled = false;
+    const pid_t pid = task.getCreatePid();
+    if (pid <= 0 || !task.isWorkerAlive()) {
+        return true;  // none recorded, or gone already
+    }
+    const int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+    if (pidfd < 0 && errno == ESRCH) {
+        return true;
+    }
+    if (pidfd < 0 && errno != ENOSYS) {
+        problem = "cannot reach the worker " + std::to_string(pid) + ": " + strerror(errno);
+        return false;
+    }
+    long rc = 0;
+    if (task.isWorkerAlive()) {  // again, now that the process is pinned
+        rc = pidfd >= 0 ? syscall(SYS_pidfd_send_signal, pidfd, SIGTERM, nullptr, 0)
+                        : static_cast<long>(kill(pid, SIGTERM));
+        signalled = rc == 0;
+        if (rc != 0 && errno != ESRCH) {
+            problem = "cannot signal the worker " + std::to_string(pid) + ": " + strerror(errno);
+        }
+    }
+    if (pidfd >= 0) {
+        close(pidfd);
+    }
+    return problem.empty();
+}
+
+int TaskStop(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {}, {"--remove"}, args, problem)) {
+        return Usage(problem.c_str());
+    }
+    std::unique_ptr<TARN::Task> task;
+    const int rc = OpenTask(args, "stop", task);
+    if (rc != 0) {
+        return rc;
+    }
+    const bool remove = !args.options.empty();
+    bool signalled = false;
+    if (!SignalWorker(*task, signalled, problem)) {
+        return Fail(problem);
+    }
+    if (signalled) {
+        printf("worker %d sent SIGTERM\n", static_cast<int>(task->getCreatePid()));
+    }
+    if (!task->finish(remove)) {
+        return Fail(remove ? "cannot remove the task's record" : "cannot mark the task finished");
+    }
+    fputs(remove ? "task removed\n" : "task finished\n", stdout);
+    return 0;
+}
+
 int PublicKey(int argc, char** argv)
 {
     if (argc != 2) {
@@ -344,6 +546,22 @@ int Run(int argc, char** argv)
     }
     if (command == "pubkey") {
         return PublicKey(argc, argv);
+    }
+    if (command == "task") {
+        if (argc < 3) {
+            return Usage("task needs an action: list, show or stop");
+        }
+        const std::string action = argv[2];
+        if (action == "list") {
+            return TaskList(argc, argv);
+        }
+        if (action == "show") {
+            return TaskShow(argc, argv);
+        }
+        if (action == "stop") {
+            return TaskStop(argc, argv);
+        }
+        return Usage(("unknown action \"" + action + "\" for task").c_str());
     }
     if (command != "session" && command != "token") {
         return Usage(("unknown command \"" + command + "\"").c_str());

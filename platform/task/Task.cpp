@@ -49,6 +49,14 @@ std::string OwnerDir(const std::string& owner) { return TasksRoot() + "/" + owne
 
 Json::Int64 Now() { return static_cast<Json::Int64>(time(nullptr)); }
 
+// An integer field of a record, `def` when it is missing, not an integer or
+// out of range (the accessors never throw on a damaged record).
+long long IntField(const Json::Value& record, const char* key, long long def)
+{
+    const Json::Value& value = record[key];
+    return value.isInt64() ? value.asInt64() : def;
+}
+
 // The kernel's start time of process `pid` (clock ticks since boot), or -1
 // when it does not exist or is a zombie.
 long long ProcessStart(pid_t pid)
@@ -116,7 +124,9 @@ bool TaskUtil::isValidOwner(const std::string& owner)
     if (owner == kAdminOwner || owner == kUsersOwner) {
         return true;
     }
-    return !owner.empty() && owner[0] != '@' && owner[0] != '.' && VELA::System::ValidAccountName(owner.c_str());
+    // A NUL inside would end the name early in every path made from it.
+    return !owner.empty() && owner[0] != '@' && owner[0] != '.' && owner.find('\0') == std::string::npos &&
+           VELA::System::ValidAccountName(owner.c_str());
 }
 
 bool TaskUtil::isValidId(const std::string& id) { return !id.empty() && IsName(id, kMaxId); }
@@ -365,10 +375,8 @@ bool Task::setCreatePid(pid_t pid)
 
 pid_t Task::getCreatePid() const
 {
-    const Json::Value& pid = record_["create_pid"];
-    return pid.isIntegral() && pid.asLargestInt() > 0 && pid.asLargestInt() < (1LL << 31)
-               ? static_cast<pid_t>(pid.asLargestInt())
-               : 0;
+    const long long pid = IntField(record_, "create_pid", 0);
+    return pid > 0 && pid < (1LL << 31) ? static_cast<pid_t>(pid) : 0;
 }
 
 bool Task::isWorkerAlive() const
@@ -377,9 +385,8 @@ bool Task::isWorkerAlive() const
     if (pid <= 0) {
         return false;
     }
-    const Json::Value& recorded = record_["create_start"];
     const long long start = ProcessStart(pid);
-    return start >= 0 && recorded.isIntegral() && recorded.asLargestInt() == start;
+    return start >= 0 && IntField(record_, "create_start", -1) == start;
 }
 
 bool Task::finish(bool remove)
@@ -394,7 +401,7 @@ bool Task::finish(bool remove)
     if (own && !beginUpdate()) {
         return false;
     }
-    if (!record_["finished"].asBool()) {
+    if (!isFinished()) {
         record_["finished"] = true;
         record_["finished_at"] = Now();
     }
@@ -403,26 +410,37 @@ bool Task::finish(bool remove)
 
 bool Task::isFinished() const { return record_["finished"].isBool() && record_["finished"].asBool(); }
 
-long long Task::getCreated() const
-{
-    return record_["created"].isIntegral() ? record_["created"].asLargestInt() : 0;
-}
+long long Task::getCreated() const { return IntField(record_, "created", 0); }
 
-long long Task::getFinishedAt() const
-{
-    return record_["finished_at"].isIntegral() ? record_["finished_at"].asLargestInt() : 0;
-}
+long long Task::getFinishedAt() const { return IntField(record_, "finished_at", 0); }
 
 bool Task::remove()
 {
     if (!valid_) {
         return false;
     }
-    if (unlink(RecordPath().c_str()) == 0 || errno == ENOENT) {
-        return true;
+    // Under the lock, unless this process holds it already: an update that
+    // checked the record is still there must not write it back after the
+    // unlink.
+    int lockFd = -1;
+    if (lockFd_ < 0) {
+        struct stat st;
+        if (lstat(OwnerDir(owner_).c_str(), &st) != 0 && errno == ENOENT) {
+            return true;  // no task of this owner at all
+        }
+        if (VLIBCFileLockTimeByFile((OwnerDir(owner_) + "/.lock").c_str(), 1, 10, &lockFd) != 0) {
+            VELA_LOG_ERR("cannot lock the tasks of [%s] to remove %s", owner_.c_str(), id_.c_str());
+            return false;
+        }
     }
-    VELA_LOG_ERR("cannot remove task record %s[%m]", RecordPath().c_str());
-    return false;
+    const bool ok = unlink(RecordPath().c_str()) == 0 || errno == ENOENT;
+    if (!ok) {
+        VELA_LOG_ERR("cannot remove task record %s[%m]", RecordPath().c_str());
+    }
+    if (lockFd >= 0) {
+        VLIBCFileUnlockByFile(lockFd);
+    }
+    return ok;
 }
 
 bool Task::waitForDataReady(const std::string& key, int seconds)
@@ -440,9 +458,10 @@ bool Task::waitForDataReady(const std::string& key, int seconds)
         if (hasProperty(key)) {
             return true;
         }
-        // A worker that was recorded and is gone will never write it.
+        // A worker that was recorded and is gone will never write it; it
+        // may have written it just before it ended, after the read above.
         if (isFinished() || (getCreatePid() > 0 && !isWorkerAlive())) {
-            return false;
+            return reload() && hasProperty(key);
         }
         struct timespec now;
         clock_gettime(CLOCK_MONOTONIC, &now);

@@ -8,7 +8,8 @@ ADM=${1:?usage: velaadm_test.sh /path/to/velaadm}
 VELA_ROOT=$(mktemp -d "${TMPDIR:-/tmp}/velaadm-test-XXXXXX") || exit 1
 export VELA_ROOT
 unset VELA_LOG_STDERR
-trap 'rm -rf "$VELA_ROOT"' EXIT
+worker=
+trap 'rm -rf "$VELA_ROOT"; [ -z "$worker" ] || kill "$worker" 2>/dev/null' EXIT
 
 OUT="$VELA_ROOT/.out"
 ERR="$VELA_ROOT/.err"
@@ -109,6 +110,56 @@ expect 0 token revoke "$tid"
 refused 1 "no access token" token revoke "$tid"
 expect 1 token revoke ../../x
 
+# ---- background tasks, on records written by hand. The worker of
+# alice/sum-1 runs; bob/sum-3 names the same pid under another start time
+# (a reused pid), so it is lost and its "worker" is never signalled.
+tasks="$VELA_ROOT/var/lib/vela/tasks"
+mkdir -p "$tasks/alice" "$tasks/bob" "$tasks/@administrators"
+sleep 300 &
+worker=$!
+start=$(cut -d' ' -f22 "/proc/$worker/stat")
+record() { # OWNER ID FINISHED PID START PROPERTIES
+    printf '{"version":1,"owner":"%s","id":"%s","created":1700000000,"updated":1700000000,"finished":%s,"finished_at":0,"create_pid":%s,"create_start":%s,"properties":%s}\n' \
+        "$@" >"$tasks/$1/$2"
+}
+record alice sum-1 false "$worker" "$start" \
+    '{"info":{"api":"VELA.Sample","method":"cksum\u001b[2J"},"progress":{"percent":40}}'
+record @administrators sum-2 true 0 -1 '{}'
+record bob sum-3 false "$worker" "$((start + 1))" '{"info":{"api":"VELA.Sample","method":"list"}}'
+: >"$tasks/alice/.lock"
+
+expect 0 task list
+stdout_has "^alice/sum-1 *running *2023-11-14T22:13:20Z *VELA.Sample / cksum?\[2J *40%$"
+stdout_has "^@administrators/sum-2 *finished"
+stdout_has "^bob/sum-3 *lost *.*VELA.Sample / list"
+stdout_lacks "$(printf '\033')"
+stdout_lacks ".lock"
+expect 0 task list --owner bob
+stdout_has "bob/sum-3"
+stdout_lacks "alice"
+refused 2 "invalid owner" task list --owner ../alice
+
+expect 0 task show alice/sum-1
+stdout_has '"percent" : 40'
+stdout_has '"cksum\\u001b\[2J"'
+for bad in alice ../etc/passwd alice/../bob alice/.x .x/sum-1 @other/sum-1 "alice/sum 1"; do
+    refused 2 "invalid task id" task show "$bad"
+done
+refused 1 "no task alice/sum-9" task stop alice/sum-9
+expect 2 task stop
+expect 2 task frobnicate
+
+expect 0 task stop bob/sum-3
+stdout_lacks SIGTERM
+grep -q '"finished":true' "$tasks/bob/sum-3" || fail "stop of a lost task did not mark it finished"
+kill -0 "$worker" 2>/dev/null || fail "the process holding a reused pid was signalled"
+expect 0 task stop alice/sum-1 --remove
+stdout_has "worker $worker sent SIGTERM"
+wait "$worker"
+[ $? -eq 143 ] || fail "the worker did not end by SIGTERM"
+worker=
+[ ! -e "$tasks/alice/sum-1" ] || fail "stop --remove left the record"
+
 # ---- public key: printed as PEM, or a clear refusal while none is available
 "$ADM" pubkey >"$OUT" 2>"$ERR"
 case $? in
@@ -122,7 +173,7 @@ expect 2 pubkey extra
 extra=$(find "$VELA_ROOT" -mindepth 1 \( -path "$VELA_ROOT/run" -o -path "$VELA_ROOT/run/vela" \
     -o -path "$VELA_ROOT/run/vela/sessions*" -o -path "$VELA_ROOT/var" -o -path "$VELA_ROOT/var/lib" \
     -o -path "$VELA_ROOT/var/lib/vela" -o -path "$VELA_ROOT/var/lib/vela/tokens*" \
-    -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$VELA_ROOT/etc*" -o -path "$OUT" -o -path "$ERR" \) \
+    -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$tasks*" -o -path "$VELA_ROOT/etc*" -o -path "$OUT" -o -path "$ERR" \) \
     -prune -o -print)
 [ -z "$extra" ] || fail "unexpected files: $extra"
 finish velaadm
