@@ -241,7 +241,9 @@ public:
     // The links of `uid`, or all of them, oldest first; revoked ones too.
     bool ListByOwner(uid_t uid, std::vector<record::Entry>& out) const;
     bool ListAll(std::vector<record::Entry>& out) const;
-    // False for an unknown or revoked link, a refused value, or an error.
+    // A new or removed password also deletes every visitor session and
+    // token of the link (visitors enter the new one). False for an unknown
+    // or revoked link, a refused value, or an error.
     bool Update(const std::string& hash, const LinkUpdate& change) const;
     // Marks the link revoked and deletes every visitor session and token of
     // it in the same transaction. False for an unknown link or an error.
