@@ -8,6 +8,7 @@ packages=(
   libjsoncpp-dev
   libssl-dev openssl passwd
   libpam0g-dev
+  libsqlite3-dev
   libgtest-dev libgmock-dev googletest
   libbenchmark-dev
   clang libclang-rt-dev

@@ -60,7 +60,8 @@ namespace Session {
     X(EVP_CIPHER_CTX_ctrl)                \
     X(EVP_DecryptInit_ex)                 \
     X(EVP_DecryptUpdate)                  \
-    X(EVP_DecryptFinal_ex)
+    X(EVP_DecryptFinal_ex)                \
+    X(PKCS5_PBKDF2_HMAC)
 
 struct CryptoApi {
 #define VELA_CRYPTO_MEMBER(name) decltype(&::name) name = nullptr;
