@@ -5,22 +5,16 @@
 set -u
 
 ADM=${1:?usage: velaadm_test.sh /path/to/velaadm}
-VELA_ROOT=$(mktemp -d "${TMPDIR:-/tmp}/velaadm-test-XXXXXX") || exit 1
-export VELA_ROOT
-unset VELA_LOG_STDERR
-trap 'rm -rf "$VELA_ROOT"' EXIT
-
-OUT="$VELA_ROOT/.out"
-ERR="$VELA_ROOT/.err"
 . "$(dirname "$0")/checks.sh"
+VELA_ROOT=$TMP/root
+export VELA_ROOT
+mkdir "$VELA_ROOT" || exit 1
 
 # expect STATUS ARGS...: runs velaadm, checks its exit status.
 expect() {
     want=$1
     shift
-    "$ADM" "$@" >"$OUT" 2>"$ERR"
-    got=$?
-    [ "$got" -eq "$want" ] || fail "velaadm $* exited $got, expected $want"
+    runs "$want" "$ADM" "$@"
 }
 
 # refused STATUS TEXT ARGS...: velaadm ARGS exits STATUS saying TEXT.
@@ -122,7 +116,7 @@ expect 2 pubkey extra
 extra=$(find "$VELA_ROOT" -mindepth 1 \( -path "$VELA_ROOT/run" -o -path "$VELA_ROOT/run/vela" \
     -o -path "$VELA_ROOT/run/vela/sessions*" -o -path "$VELA_ROOT/var" -o -path "$VELA_ROOT/var/lib" \
     -o -path "$VELA_ROOT/var/lib/vela" -o -path "$VELA_ROOT/var/lib/vela/tokens*" \
-    -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$VELA_ROOT/etc*" -o -path "$OUT" -o -path "$ERR" \) \
+    -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$VELA_ROOT/etc*" \) \
     -prune -o -print)
 [ -z "$extra" ] || fail "unexpected files: $extra"
 finish velaadm
