@@ -32,7 +32,7 @@ secret_text="ROOT-ONLY-$(head -c 24 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-
 (umask 077 && printf '%s\n' "$secret_text" >"$SECRET")
 printf 'public\n' >"$DIR/file.txt"
 chown -R nobody "$DIR"
-setpriv --reuid=nobody --regid="$(id -g nobody)" --clear-groups test -r "$SECRET" &&
+srv_as_nobody test -r "$SECRET" &&
   { fail "nobody can read the secret: the test proves nothing"; exit 1; }
 
 srv_serve --xsendfile-dir "$ROOT/vol1"

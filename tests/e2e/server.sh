@@ -26,7 +26,10 @@
 #                                  made by $VELAADM
 #   srv_stop                       ends it (also done by srv_cleanup)
 #   srv_logs                       the tails of the server's and velascgi's logs
-#   srv_add_user NAME PASS [GROUP] a Linux account with that password
+#   srv_pam                        the PAM service of deploy/pam in the root
+#   srv_add_user NAME PASS [GROUP] a Linux account with that password; exits
+#                                  1 when it cannot be made
+#   srv_as_nobody CMD...           runs CMD as the account nobody
 #   srv_cleanup                    server, accounts, groups, TMP; call it from
 #                                  the caller's EXIT trap
 #   srv_sanitizer_clean            0 when no sanitizer report is in the logs
@@ -40,6 +43,8 @@
 #   expect NAME TEXT...            the answer holds every TEXT (compact JSON)
 #   expect_header NAME HEADER      the header block has a line starting so
 #   expect_status NAME CODE        the HTTP status was CODE
+#   expect_error NAME CODE [WORD]  the answer is error CODE, with the header
+#                                  "x-request-error: WORD" when WORD is given
 #
 # lighttpd and curl are always required.
 
@@ -111,6 +116,14 @@ expect_status() {
   [ "$status" = "$2" ] || fail "$1: HTTP status $status, expected $2"
 }
 
+expect_error() {
+  expect "$1" '"success":false'
+  grep -qE "\"code\":$2[,}]" "$TMP/body" || fail "$1: not error $2: $(head -c 600 "$TMP/body")"
+  if [ -n "${3:-}" ]; then
+    expect_header "$1" "x-request-error: $3"
+  fi
+}
+
 srv_init() {
   SRV_SRC=$1
   SRV_VELASCGI=$2
@@ -125,6 +138,10 @@ srv_init() {
   RUN=$TMP/run
   mkdir -p "$ROOT/usr/vela/velaman" "$ROOT/etc/vela" "$RUN/www" || return 1
   ln -s "$3" "$ROOT/usr/vela/velaman/webapi"
+}
+
+srv_pam() {
+  mkdir -p "$ROOT/etc/pam.d" && cp "$SRV_SRC/deploy/pam/vela-webapi" "$ROOT/etc/pam.d/vela-webapi" || exit 1
 }
 
 srv_api() {
@@ -215,15 +232,17 @@ srv_add_user() {
   local args=(-M -N -s /usr/sbin/nologin)
   if [ -n "$group" ]; then
     if ! getent group "$group" >/dev/null; then
-      groupadd "$group" || return 1
+      groupadd "$group" || { fail "cannot create the group $group"; exit 1; }
       SRV_GROUPS+=("$group")
     fi
     args+=(-G "$group")
   fi
-  useradd "${args[@]}" "$name" || return 1
+  useradd "${args[@]}" "$name" || { fail "cannot create the account $name"; exit 1; }
   SRV_USERS+=("$name")
-  printf '%s:%s\n' "$name" "$pass" | chpasswd || return 1
+  printf '%s:%s\n' "$name" "$pass" | chpasswd || { fail "cannot set the password of $name"; exit 1; }
 }
+
+srv_as_nobody() { setpriv --reuid=nobody --regid="$(id -g nobody)" --clear-groups "$@"; }
 
 # A random password of letters and digits (no character that needs quoting
 # in a form or a shell).

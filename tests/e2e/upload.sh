@@ -42,7 +42,6 @@ left() {
 # ---- A form field naming the method with root's rights: the handler of the
 # method called still runs, as nobody, and sees that method.
 nobody_uid=$(id -u nobody)
-nobody_gid=$(id -g nobody)
 call --cookie "$COOKIE" -F "method=byDefault" -F "f=@$TMP/small.txt" "$IDS"
 expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$nobody_uid,$nobody_uid]" \
   '"method":"upload"' '"methodParam":"upload"'
@@ -68,18 +67,11 @@ for target in "$IDS" "$DEFERRED"; do
   if [ -z "$partial" ]; then
     fail "$name: no partial file appeared in @tmp"
   else
-    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
-        sh -c 'head -c 16 "$2" >/dev/null 2>&1' sh "$UP" "$partial"; then
-      fail "$name: nobody read the partial file $partial"
-    fi
-    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
-        sh -c 'echo evil >"$1/evil" && mv -f "$1/evil" "$2"' sh "$UP" "$partial" 2>/dev/null; then
+    srv_as_nobody head -c 16 "$partial" >/dev/null 2>&1 && fail "$name: nobody read the partial file $partial"
+    srv_as_nobody sh -c 'echo evil >"$1/evil" && mv -f "$1/evil" "$2"' sh "$UP" "$partial" 2>/dev/null &&
       fail "$name: nobody replaced the partial file $partial"
-    fi
-    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
-        mv -f "$(dirname "$partial")" "$UP/moved" 2>/dev/null; then
+    srv_as_nobody mv -f "$(dirname "$partial")" "$UP/moved" 2>/dev/null &&
       fail "$name: nobody moved the directory of the partial file $partial"
-    fi
     rm -f "$UP/evil"
   fi
   kill "$client" 2>/dev/null
