@@ -6,8 +6,6 @@
 
 #include <stdlib.h>
 #include <string>
-#include <sys/stat.h>
-#include <unistd.h>
 #include <vector>
 
 #include "access/PermissionCheck.h"
@@ -19,7 +17,6 @@
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APIRunner.h"
-#include "webapi/JsonUtil.h"
 #include "webentry/WebEntry.h"
 
 namespace {
@@ -81,6 +78,17 @@ struct PreparedCall {
     APIRequest* Req() { return runner.GetRequest(); }
     APIResponse* Resp() { return runner.GetResponseObject(); }
     bool Check() { return check.CheckPermission(Req(), Resp(), nullptr); }
+    // The check refuses with error `code` and the x-request-error `word`
+    // ("": none; null: not looked at).
+    void ExpectRefused(int code, const char* word = nullptr)
+    {
+        EXPECT_FALSE(Check());
+        EXPECT_EQ(code, Resp()->GetError());
+        if (word != nullptr) {
+            EXPECT_EQ(*word != '\0', Resp()->HasServerError());
+            EXPECT_EQ(word, Resp()->GetServerError());
+        }
+    }
     const Json::Value& Slots() { return check.Verdicts()["permResult"]; }
 
     Runner runner;
@@ -151,9 +159,7 @@ TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticatedOptionalLoginNoR
 {
     LogCapture log;
     PreparedCall c("get", "");
-    EXPECT_FALSE(c.Check());
-    EXPECT_EQ(119, c.Resp()->GetError());
-    EXPECT_EQ("unauth", c.Resp()->GetServerError());
+    c.ExpectRefused(119, "unauth");
     EXPECT_EQ(AUTH_RESULT_UNAUTHENTICATED, c.Req()->GetAuthResult());
     EXPECT_FALSE(c.Req()->IsAuthorized());
     EXPECT_EQ(J("[null, -5]"), c.Slots());
@@ -168,10 +174,8 @@ TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticatedOptionalLoginNoR
     Declare(Desc(R"({"authLevel": 2})"));
     LogCapture optionalLog;
     PreparedCall optional("get", "");
-    EXPECT_FALSE(optional.Check());
+    optional.ExpectRefused(119, "unauth");
     EXPECT_TRUE(PermissionCheck::SkipPermission(optional.Req()));
-    EXPECT_EQ(119, optional.Resp()->GetError());
-    EXPECT_EQ("unauth", optional.Resp()->GetServerError());
     EXPECT_FALSE(optionalLog.Contains("session check refused"));
 }
 
@@ -220,19 +224,13 @@ TEST_F(PermissionCheckTest, TimeoutAddressTokenProtectionAndCutIdRefusals)
     {
         Now() += 61;
         PreparedCall c("get", sid);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(106, c.Resp()->GetError());
-        EXPECT_EQ("timeout", c.Resp()->GetServerError());
+        c.ExpectRefused(106, "timeout");
         EXPECT_EQ(AUTH_RESULT_TIMEOUT, c.Req()->GetAuthResult());
     }
     const std::string other = Login("root");
     {
         ScopedEnv moved("REMOTE_ADDR", "198.51.100.1");
-        PreparedCall c("get", other);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(150, c.Resp()->GetError());
-        EXPECT_EQ("errorip", c.Resp()->GetServerError());
-
+        PreparedCall("get", other).ExpectRefused(150, "errorip");
         PreparedCall anywhere("anywhere", other);
         EXPECT_TRUE(anywhere.Check());
         EXPECT_EQ("root", anywhere.Req()->GetLoginUserName());
@@ -241,18 +239,14 @@ TEST_F(PermissionCheckTest, TimeoutAddressTokenProtectionAndCutIdRefusals)
     const std::string guarded = Login("root", options);
     {
         LogCapture log;
-        PreparedCall c("get", guarded);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(105, c.Resp()->GetError());
-        EXPECT_EQ("noprivilege", c.Resp()->GetServerError());
+        PreparedCall("get", guarded).ExpectRefused(105, "noprivilege");
         EXPECT_TRUE(log.Contains("WebEntry:566 Token Authentication Fail."));
     }
     {
         // A session id cut by a NUL byte names no session.
         PreparedCall c("get", other + "%00x");
         ASSERT_EQ(other + std::string(1, '\0') + "x", c.Req()->GetSessionID());
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(105, c.Resp()->GetError());
+        c.ExpectRefused(105);
         EXPECT_EQ(AUTH_RESULT_NO_SESSION, c.Req()->GetAuthResult());
         EXPECT_EQ("", c.Req()->GetLoginUserName());
     }
@@ -268,10 +262,7 @@ TEST_F(PermissionCheckTest, AllowTimeoutDoesNotMoveTheLastUse)
         EXPECT_EQ(J("[1, null]"), c.Slots());
     }
     EXPECT_EQ(kStart, LastUse(sid));
-    {
-        PreparedCall c("get", sid);
-        EXPECT_TRUE(c.Check());
-    }
+    EXPECT_TRUE(PreparedCall("get", sid).Check());
     EXPECT_EQ(kStart + 100, LastUse(sid));
 }
 
@@ -295,46 +286,34 @@ TEST_F(PermissionCheckTest, UserClassesAndApplicationPrivilege)
     };
     for (const auto& c : cases) {
         Declare(Desc(c.apiLevel));
+        SCOPED_TRACE(std::string(c.apiLevel) + " " + c.method);
         PreparedCall call(c.method, c.sid);
-        EXPECT_EQ(c.allowed, call.Check()) << c.apiLevel << " " << c.method;
-        if (!c.allowed) {
-            EXPECT_EQ(105, call.Resp()->GetError());
-            EXPECT_FALSE(call.Resp()->HasServerError());
+        if (c.allowed) {
+            EXPECT_TRUE(call.Check());
+        } else {
+            call.ExpectRefused(105, "");
         }
     }
 
     // An application privilege is checked from the client address.
     Declare(Desc(R"({"appPriv": "VELA.Photo"})"));
-    {
-        PreparedCall c("get", normal);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(105, c.Resp()->GetError());
-    }
+    PreparedCall("get", normal).ExpectRefused(105);
     {
         PreparedCall c("get", admin);
         ASSERT_TRUE(c.Check());
         EXPECT_TRUE(c.Req()->HasAppPriv("VELA.Photo"));
     }
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc").c_str(), 0755));
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc/vela").c_str(), 0755));
-    ASSERT_TRUE(VELA::JsonWriteFile(root_.Path() + "/etc/vela/app_privileges.json",
-                                    J(R"({"applications": {"VELA.Photo": {"users": ["daemon"],
-                                        "allow_from": ["192.0.2.0/24"]}}})")));
-    {
-        PreparedCall c("get", normal);
-        EXPECT_TRUE(c.Check());
-    }
+    Conf("app_privileges.json",
+         R"({"applications": {"VELA.Photo": {"users": ["daemon"], "allow_from": ["192.0.2.0/24"]}}})");
+    EXPECT_TRUE(PreparedCall("get", normal).Check());
 }
 
 // The judgement of a caller that already acts as the user (velaapi): the
 // description's rules without a session, with no refusal logged or set.
 TEST_F(PermissionCheckTest, UserMayCallJudgesTheDescriptionWithoutASession)
 {
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc").c_str(), 0755));
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc/vela").c_str(), 0755));
-    ASSERT_TRUE(VELA::JsonWriteFile(root_.Path() + "/etc/vela/app_privileges.json",
-                                    J(R"({"applications": {"VELA.Open": {"users": ["daemon"]},
-                                        "VELA.Near": {"users": ["daemon"], "allow_from": ["192.0.2.0/24"]}}})")));
+    Conf("app_privileges.json", R"({"applications": {"VELA.Open": {"users": ["daemon"]},
+        "VELA.Near": {"users": ["daemon"], "allow_from": ["192.0.2.0/24"]}}})");
     const struct {
         const char* apiLevel;
         const char* method;
@@ -383,16 +362,11 @@ TEST_F(PermissionCheckTest, AccessTokenGrantsOnlyItsMethods)
         EXPECT_EQ("", c.Req()->GetSessionFilePath());
         EXPECT_STREQ("daemon", getenv("VELA_WEBAPI_USERNAME"));
     }
-    {
-        // A stale session cookie falls back to the token.
-        PreparedCall c("get", std::string(VELA_SESSION_ID_LEN, 'A'));
-        EXPECT_TRUE(c.Check());
-    }
+    // A stale session cookie falls back to the token.
+    EXPECT_TRUE(PreparedCall("get", std::string(VELA_SESSION_ID_LEN, 'A')).Check());
     {
         PreparedCall c("poll", "");
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(119, c.Resp()->GetError());
-        EXPECT_EQ("unauth", c.Resp()->GetServerError());
+        c.ExpectRefused(119, "unauth");
         EXPECT_EQ("", c.Req()->GetLoginUserName());
     }
 }

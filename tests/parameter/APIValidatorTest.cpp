@@ -9,7 +9,6 @@
 namespace VELA {
 namespace {
 
-using Test::Parse;
 typedef APIValidator V;
 
 // A valid parameter holding `v`, or an invalid one.
@@ -99,7 +98,7 @@ TEST(Numeric, PortEqualAndRanges)
     EXPECT_FALSE(V::IsEqual(Param(std::string("a")), std::string("b")));
     EXPECT_TRUE(V::IsEqual(Param(std::string("a")), "a"));
     EXPECT_FALSE(V::IsEqual(Param(std::string("a")), static_cast<const char*>(nullptr)));
-    EXPECT_TRUE(V::IsEqual(Param(Parse("[1,{\"k\":2}]")), Parse("[1,{\"k\":2}]")));
+    EXPECT_TRUE(V::IsEqual(Param(J("[1,{\"k\":2}]")), J("[1,{\"k\":2}]")));
     EXPECT_TRUE(V::IsEqual(Param(0.3), 0.1 + 0.2));
     EXPECT_FALSE(V::IsEqual(Param(0.3), 0.3001));
     EXPECT_FALSE(V::IsEqual(Param(0.3, true), 0.3));
@@ -131,24 +130,24 @@ TEST(Numeric, PortEqualAndRanges)
 
 TEST(Membership, StringAndJson)
 {
-    Json::Value strings = Parse("[\"a\",\"b\",1]");
+    Json::Value strings = J("[\"a\",\"b\",1]");
     EXPECT_TRUE(V::IsBelong(Param(std::string("b")), strings));
     EXPECT_FALSE(V::IsBelong(Param(std::string("1")), strings));
     EXPECT_FALSE(V::IsBelong(Param(std::string("a"), true), strings));
-    EXPECT_FALSE(V::IsBelong(Param(std::string("a")), Parse("{\"a\":\"a\"}")));
+    EXPECT_FALSE(V::IsBelong(Param(std::string("a")), J("{\"a\":\"a\"}")));
 
     // Every element of the value must be in the list: a scalar has none, so
     // any scalar passes, in the list or not.
-    Json::Value list = Parse("[1,2,3,\"x\"]");
+    Json::Value list = J("[1,2,3,\"x\"]");
     for (const char* in : {"[1,2]", "{\"p\":3,\"q\":\"x\"}", "[]", "null", "2", "4", "\"y\"", "true", "0.5"}) {
-        EXPECT_TRUE(V::IsBelong(Param(Parse(in)), list)) << in;
+        EXPECT_TRUE(V::IsBelong(Param(J(in)), list)) << in;
     }
     for (const char* out : {"[1,4]", "{\"p\":4}", "[[1]]"}) {
-        EXPECT_FALSE(V::IsBelong(Param(Parse(out)), list)) << out;
+        EXPECT_FALSE(V::IsBelong(Param(J(out)), list)) << out;
     }
-    EXPECT_FALSE(V::IsBelong(Param(Parse("[1]")), Parse("{\"a\":1}")));
-    EXPECT_FALSE(V::IsBelong(Param(Parse("[]")), Json::Value(1)));
-    EXPECT_FALSE(V::IsBelong(Param(Parse("[1]"), true), list));
+    EXPECT_FALSE(V::IsBelong(Param(J("[1]")), J("{\"a\":1}")));
+    EXPECT_FALSE(V::IsBelong(Param(J("[]")), Json::Value(1)));
+    EXPECT_FALSE(V::IsBelong(Param(J("[1]"), true), list));
 }
 
 }  // namespace

@@ -1,10 +1,10 @@
 // What APIRequest derives from the environment and the cookies: session
 // facts, the client kind from the user agent, URL and protocol.
-#include <fstream>
 #include <gtest/gtest.h>
 #include <string>
 #include <sys/stat.h>
 
+#include "platform/StateRootTest.h"
 #include "support/JsonLiteral.h"
 #include "support/LinearTime.h"
 #include "support/TestSupport.h"
@@ -200,23 +200,22 @@ TEST(RequestEncryptedParams, HalfPairsEmptyMembersAndFailedDecryption)
     EXPECT_TRUE(f.GetParam("webapi").isMember("__tXeTrEhPiC"));
 }
 
-TEST(RequestPreferenceDir, UnderTheRootOrTmp)
+// The facts read from files under the system root.
+using RequestUnderRoot = RootTest;
+
+TEST_F(RequestUnderRoot, PreferenceDirUnderTheRootOrTmp)
 {
-    VELA::Test::TempDir root;
-    VELA::Test::ScopedEnv env("VELA_ROOT", root.Path().c_str());
-    VELA::System::RootReset();
     APIRequest r(J(R"({"session": {"username": "alice"}})"));
     const std::string dir = r.GetPreferenceDir();
-    EXPECT_EQ(0u, dir.find(root.Path() + "/"));
+    EXPECT_EQ(0u, dir.find(In("/")));
     struct stat st;
     EXPECT_EQ(0, stat(dir.c_str(), &st));
     EXPECT_TRUE(S_ISDIR(st.st_mode));
-    EXPECT_EQ(0u, r.GetGroupPreferenceDir("staff").find(root.Path() + "/"));
+    EXPECT_EQ(0u, r.GetGroupPreferenceDir("staff").find(In("/")));
     EXPECT_EQ("/tmp", r.GetGroupPreferenceDir("../etc"));
     EXPECT_EQ("/tmp", r.GetGroupPreferenceDir(""));
     EXPECT_EQ("/tmp", APIRequest(J(R"({"session": {"username": "a/b"}})")).GetPreferenceDir());
     EXPECT_EQ("/tmp", APIRequest().GetPreferenceDir());
-    VELA::System::RootReset();
 }
 
 namespace {
@@ -346,25 +345,19 @@ TEST(RequestMethod, ExactNamesOnly)
 // X-Forwarded-Proto counts only when the peer is a configured trusted proxy:
 // a client's own header would make the login cookie Secure, or anything
 // else that follows the scheme.
-TEST(RequestURL, ForwardedSchemeOnlyFromATrustedProxy)
+TEST_F(RequestUnderRoot, ForwardedSchemeOnlyFromATrustedProxy)
 {
-    VELA::Test::TempDir root;
-    VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
-    VELA::System::RootReset();
     const auto proto = [](const char* remote) {
         Json::Value env = J(R"({"HTTPS": "off", "HTTP_X_FORWARDED_PROTO": "HTTPS"})");
         env["REMOTE_ADDR"] = remote;
         return WithEnv(env).GetURLProto("x");
     };
     EXPECT_EQ("http", proto("127.0.0.1"));  // no proxy configured, loopback included
-    ASSERT_EQ(0, mkdir((root.Path() + "/etc").c_str(), 0755));
-    ASSERT_EQ(0, mkdir((root.Path() + "/etc/vela").c_str(), 0755));
-    std::ofstream(root.Path() + "/etc/vela/webapi.conf") << "trusted_proxies=\"192.0.2.10\"\n";
+    Conf("webapi.conf", "trusted_proxies=\"192.0.2.10\"\n");
     EXPECT_EQ("https", proto("192.0.2.10"));
     EXPECT_EQ("http", proto("192.0.2.11"));
     EXPECT_EQ("http", proto("127.0.0.1"));
     EXPECT_EQ("http", WithEnv(J(R"({"HTTP_X_FORWARDED_PROTO": "https"})")).GetURLProto("x"));  // no peer
-    VELA::System::RootReset();
 }
 
 // Scheme, host and port; an unusable host leaves host and port to the
@@ -436,10 +429,8 @@ TEST(RequestURL, FactsAreFrozenAtFirstUse)
 
 // An address stored in the request wins over the platform's; the platform is
 // asked once and its answer kept, but an unknown address is asked again.
-TEST(RequestRemoteIP, StoredAskedOnceOrRetried)
+TEST_F(RequestUnderRoot, RemoteIPStoredAskedOnceOrRetried)
 {
-    VELA::Test::TempDir root;
-    VELA::Test::ScopedEnv rootEnv("VELA_ROOT", root.Path().c_str());
     VELA::Test::ScopedEnv forwarded("HTTP_X_FORWARDED_FOR", nullptr);
     APIRequest r;
     APIRequest unknown;

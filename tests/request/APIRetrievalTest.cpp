@@ -7,7 +7,6 @@ namespace VELA {
 namespace {
 
 using Test::Flags;
-using Test::Parse;
 
 const APIRequest::PARAM_NECESSITY REQ = APIRequest::REQUIRED;
 const APIRequest::PARAM_NECESSITY OPT = APIRequest::OPTIONAL;
@@ -16,7 +15,7 @@ const APIRequest::PARAM_NECESSITY OPT = APIRequest::OPTIONAL;
 std::unique_ptr<APIRequest> Request(const std::string& params)
 {
     Json::Value request(Json::objectValue);
-    request["getParam"] = Parse(params);
+    request["getParam"] = J(params);
     return std::unique_ptr<APIRequest>(new APIRequest(request));
 }
 
@@ -34,9 +33,9 @@ TEST(GetAndCheck, BasicAndIntegralTypes)
     EXPECT_EQ(Flags(req->GetAndCheckBool("s", REQ)), "SI");
     EXPECT_EQ(req->GetAndCheckReal("r", REQ).Get(), 3.0);
     EXPECT_EQ(Flags(req->GetAndCheckReal("b", REQ)), "SI");
-    EXPECT_EQ(req->GetAndCheckArray("a", REQ).Get(), Parse("[1]"));
+    EXPECT_EQ(req->GetAndCheckArray("a", REQ).Get(), J("[1]"));
     EXPECT_EQ(Flags(req->GetAndCheckArray("o", REQ)), "SI");
-    EXPECT_EQ(req->GetAndCheckObject("o", REQ).Get(), Parse(R"({"k":"v"})"));
+    EXPECT_EQ(req->GetAndCheckObject("o", REQ).Get(), J(R"({"k":"v"})"));
     EXPECT_EQ(Flags(req->GetAndCheckObject("a", REQ)), "SI");
 
     // Integral types of every width, with a validator.
@@ -75,12 +74,12 @@ TEST(GetAndCheckUnitArray, WrapsSingleValues)
     auto req = Request(R"({"s":"a","z":null,"a":["x","y"],"o":{"k":1}})");
     APIParameter<Json::Value> single = req->GetAndCheckUnitArray("s", REQ);
     EXPECT_EQ(Flags(single), "S");
-    EXPECT_EQ(single.Get(), Parse(R"(["a"])"));
+    EXPECT_EQ(single.Get(), J(R"(["a"])"));
     APIParameter<Json::Value> null = req->GetAndCheckUnitArray("z", REQ);
     EXPECT_EQ(Flags(null), "S");
-    EXPECT_EQ(null.Get(), Parse("[null]"));
-    EXPECT_EQ(req->GetAndCheckUnitArray("a", REQ).Get(), Parse(R"(["x","y"])"));
-    EXPECT_EQ(req->GetAndCheckUnitArray("o", REQ).Get(), Parse(R"([{"k":1}])"));
+    EXPECT_EQ(null.Get(), J("[null]"));
+    EXPECT_EQ(req->GetAndCheckUnitArray("a", REQ).Get(), J(R"(["x","y"])"));
+    EXPECT_EQ(req->GetAndCheckUnitArray("o", REQ).Get(), J(R"([{"k":1}])"));
 
     EXPECT_EQ(Flags(req->GetAndCheckUnitArray("n", REQ)), "I");
     EXPECT_EQ(Flags(req->GetAndCheckUnitArray("n", OPT)), "");
