@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 
 #include "response/APIResponsePrivate.h"
+#include "support/JsonLiteral.h"
 #include "support/TestSupport.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
@@ -9,19 +10,8 @@
 namespace VELA {
 namespace {
 
-APIRequest MakeRequest(const Json::Value& environ)
-{
-    Json::Value json;
-    json["environ"] = environ;
-    return APIRequest(json);
-}
-
-Json::Value Obj(const char* key, const Json::Value& value)
-{
-    Json::Value v(Json::objectValue);
-    v[key] = value;
-    return v;
-}
+// A request whose environment is the JSON object `environ`.
+APIRequest MakeRequest(const std::string& environ) { return APIRequest(J(R"({"environ": )" + environ + "}")); }
 
 // A fresh response has an empty body and the JSON content type; an error,
 // then a success, each replace the whole body.
@@ -34,34 +24,23 @@ TEST(APIResponseBody, FreshThenErrorThenSuccessReplacesWholeBody)
     EXPECT_EQ(Json::Value(Json::arrayValue), resp.GetCookies());
 
     resp.SetError(WEBAPI_ERR_NO_PERMISSION);
-    Json::Value error = Obj("success", false);
-    error["error"] = Obj("code", 105);
-    EXPECT_EQ(error, resp.GetBody());
+    EXPECT_EQ(J(R"({"success": false, "error": {"code": 105}})"), resp.GetBody());
     EXPECT_EQ(105, resp.GetError());
-
-    resp.SetError(120, Obj("name", "x"));
-    error["error"] = Obj("code", 120);
-    error["error"]["errors"] = Obj("name", "x");
-    EXPECT_EQ(error, resp.GetBody());
-
-    resp.SetSuccess(Obj("a", 1));
-    Json::Value success = Obj("success", true);
-    success["data"] = Obj("a", 1);
-    EXPECT_EQ(success, resp.GetBody());
+    resp.SetError(120, J(R"({"name": "x"})"));
+    EXPECT_EQ(J(R"({"success": false, "error": {"code": 120, "errors": {"name": "x"}}})"), resp.GetBody());
+    resp.SetSuccess(J(R"({"a": 1})"));
+    EXPECT_EQ(J(R"({"success": true, "data": {"a": 1}})"), resp.GetBody());
     EXPECT_EQ(0, resp.GetError());
-
     resp.SetSuccess();
-    EXPECT_EQ(Obj("success", true), resp.GetBody());
+    EXPECT_EQ(J(R"({"success": true})"), resp.GetBody());
 }
 
 TEST(APIResponseBody, PollingTaskAnswerReachesTheHookOnly)
 {
-    Json::Value env = Obj("task_id", "7");
-    env["task_user"] = "admin";
-    APIRequest req = MakeRequest(env);
+    APIRequest req = MakeRequest(R"({"task_id": "7", "task_user": "admin"})");
     APIResponse resp(&req);
     VELA::Test::LogCapture log;
-    resp.SetSuccess(Obj("n", 1));
+    resp.SetSuccess(J(R"({"n": 1})"));
     EXPECT_TRUE(log.Contains("polling task records are not available yet"));
     EXPECT_EQ(Json::Value(true), resp.GetBody()["success"]);
 }
@@ -115,9 +94,7 @@ TEST(APIResponseStatus, DefaultSetUnreadableAndOptions)
 
 TEST(APIResponseRedirect, BuildsLocationOnCurrentHostOrIsRefused)
 {
-    Json::Value env = Obj("HTTPS", "on");
-    env["HTTP_HOST"] = "h";
-    APIRequest req = MakeRequest(env);
+    APIRequest req = MakeRequest(R"({"HTTPS": "on", "HTTP_HOST": "h"})");
     APIResponse resp(&req);
     EXPECT_TRUE(resp.Redirect("p"));
     EXPECT_EQ("https://h/p", resp.GetHeader("Location"));
@@ -125,7 +102,7 @@ TEST(APIResponseRedirect, BuildsLocationOnCurrentHostOrIsRefused)
     EXPECT_TRUE(resp.Redirect("/q?x=1"));
     EXPECT_EQ("https://h/q?x=1", resp.GetHeader("Location"));
 
-    APIRequest plainReq = MakeRequest(Obj("HTTP_HOST", "h:5000"));
+    APIRequest plainReq = MakeRequest(R"({"HTTP_HOST": "h:5000"})");
     APIResponse plain(&plainReq);
     EXPECT_TRUE(plain.Redirect("/"));
     EXPECT_EQ("http://h:5000/", plain.GetHeader("Location"));
@@ -133,7 +110,7 @@ TEST(APIResponseRedirect, BuildsLocationOnCurrentHostOrIsRefused)
     // Refused without a request, with an empty path or a line break.
     APIResponse none(nullptr);
     EXPECT_FALSE(none.Redirect("/p"));
-    APIRequest hReq = MakeRequest(Obj("HTTP_HOST", "h"));
+    APIRequest hReq = MakeRequest(R"({"HTTP_HOST": "h"})");
     APIResponse refused(&hReq);
     EXPECT_FALSE(refused.Redirect(""));
     EXPECT_FALSE(refused.Redirect("/p\r\nSet-Cookie: a=b"));

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <vector>
 
+#include "support/JsonLiteral.h"
 #include "support/TestSupport.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
@@ -35,11 +36,9 @@ TEST(APIResponseCookie, ExpiryFormsAndNow)
     EXPECT_TRUE(resp.AddCookie("sid", "x", "/", -1, "", false, true));
     EXPECT_TRUE(resp.AddCookie("sid", "x", "/", 0, "", false, false));
     EXPECT_TRUE(resp.AddCookie("sid", "x", "/webman", LONG_MIN, "nas.lan", true, false));
-    Json::Value expected(Json::arrayValue);
-    expected.append("sid=x; path=/; expires=Thu, 01-Jan-1970 00:00:01 GMT; httponly");
-    expected.append("sid=x; path=/");
-    expected.append("sid=x; path=/webman; expires=Thu, 01-Jan-1970 00:00:01 GMT; domain=nas.lan; secure");
-    EXPECT_EQ(expected, resp.GetCookies());
+    EXPECT_EQ(J(R"(["sid=x; path=/; expires=Thu, 01-Jan-1970 00:00:01 GMT; httponly", "sid=x; path=/",
+        "sid=x; path=/webman; expires=Thu, 01-Jan-1970 00:00:01 GMT; domain=nas.lan; secure"])"),
+              resp.GetCookies());
 
     // Without a client time the expiry counts from now.
     APIResponse now(nullptr);
@@ -118,11 +117,8 @@ TEST(APIResponseCookie, SameNameTwiceKeepsBothInOrderWithValuesEncoded)
     ASSERT_TRUE(resp.AddCookie("id", "1", "/", 0, "", false, false));
     ASSERT_TRUE(resp.AddCookie("id", "x;y=z", "/", 0, "", false, false));
     ASSERT_TRUE(resp.AddCookie("id", "a\r\nSet-Cookie: b", "/", 0, "", false, false));
-    Json::Value expected(Json::arrayValue);
-    expected.append("id=1; path=/");
-    expected.append("id=x%3By%3Dz; path=/");
-    expected.append("id=a%0D%0ASet-Cookie%3A%20b; path=/");
-    EXPECT_EQ(expected, resp.GetCookies());
+    EXPECT_EQ(J(R"(["id=1; path=/", "id=x%3By%3Dz; path=/", "id=a%0D%0ASet-Cookie%3A%20b; path=/"])"),
+              resp.GetCookies());
 }
 
 TEST(APIResponseCookie, SameSiteEndsTheLine)
@@ -135,11 +131,10 @@ TEST(APIResponseCookie, SameSiteEndsTheLine)
     for (const char* bad : {"strict", "Strict; secure", "Strict\r\nX-A: 1", " None"}) {
         EXPECT_FALSE(resp.AddCookie("id", "s", "/", 0, "", true, true, bad)) << bad;
     }
-    Json::Value expected(Json::arrayValue);
-    expected.append("id=s; path=/; secure; httponly; SameSite=Strict");
-    expected.append("id=s; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT; SameSite=Lax");
-    expected.append("id=; path=/; expires=Thu, 01-Jan-1970 00:00:01 GMT; secure; httponly");
-    EXPECT_EQ(expected, resp.GetCookies());
+    EXPECT_EQ(J(R"(["id=s; path=/; secure; httponly; SameSite=Strict",
+        "id=s; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT; SameSite=Lax",
+        "id=; path=/; expires=Thu, 01-Jan-1970 00:00:01 GMT; secure; httponly"])"),
+              resp.GetCookies());
 }
 
 }  // namespace
