@@ -222,7 +222,9 @@ TEST_F(PermissionCheckTest, TimeoutAddressTokenProtectionAndCutIdRefusals)
     options.idleTimeout = 60;
     const std::string sid = Login("root", options);
     {
+        // Past the idle timeout even a method a page polls is refused.
         Now() += 61;
+        PreparedCall("poll", sid).ExpectRefused(106, "timeout");
         PreparedCall c("get", sid);
         c.ExpectRefused(106, "timeout");
         EXPECT_EQ(AUTH_RESULT_TIMEOUT, c.Req()->GetAuthResult());

@@ -21,7 +21,6 @@ if [ ! -x "$CHROMIUM" ]; then
   exit 77
 fi
 srv_require "a Linux account, PAM, identity switches" node npm useradd chpasswd
-srv_traps
 
 # ---- playwright-core, exactly as the lock file pins it.
 if ! cmp -s "$SRC/tests/browser/package-lock.json" "$WORK/package-lock.json" ||

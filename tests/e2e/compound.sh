@@ -11,7 +11,6 @@ set -u
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
 srv_require "velascgi switches to the identity each API asks for" python3
-srv_traps
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 srv_serve
 

@@ -8,7 +8,6 @@ set -u
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
 srv_require "velascgi switches to the identity each API asks for" cksum cmp
-srv_traps
 
 # ---- The system root: the staged web-API directory, one data volume.
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1

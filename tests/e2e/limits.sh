@@ -8,7 +8,6 @@ set -u
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI WEBAPI SRC -- "$@"
 srv_require "velascgi runs as root under the server" timeout
-srv_traps
 
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 cat >"$ROOT/etc/vela/webapi.conf" <<'CONF'

@@ -3,22 +3,21 @@
 # Linux accounts (a user and a member of the administrators group) log in
 # through PAM with VELA.Auth, then curl calls the sample API with the session
 # cookie and the anti-forgery token, and the refusals of the session check
-# are provoked through the server: crafted or logged-out session ids, an
-# idle session (of a method that polls), a session past its lifetime,
+# are provoked through the server: crafted or logged-out session ids,
 # another client address, a missing or wrong token, a user on an
 # administrators' API. Also: a login with parameters encrypted by openssl.
 # Attacks that must fail: an account named "system" (the dispatcher's
 # run-as name) taken for root, forwarding headers of a client that is no
 # configured proxy, a password in the URL, and the login guard played
 # (blocking an address of the attacker's choice, spraying from forged
-# addresses). (The login API's own rules, the block and the replacement of
-# a session among them: webapi/AuthTest.cpp.)
+# addresses). (The login API's own rules, the block, the replacement of a
+# session and the session settings among them: webapi/AuthTest.cpp; idle
+# and expired sessions: access/PermissionCheckTest.cpp.)
 set -u
 
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
 srv_require "accounts, PAM, identity switches" openssl useradd chpasswd
-srv_traps
 
 # Error codes of VELA.Auth login (webapi/auth/).
 ERR_WRONG_PASSWORD=400
@@ -212,47 +211,6 @@ expect "logout" '"success":true'
 [ -e "$SESSIONS/$SID1" ] && fail "logout: the session file is still there"
 call -b "id=$SID1" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
 expect_error "whoami after logout" 105 noprivilege
-
-# ---- Idle timeout and lifetime: a login made while webapi.conf sets a
-# short idle timeout and lifetime keeps them in its session; the session
-# file's times are then moved back, as root, instead of waiting on the clock.
-cp "$ROOT/etc/vela/webapi.conf" "$TMP/webapi.conf"
-printf 'session_idle_timeout="60"\nsession_lifetime="600"\n' >>"$ROOT/etc/vela/webapi.conf"
-login "login with a short idle timeout" "$USER1" "$PASS1"
-ok=$?
-cp "$TMP/webapi.conf" "$ROOT/etc/vela/webapi.conf"
-STATUS="$URL?api=VELA.Sample&version=1&method=status"
-# age CREATED LASTUSE: seconds ago, written into the session file.
-age() {
-  local now
-  now=$(date +%s)
-  sed -E -e "s/(\"created\" *: *)[0-9]+/\\1$((now - $1))/" -e "s/(\"lastUse\" *: *)[0-9]+/\\1$((now - $2))/" \
-    "$file" >"$file.aged" && chmod 0600 "$file.aged" && mv -f "$file.aged" "$file"
-}
-if [ "$ok" -eq 0 ]; then
-  file=$SESSIONS/$sid
-  grep -qE '"idleTimeout" *: *60[,}[:space:]]' "$file" ||
-    fail "session_idle_timeout=60 is not the session's: $(cat "$file")"
-  grep -qE '"lifetime" *: *600[,}[:space:]]' "$file" ||
-    fail "session_lifetime=600 is not the session's: $(cat "$file")"
-  # A method a page polls ("allowTimeout") answers an idle session, but
-  # cannot bring it back once idle past the timeout (which of the last use
-  # it moves, and the refusals of ordinary methods: access/PermissionCheckTest).
-  age 40 40
-  call -b "id=$sid" -H "X-Vela-Token: $token" "$STATUS"
-  expect "status (allowTimeout) of an idle session" '"success":true' "\"user\":\"$USER1\"" '"idleTimeout":60'
-  age 120 120
-  call -b "id=$sid" -H "X-Vela-Token: $token" "$STATUS"
-  expect_error "status (allowTimeout) after the idle timeout" 106 timeout
-fi
-# Used all along but past its lifetime: over, too.
-if login "login with a short lifetime" "$USER1" "$PASS1"; then
-  file=$SESSIONS/$sid
-  sed -i -E 's/("lifetime" *: *)[0-9]+/\1600/' "$file"
-  age 700 1
-  call -b "id=$sid" -H "X-Vela-Token: $token" "$WHOAMI"
-  expect_error "whoami after the session's lifetime" 106 timeout
-fi
 
 # ---- Wrong passwords and unknown accounts get the same answer. From an
 # address of their own, so that these failures count against no other

@@ -14,7 +14,6 @@ set -u
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "the after-reply work runs as root" seq cmp sleep
-srv_traps
 
 # ---- The system root: the staged web-API directory plus VELA.Pipe.Test of
 # the test handler library, run as root so that its callbacks are too; the

@@ -8,7 +8,8 @@
 #   srv_args NAME... -- ARG...     each NAME the real path of its ARG; exits 2
 #                                  with the usage when the counts differ
 #   srv_require WHY TOOL...        exits 77 (skipped) when a TOOL is missing or
-#                                  when not root (WHY says what needs root)
+#                                  when not root (WHY says what needs root);
+#                                  else srv_traps
 #   srv_traps [COMMAND]            clean-up at exit (COMMAND first), with the
 #                                  logs after a failure
 #   srv_init SRC VELASCGI WEBAPI [private]
@@ -84,6 +85,7 @@ srv_require() {
     echo "SKIP: needs root ($why)"
     exit 77
   fi
+  srv_traps
 }
 
 srv_traps() {

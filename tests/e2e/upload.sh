@@ -9,7 +9,6 @@ set -u
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI VELAADM WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "velascgi stores uploads as root and switches identity" setpriv flock find stat
-srv_traps
 
 # ---- The system root: the staged web-API directory plus VELA.Pipe.Ids of the
 # test handler library, whose "upload" runs as nobody and whose "byDefault"

@@ -47,7 +47,7 @@ protected:
         }
         ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapi + "/lib.def", libDef, 0644));
         ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapi + "/VELA.Auth.lib", desc, 0644));
-        Conf("webapi.conf", "login_max_failures=\"2\"\nsession_idle_timeout=\"600\"\n");
+        Conf("webapi.conf", "login_max_failures=\"2\"\nsession_idle_timeout=\"600\"\nsession_lifetime=\"7200\"\n");
         Pam("pam_permit.so");
     }
 
@@ -123,6 +123,7 @@ TEST_F(Auth, LoginOpensASessionAndSetsTheCookie)
     EXPECT_TRUE(session["tokenProtect"].asBool());
     EXPECT_EQ(token, session["token"].asString());
     EXPECT_EQ(600, session["idleTimeout"].asInt());
+    EXPECT_EQ(7200, session["lifetime"].asInt());
 
     // A new login with the old cookie, over HTTPS: the old session is gone,
     // the new cookie is secure.
