@@ -6,7 +6,6 @@
 
 #include <stdlib.h>
 #include <string>
-#include <vector>
 
 #include "access/PermissionCheck.h"
 #include "dispatcher/PipeFixture.h"
@@ -61,17 +60,13 @@ Json::Value Desc(const std::string& apiLevel = "")
 struct PreparedCall {
     PreparedCall(const std::string& method, const std::string& sid)
     {
-        Json::Value env(Json::objectValue);
-        env["REQUEST_METHOD"] = "GET";
+        Json::Value env = J(R"({"REQUEST_METHOD": "GET"})");
         if (!sid.empty()) {
             env["HTTP_COOKIE"] = "lang=x; id=" + sid;
         }
         Req()->InitEnv(env);
-        Json::Value param;
-        param["getParam"]["api"] = kApi;
-        param["getParam"]["version"] = "1";
-        param["getParam"]["method"] = method;
-        Req()->InitParam(param, true);
+        Req()->InitParam(J(R"({"getParam": {"api": "VELA.Test.Perm", "version": "1", "method": ")" + method + "\"}}"),
+                         true);
         EXPECT_TRUE(runner.CheckRequestParam(Req(), Resp())) << method;
         EXPECT_TRUE(runner.AddAPIInfo(Req()));
     }
@@ -119,15 +114,9 @@ protected:
     }
     long long LastUse(const std::string& sid)
     {
-        std::vector<VELA::Session::Record> all;
-        EXPECT_EQ(0, VELA::Session::List(all));
-        for (const VELA::Session::Record& r : all) {
-            if (r.sid == sid) {
-                return r.lastUse;
-            }
-        }
-        ADD_FAILURE() << "no session " << sid;
-        return -1;
+        Json::Value session;
+        EXPECT_TRUE(VELA::WebAPIUtil::ReadJsonFile(In("/run/vela/sessions/" + sid), session)) << sid;
+        return session["lastUse"].asInt64();
     }
 
     ScopedEnv remote_{"REMOTE_ADDR", kClient};

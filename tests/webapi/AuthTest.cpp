@@ -54,7 +54,8 @@ protected:
     // The PAM service answers every login with `module`.
     void Pam(const char* module)
     {
-        std::ofstream(In("/etc/pam.d/vela-webapi")) << "auth required " << module << "\naccount required pam_permit.so\n";
+        std::ofstream(In("/etc/pam.d/vela-webapi")) << "auth required " << module
+                                                     << "\naccount required pam_permit.so\n";
     }
 
     // One call of `method`; `body` non-empty makes it a form POST. `env`
