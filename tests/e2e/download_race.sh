@@ -16,11 +16,10 @@ srv_require "a root-only file, an unprivileged account, identity switches" perl 
 srv_traps stop_swapper
 SWAPPER=""
 stop_swapper() {
-  if [ -n "$SWAPPER" ]; then
-    kill "$SWAPPER" 2>/dev/null
-    wait "$SWAPPER" 2>/dev/null
-    SWAPPER=""
-  fi
+  [ -n "$SWAPPER" ] || return 0
+  kill "$SWAPPER" 2>/dev/null
+  wait "$SWAPPER" 2>/dev/null
+  SWAPPER=""
 }
 
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1

@@ -29,6 +29,8 @@ cgi_count() {
   done
   echo "$n"
 }
+cgi_at_least() { [ "$(cgi_count)" -ge "$1" ]; }
+cgi_none() { [ "$(cgi_count)" -eq 0 ]; }
 
 # ---- 16 MiB of "&": answered at once (the parser is linear), not after
 # minutes of CPU.
@@ -80,10 +82,7 @@ slow_body "$TMP/slow1"; p1=$!
 slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
 # Started, then a moment to load and take their slots.
-for _ in $(seq 1 400); do
-  [ "$(cgi_count)" -ge 3 ] && break
-  sleep 0.05
-done
+srv_wait 400 0.05 cgi_at_least 3
 sleep 1
 # A fourth request of the same client, while three are under way.
 call "$URL?api=VELA.Sample&version=1&method=echo"
@@ -96,11 +95,7 @@ for f in "$TMP/slow1" "$TMP/slow2" "$TMP/slow3"; do
 done
 grep -q 'nothing arrived for 3 s' "$RUN/cgi.log" || fail "slow body: no log line"
 # Gone once their answers are out (a sanitizer build takes a moment to exit).
-for _ in $(seq 1 100); do
-  [ "$(cgi_count)" -eq 0 ] && break
-  sleep 0.1
-done
-[ "$(cgi_count)" -eq 0 ] || fail "velascgi processes left: $(cgi_count)"
+srv_wait 100 0.1 cgi_none || fail "velascgi processes left: $(cgi_count)"
 # Slots come back when their requests end.
 call "$URL?api=VELA.Sample&version=1&method=echo"
 expect "after the slow bodies" '"code":119'

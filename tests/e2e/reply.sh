@@ -36,14 +36,7 @@ printf 'httpd_name="sleep"\nhttpd_pidfile="/run/standin.pid"\nhttpd_restart_sign
 srv_serve
 
 # wait_for CHECK...: up to a minute until the command CHECK succeeds.
-wait_for() {
-  local _
-  for _ in $(seq 1 600); do
-    "$@" && return 0
-    sleep 0.1
-  done
-  return 1
-}
+wait_for() { srv_wait 600 0.1 "$@"; }
 # The stand-in runs (a zombie, which kill -0 still finds, does not).
 alive() {
   local state

@@ -31,6 +31,8 @@
 #   srv_add_user NAME PASS [GROUP] a Linux account with that password; exits
 #                                  1 when it cannot be made
 #   srv_as_nobody CMD...           runs CMD as the account nobody
+#   srv_wait TRIES PAUSE CMD...    runs CMD until it succeeds (0), at most TRIES
+#                                  times PAUSE seconds apart (else 1)
 #   srv_cleanup                    server, accounts, groups, TMP; call it from
 #                                  the caller's EXIT trap
 #   srv_sanitizer_clean            0 when no sanitizer report is in the logs
@@ -76,15 +78,9 @@ srv_require() {
   local why=$1 tool
   shift
   for tool in lighttpd curl "$@"; do
-    if ! command -v "$tool" >/dev/null 2>&1; then
-      echo "SKIP: $tool is not installed"
-      exit 77
-    fi
+    command -v "$tool" >/dev/null 2>&1 || { echo "SKIP: $tool is not installed"; exit 77; }
   done
-  if [ "$(id -u)" -ne 0 ]; then
-    echo "SKIP: needs root ($why)"
-    exit 77
-  fi
+  [ "$(id -u)" -eq 0 ] || { echo "SKIP: needs root ($why)"; exit 77; }
   srv_traps
 }
 
@@ -121,17 +117,12 @@ expect_status() {
 expect_error() {
   expect "$1" '"success":false'
   grep -qE "\"code\":$2[,}]" "$TMP/body" || fail "$1: not error $2: $(head -c 600 "$TMP/body")"
-  if [ -n "${3:-}" ]; then
-    expect_header "$1" "x-request-error: $3"
-  fi
+  [ -z "${3:-}" ] || expect_header "$1" "x-request-error: $3"
 }
 
 srv_init() {
-  SRV_SRC=$1
-  SRV_VELASCGI=$2
-  if [ "${4:-}" = private ] && [ -d /run ] && [ -w /run ]; then
-    export TMPDIR=/run
-  fi
+  SRV_SRC=$1 SRV_VELASCGI=$2
+  if [ "${4:-}" = private ] && [ -d /run ] && [ -w /run ]; then export TMPDIR=/run; fi
   TMP=$(mktemp -d "${TMPDIR:-/tmp}/vela-e2e-XXXXXX") || return 1
   # Searchable like the real "/": what an account of the run can reach
   # below the root then depends on the modes the server gives its files.
@@ -167,16 +158,12 @@ srv_start() {
   # Sanitizer builds: the options reach velascgi too.
   local var
   for var in ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS; do
-    if [ -n "${!var:-}" ]; then
-      args+=(--env "$var=${!var}")
-    fi
+    [ -z "${!var:-}" ] || args+=(--env "$var=${!var}")
   done
   BASE="" URL=""
   for _ in $(seq 1 20); do
     port=$((20000 + RANDOM % 40000))
-    if (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null; then
-      continue
-    fi
+    (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null && continue
     "$SRV_SRC/scripts/lighttpd-conf.sh" "${args[@]}" --port "$port" || return 1
     lighttpd -D -f "$RUN/lighttpd.conf" 2>>"$RUN/start.log" &
     LPID=$!
@@ -211,20 +198,16 @@ srv_session() {
 }
 
 srv_stop() {
-  if [ -n "$LPID" ]; then
-    kill -TERM "$LPID" 2>/dev/null
-    wait "$LPID" 2>/dev/null
-    LPID=""
-  fi
+  [ -n "$LPID" ] || return 0
+  kill -TERM "$LPID" 2>/dev/null
+  wait "$LPID" 2>/dev/null
+  LPID=""
 }
 
 srv_logs() {
   local log
   for log in start.log error.log cgi.log; do
-    if [ -s "$RUN/$log" ]; then
-      echo "---- $log (last 100 lines)"
-      tail -n 100 "$RUN/$log"
-    fi
+    [ -s "$RUN/$log" ] && echo "---- $log (last 100 lines)" && tail -n 100 "$RUN/$log"
   done
 }
 
@@ -232,13 +215,11 @@ srv_logs() {
 srv_add_user() {
   local name=$1 pass=$2 group=${3:-}
   local args=(-M -N -s /usr/sbin/nologin)
-  if [ -n "$group" ]; then
-    if ! getent group "$group" >/dev/null; then
-      groupadd "$group" || { fail "cannot create the group $group"; exit 1; }
-      SRV_GROUPS+=("$group")
-    fi
-    args+=(-G "$group")
+  if [ -n "$group" ] && ! getent group "$group" >/dev/null; then
+    groupadd "$group" || { fail "cannot create the group $group"; exit 1; }
+    SRV_GROUPS+=("$group")
   fi
+  [ -z "$group" ] || args+=(-G "$group")
   useradd "${args[@]}" "$name" || { fail "cannot create the account $name"; exit 1; }
   SRV_USERS+=("$name")
   printf '%s:%s\n' "$name" "$pass" | chpasswd || { fail "cannot set the password of $name"; exit 1; }
@@ -246,12 +227,20 @@ srv_add_user() {
 
 srv_as_nobody() { setpriv --reuid=nobody --regid="$(id -g nobody)" --clear-groups "$@"; }
 
+srv_wait() {
+  local tries=$1 pause=$2 _
+  shift 2
+  for _ in $(seq 1 "$tries"); do
+    "$@" && return 0
+    sleep "$pause"
+  done
+  return 1
+}
+
 # A random password of letters and digits (no character that needs quoting
 # in a form or a shell).
 srv_password() {
-  local pass
-  pass=$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)
-  printf 'Pw%s' "$pass"
+  printf 'Pw%s' "$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)"
 }
 
 srv_sanitizer_clean() {
@@ -260,10 +249,7 @@ srv_sanitizer_clean() {
 
 srv_finish() {
   srv_sanitizer_clean || fail "sanitizer reports in the logs"
-  if [ "$failures" -ne 0 ]; then
-    echo "$failures check(s) failed"
-    exit 1
-  fi
+  [ "$failures" -eq 0 ] || { echo "$failures check(s) failed"; exit 1; }
   echo "$1"
   exit 0
 }

@@ -31,12 +31,15 @@ head -c 33554432 /dev/urandom >"$TMP/big.bin"
 IDS="$URL?api=VELA.Pipe.Ids&version=1&method=upload"
 DEFERRED="$URL?api=VELA.Sample&version=1&method=upload"
 
-# left: what is in "@tmp" besides the entries named as arguments.
+# left: what is in "@tmp" besides the entries named as arguments; clean:
+# nothing is. found: $partial, a file being stored in "@tmp".
 left() {
   local skip=() name
   for name in "$@"; do skip+=(! -name "$name"); done
   find "$UP" -mindepth 1 -maxdepth 1 "${skip[@]}" -printf '%f ' 2>/dev/null
 }
+clean() { [ -z "$(left)" ]; }
+found() { partial=$(find "$UP" -type f -size +0 -print -quit 2>/dev/null) && [ -n "$partial" ]; }
 
 # ---- A form field naming the method with root's rights: the handler of the
 # method called still runs, as nobody, and sees that method.
@@ -45,7 +48,7 @@ call --cookie "$COOKIE" -F "method=byDefault" -F "f=@$TMP/small.txt" "$IDS"
 expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$nobody_uid,$nobody_uid]" \
   '"method":"upload"' '"methodParam":"upload"'
 [ "$(stat -c %a "$UP")" = 1777 ] || fail "@tmp is $(stat -c %a "$UP") after an upload, not 1777"
-[ -z "$(left)" ] || fail "an upload left $(left)in @tmp"
+clean || fail "an upload left $(left)in @tmp"
 
 # ---- A client that goes away in the middle of a big file, for an upload the
 # front end stores and one the handler reads itself. While it is in flight,
@@ -57,13 +60,7 @@ for target in "$IDS" "$DEFERRED"; do
   name="client gone (${name%%&*})"
   curl -s -o /dev/null --max-time 120 --limit-rate 1M --cookie "$COOKIE" -F "f=@$TMP/big.bin" "$target" &
   client=$!
-  partial=""
-  for _ in $(seq 1 100); do
-    partial=$(find "$UP" -type f -size +0 -print -quit 2>/dev/null)
-    [ -n "$partial" ] && break
-    sleep 0.1
-  done
-  if [ -z "$partial" ]; then
+  if ! srv_wait 100 0.1 found; then
     fail "$name: no partial file appeared in @tmp"
   else
     srv_as_nobody head -c 16 "$partial" >/dev/null 2>&1 && fail "$name: nobody read the partial file $partial"
@@ -75,11 +72,7 @@ for target in "$IDS" "$DEFERRED"; do
   fi
   kill "$client" 2>/dev/null
   wait "$client" 2>/dev/null
-  for _ in $(seq 1 50); do
-    [ -z "$(left)" ] && break
-    sleep 0.1
-  done
-  [ -z "$(left)" ] || fail "$name: left behind in @tmp: $(find "$UP" -mindepth 1 -printf '%P(%s) ')"
+  srv_wait 50 0.1 clean || fail "$name: left behind in @tmp: $(find "$UP" -mindepth 1 -printf '%P(%s) ')"
 done
 
 # ---- Directories of requests that died without removing theirs: the next
