@@ -10,6 +10,7 @@
 #include "access/PermissionCheck.h"
 #include "dispatcher/PipeFixture.h"
 #include "support/JsonLiteral.h"
+#include "support/RequestFacts.h"
 #include "support/TestSupport.h"
 #include "vela/session.h"
 #include "vela/token.h"
@@ -182,16 +183,7 @@ TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlo
     EXPECT_EQ(0, c.Resp()->GetError());
     EXPECT_FALSE(c.Resp()->HasServerError());
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, r->GetAuthResult());
-    EXPECT_EQ("root", r->GetLoginUserName());
-    EXPECT_TRUE(r->IsAdmin());
-    EXPECT_TRUE(r->IsAuthorized());
-    EXPECT_FALSE(r->IsTimeout());
-    EXPECT_FALSE(r->IsSkipCheckIP());
-    EXPECT_EQ(600, r->GetTimeoutDuration());
-    EXPECT_EQ("ger", r->GetUILanguage());
-    EXPECT_EQ("VELA.App", r->GetApplication());
-    EXPECT_EQ("full", r->GetWebAPIPriv());
-    EXPECT_EQ(root_.Path() + "/run/vela/sessions/" + sid, r->GetSessionFilePath());
+    EXPECT_EQ("0011 ger 600 root|VELA.App|full|" + In("/run/vela/sessions/" + sid), VELA::Test::SessionFacts(*r));
     EXPECT_TRUE(r->HasAppPriv(""));
     ASSERT_NE(nullptr, getenv("VELA_WEBAPI_USERNAME"));
     EXPECT_STREQ("root", getenv("VELA_WEBAPI_USERNAME"));

@@ -7,6 +7,7 @@
 #include "platform/StateRootTest.h"
 #include "support/JsonLiteral.h"
 #include "support/LinearTime.h"
+#include "support/RequestFacts.h"
 #include "support/TestSupport.h"
 #include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
@@ -74,16 +75,7 @@ TEST(RequestCookieHeader, ParsedInLinearTime)
 TEST(RequestSessionFacts, DefaultsStoredFactsAndTheirConversions)
 {
     APIRequest r;
-    EXPECT_TRUE(r.IsTimeout());
-    EXPECT_TRUE(r.IsSkipCheckIP());
-    EXPECT_FALSE(r.IsAuthorized());
-    EXPECT_FALSE(r.IsAdmin());
-    EXPECT_EQ("enu", r.GetUILanguage());
-    EXPECT_EQ(0, r.GetTimeoutDuration());
-    EXPECT_EQ("", r.GetLoginUserName());
-    EXPECT_EQ("", r.GetApplication());
-    EXPECT_EQ("", r.GetWebAPIPriv());
-    EXPECT_EQ("", r.GetSessionFilePath());
+    EXPECT_EQ("1100 enu 0 |||", VELA::Test::SessionFacts(r));
     EXPECT_TRUE(r.HasAppPriv(""));
     EXPECT_FALSE(r.HasAppPriv("x"));
     EXPECT_EQ(static_cast<uid_t>(-1), r.GetLoginUID());
@@ -91,16 +83,8 @@ TEST(RequestSessionFacts, DefaultsStoredFactsAndTheirConversions)
     APIRequest s(J(R"({"session": {"username": "alice", "isAdmin": "yes", "isTimeout": 0,
         "isSkipCheckIP": [], "isAuthorized": 2, "timeout": "900", "uiLang": "ger", "app": "a",
         "webapi": "w", "sessFile": "/f", "appPriv": "VELA.App"}})"));
-    EXPECT_EQ("alice", s.GetLoginUserName());
-    EXPECT_TRUE(s.IsAdmin());        // non-empty text counts as true
-    EXPECT_FALSE(s.IsTimeout());     // 0
-    EXPECT_FALSE(s.IsSkipCheckIP()); // empty container
-    EXPECT_TRUE(s.IsAuthorized());
-    EXPECT_EQ(900, s.GetTimeoutDuration());
-    EXPECT_EQ("ger", s.GetUILanguage());
-    EXPECT_EQ("a", s.GetApplication());
-    EXPECT_EQ("w", s.GetWebAPIPriv());
-    EXPECT_EQ("/f", s.GetSessionFilePath());
+    // Non-empty text counts as true, 0 and an empty container as false.
+    EXPECT_EQ("0011 ger 900 alice|a|w|/f", VELA::Test::SessionFacts(s));
     EXPECT_TRUE(s.HasAppPriv("VELA.App"));
     EXPECT_FALSE(s.HasAppPriv(""));
 }
@@ -142,9 +126,7 @@ TEST(RequestAllowUser, BitsFromTheDescription)
     // No list: zero, and nothing stored.
     for (const char* desc : {"{}", R"({"allowUser": "admin.local"})", R"({"allowUser": []})"}) {
         SCOPED_TRACE(desc);
-        Json::Value request(Json::objectValue);
-        request["reqLib"] = J(desc);
-        APIRequest r(request);
+        APIRequest r(J(std::string(R"({"reqLib": )") + desc + "}"));
         EXPECT_EQ(0, r.GetAllowUser());
         EXPECT_EQ(0, r.GetAllowUser());
     }
