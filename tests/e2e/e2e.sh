@@ -87,6 +87,6 @@ rm -f "$ROOT/etc/vela/webapi.conf"
 call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=download&name=../../etc/passwd"
 expect_error "download outside the folder" 101
 # (The refusals of the front end and the registry, the same through the
-# server: webentry/VelascgiTest.cpp.)
+# server: webentry/OutputTest.cpp.)
 
 srv_finish "all end-to-end checks passed ($URL)"
