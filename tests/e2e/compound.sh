@@ -4,8 +4,6 @@
 # text, and every call is checked like a request of its own. A session
 # without administrator rights can never get an administrators-only method
 # run by hiding it in a compound, in sequence or in parallel.
-#
-# usage: compound.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR
 set -u
 
 . "$(dirname "$0")/server.sh"

@@ -44,9 +44,7 @@ expect_error "16 MiB of &" 101
 echo "16 MiB of & answered in $took s"
 
 # ---- "version" texts that are not exactly a number name no version (101),
-# whoever refuses them: "1%00" is refused by lighttpd itself, in the same
-# JSON shape. Other numbers sent as text may carry blanks or a fraction;
-# the version, which selects what runs, may not.
+# refused in the same JSON shape by lighttpd itself ("1%00") or by velascgi.
 for v in '1%00' '1e0' '%201' '%2B1' '1.0' '1.' '0x1' '99999999999999999999'; do
   call "$URL?api=VELA.Sample&version=$v&method=echo"
   expect_error "version $v" 101
@@ -67,9 +65,8 @@ call -H 'Transfer-Encoding: chunked' --data-binary 'api=VELA.Sample&version=1&me
 expect "chunked body" '"code":119'
 
 # ---- Slow bodies: a client that announces 1000 bytes, sends 2 and waits
-# holds a root process only for the idle time, and only a few at once.
-# Each holder keeps its connection open until the server ends it (30 s at
-# most); its answer goes to its own file.
+# holds a root process only for the idle time, and only a few at once. Each
+# holder's answer goes to its own file (30 s at most).
 slow_body() {
   (
     exec 3<>"/dev/tcp/127.0.0.1/$port" || exit 1

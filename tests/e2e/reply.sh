@@ -3,12 +3,9 @@
 # private lighttpd, as in e2e.sh): work a handler leaves for after the reply
 # (a slow callback, a restart of the web server) does not hold the answer
 # open, and generated content (a download read from a pipe) goes out to its
-# end without a length.
-#
-# No check here measures time: the callback of VELA.Pipe.Test's "callback"
-# writes its marker file only when it ends, several seconds after the reply,
-# so the answer must be complete while the marker is still missing, and the
-# marker must appear later.
+# end without a length. No check measures time: the callback writes its
+# marker file only when it ends, seconds after the reply, so the answer must
+# be complete while the marker is still missing.
 set -u
 
 . "$(dirname "$0")/server.sh"

@@ -51,10 +51,9 @@ expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$no
 clean || fail "an upload left $(left)in @tmp"
 
 # ---- A client that goes away in the middle of a big file, for an upload the
-# front end stores and one the handler reads itself. While it is in flight,
-# another local user can neither read the partial file, nor put a file of
-# their own in its place, nor move its directory away; shortly after the
-# client is gone, nothing of it is left.
+# front end stores and one the handler reads itself. In flight, another local
+# user can neither read the partial file, nor replace it, nor move its
+# directory away; shortly after the client is gone, nothing of it is left.
 for target in "$IDS" "$DEFERRED"; do
   name=${target#*api=}
   name="client gone (${name%%&*})"
