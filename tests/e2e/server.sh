@@ -5,38 +5,29 @@
 # the paths its srv_args names and exits 0 when every check passed, 1
 # otherwise, 77 (skipped) without a tool it needs or without root.
 #
-#   srv_args NAME... -- ARG...     each NAME the real path of its ARG; exits 2
-#                                  with the usage when the counts differ
-#   srv_require WHY TOOL...        exits 77 (skipped) when a TOOL is missing or
-#                                  when not root (WHY says what needs root);
-#                                  else srv_traps
-#   srv_traps [COMMAND]            clean-up at exit (COMMAND first), with the
-#                                  logs after a failure
+#   srv_args NAME... -- ARG...     each NAME the real path of its ARG (exit 2
+#                                  with the usage when the counts differ)
+#   srv_require WHY TOOL...        exit 77 without a TOOL or without root (WHY
+#                                  needs it); then srv_traps
+#   srv_traps [COMMAND]            at exit: COMMAND, the logs after a failure,
+#                                  srv_cleanup (server, accounts, groups, TMP)
 #   srv_init SRC VELASCGI WEBAPI [private]
-#                                  TMP, ROOT and RUN (with RUN/www); the root's
-#                                  web-API directory. "private": not below a
-#                                  directory others may write to (/tmp), as
-#                                  X-Sendfile paths must not be
-#   srv_api NAME <DESCRIPTION      the root's web-API directory: links to the
-#                                  staged one, and NAME.lib from standard input
-#   srv_start DOCROOT [ARG...]     lighttpd, ARGs go to scripts/lighttpd-conf.sh;
-#                                  sets BASE (http://127.0.0.1:<port>) and URL
-#                                  (the entry); 1 when it does not start
-#   srv_serve [ARG...]             srv_start RUN/www; exits 1 when it fails
-#   srv_session                    sid: a session of root from 127.0.0.1,
-#                                  made by $VELAADM
-#   srv_stop                       ends it (also done by srv_cleanup)
-#   srv_logs                       the tails of the server's and velascgi's logs
+#                                  TMP, ROOT, RUN (with RUN/www), the root's
+#                                  web-API directory; "private": not below /tmp
+#                                  (X-Sendfile paths must not be)
+#   srv_api NAME <DESCRIPTION      links to the staged web-API directory, and
+#                                  NAME.lib from standard input
+#   srv_start DOCROOT [ARG...]     lighttpd (ARGs to scripts/lighttpd-conf.sh):
+#                                  BASE and URL (the entry), or 1; srv_stop
+#   srv_serve [ARG...]             srv_start RUN/www, or exit 1
+#   srv_session                    sid: a session of root from 127.0.0.1
 #   srv_pam                        the PAM service of deploy/pam in the root
-#   srv_add_user NAME PASS [GROUP] a Linux account with that password; exits
-#                                  1 when it cannot be made
-#   srv_as_nobody CMD...           runs CMD as the account nobody
-#   srv_wait TRIES PAUSE CMD...    runs CMD until it succeeds (0), at most TRIES
-#                                  times PAUSE seconds apart (else 1)
-#   srv_cleanup                    server, accounts, groups, TMP; call it from
-#                                  the caller's EXIT trap
-#   srv_sanitizer_clean            0 when no sanitizer report is in the logs
-#   srv_finish TEXT                exits: 1 after failed checks or sanitizer
+#   srv_add_user NAME PASS [GROUP] a Linux account with that password, or exit 1
+#   srv_password                   a password of letters and digits only
+#   srv_as_nobody CMD...           CMD as the account nobody
+#   srv_wait TRIES PAUSE CMD...    CMD until it succeeds, at most TRIES times
+#                                  PAUSE seconds apart (else 1)
+#   srv_finish TEXT                exit 1 after failed checks or sanitizer
 #                                  reports, else 0 printing TEXT
 #
 # Checks, counted in $failures:
@@ -237,8 +228,7 @@ srv_wait() {
   return 1
 }
 
-# A random password of letters and digits (no character that needs quoting
-# in a form or a shell).
+# (No character that needs quoting in a form or a shell.)
 srv_password() {
   printf 'Pw%s' "$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)"
 }
