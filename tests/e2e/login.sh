@@ -19,11 +19,6 @@ set -u
 srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
 srv_require "accounts, PAM, identity switches" openssl useradd chpasswd
 
-# Error codes of VELA.Auth login (webapi/auth/).
-ERR_WRONG_PASSWORD=400
-ERR_PASSWORD_IN_URL=403
-ERR_BLOCKED=407
-
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 srv_pam
 # Names unique to the run: a run killed before its clean-up cannot collide
@@ -52,11 +47,9 @@ srv_serve
 # ---- Helpers (call, expect, expect_error, fail: server.sh).
 # A string member of the answer.
 member() { sed -n "s/.*\"$1\":\"\\([^\"]*\\)\".*/\\1/p" "$TMP/body"; }
-# The lines velascgi logged from here on: log_mark, then log_since;
-# logged TEXT: one of them holds TEXT.
+# logged TEXT: a line velascgi logged since log_mark holds TEXT.
 log_mark() { log_from=$(($(wc -l <"$RUN/cgi.log" 2>/dev/null || echo 0) + 1)); }
-log_since() { tail -n "+$log_from" "$RUN/cgi.log" 2>/dev/null; }
-logged() { log_since | grep -qF -- "$1" || fail "not in cgi.log: $1: $(log_since | tail -n 5)"; }
+logged() { tail -n "+$log_from" "$RUN/cgi.log" 2>/dev/null | grep -qF -- "$1" || fail "not in cgi.log: $1"; }
 
 AUTH="$URL?api=VELA.Auth&version=1"
 WHOAMI="$URL?api=VELA.Sample&version=1&method=whoami"
@@ -67,23 +60,22 @@ nobody_uid=$(id -u nobody)
 # sets $sid and $token.
 sid="" token=""
 login() {
-  local name=$1 account=$2 passwd=$3
-  shift 3
-  call "$@" --data-urlencode "account=$account" --data-urlencode "passwd=$passwd" "$AUTH&method=login"
+  call "${@:4}" --data-urlencode "account=$2" --data-urlencode "passwd=$3" "$AUTH&method=login"
   sid=$(member sid) token=$(member token)
   if [ "$status" != 200 ] || ! grep -qF '"success":true' "$TMP/body" || [ -z "$sid" ] || [ -z "$token" ]; then
-    fail "$name: login of $account failed (HTTP $status): $(head -c 600 "$TMP/body")"
+    fail "$1: login of $2 failed (HTTP $status): $(head -c 600 "$TMP/body")"
     return 1
   fi
 }
 # login_refused NAME CODE ACCOUNT PASSWORD [CURL ARGS...]: a form login
-# refused with error CODE and no cookie.
+# refused with error CODE and no cookie; login_fails: with 400, a wrong
+# password (407: blocked, 403: a password in the URL).
 login_refused() {
   call "${@:5}" --data-urlencode "account=$3" --data-urlencode "passwd=$4" "$AUTH&method=login"
   expect_error "$1" "$2"
   grep -qi '^Set-Cookie: id=' "$TMP/headers" && fail "$1: a refused login sets a cookie"
 }
-login_fails() { login_refused "$1" "$ERR_WRONG_PASSWORD" "${@:2}"; }
+login_fails() { login_refused "$1" 400 "${@:2}"; }
 
 # ---- A user logs in (the cookie's attributes: webapi/AuthTest.cpp).
 JAR1=$TMP/jar1
@@ -221,7 +213,7 @@ fi
 for i in 1 2 3; do
   login_fails "spray $i" "spray$i$tag" "$PASS1" --interface 127.0.0.6 -H "X-Forwarded-For: 198.51.100.$i"
 done
-login_refused "spray 4 with yet another forged address" "$ERR_BLOCKED" "spray4$tag" "$PASS1" \
+login_refused "spray 4 with yet another forged address" 407 "spray4$tag" "$PASS1" \
   --interface 127.0.0.6 -H "X-Forwarded-For: 198.51.100.4"
 expect "spray 4 with yet another forged address" '"waitSeconds":'
 for i in 1 2 3; do
@@ -235,7 +227,7 @@ login "a login from the address an attacker named" "$USER1" "$PASS1" --interface
 # among them: webapi/AuthTest.cpp).
 log_mark
 call --interface 127.0.0.12 --data "account=$USER1" "$AUTH&method=login&passwd=$PASS1"
-expect_error "password in the query string of a POST" "$ERR_PASSWORD_IN_URL"
+expect_error "password in the query string of a POST" 403
 logged 'login refused: a password in the query string'
 grep -qF -- "$PASS1" "$RUN/cgi.log" && fail "a password is in cgi.log"
 
