@@ -4,6 +4,7 @@
 // check behind WebEntry's permission hooks after Initialize.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <stdlib.h>
 #include <string>
 
@@ -153,11 +154,9 @@ TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticatedOptionalLoginNoR
     EXPECT_EQ(AUTH_RESULT_UNAUTHENTICATED, c.Req()->GetAuthResult());
     EXPECT_FALSE(c.Req()->IsAuthorized());
     EXPECT_EQ(J("[null, -5]"), c.Slots());
-    int refusals = 0;
-    for (const std::string& line : log.Lines()) {
-        refusals += line.find("session check refused") != std::string::npos;
-    }
-    EXPECT_EQ(1, refusals);
+    EXPECT_EQ(1, std::count_if(log.Lines().begin(), log.Lines().end(), [](const std::string& line) {
+                  return line.find("session check refused") != std::string::npos;
+              }));
 
     // Where the login is optional, the same verdict is no refusal and logs
     // nothing.

@@ -22,38 +22,35 @@ template <typename T> APIParameter<T> Param(T const& v, bool invalid = false)
     return p;
 }
 
-void ExpectAll(bool (*check)(std::string const&), std::vector<std::string> const& texts, bool expected)
-{
-    for (auto const& text : texts) {
-        EXPECT_EQ(check(text), expected) << '"' << text << '"';
-    }
-}
-
 TEST(TextFormat, PatternsHostAndAddress)
 {
-    // In the e-mail pattern "+-\" is a range: ":" and "[" lie inside it.
-    ExpectAll(V::IsEMail, {"john.doe@example.com", "a\"b,(c)<d>@host", "a:b[@host"}, true);
-    ExpectAll(V::IsEMail, {"a b@host", "@host", "user@", "user@ho st", ""}, false);
-    ExpectAll(V::IsNetbios, {"a_b-C9", std::string(255, 'a')}, true);
-    ExpectAll(V::IsNetbios, {std::string(256, 'a'), "9abc", "ab.c", ""}, false);
-    // Unanchored: one character outside the forbidden set is enough.
-    ExpectAll(V::IsWorkGroup, {"WORKGROUP", "a;"}, true);
-    ExpectAll(V::IsWorkGroup, {";", "]", "[", "\\", "/", "|?,*+<>:\"", ""}, false);
-    ExpectAll(V::IsDigit, {"007"}, true);
-    ExpectAll(V::IsDigit, {"", "12a", "-1", std::string("12\0x", 4)}, false);
-    ExpectAll(V::IsFarlinkId, {"Ab-12"}, true);
-    ExpectAll(V::IsFarlinkId, {"a_b", ""}, false);
-
-    ExpectAll(V::IsHostname, {"nas-01"}, true);
-    ExpectAll(V::IsHostname, {"-nas", std::string("nas\0-", 5), ""}, false);
-    ExpectAll(V::IsDomain, {"corp.example.com"}, true);
-    ExpectAll(V::IsDomain, {"corp..com", ""}, false);
-    ExpectAll(V::IsIP, {"192.168.0.1", "fe80::1"}, true);
-    ExpectAll(V::IsIP, {"192.168.0.256", std::string("10.0.0.1\0junk", 13), ""}, false);
-    ExpectAll(V::IsIPv4, {"192.168.0.1"}, true);
-    ExpectAll(V::IsIPv4, {"fe80::1", ""}, false);
-    ExpectAll(V::IsIPv6, {"fe80::1"}, true);
-    ExpectAll(V::IsIPv6, {"192.168.0.1", ""}, false);
+    const struct {
+        bool (*check)(std::string const&);
+        std::vector<std::string> valid, invalid;
+    } cases[] = {
+        // In the e-mail pattern "+-\" is a range: ":" and "[" lie inside it.
+        {V::IsEMail, {"john.doe@example.com", "a\"b,(c)<d>@host", "a:b[@host"},
+         {"a b@host", "@host", "user@", "user@ho st", ""}},
+        {V::IsNetbios, {"a_b-C9", std::string(255, 'a')}, {std::string(256, 'a'), "9abc", "ab.c", ""}},
+        // Unanchored: one character outside the forbidden set is enough.
+        {V::IsWorkGroup, {"WORKGROUP", "a;"}, {";", "]", "[", "\\", "/", "|?,*+<>:\"", ""}},
+        {V::IsDigit, {"007"}, {"", "12a", "-1", std::string("12\0x", 4)}},
+        {V::IsFarlinkId, {"Ab-12"}, {"a_b", ""}},
+        {V::IsHostname, {"nas-01"}, {"-nas", std::string("nas\0-", 5), ""}},
+        {V::IsDomain, {"corp.example.com"}, {"corp..com", ""}},
+        {V::IsIP, {"192.168.0.1", "fe80::1"}, {"192.168.0.256", std::string("10.0.0.1\0junk", 13), ""}},
+        {V::IsIPv4, {"192.168.0.1"}, {"fe80::1", ""}},
+        {V::IsIPv6, {"fe80::1"}, {"192.168.0.1", ""}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(&c - cases);
+        for (const std::string& text : c.valid) {
+            EXPECT_TRUE(c.check(text)) << '"' << text << '"';
+        }
+        for (const std::string& text : c.invalid) {
+            EXPECT_FALSE(c.check(text)) << '"' << text << '"';
+        }
+    }
 }
 
 TEST(CheckRegex, BadPatternLogsSharedAcrossThreads)
