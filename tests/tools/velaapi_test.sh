@@ -47,19 +47,14 @@ cli)
     run 2 call VELA.Sample
     run 2 call VELA.Sample echo --bogus
     stderr_has "unknown option"
-    run 2 call VELA.Sample echo novalue
-    run 2 call VELA.Sample echo =x
     run 2 call VELA.Sample echo '{"a": '
     stderr_has "not a JSON object"
-    run 2 call VELA.Sample echo '[1, 2]'
-    run 2 call VELA.Sample echo '{"a": 1}' b=2
-    run 2 call VELA.Sample echo api=VELA.Other
-    run 2 call VELA.Sample echo '{"method": "fail"}'
-    for v in 0 -1 abc 1.5 99999999999 ''; do
-        run 2 call VELA.Sample echo --version "$v"
+    # More parameters and versions refused, each a list of shell words.
+    for args in novalue =x "'[1, 2]'" "'{\"a\": 1}' b=2" api=VELA.Other "'{\"method\": \"fail\"}'" --version \
+        "--version 1 --version 1" "--version 0" "--version -1" "--version abc" "--version 1.5" \
+        "--version 99999999999" "--version ''"; do
+        eval "run 2 call VELA.Sample echo $args"
     done
-    run 2 call VELA.Sample echo --version
-    run 2 call VELA.Sample echo --version 1 --version 1
     run 2 list extra
     run 2 list --version 1
     # Standard input is bounded.
