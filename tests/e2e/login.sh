@@ -89,16 +89,12 @@ expect "whoami with cookie and token" '"success":true' "\"user\":\"$USER1\"" "\"
 call -b "$JAR1" "$WHOAMI&VelaToken=$TOKEN1"
 expect "whoami with VelaToken" '"success":true' "\"user\":\"$USER1\""
 
-# ---- Crafted session ids reach no file: refused like any unknown session,
-# whether they come as the cookie or as "_sid".
-# A NUL byte ("%00", which lighttpd refuses in the URL itself) must not cut
-# a cookie down to the real id either.
+# ---- Crafted session ids reach no file: refused like any unknown session
+# ("_sid" of the query becomes this cookie: webentry/WebEntryTest.cpp). A
+# NUL byte must not cut a cookie down to the real id either.
 for crafted in ../../../etc/passwd ..%2F..%2Fetc%2Fshadow "$SID1/../$SID1" "$SID1%00x"; do
   call -b "id=$crafted" -H "X-Vela-Token: $TOKEN1" "$WHOAMI"
   expect_error "whoami with the cookie id=$crafted" 105 noprivilege
-  case "$crafted" in *%00*) continue ;; esac
-  call -H "X-Vela-Token: $TOKEN1" "$WHOAMI&_sid=$crafted"
-  expect_error "whoami with _sid=$crafted" 105 noprivilege
 done
 
 # ---- The token missing or wrong: refused, and velascgi says why.

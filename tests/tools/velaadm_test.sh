@@ -28,14 +28,13 @@ refused() {
 # ---- usage errors
 refused 2 "usage: velaadm"
 refused 2 "unknown command" frobnicate
-expect 2 session
-expect 2 session frobnicate
-expect 2 session create
+for args in session "session frobnicate" "session create" "session list extra"; do
+    eval "expect 2 $args"
+done
 refused 2 "\-\-timeout must be" session create root --timeout abc
 expect 2 session create root --timeout -5
 refused 2 "needs a value" session create root --ip
 refused 2 "unknown option --bogus" session create root --bogus
-expect 2 session list extra
 expect 0 --help
 stdout_has "session create"
 

@@ -37,8 +37,7 @@ protected:
         const std::string webapi = In("/usr/vela/velaman/webapi");
         ASSERT_EQ(0, system(("mkdir -p '" + webapi + "' '" + In("/etc/pam.d") + "'").c_str()));
         ASSERT_EQ(0, symlink((staged + "/auth").c_str(), (webapi + "/auth").c_str()));
-        Json::Value libDef;
-        Json::Value desc;
+        Json::Value libDef, desc;
         ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(staged + "/lib.def", libDef));
         ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(staged + "/VELA.Auth.lib", desc));
         // Only root can switch to "system"; anyone else runs it as themselves.
