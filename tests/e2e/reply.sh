@@ -32,8 +32,6 @@ printf 'httpd_name="sleep"\nhttpd_pidfile="/run/standin.pid"\nhttpd_restart_sign
   >"$ROOT/etc/vela/webapi.conf"
 srv_serve
 
-# wait_for CHECK...: up to a minute until the command CHECK succeeds.
-wait_for() { srv_wait 600 0.1 "$@"; }
 # The stand-in runs (a zombie, which kill -0 still finds, does not).
 alive() {
   local state
@@ -49,13 +47,13 @@ call "$URL?api=VELA.Pipe.Test&version=1&method=callback&sleep=3&file=$marker"
 expect_status "callback" 200
 expect "callback" '"success":true'
 [ -e "$marker" ] && fail "the answer was held until the callback ended"
-wait_for test -s "$marker" || fail "the callback did not run"
+srv_wait 600 0.1 test -s "$marker" || fail "the callback did not run"
 call "$URL?api=VELA.Pipe.Test&version=1&method=callback&sleep=3&file=$marker.2&restart=1"
 expect "callback and restart" '"success":true'
 [ -e "$marker.2" ] && fail "the answer with a restart was held until the callback ended"
 alive || fail "the answer with a restart was held until the web server was restarted"
-wait_for gone || fail "the web server was not restarted after the reply"
-wait_for test -s "$marker.2" || fail "the callback before the restart did not run"
+srv_wait 600 0.1 gone || fail "the web server was not restarted after the reply"
+srv_wait 600 0.1 test -s "$marker.2" || fail "the callback before the restart did not run"
 kill "$standin" 2>/dev/null
 
 # ---- Generated content: the output of a program, read from a pipe, whole
