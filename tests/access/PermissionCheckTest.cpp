@@ -11,7 +11,7 @@
 #include "access/PermissionCheck.h"
 #include "dispatcher/PipeFixture.h"
 #include "support/JsonLiteral.h"
-#include "support/RequestFacts.h"
+#include "support/SessionFacts.h"
 #include "support/TestSupport.h"
 #include "vela/session.h"
 #include "vela/token.h"

@@ -7,7 +7,7 @@
 #include "platform/StateRootTest.h"
 #include "support/JsonLiteral.h"
 #include "support/LinearTime.h"
-#include "support/RequestFacts.h"
+#include "support/SessionFacts.h"
 #include "support/TestSupport.h"
 #include "vela/vlibc.h"
 #include "webapi/APIRequest.h"
