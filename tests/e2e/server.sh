@@ -35,7 +35,8 @@
 #   call CURL_ARGS...              the answer in $TMP/body, the header block in
 #                                  $TMP/headers, the HTTP status in $status
 #   expect NAME TEXT...            the answer holds every TEXT (compact JSON)
-#   expect_header NAME HEADER      the header block has a line starting so
+#   expect_header NAME HEADER...   the header block has a line starting with
+#                                  each HEADER
 #   expect_status NAME CODE        the HTTP status was CODE
 #   expect_error NAME CODE [WORD]  the answer is error CODE, with the header
 #                                  "x-request-error: WORD" when WORD is given
@@ -98,7 +99,11 @@ expect() {
 }
 
 expect_header() {
-  grep -qi -- "^$2" "$TMP/headers" || fail "$1: no header \"$2\" in: $(tr -d '\r' <"$TMP/headers")"
+  local name=$1 header
+  shift
+  for header in "$@"; do
+    grep -qi -- "^$header" "$TMP/headers" || fail "$name: no header \"$header\" in: $(tr -d '\r' <"$TMP/headers")"
+  done
 }
 
 expect_status() {

@@ -4,7 +4,7 @@
 #   runs STATUS CMD...  runs CMD with standard input from $IN (default empty)
 #                       and checks its exit status
 #   fail TEXT           one failed check, shown with the tool's output
-#   stdout_has TEXT     $OUT holds TEXT (a grep pattern); stderr_has likewise
+#   stdout_has TEXT...  $OUT holds each TEXT (a grep pattern); stderr_has TEXT
 #   stdout_lacks TEXT   $OUT does not hold it
 #   stdout_is TEXT      $OUT is exactly TEXT; stdout_empty: $OUT is empty
 #   finish NAME         exits 1 after failed checks, else 0 saying so
@@ -32,7 +32,11 @@ runs() {
     [ "$got" -eq "$want" ] || fail "$* exited $got, expected $want"
 }
 
-stdout_has() { grep -q -- "$1" "$OUT" || fail "stdout lacks \"$1\""; }
+stdout_has() {
+    for text in "$@"; do
+        grep -q -- "$text" "$OUT" || fail "stdout lacks \"$text\""
+    done
+}
 stderr_has() { grep -q -- "$1" "$ERR" || fail "stderr lacks \"$1\""; }
 stdout_lacks() { ! grep -q -- "$1" "$OUT" || fail "stdout shows \"$1\""; }
 stdout_is() { [ "$(cat "$OUT")" = "$1" ] || fail "stdout is not $1"; }

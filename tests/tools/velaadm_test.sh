@@ -57,10 +57,7 @@ sid2=$(sed -n 's/^sid=//p' "$OUT")
 grep -q '"skipIP":true' "$VELA_ROOT/run/vela/sessions/$sid2" || fail "a session without --ip must skip the address check"
 
 expect 0 session list
-stdout_has "$sid"
-stdout_has "192.0.2.7"
-stdout_has "$sid2"
-stdout_has "nobody"
+stdout_has "$sid" "192.0.2.7" "$sid2" "nobody"
 stdout_lacks "$token"
 
 expect 0 session revoke "$sid"
@@ -87,8 +84,7 @@ case "$tok" in
 esac
 
 expect 0 token list
-stdout_has "$tid"
-stdout_has "VELA.Demo.\*,VELA.Other / get\*"
+stdout_has "$tid" "VELA.Demo.\*,VELA.Other / get\*"
 stdout_lacks "${tok#*.}"
 
 expect 0 token revoke "$tid"
