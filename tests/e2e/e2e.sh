@@ -33,6 +33,9 @@ call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=whoami"
 expect "whoami with session" '"success":true' "\"uid\":[$nobody_uid,$nobody_uid,$nobody_uid]"
 call --cookie "id=not-a-session" "$URL?api=VELA.Sample&version=1&method=whoami&_sid=$sid"
 expect "whoami with _sid" '"success":true' "\"uid\":[$nobody_uid,"
+# A method a page polls ("allowTimeout") answers the session like any other.
+call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=status"
+expect "status" '"success":true' '"user":"root"' '"idleTimeout":'
 
 # ---- Upload: two fields and two files to a method with "allowUpload".
 head -c 1048576 /dev/urandom >"$TMP/one.bin"
