@@ -4,22 +4,20 @@
 // check behind WebEntry's permission hooks after Initialize.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <stdlib.h>
 #include <string>
-#include <sys/stat.h>
-#include <unistd.h>
-#include <vector>
 
 #include "access/PermissionCheck.h"
 #include "dispatcher/PipeFixture.h"
 #include "support/JsonLiteral.h"
+#include "support/SessionFacts.h"
 #include "support/TestSupport.h"
 #include "vela/session.h"
 #include "vela/token.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APIRunner.h"
-#include "webapi/JsonUtil.h"
 #include "webentry/WebEntry.h"
 
 namespace {
@@ -64,23 +62,30 @@ Json::Value Desc(const std::string& apiLevel = "")
 struct PreparedCall {
     PreparedCall(const std::string& method, const std::string& sid)
     {
-        Json::Value env(Json::objectValue);
-        env["REQUEST_METHOD"] = "GET";
+        Json::Value env = J(R"({"REQUEST_METHOD": "GET"})");
         if (!sid.empty()) {
             env["HTTP_COOKIE"] = "lang=x; id=" + sid;
         }
         Req()->InitEnv(env);
-        Json::Value param;
-        param["getParam"]["api"] = kApi;
-        param["getParam"]["version"] = "1";
-        param["getParam"]["method"] = method;
-        Req()->InitParam(param, true);
+        Req()->InitParam(J(R"({"getParam": {"api": "VELA.Test.Perm", "version": "1", "method": ")" + method + "\"}}"),
+                         true);
         EXPECT_TRUE(runner.CheckRequestParam(Req(), Resp())) << method;
         EXPECT_TRUE(runner.AddAPIInfo(Req()));
     }
     APIRequest* Req() { return runner.GetRequest(); }
     APIResponse* Resp() { return runner.GetResponseObject(); }
     bool Check() { return check.CheckPermission(Req(), Resp(), nullptr); }
+    // The check refuses with error `code` and the x-request-error `word`
+    // ("": none; null: not looked at).
+    void ExpectRefused(int code, const char* word = nullptr)
+    {
+        EXPECT_FALSE(Check());
+        EXPECT_EQ(code, Resp()->GetError());
+        if (word != nullptr) {
+            EXPECT_EQ(*word != '\0', Resp()->HasServerError());
+            EXPECT_EQ(word, Resp()->GetServerError());
+        }
+    }
     const Json::Value& Slots() { return check.Verdicts()["permResult"]; }
 
     Runner runner;
@@ -111,15 +116,9 @@ protected:
     }
     long long LastUse(const std::string& sid)
     {
-        std::vector<VELA::Session::Record> all;
-        EXPECT_EQ(0, VELA::Session::List(all));
-        for (const VELA::Session::Record& r : all) {
-            if (r.sid == sid) {
-                return r.lastUse;
-            }
-        }
-        ADD_FAILURE() << "no session " << sid;
-        return -1;
+        Json::Value session;
+        EXPECT_TRUE(VELA::WebAPIUtil::ReadJsonFile(In("/run/vela/sessions/" + sid), session)) << sid;
+        return session["lastUse"].asInt64();
     }
 
     ScopedEnv remote_{"REMOTE_ADDR", kClient};
@@ -151,27 +150,21 @@ TEST_F(PermissionCheckTest, NoSessionAndNoTokenIsUnauthenticatedOptionalLoginNoR
 {
     LogCapture log;
     PreparedCall c("get", "");
-    EXPECT_FALSE(c.Check());
-    EXPECT_EQ(119, c.Resp()->GetError());
-    EXPECT_EQ("unauth", c.Resp()->GetServerError());
+    c.ExpectRefused(119, "unauth");
     EXPECT_EQ(AUTH_RESULT_UNAUTHENTICATED, c.Req()->GetAuthResult());
     EXPECT_FALSE(c.Req()->IsAuthorized());
     EXPECT_EQ(J("[null, -5]"), c.Slots());
-    int refusals = 0;
-    for (const std::string& line : log.Lines()) {
-        refusals += line.find("session check refused") != std::string::npos;
-    }
-    EXPECT_EQ(1, refusals);
+    EXPECT_EQ(1, std::count_if(log.Lines().begin(), log.Lines().end(), [](const std::string& line) {
+                  return line.find("session check refused") != std::string::npos;
+              }));
 
     // Where the login is optional, the same verdict is no refusal and logs
     // nothing.
     Declare(Desc(R"({"authLevel": 2})"));
     LogCapture optionalLog;
     PreparedCall optional("get", "");
-    EXPECT_FALSE(optional.Check());
+    optional.ExpectRefused(119, "unauth");
     EXPECT_TRUE(PermissionCheck::SkipPermission(optional.Req()));
-    EXPECT_EQ(119, optional.Resp()->GetError());
-    EXPECT_EQ("unauth", optional.Resp()->GetServerError());
     EXPECT_FALSE(optionalLog.Contains("session check refused"));
 }
 
@@ -189,16 +182,7 @@ TEST_F(PermissionCheckTest, ValidSessionGivesItsFactsAndTheVerdictIsCachedPerSlo
     EXPECT_EQ(0, c.Resp()->GetError());
     EXPECT_FALSE(c.Resp()->HasServerError());
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, r->GetAuthResult());
-    EXPECT_EQ("root", r->GetLoginUserName());
-    EXPECT_TRUE(r->IsAdmin());
-    EXPECT_TRUE(r->IsAuthorized());
-    EXPECT_FALSE(r->IsTimeout());
-    EXPECT_FALSE(r->IsSkipCheckIP());
-    EXPECT_EQ(600, r->GetTimeoutDuration());
-    EXPECT_EQ("ger", r->GetUILanguage());
-    EXPECT_EQ("VELA.App", r->GetApplication());
-    EXPECT_EQ("full", r->GetWebAPIPriv());
-    EXPECT_EQ(root_.Path() + "/run/vela/sessions/" + sid, r->GetSessionFilePath());
+    EXPECT_EQ("0011 ger 600 root|VELA.App|full|" + In("/run/vela/sessions/" + sid), VELA::Test::SessionFacts(*r));
     EXPECT_TRUE(r->HasAppPriv(""));
     ASSERT_NE(nullptr, getenv("VELA_WEBAPI_USERNAME"));
     EXPECT_STREQ("root", getenv("VELA_WEBAPI_USERNAME"));
@@ -218,21 +202,17 @@ TEST_F(PermissionCheckTest, TimeoutAddressTokenProtectionAndCutIdRefusals)
     options.idleTimeout = 60;
     const std::string sid = Login("root", options);
     {
+        // Past the idle timeout even a method a page polls is refused.
         Now() += 61;
+        PreparedCall("poll", sid).ExpectRefused(106, "timeout");
         PreparedCall c("get", sid);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(106, c.Resp()->GetError());
-        EXPECT_EQ("timeout", c.Resp()->GetServerError());
+        c.ExpectRefused(106, "timeout");
         EXPECT_EQ(AUTH_RESULT_TIMEOUT, c.Req()->GetAuthResult());
     }
     const std::string other = Login("root");
     {
         ScopedEnv moved("REMOTE_ADDR", "198.51.100.1");
-        PreparedCall c("get", other);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(150, c.Resp()->GetError());
-        EXPECT_EQ("errorip", c.Resp()->GetServerError());
-
+        PreparedCall("get", other).ExpectRefused(150, "errorip");
         PreparedCall anywhere("anywhere", other);
         EXPECT_TRUE(anywhere.Check());
         EXPECT_EQ("root", anywhere.Req()->GetLoginUserName());
@@ -241,18 +221,14 @@ TEST_F(PermissionCheckTest, TimeoutAddressTokenProtectionAndCutIdRefusals)
     const std::string guarded = Login("root", options);
     {
         LogCapture log;
-        PreparedCall c("get", guarded);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(105, c.Resp()->GetError());
-        EXPECT_EQ("noprivilege", c.Resp()->GetServerError());
+        PreparedCall("get", guarded).ExpectRefused(105, "noprivilege");
         EXPECT_TRUE(log.Contains("WebEntry:566 Token Authentication Fail."));
     }
     {
         // A session id cut by a NUL byte names no session.
         PreparedCall c("get", other + "%00x");
         ASSERT_EQ(other + std::string(1, '\0') + "x", c.Req()->GetSessionID());
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(105, c.Resp()->GetError());
+        c.ExpectRefused(105);
         EXPECT_EQ(AUTH_RESULT_NO_SESSION, c.Req()->GetAuthResult());
         EXPECT_EQ("", c.Req()->GetLoginUserName());
     }
@@ -268,10 +244,7 @@ TEST_F(PermissionCheckTest, AllowTimeoutDoesNotMoveTheLastUse)
         EXPECT_EQ(J("[1, null]"), c.Slots());
     }
     EXPECT_EQ(kStart, LastUse(sid));
-    {
-        PreparedCall c("get", sid);
-        EXPECT_TRUE(c.Check());
-    }
+    EXPECT_TRUE(PreparedCall("get", sid).Check());
     EXPECT_EQ(kStart + 100, LastUse(sid));
 }
 
@@ -295,46 +268,34 @@ TEST_F(PermissionCheckTest, UserClassesAndApplicationPrivilege)
     };
     for (const auto& c : cases) {
         Declare(Desc(c.apiLevel));
+        SCOPED_TRACE(std::string(c.apiLevel) + " " + c.method);
         PreparedCall call(c.method, c.sid);
-        EXPECT_EQ(c.allowed, call.Check()) << c.apiLevel << " " << c.method;
-        if (!c.allowed) {
-            EXPECT_EQ(105, call.Resp()->GetError());
-            EXPECT_FALSE(call.Resp()->HasServerError());
+        if (c.allowed) {
+            EXPECT_TRUE(call.Check());
+        } else {
+            call.ExpectRefused(105, "");
         }
     }
 
     // An application privilege is checked from the client address.
     Declare(Desc(R"({"appPriv": "VELA.Photo"})"));
-    {
-        PreparedCall c("get", normal);
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(105, c.Resp()->GetError());
-    }
+    PreparedCall("get", normal).ExpectRefused(105);
     {
         PreparedCall c("get", admin);
         ASSERT_TRUE(c.Check());
         EXPECT_TRUE(c.Req()->HasAppPriv("VELA.Photo"));
     }
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc").c_str(), 0755));
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc/vela").c_str(), 0755));
-    ASSERT_TRUE(VELA::JsonWriteFile(root_.Path() + "/etc/vela/app_privileges.json",
-                                    J(R"({"applications": {"VELA.Photo": {"users": ["daemon"],
-                                        "allow_from": ["192.0.2.0/24"]}}})")));
-    {
-        PreparedCall c("get", normal);
-        EXPECT_TRUE(c.Check());
-    }
+    Conf("app_privileges.json",
+         R"({"applications": {"VELA.Photo": {"users": ["daemon"], "allow_from": ["192.0.2.0/24"]}}})");
+    EXPECT_TRUE(PreparedCall("get", normal).Check());
 }
 
 // The judgement of a caller that already acts as the user (velaapi): the
 // description's rules without a session, with no refusal logged or set.
 TEST_F(PermissionCheckTest, UserMayCallJudgesTheDescriptionWithoutASession)
 {
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc").c_str(), 0755));
-    ASSERT_EQ(0, mkdir((root_.Path() + "/etc/vela").c_str(), 0755));
-    ASSERT_TRUE(VELA::JsonWriteFile(root_.Path() + "/etc/vela/app_privileges.json",
-                                    J(R"({"applications": {"VELA.Open": {"users": ["daemon"]},
-                                        "VELA.Near": {"users": ["daemon"], "allow_from": ["192.0.2.0/24"]}}})")));
+    Conf("app_privileges.json", R"({"applications": {"VELA.Open": {"users": ["daemon"]},
+        "VELA.Near": {"users": ["daemon"], "allow_from": ["192.0.2.0/24"]}}})");
     const struct {
         const char* apiLevel;
         const char* method;
@@ -382,17 +343,20 @@ TEST_F(PermissionCheckTest, AccessTokenGrantsOnlyItsMethods)
         EXPECT_FALSE(c.Req()->IsAdmin());
         EXPECT_EQ("", c.Req()->GetSessionFilePath());
         EXPECT_STREQ("daemon", getenv("VELA_WEBAPI_USERNAME"));
+        // Another call of the same client, to "poll": the cached verdict on
+        // "get" does not open it (a compound's calls share one check).
+        APIRequest sub(*c.Req());
+        sub.InitParam(J(R"({"postParam": {"method": "poll"}})"), false);
+        APIResponse subResp(&sub);
+        EXPECT_FALSE(c.check.CheckPermission(&sub, &subResp, nullptr));
+        EXPECT_EQ(119, subResp.GetError());
+        EXPECT_TRUE(c.Check());  // and "get" is still granted
     }
-    {
-        // A stale session cookie falls back to the token.
-        PreparedCall c("get", std::string(VELA_SESSION_ID_LEN, 'A'));
-        EXPECT_TRUE(c.Check());
-    }
+    // A stale session cookie falls back to the token.
+    EXPECT_TRUE(PreparedCall("get", std::string(VELA_SESSION_ID_LEN, 'A')).Check());
     {
         PreparedCall c("poll", "");
-        EXPECT_FALSE(c.Check());
-        EXPECT_EQ(119, c.Resp()->GetError());
-        EXPECT_EQ("unauth", c.Resp()->GetServerError());
+        c.ExpectRefused(119, "unauth");
         EXPECT_EQ("", c.Req()->GetLoginUserName());
     }
 }
@@ -434,27 +398,11 @@ TEST_F(PermissionCheckTest, WebEntryHooksCheckTheSessionOfItsRequest)
 // client, checked by the runner's one PermissionCheck.
 TEST_F(PermissionCheckTest, EveryCallOfOneClientIsCheckedOnItsOwn)
 {
-    const std::string sid = Login("daemon");
-    {
-        PreparedCall c("get", sid);
-        APIRequest sub(*c.Req());  // copied before the check: no facts yet
-        ASSERT_TRUE(c.Check());
-        APIResponse subResp(&sub);
-        ASSERT_TRUE(c.check.CheckPermission(&sub, &subResp, nullptr));
-        EXPECT_EQ("daemon", sub.GetLoginUserName());  // the cached verdict brings its facts
-    }
-    // A token granted for "get" only: the cached verdict does not open "poll".
-    std::string token, id;
-    ASSERT_EQ(0, VelaAccessTokenCreate("daemon", {"VELA.Test.*"}, {"get"}, 0, token, id));
-    ScopedEnv tid("velaAccessToken", token.c_str());
-    PreparedCall c("get", "");
+    PreparedCall c("get", Login("daemon"));
+    APIRequest sub(*c.Req());  // copied before the check: no facts yet
     ASSERT_TRUE(c.Check());
-    APIRequest sub(*c.Req());
-    Json::Value poll;
-    poll["postParam"]["method"] = "poll";
-    sub.InitParam(poll, false);
     APIResponse subResp(&sub);
-    EXPECT_FALSE(c.check.CheckPermission(&sub, &subResp, nullptr));
-    EXPECT_EQ(119, subResp.GetError());
-    EXPECT_TRUE(c.Check());  // and "get" is still granted
+    ASSERT_TRUE(c.check.CheckPermission(&sub, &subResp, nullptr));
+    EXPECT_EQ("daemon", sub.GetLoginUserName());  // the cached verdict brings its facts
+    // (A call the cached verdict does not open: AccessTokenGrantsOnlyItsMethods.)
 }

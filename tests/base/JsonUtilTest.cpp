@@ -3,7 +3,6 @@
 // the search in arrays.
 #include <gtest/gtest.h>
 
-#include <fstream>
 #include <sys/stat.h>
 
 #include "support/JsonLiteral.h"
@@ -66,31 +65,21 @@ TEST(JsonToString, EveryByteOutsideUTF8BecomesOneReplacementCharacter)
     EXPECT_EQ("{\"k" + R + "\":\"\\u0001\\\"" + R + R + R + "\"}", VELA::JsonToString(object));
 }
 
-TEST(JsonUtil, ParseRefusesGarbageAndExtremeNesting)
-{
-    Json::Value v(5);
-    EXPECT_FALSE(VELA::JsonParse("{\"a\": 1} trailing", v));
-    EXPECT_FALSE(VELA::JsonParse("", v));
-    EXPECT_FALSE(VELA::JsonParse(std::string(100000, '['), v));
-    EXPECT_EQ(Json::Value(5), v);
-    EXPECT_TRUE(VELA::JsonParse(std::string(100, '[') + std::string(100, ']'), v));
-}
-
-TEST(JsonUtil, WriteIsAtomicAndReadable)
+// Thin over the platform's parser and files (platform/system/WebAPIUtilTest):
+// the mode reaches the file, and a failure leaves the value alone.
+TEST(JsonUtil, ParseAndFilesKeepThePlatformsContract)
 {
     VELA::Test::TempDir dir;
     const std::string path = dir.Path() + "/doc.json";
     ASSERT_TRUE(VELA::JsonWriteFile(path, J(R"({"a": [1, "x"]})"), 0600));
     Json::Value back;
     ASSERT_TRUE(VELA::JsonReadFile(path, back));
-    EXPECT_EQ(J(R"({"a": [1, "x"]})"), back);
     struct stat st;
     ASSERT_EQ(0, stat(path.c_str(), &st));
     EXPECT_EQ(0600u, st.st_mode & 0777);
-    EXPECT_FALSE(VELA::JsonWriteFile(dir.Path() + "/no/such/dir/doc.json", 1));
     EXPECT_FALSE(VELA::JsonReadFile(dir.Path() + "/missing.json", back));
-    std::ofstream(dir.Path() + "/bad.json") << "{\"a\":";
-    EXPECT_FALSE(VELA::JsonReadFile(dir.Path() + "/bad.json", back));
+    EXPECT_FALSE(VELA::JsonParse("{\"a\": 1} trailing", back));
+    EXPECT_EQ(J(R"({"a": [1, "x"]})"), back);
 }
 
 TEST(JsonUtil, SearchArrayIndexByJsonEquality)

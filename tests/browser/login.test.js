@@ -32,32 +32,18 @@ function check(ok, message) {
 // Waits until the sign-in is over: the whoami answer or the error shown.
 // Their texts ("" for the one not shown).
 async function outcome(page) {
-  await page.waitForFunction(() => ["user", "error"].some((id) => {
-    const e = document.getElementById(id);
-    return !e.closest("[hidden]") && e.textContent.trim() !== "";
-  }), null, { timeout: STEP_MS });
-  return page.evaluate(() => {
+  const shown = await page.waitForFunction(() => {
     const text = (id) => (document.getElementById(id).closest("[hidden]") ? "" : document.getElementById(id).textContent.trim());
-    return { user: text("user"), error: text("error") };
-  });
+    const o = { user: text("user"), error: text("error") };
+    return o.user !== "" || o.error !== "" ? o : null;
+  }, null, { timeout: STEP_MS });
+  return shown.jsonValue();
 }
 
 async function signIn(page, passwd) {
   await page.fill("#account", account);
   await page.fill("#passwd", passwd);
   await page.click("#submit");
-}
-
-async function main() {
-  await run();
-  if (failures !== 0) {
-    console.log("---- what the page did");
-    console.log(pageLog.join("\n"));
-    console.log(`${failures} check(s) failed`);
-    return 1;
-  }
-  console.log("browser login checks passed");
-  return 0;
 }
 
 async function run() {
@@ -123,15 +109,16 @@ async function run() {
       return (await r.json()).error;
     });
     check(status && status.code === 119, `whoami after signing out: ${JSON.stringify(status)}`);
-  } catch (e) {
-    console.log(`FAIL: ${e.message}`);
-    failures++;
   } finally {
     await browser.close();
   }
 }
 
-main().then((code) => process.exit(code), (e) => {
-  console.log(`FAIL: ${e.stack || e}`);
-  process.exit(1);
+run().catch((e) => check(false, e.stack || e)).then(() => {
+  if (failures !== 0) {
+    console.log(`---- what the page did\n${pageLog.join("\n")}\n${failures} check(s) failed`);
+  } else {
+    console.log("browser login checks passed");
+  }
+  process.exit(failures === 0 ? 0 : 1);
 });

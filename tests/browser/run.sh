@@ -11,23 +11,18 @@
 # (the account, PAM and the identity switches need it).
 set -u
 
-[ $# -eq 4 ] || { echo "usage: run.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR WORK_DIR" >&2; exit 2; }
-VELASCGI=$(realpath -e "$1") || exit 1
-WEBAPI=$(realpath -e "$2") || exit 1
-SRC=$(realpath -e "$3") || exit 1
-WORK=$4
+. "$(dirname "$0")/../e2e/server.sh"
+mkdir -p "${4:?usage: run.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR WORK_DIR}" || exit 1
+srv_args VELASCGI WEBAPI SRC WORK -- "$@"
 
 CHROMIUM=${CHROMIUM:-/usr/bin/chromium}
 if [ ! -x "$CHROMIUM" ]; then
   echo "SKIP: $CHROMIUM is not installed"
   exit 77
 fi
-. "$SRC/tests/e2e/server.sh"
 srv_require "a Linux account, PAM, identity switches" node npm useradd chpasswd
-srv_traps
 
 # ---- playwright-core, exactly as the lock file pins it.
-mkdir -p "$WORK" || exit 1
 if ! cmp -s "$SRC/tests/browser/package-lock.json" "$WORK/package-lock.json" ||
    [ ! -f "$WORK/node_modules/playwright-core/package.json" ]; then
   cp "$SRC/tests/browser/package.json" "$SRC/tests/browser/package-lock.json" "$WORK/" || exit 1
@@ -40,19 +35,12 @@ fi
 
 # ---- The server and an account.
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
-mkdir -p "$ROOT/etc/pam.d"
-cp "$SRC/deploy/pam/vela-webapi" "$ROOT/etc/pam.d/vela-webapi" || exit 1
+srv_pam
 account="vtw$(printf '%04x%04x' $RANDOM $RANDOM)"
 password=$(srv_password)
-srv_add_user "$account" "$password" || { echo "FAIL: cannot create $account"; exit 1; }
+srv_add_user "$account" "$password"
 srv_start "$SRC/deploy/www" || { failures=1; exit 1; }
 
 NODE_PATH="$WORK/node_modules" CHROMIUM="$CHROMIUM" \
-  node "$SRC/tests/browser/login.test.js" "$BASE" "$account" "$password"
-rc=$?
-if [ "$rc" -eq 0 ] && ! srv_sanitizer_clean; then
-  echo "FAIL: sanitizer reports in the logs"
-  rc=1
-fi
-[ "$rc" -eq 0 ] || failures=1
-exit "$rc"
+  node "$SRC/tests/browser/login.test.js" "$BASE" "$account" "$password" || fail "the page's checks"
+srv_finish "browser login passed"

@@ -8,7 +8,6 @@ set -u
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI WEBAPI SRC -- "$@"
 srv_require "velascgi runs as root under the server" timeout
-srv_traps
 
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 cat >"$ROOT/etc/vela/webapi.conf" <<'CONF'
@@ -30,6 +29,8 @@ cgi_count() {
   done
   echo "$n"
 }
+cgi_at_least() { [ "$(cgi_count)" -ge "$1" ]; }
+cgi_none() { [ "$(cgi_count)" -eq 0 ]; }
 
 # ---- 16 MiB of "&": answered at once (the parser is linear), not after
 # minutes of CPU.
@@ -39,16 +40,14 @@ call --data-binary "@$TMP/amps" -H 'Content-Type: application/x-www-form-urlenco
 took=$(($(date +%s) - start))
 # The answer itself is the check (curl gives up after 60 s; the quadratic
 # parser took many minutes); the time is printed, not judged.
-expect "16 MiB of &" '"success":false' '"code":101'
+expect_error "16 MiB of &" 101
 echo "16 MiB of & answered in $took s"
 
 # ---- "version" texts that are not exactly a number name no version (101),
-# whoever refuses them: "1%00" is refused by lighttpd itself, in the same
-# JSON shape. Other numbers sent as text may carry blanks or a fraction;
-# the version, which selects what runs, may not.
+# refused in the same JSON shape by lighttpd itself ("1%00") or by velascgi.
 for v in '1%00' '1e0' '%201' '%2B1' '1.0' '1.' '0x1' '99999999999999999999'; do
   call "$URL?api=VELA.Sample&version=$v&method=echo"
-  expect "version $v" '"success":false' '"code":101'
+  expect_error "version $v" 101
   expect_header "version $v" 'Content-Type: application/json'
 done
 call "$URL?api=VELA.Sample&version=1&method=echo"
@@ -56,19 +55,18 @@ expect "version 1 reaches the session check" '"code":119'
 
 # ---- lighttpd's other refusals answer JSON too.
 call -H "X-Big: $(head -c 70000 /dev/zero | tr '\0' a)" "$URL?api=VELA.Sample&version=1&method=echo"
-expect "header too large" '"success":false' '"code":101'
+expect_error "header too large" 101
 call "$BASE/no-such-page"
 expect_status "missing page" 404
-expect "missing page" '"success":false' '"code":101'
+expect_error "missing page" 101
 
 # ---- A chunked body reaches the API like one with a length.
 call -H 'Transfer-Encoding: chunked' --data-binary 'api=VELA.Sample&version=1&method=echo' "$URL"
 expect "chunked body" '"code":119'
 
 # ---- Slow bodies: a client that announces 1000 bytes, sends 2 and waits
-# holds a root process only for the idle time, and only a few at once.
-# Each holder keeps its connection open until the server ends it (30 s at
-# most); its answer goes to its own file.
+# holds a root process only for the idle time, and only a few at once. Each
+# holder's answer goes to its own file (30 s at most).
 slow_body() {
   (
     exec 3<>"/dev/tcp/127.0.0.1/$port" || exit 1
@@ -81,10 +79,7 @@ slow_body "$TMP/slow1"; p1=$!
 slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
 # Started, then a moment to load and take their slots.
-for _ in $(seq 1 400); do
-  [ "$(cgi_count)" -ge 3 ] && break
-  sleep 0.05
-done
+srv_wait 400 0.05 cgi_at_least 3
 sleep 1
 # A fourth request of the same client, while three are under way.
 call "$URL?api=VELA.Sample&version=1&method=echo"
@@ -97,11 +92,7 @@ for f in "$TMP/slow1" "$TMP/slow2" "$TMP/slow3"; do
 done
 grep -q 'nothing arrived for 3 s' "$RUN/cgi.log" || fail "slow body: no log line"
 # Gone once their answers are out (a sanitizer build takes a moment to exit).
-for _ in $(seq 1 100); do
-  [ "$(cgi_count)" -eq 0 ] && break
-  sleep 0.1
-done
-[ "$(cgi_count)" -eq 0 ] || fail "velascgi processes left: $(cgi_count)"
+srv_wait 100 0.1 cgi_none || fail "velascgi processes left: $(cgi_count)"
 # Slots come back when their requests end.
 call "$URL?api=VELA.Sample&version=1&method=echo"
 expect "after the slow bodies" '"code":119'

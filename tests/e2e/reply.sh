@@ -3,18 +3,14 @@
 # private lighttpd, as in e2e.sh): work a handler leaves for after the reply
 # (a slow callback, a restart of the web server) does not hold the answer
 # open, and generated content (a download read from a pipe) goes out to its
-# end without a length.
-#
-# No check here measures time: the callback of VELA.Pipe.Test's "callback"
-# writes its marker file only when it ends, several seconds after the reply,
-# so the answer must be complete while the marker is still missing, and the
-# marker must appear later.
+# end without a length. No check measures time: the callback writes its
+# marker file only when it ends, seconds after the reply, so the answer must
+# be complete while the marker is still missing.
 set -u
 
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "the after-reply work runs as root" seq cmp sleep
-srv_traps
 
 # ---- The system root: the staged web-API directory plus VELA.Pipe.Test of
 # the test handler library, run as root so that its callbacks are too; the
@@ -36,15 +32,6 @@ printf 'httpd_name="sleep"\nhttpd_pidfile="/run/standin.pid"\nhttpd_restart_sign
   >"$ROOT/etc/vela/webapi.conf"
 srv_serve
 
-# wait_for CHECK...: up to a minute until the command CHECK succeeds.
-wait_for() {
-  local _
-  for _ in $(seq 1 600); do
-    "$@" && return 0
-    sleep 0.1
-  done
-  return 1
-}
 # The stand-in runs (a zombie, which kill -0 still finds, does not).
 alive() {
   local state
@@ -60,13 +47,13 @@ call "$URL?api=VELA.Pipe.Test&version=1&method=callback&sleep=3&file=$marker"
 expect_status "callback" 200
 expect "callback" '"success":true'
 [ -e "$marker" ] && fail "the answer was held until the callback ended"
-wait_for test -s "$marker" || fail "the callback did not run"
+srv_wait 600 0.1 test -s "$marker" || fail "the callback did not run"
 call "$URL?api=VELA.Pipe.Test&version=1&method=callback&sleep=3&file=$marker.2&restart=1"
 expect "callback and restart" '"success":true'
 [ -e "$marker.2" ] && fail "the answer with a restart was held until the callback ended"
 alive || fail "the answer with a restart was held until the web server was restarted"
-wait_for gone || fail "the web server was not restarted after the reply"
-wait_for test -s "$marker.2" || fail "the callback before the restart did not run"
+srv_wait 600 0.1 gone || fail "the web server was not restarted after the reply"
+srv_wait 600 0.1 test -s "$marker.2" || fail "the callback before the restart did not run"
 kill "$standin" 2>/dev/null
 
 # ---- Generated content: the output of a program, read from a pipe, whole
@@ -74,8 +61,7 @@ kill "$standin" 2>/dev/null
 seq 1 300000 >"$TMP/expected"
 call -H "Range: bytes=0-9" "$URL?api=VELA.Pipe.Test&version=1&method=stream&count=300000"
 expect_status "stream" 200
-expect_header "stream" 'Content-Type: text/plain'
-expect_header "stream" 'Accept-Ranges: none'
+expect_header "stream" 'Content-Type: text/plain' 'Accept-Ranges: none'
 cmp -s "$TMP/expected" "$TMP/body" || fail "stream: the body is not the program's output ($(wc -c <"$TMP/body") bytes)"
 
 srv_finish "all reply checks passed ($URL)"

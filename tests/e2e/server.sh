@@ -5,32 +5,29 @@
 # the paths its srv_args names and exits 0 when every check passed, 1
 # otherwise, 77 (skipped) without a tool it needs or without root.
 #
-#   srv_args NAME... -- ARG...     each NAME the real path of its ARG; exits 2
-#                                  with the usage when the counts differ
-#   srv_require WHY TOOL...        exits 77 (skipped) when a TOOL is missing or
-#                                  when not root (WHY says what needs root)
-#   srv_traps [COMMAND]            clean-up at exit (COMMAND first), with the
-#                                  logs after a failure
+#   srv_args NAME... -- ARG...     each NAME the real path of its ARG (exit 2
+#                                  with the usage when the counts differ)
+#   srv_require WHY TOOL...        exit 77 without a TOOL or without root (WHY
+#                                  needs it); then srv_traps
+#   srv_traps [COMMAND]            at exit: COMMAND, the logs after a failure,
+#                                  srv_cleanup (server, accounts, groups, TMP)
 #   srv_init SRC VELASCGI WEBAPI [private]
-#                                  TMP, ROOT and RUN (with RUN/www); the root's
-#                                  web-API directory. "private": not below a
-#                                  directory others may write to (/tmp), as
-#                                  X-Sendfile paths must not be
-#   srv_api NAME <DESCRIPTION      the root's web-API directory: links to the
-#                                  staged one, and NAME.lib from standard input
-#   srv_start DOCROOT [ARG...]     lighttpd, ARGs go to scripts/lighttpd-conf.sh;
-#                                  sets BASE (http://127.0.0.1:<port>) and URL
-#                                  (the entry); 1 when it does not start
-#   srv_serve [ARG...]             srv_start RUN/www; exits 1 when it fails
-#   srv_session                    sid: a session of root from 127.0.0.1,
-#                                  made by $VELAADM
-#   srv_stop                       ends it (also done by srv_cleanup)
-#   srv_logs                       the tails of the server's and velascgi's logs
-#   srv_add_user NAME PASS [GROUP] a Linux account with that password
-#   srv_cleanup                    server, accounts, groups, TMP; call it from
-#                                  the caller's EXIT trap
-#   srv_sanitizer_clean            0 when no sanitizer report is in the logs
-#   srv_finish TEXT                exits: 1 after failed checks or sanitizer
+#                                  TMP, ROOT, RUN (with RUN/www), the root's
+#                                  web-API directory; "private": not below /tmp
+#                                  (X-Sendfile paths must not be)
+#   srv_api NAME <DESCRIPTION      links to the staged web-API directory, and
+#                                  NAME.lib from standard input
+#   srv_start DOCROOT [ARG...]     lighttpd (ARGs to scripts/lighttpd-conf.sh):
+#                                  BASE and URL (the entry), or 1; srv_stop
+#   srv_serve [ARG...]             srv_start RUN/www, or exit 1
+#   srv_session                    sid: a session of root from 127.0.0.1
+#   srv_pam                        the PAM service of deploy/pam in the root
+#   srv_add_user NAME PASS [GROUP] a Linux account with that password, or exit 1
+#   srv_password                   a password of letters and digits only
+#   srv_as_nobody CMD...           CMD as the account nobody
+#   srv_wait TRIES PAUSE CMD...    CMD until it succeeds, at most TRIES times
+#                                  PAUSE seconds apart (else 1)
+#   srv_finish TEXT                exit 1 after failed checks or sanitizer
 #                                  reports, else 0 printing TEXT
 #
 # Checks, counted in $failures:
@@ -38,8 +35,11 @@
 #   call CURL_ARGS...              the answer in $TMP/body, the header block in
 #                                  $TMP/headers, the HTTP status in $status
 #   expect NAME TEXT...            the answer holds every TEXT (compact JSON)
-#   expect_header NAME HEADER      the header block has a line starting so
+#   expect_header NAME HEADER...   the header block has a line starting with
+#                                  each HEADER
 #   expect_status NAME CODE        the HTTP status was CODE
+#   expect_error NAME CODE [WORD]  the answer is error CODE, with the header
+#                                  "x-request-error: WORD" when WORD is given
 #
 # lighttpd and curl are always required.
 
@@ -70,15 +70,10 @@ srv_require() {
   local why=$1 tool
   shift
   for tool in lighttpd curl "$@"; do
-    if ! command -v "$tool" >/dev/null 2>&1; then
-      echo "SKIP: $tool is not installed"
-      exit 77
-    fi
+    command -v "$tool" >/dev/null 2>&1 || { echo "SKIP: $tool is not installed"; exit 77; }
   done
-  if [ "$(id -u)" -ne 0 ]; then
-    echo "SKIP: needs root ($why)"
-    exit 77
-  fi
+  [ "$(id -u)" -eq 0 ] || { echo "SKIP: needs root ($why)"; exit 77; }
+  srv_traps
 }
 
 srv_traps() {
@@ -104,19 +99,26 @@ expect() {
 }
 
 expect_header() {
-  grep -qi -- "^$2" "$TMP/headers" || fail "$1: no header \"$2\" in: $(tr -d '\r' <"$TMP/headers")"
+  local name=$1 header
+  shift
+  for header in "$@"; do
+    grep -qi -- "^$header" "$TMP/headers" || fail "$name: no header \"$header\" in: $(tr -d '\r' <"$TMP/headers")"
+  done
 }
 
 expect_status() {
   [ "$status" = "$2" ] || fail "$1: HTTP status $status, expected $2"
 }
 
+expect_error() {
+  expect "$1" '"success":false'
+  grep -qE "\"code\":$2[,}]" "$TMP/body" || fail "$1: not error $2: $(head -c 600 "$TMP/body")"
+  [ -z "${3:-}" ] || expect_header "$1" "x-request-error: $3"
+}
+
 srv_init() {
-  SRV_SRC=$1
-  SRV_VELASCGI=$2
-  if [ "${4:-}" = private ] && [ -d /run ] && [ -w /run ]; then
-    export TMPDIR=/run
-  fi
+  SRV_SRC=$1 SRV_VELASCGI=$2
+  if [ "${4:-}" = private ] && [ -d /run ] && [ -w /run ]; then export TMPDIR=/run; fi
   TMP=$(mktemp -d "${TMPDIR:-/tmp}/vela-e2e-XXXXXX") || return 1
   # Searchable like the real "/": what an account of the run can reach
   # below the root then depends on the modes the server gives its files.
@@ -125,6 +127,10 @@ srv_init() {
   RUN=$TMP/run
   mkdir -p "$ROOT/usr/vela/velaman" "$ROOT/etc/vela" "$RUN/www" || return 1
   ln -s "$3" "$ROOT/usr/vela/velaman/webapi"
+}
+
+srv_pam() {
+  mkdir -p "$ROOT/etc/pam.d" && cp "$SRV_SRC/deploy/pam/vela-webapi" "$ROOT/etc/pam.d/vela-webapi" || exit 1
 }
 
 srv_api() {
@@ -148,16 +154,12 @@ srv_start() {
   # Sanitizer builds: the options reach velascgi too.
   local var
   for var in ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS; do
-    if [ -n "${!var:-}" ]; then
-      args+=(--env "$var=${!var}")
-    fi
+    [ -z "${!var:-}" ] || args+=(--env "$var=${!var}")
   done
   BASE="" URL=""
   for _ in $(seq 1 20); do
     port=$((20000 + RANDOM % 40000))
-    if (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null; then
-      continue
-    fi
+    (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null && continue
     "$SRV_SRC/scripts/lighttpd-conf.sh" "${args[@]}" --port "$port" || return 1
     lighttpd -D -f "$RUN/lighttpd.conf" 2>>"$RUN/start.log" &
     LPID=$!
@@ -192,20 +194,16 @@ srv_session() {
 }
 
 srv_stop() {
-  if [ -n "$LPID" ]; then
-    kill -TERM "$LPID" 2>/dev/null
-    wait "$LPID" 2>/dev/null
-    LPID=""
-  fi
+  [ -n "$LPID" ] || return 0
+  kill -TERM "$LPID" 2>/dev/null
+  wait "$LPID" 2>/dev/null
+  LPID=""
 }
 
 srv_logs() {
   local log
   for log in start.log error.log cgi.log; do
-    if [ -s "$RUN/$log" ]; then
-      echo "---- $log (last 100 lines)"
-      tail -n 100 "$RUN/$log"
-    fi
+    [ -s "$RUN/$log" ] && echo "---- $log (last 100 lines)" && tail -n 100 "$RUN/$log"
   done
 }
 
@@ -213,24 +211,31 @@ srv_logs() {
 srv_add_user() {
   local name=$1 pass=$2 group=${3:-}
   local args=(-M -N -s /usr/sbin/nologin)
-  if [ -n "$group" ]; then
-    if ! getent group "$group" >/dev/null; then
-      groupadd "$group" || return 1
-      SRV_GROUPS+=("$group")
-    fi
-    args+=(-G "$group")
+  if [ -n "$group" ] && ! getent group "$group" >/dev/null; then
+    groupadd "$group" || { fail "cannot create the group $group"; exit 1; }
+    SRV_GROUPS+=("$group")
   fi
-  useradd "${args[@]}" "$name" || return 1
+  [ -z "$group" ] || args+=(-G "$group")
+  useradd "${args[@]}" "$name" || { fail "cannot create the account $name"; exit 1; }
   SRV_USERS+=("$name")
-  printf '%s:%s\n' "$name" "$pass" | chpasswd || return 1
+  printf '%s:%s\n' "$name" "$pass" | chpasswd || { fail "cannot set the password of $name"; exit 1; }
 }
 
-# A random password of letters and digits (no character that needs quoting
-# in a form or a shell).
+srv_as_nobody() { setpriv --reuid=nobody --regid="$(id -g nobody)" --clear-groups "$@"; }
+
+srv_wait() {
+  local tries=$1 pause=$2 _
+  shift 2
+  for _ in $(seq 1 "$tries"); do
+    "$@" && return 0
+    sleep "$pause"
+  done
+  return 1
+}
+
+# (No character that needs quoting in a form or a shell.)
 srv_password() {
-  local pass
-  pass=$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)
-  printf 'Pw%s' "$pass"
+  printf 'Pw%s' "$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)"
 }
 
 srv_sanitizer_clean() {
@@ -239,10 +244,7 @@ srv_sanitizer_clean() {
 
 srv_finish() {
   srv_sanitizer_clean || fail "sanitizer reports in the logs"
-  if [ "$failures" -ne 0 ]; then
-    echo "$failures check(s) failed"
-    exit 1
-  fi
+  [ "$failures" -eq 0 ] || { echo "$failures check(s) failed"; exit 1; }
   echo "$1"
   exit 0
 }

@@ -9,7 +9,6 @@ set -u
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI VELAADM WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "velascgi stores uploads as root and switches identity" setpriv flock find stat
-srv_traps
 
 # ---- The system root: the staged web-API directory plus VELA.Pipe.Ids of the
 # test handler library, whose "upload" runs as nobody and whose "byDefault"
@@ -32,63 +31,47 @@ head -c 33554432 /dev/urandom >"$TMP/big.bin"
 IDS="$URL?api=VELA.Pipe.Ids&version=1&method=upload"
 DEFERRED="$URL?api=VELA.Sample&version=1&method=upload"
 
-# left: what is in "@tmp" besides the entries named as arguments.
+# left: what is in "@tmp" besides the entries named as arguments; clean:
+# nothing is. found: $partial, a file being stored in "@tmp".
 left() {
   local skip=() name
   for name in "$@"; do skip+=(! -name "$name"); done
   find "$UP" -mindepth 1 -maxdepth 1 "${skip[@]}" -printf '%f ' 2>/dev/null
 }
+clean() { [ -z "$(left)" ]; }
+found() { partial=$(find "$UP" -type f -size +0 -print -quit 2>/dev/null) && [ -n "$partial" ]; }
 
 # ---- A form field naming the method with root's rights: the handler of the
 # method called still runs, as nobody, and sees that method.
 nobody_uid=$(id -u nobody)
-nobody_gid=$(id -g nobody)
 call --cookie "$COOKIE" -F "method=byDefault" -F "f=@$TMP/small.txt" "$IDS"
 expect "upload naming another method" '"success":true' "\"uid\":[$nobody_uid,$nobody_uid,$nobody_uid]" \
   '"method":"upload"' '"methodParam":"upload"'
 [ "$(stat -c %a "$UP")" = 1777 ] || fail "@tmp is $(stat -c %a "$UP") after an upload, not 1777"
-[ -z "$(left)" ] || fail "an upload left $(left)in @tmp"
+clean || fail "an upload left $(left)in @tmp"
 
 # ---- A client that goes away in the middle of a big file, for an upload the
-# front end stores and one the handler reads itself. While it is in flight,
-# another local user can neither read the partial file, nor put a file of
-# their own in its place, nor move its directory away; shortly after the
-# client is gone, nothing of it is left.
+# front end stores and one the handler reads itself. In flight, another local
+# user can neither read the partial file, nor replace it, nor move its
+# directory away; shortly after the client is gone, nothing of it is left.
 for target in "$IDS" "$DEFERRED"; do
   name=${target#*api=}
   name="client gone (${name%%&*})"
   curl -s -o /dev/null --max-time 120 --limit-rate 1M --cookie "$COOKIE" -F "f=@$TMP/big.bin" "$target" &
   client=$!
-  partial=""
-  for _ in $(seq 1 100); do
-    partial=$(find "$UP" -type f -size +0 -print -quit 2>/dev/null)
-    [ -n "$partial" ] && break
-    sleep 0.1
-  done
-  if [ -z "$partial" ]; then
+  if ! srv_wait 100 0.1 found; then
     fail "$name: no partial file appeared in @tmp"
   else
-    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
-        sh -c 'head -c 16 "$2" >/dev/null 2>&1' sh "$UP" "$partial"; then
-      fail "$name: nobody read the partial file $partial"
-    fi
-    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
-        sh -c 'echo evil >"$1/evil" && mv -f "$1/evil" "$2"' sh "$UP" "$partial" 2>/dev/null; then
+    srv_as_nobody head -c 16 "$partial" >/dev/null 2>&1 && fail "$name: nobody read the partial file $partial"
+    srv_as_nobody sh -c 'echo evil >"$1/evil" && mv -f "$1/evil" "$2"' sh "$UP" "$partial" 2>/dev/null &&
       fail "$name: nobody replaced the partial file $partial"
-    fi
-    if setpriv --reuid="$nobody_uid" --regid="$nobody_gid" --clear-groups \
-        mv -f "$(dirname "$partial")" "$UP/moved" 2>/dev/null; then
+    srv_as_nobody mv -f "$(dirname "$partial")" "$UP/moved" 2>/dev/null &&
       fail "$name: nobody moved the directory of the partial file $partial"
-    fi
     rm -f "$UP/evil"
   fi
   kill "$client" 2>/dev/null
   wait "$client" 2>/dev/null
-  for _ in $(seq 1 50); do
-    [ -z "$(left)" ] && break
-    sleep 0.1
-  done
-  [ -z "$(left)" ] || fail "$name: left behind in @tmp: $(find "$UP" -mindepth 1 -printf '%P(%s) ')"
+  srv_wait 50 0.1 clean || fail "$name: left behind in @tmp: $(find "$UP" -mindepth 1 -printf '%P(%s) ')"
 done
 
 # ---- Directories of requests that died without removing theirs: the next

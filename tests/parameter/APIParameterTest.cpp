@@ -1,15 +1,16 @@
+#include <initializer_list>
+
 #include "support/ParamTestUtil.h"
 
 namespace VELA {
 namespace {
 
 using Test::Flags;
-using Test::Parse;
 
 // {"n": <literal>} read as a required T.
 template <typename T> APIParameter<T> Member(const std::string& literal)
 {
-    return APIParameterFactoryBasicImpl<T>::FromJson(Parse("{\"n\":" + literal + "}"), "n", PARAM_REQUIRED);
+    return APIParameterFactoryBasicImpl<T>::FromJson(J("{\"n\":" + literal + "}"), "n", PARAM_REQUIRED);
 }
 
 template <typename T> void Accepted(const std::string& literal, T const& expected)
@@ -19,53 +20,40 @@ template <typename T> void Accepted(const std::string& literal, T const& expecte
     EXPECT_EQ(p.Get(), expected) << literal;
 }
 
-template <typename T> void Refused(const std::string& literal)
+template <typename T> void Refused(std::initializer_list<const char*> literals)
 {
-    EXPECT_EQ(Flags(Member<T>(literal)), "SI") << literal;
+    for (const char* literal : literals) {
+        EXPECT_EQ(Flags(Member<T>(literal)), "SI") << literal;
+    }
 }
 
-TEST(ParseValue, SignedIntegers)
+// Per type: the range it takes, the JSON types it refuses.
+TEST(ParseValue, RangesAndTypesOfEachType)
 {
     Accepted<int>("2147483647", 2147483647);
     Accepted<int>("-2147483648", -2147483647 - 1);
     Accepted<int>("3.0", 3);
-    for (const char* bad : {"2147483648", "-2147483649", "3.5", "\"5\"", "true", "[1]"}) {
-        Refused<int>(bad);
-    }
+    Refused<int>({"2147483648", "-2147483649", "3.5", "\"5\"", "true", "[1]"});
     Accepted<long long>("2147483648", 2147483648LL);
     Accepted<long long>("-9223372036854775808", -9223372036854775807LL - 1);
-    for (const char* bad : {"9223372036854775808", "18446744073709551615", "1e19", "1.5"}) {
-        Refused<long long>(bad);
-    }
-}
-
-TEST(ParseValue, UnsignedIntegers)
-{
+    Refused<long long>({"9223372036854775808", "18446744073709551615", "1e19", "1.5"});
     Accepted<unsigned int>("4294967295", 4294967295u);
-    Refused<unsigned int>("-1");
-    Refused<unsigned int>("4294967296");
+    Refused<unsigned int>({"-1", "4294967296"});
     Accepted<unsigned long long>("18446744073709551615", 18446744073709551615ULL);
-    Refused<unsigned long long>("-1");
-    Refused<unsigned long long>("\"1\"");
-}
-
-TEST(ParseValue, OtherTypes)
-{
+    Refused<unsigned long long>({"-1", "\"1\""});
     Accepted<bool>("false", false);
-    Refused<bool>("\"true\"");
-    Refused<bool>("1");
+    Refused<bool>({"\"true\"", "1"});
     Accepted<double>("3", 3.0);
     Accepted<double>("18446744073709551615", 18446744073709551615.0);
-    Refused<double>("\"3\"");
-    Refused<double>("true");
+    Refused<double>({"\"3\"", "true"});
     Accepted<std::string>("\"x\"", std::string("x"));
-    Refused<std::string>("5");
+    Refused<std::string>({"5"});
 
     // A refused value leaves the stored one alone.
     APIParameter<Json::Value> j;
-    EXPECT_TRUE(j.ParseValue(Parse("[1]"), Json::arrayValue));
-    EXPECT_FALSE(j.ParseValue(Parse("{}"), Json::arrayValue));
-    EXPECT_EQ(j.Get(), Parse("[1]"));
+    EXPECT_TRUE(j.ParseValue(J("[1]"), Json::arrayValue));
+    EXPECT_FALSE(j.ParseValue(J("{}"), Json::arrayValue));
+    EXPECT_EQ(j.Get(), J("[1]"));
 }
 
 int g_validatorCalls = 0;
@@ -108,7 +96,7 @@ TEST(CheckValueTypeAndGet, NullIsResetValidatorDecides)
 
 TEST(Factory, MissingMemberArrayAndObject)
 {
-    Json::Value obj = Parse("{\"other\":1}");
+    Json::Value obj = J("{\"other\":1}");
     APIParameter<int> required = APIParameterFactoryBasicImpl<int>::FromJson(obj, "n", PARAM_REQUIRED);
     EXPECT_EQ(Flags(required), "I");
     EXPECT_EQ(required.Get(9), 9);
@@ -121,11 +109,11 @@ TEST(Factory, MissingMemberArrayAndObject)
     EXPECT_EQ(optional.Get(), 9);
 
     for (const char* notObject : {"[1]", "null", "\"n\""}) {
-        EXPECT_EQ(Flags(APIParameterFactoryBasicImpl<std::string>::FromJson(Parse(notObject), "n", PARAM_OPTIONAL)),
+        EXPECT_EQ(Flags(APIParameterFactoryBasicImpl<std::string>::FromJson(J(notObject), "n", PARAM_OPTIONAL)),
                   "I");
     }
 
-    Json::Value mixed = Parse("{\"a\":[1,2],\"o\":{\"k\":1},\"z\":null}");
+    Json::Value mixed = J("{\"a\":[1,2],\"o\":{\"k\":1},\"z\":null}");
     APIParameter<Json::Value> array = APIParameterFactory::ArrayFromJson(mixed, "a", PARAM_REQUIRED);
     EXPECT_EQ(Flags(array), "S");
     EXPECT_EQ(array.Get(), mixed["a"]);
@@ -136,7 +124,7 @@ TEST(Factory, MissingMemberArrayAndObject)
     EXPECT_EQ(APIParameterFactory::ObjectFromJson(mixed, "o", PARAM_REQUIRED).Get(), mixed["o"]);
     EXPECT_EQ(Flags(APIParameterFactory::ObjectFromJson(mixed, "a", PARAM_REQUIRED)), "SI");
     EXPECT_EQ(Flags(APIParameterFactory::ObjectFromJson(mixed, "z", PARAM_REQUIRED)), "SR");
-    EXPECT_EQ(Flags(APIParameterFactory::ArrayFromJson(Parse("[]"), "n", PARAM_OPTIONAL)), "I");
+    EXPECT_EQ(Flags(APIParameterFactory::ArrayFromJson(J("[]"), "n", PARAM_OPTIONAL)), "I");
 }
 
 TEST(APIParameter, CopyAndCompare)

@@ -9,7 +9,6 @@
 namespace VELA {
 namespace {
 
-using Test::Parse;
 typedef APIValidator V;
 
 // A valid parameter holding `v`, or an invalid one.
@@ -23,38 +22,35 @@ template <typename T> APIParameter<T> Param(T const& v, bool invalid = false)
     return p;
 }
 
-void ExpectAll(bool (*check)(std::string const&), std::vector<std::string> const& texts, bool expected)
-{
-    for (auto const& text : texts) {
-        EXPECT_EQ(check(text), expected) << '"' << text << '"';
-    }
-}
-
 TEST(TextFormat, PatternsHostAndAddress)
 {
-    // In the e-mail pattern "+-\" is a range: ":" and "[" lie inside it.
-    ExpectAll(V::IsEMail, {"john.doe@example.com", "a\"b,(c)<d>@host", "a:b[@host"}, true);
-    ExpectAll(V::IsEMail, {"a b@host", "@host", "user@", "user@ho st", ""}, false);
-    ExpectAll(V::IsNetbios, {"a_b-C9", std::string(255, 'a')}, true);
-    ExpectAll(V::IsNetbios, {std::string(256, 'a'), "9abc", "ab.c", ""}, false);
-    // Unanchored: one character outside the forbidden set is enough.
-    ExpectAll(V::IsWorkGroup, {"WORKGROUP", "a;"}, true);
-    ExpectAll(V::IsWorkGroup, {";", "]", "[", "\\", "/", "|?,*+<>:\"", ""}, false);
-    ExpectAll(V::IsDigit, {"007"}, true);
-    ExpectAll(V::IsDigit, {"", "12a", "-1", std::string("12\0x", 4)}, false);
-    ExpectAll(V::IsFarlinkId, {"Ab-12"}, true);
-    ExpectAll(V::IsFarlinkId, {"a_b", ""}, false);
-
-    ExpectAll(V::IsHostname, {"nas-01"}, true);
-    ExpectAll(V::IsHostname, {"-nas", std::string("nas\0-", 5), ""}, false);
-    ExpectAll(V::IsDomain, {"corp.example.com"}, true);
-    ExpectAll(V::IsDomain, {"corp..com", ""}, false);
-    ExpectAll(V::IsIP, {"192.168.0.1", "fe80::1"}, true);
-    ExpectAll(V::IsIP, {"192.168.0.256", std::string("10.0.0.1\0junk", 13), ""}, false);
-    ExpectAll(V::IsIPv4, {"192.168.0.1"}, true);
-    ExpectAll(V::IsIPv4, {"fe80::1", ""}, false);
-    ExpectAll(V::IsIPv6, {"fe80::1"}, true);
-    ExpectAll(V::IsIPv6, {"192.168.0.1", ""}, false);
+    const struct {
+        bool (*check)(std::string const&);
+        std::vector<std::string> valid, invalid;
+    } cases[] = {
+        // In the e-mail pattern "+-\" is a range: ":" and "[" lie inside it.
+        {V::IsEMail, {"john.doe@example.com", "a\"b,(c)<d>@host", "a:b[@host"},
+         {"a b@host", "@host", "user@", "user@ho st", ""}},
+        {V::IsNetbios, {"a_b-C9", std::string(255, 'a')}, {std::string(256, 'a'), "9abc", "ab.c", ""}},
+        // Unanchored: one character outside the forbidden set is enough.
+        {V::IsWorkGroup, {"WORKGROUP", "a;"}, {";", "]", "[", "\\", "/", "|?,*+<>:\"", ""}},
+        {V::IsDigit, {"007"}, {"", "12a", "-1", std::string("12\0x", 4)}},
+        {V::IsFarlinkId, {"Ab-12"}, {"a_b", ""}},
+        {V::IsHostname, {"nas-01"}, {"-nas", std::string("nas\0-", 5), ""}},
+        {V::IsDomain, {"corp.example.com"}, {"corp..com", ""}},
+        {V::IsIP, {"192.168.0.1", "fe80::1"}, {"192.168.0.256", std::string("10.0.0.1\0junk", 13), ""}},
+        {V::IsIPv4, {"192.168.0.1"}, {"fe80::1", ""}},
+        {V::IsIPv6, {"fe80::1"}, {"192.168.0.1", ""}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(&c - cases);
+        for (const std::string& text : c.valid) {
+            EXPECT_TRUE(c.check(text)) << '"' << text << '"';
+        }
+        for (const std::string& text : c.invalid) {
+            EXPECT_FALSE(c.check(text)) << '"' << text << '"';
+        }
+    }
 }
 
 TEST(CheckRegex, BadPatternLogsSharedAcrossThreads)
@@ -99,7 +95,7 @@ TEST(Numeric, PortEqualAndRanges)
     EXPECT_FALSE(V::IsEqual(Param(std::string("a")), std::string("b")));
     EXPECT_TRUE(V::IsEqual(Param(std::string("a")), "a"));
     EXPECT_FALSE(V::IsEqual(Param(std::string("a")), static_cast<const char*>(nullptr)));
-    EXPECT_TRUE(V::IsEqual(Param(Parse("[1,{\"k\":2}]")), Parse("[1,{\"k\":2}]")));
+    EXPECT_TRUE(V::IsEqual(Param(J("[1,{\"k\":2}]")), J("[1,{\"k\":2}]")));
     EXPECT_TRUE(V::IsEqual(Param(0.3), 0.1 + 0.2));
     EXPECT_FALSE(V::IsEqual(Param(0.3), 0.3001));
     EXPECT_FALSE(V::IsEqual(Param(0.3, true), 0.3));
@@ -131,24 +127,24 @@ TEST(Numeric, PortEqualAndRanges)
 
 TEST(Membership, StringAndJson)
 {
-    Json::Value strings = Parse("[\"a\",\"b\",1]");
+    Json::Value strings = J("[\"a\",\"b\",1]");
     EXPECT_TRUE(V::IsBelong(Param(std::string("b")), strings));
     EXPECT_FALSE(V::IsBelong(Param(std::string("1")), strings));
     EXPECT_FALSE(V::IsBelong(Param(std::string("a"), true), strings));
-    EXPECT_FALSE(V::IsBelong(Param(std::string("a")), Parse("{\"a\":\"a\"}")));
+    EXPECT_FALSE(V::IsBelong(Param(std::string("a")), J("{\"a\":\"a\"}")));
 
     // Every element of the value must be in the list: a scalar has none, so
     // any scalar passes, in the list or not.
-    Json::Value list = Parse("[1,2,3,\"x\"]");
+    Json::Value list = J("[1,2,3,\"x\"]");
     for (const char* in : {"[1,2]", "{\"p\":3,\"q\":\"x\"}", "[]", "null", "2", "4", "\"y\"", "true", "0.5"}) {
-        EXPECT_TRUE(V::IsBelong(Param(Parse(in)), list)) << in;
+        EXPECT_TRUE(V::IsBelong(Param(J(in)), list)) << in;
     }
     for (const char* out : {"[1,4]", "{\"p\":4}", "[[1]]"}) {
-        EXPECT_FALSE(V::IsBelong(Param(Parse(out)), list)) << out;
+        EXPECT_FALSE(V::IsBelong(Param(J(out)), list)) << out;
     }
-    EXPECT_FALSE(V::IsBelong(Param(Parse("[1]")), Parse("{\"a\":1}")));
-    EXPECT_FALSE(V::IsBelong(Param(Parse("[]")), Json::Value(1)));
-    EXPECT_FALSE(V::IsBelong(Param(Parse("[1]"), true), list));
+    EXPECT_FALSE(V::IsBelong(Param(J("[1]")), J("{\"a\":1}")));
+    EXPECT_FALSE(V::IsBelong(Param(J("[]")), Json::Value(1)));
+    EXPECT_FALSE(V::IsBelong(Param(J("[1]"), true), list));
 }
 
 }  // namespace

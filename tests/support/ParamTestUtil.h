@@ -1,23 +1,16 @@
-// Helpers shared by the tests of typed parameters and their getters.
+// Helpers shared by the tests of typed parameters and their getters (and
+// J, JSON text as a value).
 #pragma once
 
 #include <gtest/gtest.h>
 
-#include <json/json.h>
 #include <string>
 
+#include "support/JsonLiteral.h"
 #include "webapi/APIParameter.h"
 
 namespace VELA {
 namespace Test {
-
-inline Json::Value Parse(const std::string& text)
-{
-    Json::Value out;
-    Json::Reader reader;
-    EXPECT_TRUE(reader.parse(text, out)) << text;
-    return out;
-}
 
 // The flags of `p` in one word: S set, R reset, I invalid, D default.
 template <typename T> std::string Flags(APIParameter<T> const& p)

@@ -1,9 +1,10 @@
 #include "support/TestSupport.h"
 
 #include <cstdlib>
+#include <cstring>
 #include <dirent.h>
 #include <fstream>
-#include <sstream>
+#include <iterator>
 #include <ftw.h>
 #include <stdexcept>
 #include <unistd.h>
@@ -57,13 +58,9 @@ static int RemoveOne(const char* path, const struct stat*, int, struct FTW*)
 
 TempDir::~TempDir() { nftw(path_.c_str(), RemoveOne, 16, FTW_DEPTH | FTW_PHYS); }
 
-ScopedEnv::ScopedEnv(const char* name, const char* value) : name_(name)
+ScopedEnv::ScopedEnv(const char* name, const char* value) : name_(name), had_(getenv(name) != nullptr)
 {
-    const char* old = getenv(name);
-    had_ = old != nullptr;
-    if (had_) {
-        old_ = old;
-    }
+    old_ = had_ ? getenv(name) : "";
     if (value) {
         setenv(name, value, 1);
     } else {
@@ -83,24 +80,20 @@ ScopedEnv::~ScopedEnv()
 std::string ReadText(const std::string& path)
 {
     std::ifstream in(path, std::ios::binary);
-    std::ostringstream text;
-    text << in.rdbuf();
-    return text.str();
+    return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
 std::vector<std::string> DirEntries(const std::string& dir)
 {
     std::vector<std::string> names;
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        return names;
-    }
-    while (struct dirent* e = readdir(d)) {
-        if (std::string(e->d_name) != "." && std::string(e->d_name) != "..") {
-            names.push_back(e->d_name);
+    if (DIR* d = opendir(dir.c_str())) {
+        while (struct dirent* e = readdir(d)) {
+            if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) {
+                names.push_back(e->d_name);
+            }
         }
+        closedir(d);
     }
-    closedir(d);
     return names;
 }
 

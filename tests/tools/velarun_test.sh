@@ -9,22 +9,15 @@ PART=${1:?usage: velarun_test.sh refusals|sample velarun root}
 RUN=${2:?velarun path}
 VELA_ROOT=${3:?stage root}
 export VELA_ROOT
-unset VELA_LOG_STDERR
 WEBAPI=$VELA_ROOT/usr/vela/velaman/webapi
-TMP=$(mktemp -d "${TMPDIR:-/tmp}/velarun-test-XXXXXX") || exit 1
-trap 'rm -rf "$TMP"' EXIT
-OUT=$TMP/out
-ERR=$TMP/err
 . "$(dirname "$0")/checks.sh"
 
 # call STATUS JSON [ARGS...]: runs velarun with JSON on standard input.
 call() {
-    want=$1
-    json=$2
+    want=$1 IN=$TMP/in
+    printf '%s' "$2" >"$IN"
     shift 2
-    printf '%s' "$json" | "$RUN" "$@" >"$OUT" 2>"$ERR"
-    got=$?
-    [ "$got" -eq "$want" ] || fail "velarun $* <<< $json exited $got, expected $want"
+    runs "$want" "$RUN" "$@"
 }
 
 # answers STATUS TEXT JSON [ARGS...]: call, and the one line printed is
@@ -33,7 +26,7 @@ answers() {
     status=$1 text=$2
     shift 2
     call "$status" "$@"
-    [ "$(cat "$OUT")" = "$text" ] || fail "answer is not $text"
+    stdout_is "$text"
     [ "$(wc -l <"$OUT")" -eq 1 ] || fail "answer is not one line"
 }
 
@@ -48,7 +41,7 @@ refusals)
 
     call 2 '{"getParam": ' -
     stderr_has "not valid JSON"
-    [ ! -s "$OUT" ] || fail "an answer was printed for bad JSON"
+    stdout_empty
     call 2 '{}' "$TMP/missing.json"
     stderr_has "cannot open"
     call 2 '{}' --bogus

@@ -5,15 +5,11 @@
 
 #include <cstdio>
 #include <fcntl.h>
-#include <fstream>
-#include <functional>
 #include <string>
-#include <sys/stat.h>
 #include <unistd.h>
 
-#include "support/TestSupport.h"
+#include "platform/StateRootTest.h"
 #include "vela/httpoutput.h"
-#include "vela/vlibc.h"
 #include "webapi/APIDownload.h"
 #include "webapi/APIResponse.h"
 
@@ -23,40 +19,42 @@ using VELA::APIDownload;
 using VELA::APIResponse;
 using VELA::Test::ScopedEnv;
 
-class Download : public ::testing::Test {
+class Download : public RootTest {
 protected:
     void SetUp() override
     {
-        VELA::System::RootReset();
         VELA::HTTP::FileOutputerHelper::SetFastOutputEnabled(true);
-        mkdir((root_.Path() + "/etc").c_str(), 0755);
-        std::ofstream(root_.Path() + "/etc/mime.types") << "text/plain txt\ntext/csv csv\n";
-        file_ = root_.Path() + "/notes.txt";
+        mkdir(In("/etc").c_str(), 0755);
+        std::ofstream(In("/etc/mime.types")) << "text/plain txt\ntext/csv csv\n";
         std::ofstream(file_) << "hello";
     }
-    void TearDown() override { VELA::System::RootReset(); }
 
-    // What `fn` writes to standard output; `ok` receives its result.
-    std::string Capture(const std::function<bool()>& fn, bool& ok)
+    // What d.Output(args...) writes to standard output; ok_ its result.
+    template <typename... A> std::string Out(APIDownload& d, A... args)
     {
-        const std::string path = root_.Path() + "/stdout";
+        const std::string path = In("/stdout");
         const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC, 0600);
         fflush(stdout);
         const int saved = dup(1);
         dup2(fd, 1);
         close(fd);
-        ok = fn();
+        ok_ = d.Output(args...);
         fflush(stdout);
         dup2(saved, 1);
         close(saved);
         return VELA::Test::ReadText(path);
     }
+    // d.Output(args...) fails before anything is written.
+    template <typename... A> void Refused(APIDownload& d, A... args)
+    {
+        EXPECT_EQ("", Out(d, args...));
+        EXPECT_FALSE(ok_);
+    }
 
-    VELA::Test::TempDir root_;
-    ScopedEnv rootEnv_{"VELA_ROOT", root_.Path().c_str()};
     ScopedEnv range_{"HTTP_RANGE", nullptr};
     ScopedEnv method_{"REQUEST_METHOD", "GET"};
-    std::string file_;
+    std::string file_ = In("/notes.txt");
+    bool ok_ = false;
 };
 
 TEST_F(Download, PrintsTheResponseHeadersThenTheFile)
@@ -69,9 +67,8 @@ TEST_F(Download, PrintsTheResponseHeadersThenTheFile)
     headers["Content-Type"] = "text/html";
     EXPECT_TRUE(download.SetHeader(headers));
     EXPECT_FALSE(download.SetHeader("X-Bad", "a\r\nInjected: 1"));
-    bool ok = false;
-    const std::string out = Capture([&] { return download.Output(file_); }, ok);
-    EXPECT_TRUE(ok);
+    const std::string out = Out(download, file_);
+    EXPECT_TRUE(ok_);
     EXPECT_EQ(0u, out.find("X-A: 1\r\nContent-Type: text/plain\r\n")) << out;
     EXPECT_EQ(std::string::npos, out.find("X-Number"));
     EXPECT_EQ(std::string::npos, out.find("Injected"));
@@ -85,7 +82,7 @@ TEST_F(Download, PrintsTheResponseHeadersThenTheFile)
     // A disposition of the handler's own replaces the outputer's.
     response.SetHeader("Content-Disposition", "inline");
     download.SetMimeType("text/x-own");
-    const std::string inl = Capture([&] { return download.Output(file_); }, ok);
+    const std::string inl = Out(download, file_);
     EXPECT_NE(std::string::npos, inl.find("Content-Disposition: inline\r\n"));
     EXPECT_EQ(std::string::npos, inl.find("attachment"));
     EXPECT_NE(std::string::npos, inl.find("Content-Type: text/x-own\r\n"));
@@ -97,13 +94,12 @@ TEST_F(Download, StreamIsOctetStreamUnlessTyped)
     APIDownload download(&response);
     FILE* file = fopen(file_.c_str(), "r");
     ASSERT_NE(nullptr, file);
-    bool ok = false;
-    std::string out = Capture([&] { return download.Output(file); }, ok);
-    EXPECT_TRUE(ok);
+    std::string out = Out(download, file);
+    EXPECT_TRUE(ok_);
     EXPECT_NE(std::string::npos, out.find("Content-Type: application/octet-stream\r\n"));
     EXPECT_EQ(std::string::npos, out.find("Content-Disposition"));
     download.SetMimeTypeFromFileName("table.CSV");
-    out = Capture([&] { return download.Output(file); }, ok);
+    out = Out(download, file);
     EXPECT_NE(std::string::npos, out.find("Content-Type: text/csv\r\n"));
     EXPECT_EQ("hello", out.substr(out.size() - 5));
     fclose(file);
@@ -113,9 +109,9 @@ TEST_F(Download, StreamIsOctetStreamUnlessTyped)
     response.SetHeader("X-A", "1");
     FILE* pipe = popen("printf 'made by a program'", "r");
     ASSERT_NE(nullptr, pipe);
-    out = Capture([&] { return download.Output(pipe); }, ok);
+    out = Out(download, pipe);
     pclose(pipe);
-    EXPECT_TRUE(ok);
+    EXPECT_TRUE(ok_);
     EXPECT_EQ(0u, out.find("X-A: 1\r\nContent-Type: text/csv\r\n")) << out;
     EXPECT_EQ(std::string::npos, out.find("Content-Length"));
     EXPECT_EQ(std::string::npos, out.find("Status"));
@@ -123,10 +119,9 @@ TEST_F(Download, StreamIsOctetStreamUnlessTyped)
     EXPECT_EQ("made by a program", end == std::string::npos ? "" : out.substr(end + 4));
 
     // A stream that cannot be read is refused before anything is written.
-    FILE* writeOnly = fopen((root_.Path() + "/w").c_str(), "w");
+    FILE* writeOnly = fopen(In("/w").c_str(), "w");
     ASSERT_NE(nullptr, writeOnly);
-    EXPECT_EQ("", Capture([&] { return download.Output(writeOnly); }, ok));
-    EXPECT_FALSE(ok);
+    Refused(download, writeOnly);
     fclose(writeOnly);
 }
 
@@ -134,9 +129,8 @@ TEST_F(Download, OwnResponseNoResponseAndMissingFiles)
 {
     APIDownload own;
     EXPECT_TRUE(own.SetHeader("X-Own", "yes"));
-    bool ok = false;
-    EXPECT_NE(std::string::npos, Capture([&] { return own.Output(file_); }, ok).find("X-Own: yes\r\n"));
-    EXPECT_TRUE(ok);
+    EXPECT_NE(std::string::npos, Out(own, file_).find("X-Own: yes\r\n"));
+    EXPECT_TRUE(ok_);
 
     APIDownload none(nullptr);
     EXPECT_FALSE(none.SetHeader("X-A", "1"));
@@ -149,10 +143,8 @@ TEST_F(Download, OwnResponseNoResponseAndMissingFiles)
     APIResponse response(nullptr);
     APIDownload download(&response);
     download.SetHeader("X-A", "1");
-    EXPECT_EQ("", Capture([&] { return download.Output(root_.Path() + "/missing"); }, ok));
-    EXPECT_FALSE(ok);
-    EXPECT_EQ("", Capture([&] { return download.Output(root_.Path()); }, ok));
-    EXPECT_FALSE(ok);
+    Refused(download, In("/missing"));
+    Refused(download, In(""));
     EXPECT_TRUE(response.IsEnableOutput());
 }
 
@@ -163,14 +155,13 @@ TEST_F(Download, HandlerStatusTurnsRangesOff)
     ScopedEnv range("HTTP_RANGE", "bytes=1-2");
     APIResponse response(nullptr);
     APIDownload download(&response);
-    bool ok = false;
-    std::string out = Capture([&] { return download.Output(file_); }, ok);
+    std::string out = Out(download, file_);
     EXPECT_NE(std::string::npos, out.find("Status: 206 Partial Content\r\n")) << out;
     EXPECT_EQ("el", out.substr(out.size() - 2));
 
     response.SetHeader("Status", "203 Non-Authoritative Information");
-    out = Capture([&] { return download.Output(file_); }, ok);
-    EXPECT_TRUE(ok);
+    out = Out(download, file_);
+    EXPECT_TRUE(ok_);
     EXPECT_EQ(out.find("Status:"), out.rfind("Status:")) << out;
     EXPECT_NE(std::string::npos, out.find("Status: 203 Non-Authoritative Information\r\n"));
     EXPECT_EQ(std::string::npos, out.find("Accept-Ranges"));
@@ -181,24 +172,22 @@ TEST_F(Download, HandlerStatusTurnsRangesOff)
 // the handler opened itself is sent under the name it gives.
 TEST_F(Download, LinkRefusedDescriptorSent)
 {
-    const std::string link = root_.Path() + "/link.txt";
+    const std::string link = In("/link.txt");
     ASSERT_EQ(0, symlink(file_.c_str(), link.c_str()));
     APIResponse response(nullptr);
     APIDownload download(&response);
-    bool ok = true;
-    EXPECT_EQ("", Capture([&] { return download.Output(link); }, ok));
-    EXPECT_FALSE(ok);
-    const int dir = open(root_.Path().c_str(), O_RDONLY | O_DIRECTORY);
-    EXPECT_EQ("", Capture([&] { return download.Output(dir, "x"); }, ok));
-    EXPECT_FALSE(ok);
+    ok_ = true;
+    Refused(download, link);
+    const int dir = open(In("").c_str(), O_RDONLY | O_DIRECTORY);
+    Refused(download, dir, std::string("x"));
     close(dir);
     EXPECT_TRUE(response.IsEnableOutput());
 
     const int fd = open(file_.c_str(), O_RDONLY);
     ASSERT_GE(fd, 0);
-    const std::string out = Capture([&] { return download.Output(fd, "table.csv"); }, ok);
+    const std::string out = Out(download, fd, std::string("table.csv"));
     close(fd);
-    EXPECT_TRUE(ok);
+    EXPECT_TRUE(ok_);
     EXPECT_NE(std::string::npos, out.find("Content-Type: text/csv\r\n")) << out;
     EXPECT_NE(std::string::npos, out.find("filename=\"table.csv\"")) << out;
     EXPECT_EQ("\r\n\r\nhello", out.substr(out.size() - 9));
@@ -207,8 +196,7 @@ TEST_F(Download, LinkRefusedDescriptorSent)
 
 TEST_F(Download, XSendFileSwitch)
 {
-    mkdir((root_.Path() + "/etc/vela").c_str(), 0755);
-    std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << "xsendfile=\"yes\"\n";
+    Conf("webapi.conf", "xsendfile=\"yes\"\n");
     EXPECT_TRUE(APIDownload::GetXSendFileEnabled());
     APIDownload::SetXSendFileDisabled();
     EXPECT_FALSE(APIDownload::GetXSendFileEnabled());

@@ -4,19 +4,17 @@
 // password. The account is the test's own user.
 #include <gtest/gtest.h>
 
-#include <fstream>
 #include <json/json.h>
 #include <map>
 #include <pwd.h>
+#include <sstream>
 #include <string>
-#include <sys/stat.h>
 #include <unistd.h>
 #include <utility>
 #include <vector>
 
-#include "support/TestSupport.h"
+#include "platform/StateRootTest.h"
 #include "vela/user.h"
-#include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 #include "webentry/ChildRun.h"
 
@@ -28,7 +26,7 @@ struct Reply {
     int Code() const { return body["success"].asBool() ? 0 : body["error"]["code"].asInt(); }
 };
 
-class Auth : public ::testing::Test {
+class Auth : public RootTest {
 protected:
     void SetUp() override
     {
@@ -36,13 +34,10 @@ protected:
         ASSERT_NE(nullptr, pw);
         user_ = pw->pw_name;
         const std::string staged = BuiltProgram("root/usr/vela/velaman/webapi");
-        const std::string webapi = root_.Path() + "/usr/vela/velaman/webapi";
-        ASSERT_EQ(0, system(("mkdir -p '" + webapi + "' '" + root_.Path() + "/etc/pam.d' '" + root_.Path() +
-                             "/etc/vela'")
-                                .c_str()));
+        const std::string webapi = In("/usr/vela/velaman/webapi");
+        ASSERT_EQ(0, system(("mkdir -p '" + webapi + "' '" + In("/etc/pam.d") + "'").c_str()));
         ASSERT_EQ(0, symlink((staged + "/auth").c_str(), (webapi + "/auth").c_str()));
-        Json::Value libDef;
-        Json::Value desc;
+        Json::Value libDef, desc;
         ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(staged + "/lib.def", libDef));
         ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(staged + "/VELA.Auth.lib", desc));
         // Only root can switch to "system"; anyone else runs it as themselves.
@@ -51,16 +46,15 @@ protected:
         }
         ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapi + "/lib.def", libDef, 0644));
         ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapi + "/VELA.Auth.lib", desc, 0644));
-        Write("/etc/vela/webapi.conf", "login_max_failures=\"2\"\nsession_idle_timeout=\"600\"\n");
+        Conf("webapi.conf", "login_max_failures=\"2\"\nsession_idle_timeout=\"600\"\nsession_lifetime=\"7200\"\n");
         Pam("pam_permit.so");
     }
 
-    void Write(const std::string& path, const std::string& text) { std::ofstream(root_.Path() + path) << text; }
     // The PAM service answers every login with `module`.
     void Pam(const char* module)
     {
-        Write("/etc/pam.d/vela-webapi",
-              std::string("auth required ") + module + "\naccount required pam_permit.so\n");
+        std::ofstream(In("/etc/pam.d/vela-webapi")) << "auth required " << module
+                                                     << "\naccount required pam_permit.so\n";
     }
 
     // One call of `method`; `body` non-empty makes it a form POST. `env`
@@ -69,7 +63,7 @@ protected:
                const std::string& query = "")
     {
         std::map<std::string, std::string> vars = {
-            {"VELA_ROOT", root_.Path()},
+            {"VELA_ROOT", In("")},
             {"REMOTE_ADDR", "192.0.2.7"},
             {"HTTP_HOST", "nas.example"},
             {"QUERY_STRING", "api=VELA.Auth&version=1&method=" + method + query},
@@ -88,18 +82,13 @@ protected:
         Reply reply;
         const size_t end = out.find("\r\n\r\n");
         EXPECT_NE(std::string::npos, end) << out;
-        if (end == std::string::npos) {
-            return reply;
-        }
-        for (size_t pos = 0; pos < end;) {
-            const size_t eol = out.find("\r\n", pos);
-            const std::string line = out.substr(pos, eol - pos);
+        std::istringstream head(out.substr(0, end));
+        for (std::string line; std::getline(head, line, '\n');) {
             if (line.compare(0, 12, "Set-Cookie: ") == 0) {
-                reply.cookies.push_back(line.substr(12));
+                reply.cookies.push_back(line.substr(12, line.find('\r') - 12));
             }
-            pos = eol + 2;
         }
-        EXPECT_TRUE(VELA::WebAPIUtil::ParseJson(out.substr(end + 4), reply.body)) << out;
+        EXPECT_TRUE(end != std::string::npos && VELA::WebAPIUtil::ParseJson(out.substr(end + 4), reply.body)) << out;
         return reply;
     }
     Reply Login(const std::string& account, std::vector<std::string> env = {})
@@ -107,14 +96,14 @@ protected:
         return Call("login", "account=" + account + "&passwd=s3cret%21", std::move(env));
     }
 
-    std::string SessionFile(const std::string& sid) const { return root_.Path() + "/run/vela/sessions/" + sid; }
+    std::string SessionFile(const std::string& sid) const { return In("/run/vela/sessions/" + sid); }
     bool SessionExists(const std::string& sid) const
     {
         struct stat st;
         return !sid.empty() && stat(SessionFile(sid).c_str(), &st) == 0;
     }
+    bool NoSessions() const { return VELA::Test::DirEntries(In("/run/vela/sessions")).empty(); }
 
-    VELA::Test::TempDir root_;
     std::string user_;
 };
 
@@ -125,12 +114,7 @@ TEST_F(Auth, LoginOpensASessionAndSetsTheCookie)
     const std::string sid = first.body["data"]["sid"].asString();
     const std::string token = first.body["data"]["token"].asString();
     EXPECT_EQ(user_, first.body["data"]["account"].asString());
-    {
-        VELA::Test::ScopedEnv env("VELA_ROOT", root_.Path().c_str());
-        VELA::System::RootReset();
-        EXPECT_EQ(VLIBGroupIsAdminGroupMem(user_.c_str(), 0) == 1, first.body["data"]["isAdmin"].asBool());
-        VELA::System::RootReset();
-    }
+    EXPECT_EQ(VLIBGroupIsAdminGroupMem(user_.c_str(), 0) == 1, first.body["data"]["isAdmin"].asBool());
     EXPECT_EQ(std::vector<std::string>{"id=" + sid + "; path=/; httponly; SameSite=Strict"}, first.cookies);
     Json::Value session;
     ASSERT_TRUE(VELA::WebAPIUtil::ReadJsonFile(SessionFile(sid), session));
@@ -139,6 +123,7 @@ TEST_F(Auth, LoginOpensASessionAndSetsTheCookie)
     EXPECT_TRUE(session["tokenProtect"].asBool());
     EXPECT_EQ(token, session["token"].asString());
     EXPECT_EQ(600, session["idleTimeout"].asInt());
+    EXPECT_EQ(7200, session["lifetime"].asInt());
 
     // A new login with the old cookie, over HTTPS: the old session is gone,
     // the new cookie is secure.
@@ -213,7 +198,7 @@ TEST_F(Auth, MalformedCredentialsAreRefusedBeforePam)
     }
     // A GET, even with the account alone in the query string.
     EXPECT_EQ(101, Call("login", "", {}, "&account=" + user_).Code());
-    EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
+    EXPECT_TRUE(NoSessions());
 }
 
 // The password, or a parameter of an encrypted form that may carry it, in
@@ -237,7 +222,7 @@ TEST_F(Auth, PasswordInTheQueryStringIsRefused)
         EXPECT_EQ(403, r.Code()) << c.second << " " << r.body;
         EXPECT_TRUE(r.cookies.empty()) << c.second;
     }
-    EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
+    EXPECT_TRUE(NoSessions());
     // Names that only resemble it do not stop a login.
     EXPECT_EQ(0, Call("login", account + "&passwd=s3cret", {}, "&passwdx=1&xpasswd=1&a=passwd").Code());
 }
@@ -249,7 +234,7 @@ TEST_F(Auth, SystemIsNoLoginName)
     const Reply r = Login("system");
     EXPECT_EQ(400, r.Code()) << r.body;
     EXPECT_TRUE(r.cookies.empty());
-    EXPECT_TRUE(VELA::Test::DirEntries(root_.Path() + "/run/vela/sessions").empty());
+    EXPECT_TRUE(NoSessions());
     Login("system");
     EXPECT_EQ(407, Login(user_).Code()) << "two refusals from 192.0.2.7 reach login_max_failures";
 }

@@ -3,38 +3,17 @@
 #include <gtest/gtest.h>
 
 #include <csignal>
-#include <fstream>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include "support/TestSupport.h"
-#include "vela/vlibc.h"
+#include "platform/StateRootTest.h"
 #include "webentry/RequestLimits.h"
 
 namespace {
 
 using VELA::RequestLimits;
-
-class RequestLimitsTest : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        env_.reset(new VELA::Test::ScopedEnv("VELA_ROOT", dir_.Path().c_str()));
-        VELA::System::RootReset();
-        mkdir((dir_.Path() + "/etc").c_str(), 0755);
-        mkdir((dir_.Path() + "/etc/vela").c_str(), 0755);
-    }
-    void TearDown() override
-    {
-        env_.reset();
-        VELA::System::RootReset();
-    }
-    void Conf(const std::string& text) { std::ofstream(dir_.Path() + "/etc/vela/webapi.conf") << text; }
-
-    VELA::Test::TempDir dir_;
-    std::unique_ptr<VELA::Test::ScopedEnv> env_;
-};
+using RequestLimitsTest = RootTest;
 
 // The signal that ended a child running `body` under `limits`, 0 when it
 // exited.
@@ -54,7 +33,7 @@ int EndingSignal(const RequestLimits& limits, void (*body)())
 TEST_F(RequestLimitsTest, SettingsFromTheConfiguration)
 {
     VELA::Test::LogCapture log;
-    Conf("request_cpu_seconds=\"7\"\nrequest_time_seconds=\"9\"\nrequest_max_per_client=\"0\"\n"
+    Conf("webapi.conf", "request_cpu_seconds=\"7\"\nrequest_time_seconds=\"9\"\nrequest_max_per_client=\"0\"\n"
          "request_body_idle_seconds=\" 5\"\nrequest_body_min_rate=\"1e3\"\n");
     const RequestLimits limits = VELA::LoadRequestLimits();
     EXPECT_EQ(7, limits.cpuSeconds);
@@ -136,7 +115,7 @@ TEST_F(RequestLimitsTest, ClientSlots)
 
     // The lock file is the server's own.
     struct stat st;
-    ASSERT_EQ(0, stat((dir_.Path() + "/run/vela/clients.lock").c_str(), &st));
+    ASSERT_EQ(0, stat(In("/run/vela/clients.lock").c_str(), &st));
     EXPECT_EQ(0600u, st.st_mode & 07777);
     limits.maxPerClient = 0;
     EXPECT_EQ(1, VELA::TakeClientSlot(limits, "192.0.2.7"));

@@ -228,12 +228,12 @@ TEST_F(WebEntryInit, UploadIdentityFromLeadingFields)
     VELA::Test::TempDir root;
     ASSERT_EQ(0, mkdir((root.Path() + "/tmp").c_str(), 0700));
     Set("VELA_ROOT", root.Path().c_str());
+    const auto field = [](const std::string& name, const std::string& value) {
+        return "--XyZ\r\nContent-Disposition: form-data; name=\"" + name + "\"\r\n\r\n" + value + "\r\n";
+    };
+    const std::string file = field("file\"; filename=\"a.txt", "hello");
     const std::string body =
-        "--XyZ\r\nContent-Disposition: form-data; name=\"api\"\r\n\r\nVELA.Sample\r\n"
-        "--XyZ\r\nContent-Disposition: form-data; name=\"version\"\r\n\r\n1\r\n"
-        "--XyZ\r\nContent-Disposition: form-data; name=\"method\"\r\n\r\nput\r\n"
-        "--XyZ\r\nContent-Disposition: form-data; name=\"file\"; filename=\"a.txt\"\r\n\r\nhello\r\n"
-        "--XyZ\r\nContent-Disposition: form-data; name=\"after\"\r\n\r\nyes\r\n"
+        field("api", "VELA.Sample") + field("version", "1") + field("method", "put") + file + field("after", "yes") +
         "--XyZ--\r\n";
     Set("REQUEST_METHOD", "POST");
     Set("CONTENT_TYPE", "multipart/form-data; boundary=XyZ");
@@ -249,9 +249,7 @@ TEST_F(WebEntryInit, UploadIdentityFromLeadingFields)
     EXPECT_EQ("hello", VELA::Test::ReadText(p["file"].asString()));
 
     // Without the identity before the first file part the upload is refused.
-    const std::string late =
-        "--XyZ\r\nContent-Disposition: form-data; name=\"file\"; filename=\"a.txt\"\r\n\r\nhello\r\n"
-        "--XyZ\r\nContent-Disposition: form-data; name=\"api\"\r\n\r\nVELA.Sample\r\n--XyZ--\r\n";
+    const std::string late = file + field("api", "VELA.Sample") + "--XyZ--\r\n";
     Set("CONTENT_LENGTH", std::to_string(late.size()).c_str());
     const Json::Value refused = InitializeWithBody(late, true);
     EXPECT_FALSE(refused["ok"].asBool());
