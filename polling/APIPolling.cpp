@@ -77,17 +77,6 @@ Json::Value StoredParams(APIRequest* req, bool* dropped)
     return *dropped ? Json::Value(Json::objectValue) : params;
 }
 
-bool SplitTaskId(const std::string& full, std::string& owner, std::string& id)
-{
-    const size_t slash = full.find('/');
-    if (slash == std::string::npos) {
-        return false;
-    }
-    owner = full.substr(0, slash);
-    id = full.substr(slash + 1);
-    return TARN::TaskUtil::isValidOwner(owner) && TARN::TaskUtil::isValidId(id);
-}
-
 // A task that is not finished, and whose worker is gone (or never came),
 // will never finish by itself.
 bool WorkerLost(const TARN::Task& task)
@@ -456,7 +445,7 @@ bool OpenTask(APIPolling* self, APIRequest* req, const std::string& fullId,
         return false;
     }
     std::string owner, id;
-    if (!SplitTaskId(fullId, owner, id)) {
+    if (!TARN::TaskUtil::splitFullId(fullId, owner, id)) {
         VELA_LOG_ERR("Invalid task id[%s]", fullId.c_str());
         self->SetError(WEBAPI_ERR_POLLING_BAD_TASK_ID);
         return false;

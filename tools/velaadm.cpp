@@ -352,19 +352,6 @@ std::string Column(const Json::Value& value, size_t max)
     return out;
 }
 
-// Splits "OWNER/ID" at its first "/". False unless both parts are valid
-// names of a task.
-bool ParseTaskId(const std::string& full, std::string& owner, std::string& id)
-{
-    const size_t slash = full.find('/');
-    if (slash == std::string::npos) {
-        return false;
-    }
-    owner = full.substr(0, slash);
-    id = full.substr(slash + 1);
-    return TARN::TaskUtil::isValidOwner(owner) && TARN::TaskUtil::isValidId(id);
-}
-
 const char kBadTaskId[] =
     "invalid task id: OWNER/ID expected (OWNER a user name, @administrators or @users; ID letters, digits, "
     "'.', '_' and '-')";
@@ -378,7 +365,7 @@ int OpenTask(const Args& args, const char* action, std::unique_ptr<TARN::Task>& 
     }
     std::string owner;
     std::string id;
-    if (!ParseTaskId(args.positional[0], owner, id)) {
+    if (!TARN::TaskUtil::splitFullId(args.positional[0], owner, id)) {
         return Usage(kBadTaskId);
     }
     task.reset(new TARN::Task(owner, id));

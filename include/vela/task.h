@@ -119,6 +119,10 @@ public:
     static std::string getUniqueID(const std::string& owner, const std::string& prefix);
 
     static bool checkTaskExists(const std::string& owner, const std::string& id);
+
+    // Splits a full task id "OWNER/ID" at its first "/". False unless both
+    // parts are valid names of a task.
+    static bool splitFullId(const std::string& full, std::string& owner, std::string& id);
 };
 
 class TaskMgr {

@@ -196,6 +196,17 @@ bool TaskUtil::checkTaskExists(const std::string& owner, const std::string& id)
     return lstat((OwnerDir(owner) + "/" + id).c_str(), &st) == 0 && S_ISREG(st.st_mode);
 }
 
+bool TaskUtil::splitFullId(const std::string& full, std::string& owner, std::string& id)
+{
+    const size_t slash = full.find('/');
+    if (slash == std::string::npos) {
+        return false;
+    }
+    owner = full.substr(0, slash);
+    id = full.substr(slash + 1);
+    return isValidOwner(owner) && isValidId(id);
+}
+
 // ---- TaskMgr ----------------------------------------------------------------------
 
 namespace {
