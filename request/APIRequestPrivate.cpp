@@ -17,6 +17,20 @@ namespace VELA {
 
 namespace {
 
+// A link id as the sharing store makes them: 22 characters of base64url.
+bool IsLinkId(const std::string& id)
+{
+    if (id.size() != 22) {
+        return false;
+    }
+    for (char c : id) {
+        if (!((c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' || c == '_')) {
+            return false;
+        }
+    }
+    return true;
+}
+
 const char* const kCategories[] = {"environ", "cookie", "reqLib", "session", "param", "attr", "url", "userAgent"};
 
 const char kMobilePattern[] =
@@ -219,6 +233,13 @@ void APIRequestPrivate::InitSharing()
     sharingID = GetText("environ", SZ_X_SHARING_HEADER);
     sharingSID = GetText("cookie", sharing::SZK_SHARING_SID);
     if (sharingID.empty()) {
+        return;
+    }
+    if (!IsLinkId(sharingID)) {
+        // Names no link: the database is not opened for it.
+        sharingEntry = sharing::record::Entry();
+        sharingSession = sharing::record::Session();
+        sharingToken = sharing::record::Token();
         return;
     }
     sharing::db::SharingDB& db = sharing::db::SharingDB::Instance();
