@@ -162,9 +162,9 @@ public:
     sharing::record::Token GetSharingToken() const;
     // The URL under which visitors reach this server's sharing page, derived
     // once from the request's host, port and scheme and the application
-    // ("HOST", else "REWRITE_APP"); `def` only when it was never derived.
-    // The URL is "" when the platform refused the host, port or name, with
-    // the type SHARING_URL_TYPE_NONE.
+    // ("HOST", else "REWRITE_APP"), or `def` when no URL is stored. The
+    // URL is "" when the platform refused the host, port or name, with the
+    // type SHARING_URL_TYPE_NONE.
     std::string GetSharingURL(const std::string& def = "") const;
     sharing::_tag_SHARING_URL_TYPE GetSharingURLType() const;
 

@@ -305,6 +305,22 @@ TEST_F(SharingCheckTest, HookRefusesWithTheStatusCodeAndRunsTheCheckAsTheLibrary
     EXPECT_EQ(123, Error());
 }
 
+// The checker front end: Initialize from the CGI environment, then only the
+// application's check.
+TEST_F(SharingCheckTest, SharingCheckerRunsOnlyTheApplicationsCheck)
+{
+    const record::Entry e = Link("probe");
+    for (const char* method : {"probe", "deny"}) {
+        const std::string query = std::string("api=VELA.Test.Share&version=1&method=") + method +
+                                  "&_sharing_id=" + e.get_hash() + "&_sharing_sid=" + Visit(e);
+        ScopedEnv get("REQUEST_METHOD", "GET");
+        ScopedEnv q("QUERY_STRING", query.c_str());
+        VELA::SharingChecker checker;
+        EXPECT_EQ(std::string(method) == "probe", checker.Run(Json::Value())) << method;
+        EXPECT_EQ(e.get_hash(), checker.GetRequest()->GetSharingID());
+    }
+}
+
 // The sample share handlers, called as the road would after the check: a
 // shared folder with a file, a sub-folder, and links that lead out of it.
 TEST_F(SharingCheckTest, SampleShareStaysInsideTheSharedFolder)
