@@ -1,6 +1,6 @@
 // The session permission check: whether a method needs a login, the
 // login-session / access-token verdict with its cache, the user classes and
-// application privilege of the API, and the sharing-link refusal.
+// application privilege of the API.
 //
 // The platform's verdict (VelaCgiIsAuthorizedEx, VelaAccessTokenGrant) is
 // computed at most once per process for each value of "allowTimeout" and kept
@@ -403,14 +403,6 @@ bool PermissionCheck::UserMayCall(APIRequest* req)
         return true;
     }
     return SkipPermission(req);
-}
-
-bool PermissionCheck::CheckSharingPermission(APIRequest* req, APIResponse* resp)
-{
-    // Sharing links are not served yet: refuse, whatever the link says.
-    VELA_REFUSE(resp, WEBAPI_ERR_NO_PERMISSION, "sharing links are not available; %s refused",
-                req != nullptr ? LogSafe(req->GetAPIClass()).c_str() : "request");
-    return false;
 }
 
 }  // namespace VELA

@@ -65,10 +65,6 @@ public:
     // when "authLevel" is 2. Logs no refusal, sets no error, stores nothing.
     bool UserMayCall(APIRequest* req);
 
-    // A call through a sharing link: refused (105) until sharing links are
-    // served.
-    static bool CheckSharingPermission(APIRequest* req, APIResponse* resp);
-
     // {"permResult": [verdict with timeout allowed, without]}.
     const Json::Value& Verdicts() const { return permission_; }
 

@@ -336,4 +336,23 @@ std::string APIRequest::GetSharingID() const { return d_->sharingID; }
 
 std::string APIRequest::GetSharingSID() const { return d_->sharingSID; }
 
+sharing::record::Entry APIRequest::GetSharingEntry() const { return d_->sharingEntry; }
+
+sharing::record::Session APIRequest::GetSharingSession() const { return d_->sharingSession; }
+
+sharing::record::Token APIRequest::GetSharingToken() const { return d_->sharingToken; }
+
+std::string APIRequest::GetSharingURL(const std::string& def) const
+{
+    d_->InitSharingURL();
+    const Json::Value& url = d_->GetData("url", "urlSharing", Json::Value::nullSingleton());
+    return url.isString() ? url.asString() : def;
+}
+
+sharing::_tag_SHARING_URL_TYPE APIRequest::GetSharingURLType() const
+{
+    d_->InitSharingURL();
+    return d_->sharingURLType;
+}
+
 }  // namespace VELA

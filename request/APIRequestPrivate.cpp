@@ -15,10 +15,21 @@
 
 namespace VELA {
 
-const char kSharingHeaderEnv[] = "HTTP_X_VELA_SHARING";
-const char kSharingSidCookie[] = "sharing_sid";
-
 namespace {
+
+// A link id as the sharing store makes them: 22 characters of base64url.
+bool IsLinkId(const std::string& id)
+{
+    if (id.size() != 22) {
+        return false;
+    }
+    for (char c : id) {
+        if (!((c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' || c == '_')) {
+            return false;
+        }
+    }
+    return true;
+}
 
 const char* const kCategories[] = {"environ", "cookie", "reqLib", "session", "param", "attr", "url", "userAgent"};
 
@@ -83,7 +94,11 @@ APIRequestPrivate::APIRequestPrivate(const APIRequestPrivate& other, APIRequest*
       owner(owner_),
       sharingInfo(other.sharingInfo),
       sharingID(other.sharingID),
-      sharingSID(other.sharingSID)
+      sharingSID(other.sharingSID),
+      sharingEntry(other.sharingEntry),
+      sharingSession(other.sharingSession),
+      sharingToken(other.sharingToken),
+      sharingURLType(other.sharingURLType)
 {
 }
 
@@ -209,12 +224,59 @@ void APIRequestPrivate::InitRequestMethod()
     }
 }
 
-// The sharing identifiers are re-read at every environment merge. The
-// records behind them come with the sharing store.
+// The sharing identifiers are re-read at every environment merge. Only a
+// request that names a link opens the sharing database (and so loads
+// libsqlite3); the records are judged by the permission check, a record
+// that is not found stays empty.
 void APIRequestPrivate::InitSharing()
 {
-    sharingID = GetText("environ", kSharingHeaderEnv);
-    sharingSID = GetText("cookie", kSharingSidCookie);
+    sharingID = GetText("environ", SZ_X_SHARING_HEADER);
+    sharingSID = GetText("cookie", sharing::SZK_SHARING_SID);
+    if (sharingID.empty()) {
+        return;
+    }
+    if (!IsLinkId(sharingID)) {
+        // Names no link: the database is not opened for it.
+        sharingEntry = sharing::record::Entry();
+        sharingSession = sharing::record::Session();
+        sharingToken = sharing::record::Token();
+        return;
+    }
+    sharing::db::SharingDB& db = sharing::db::SharingDB::Instance();
+    sharing::db::EntryDB entries(db);
+    sharing::db::SessionDB sessions(db);
+    sharing::db::TokenDB tokens(db);
+    if (db.IsGood()) {
+        entries.GetByHash(sharingID, sharingEntry);
+        sessions.GetBySessionId(sharingSID, sharingSession);
+        tokens.GetBySessionEntry(sharingSession, sharingEntry, sharingToken);
+    }
+    tokens.Close();
+    sessions.Close();
+    entries.Close();
+}
+
+// The application named by the virtual host ("HOST"), else by the rewrite
+// rule that brought the request ("REWRITE_APP"). The platform refuses a
+// host, port or name it does not accept and leaves the URL empty; whatever
+// it left is kept, so the URL is derived once per request.
+void APIRequestPrivate::InitSharingURL()
+{
+    if (HasData("url", "urlSharing")) {
+        return;
+    }
+    std::string app = GetText("environ", "HOST");
+    if (app.empty()) {
+        app = GetText("environ", "REWRITE_APP");
+    }
+    const std::string host = owner->GetURLHost("");
+    const int port = owner->GetURLPort(0);
+    const bool https = owner->GetURLProto("http") == "https";
+    std::string url;
+    sharing::_tag_SHARING_URL_TYPE type = sharing::SHARING_URL_TYPE_NONE;
+    sharing::GetSharingURL(host, port, https, app, url, type);
+    SetData("url", "urlSharing", Json::Value(url), true);
+    sharingURLType = type;
 }
 
 // ---- URL ------------------------------------------------------------------

@@ -8,15 +8,11 @@
 #include <sys/types.h>
 
 #include "base/APIBase.h"
+#include "vela/sharing.h"
 #include "webapi/APIParameter.h"
 #include "webapi/APIRequest.h"
 
 namespace VELA {
-
-// Name of the sharing-link header as the CGI environment presents it, and of
-// the sharing session cookie.
-extern const char kSharingHeaderEnv[];
-extern const char kSharingSidCookie[];
 
 class APIRequestPrivate : public APIBase {
 public:
@@ -31,7 +27,11 @@ public:
 
     void InitCookie();
     void InitRequestMethod();
+    // Re-reads the sharing id and session id; with a sharing id, looks the
+    // link, the visitor session and the token binding them up.
     void InitSharing();
+    // Derives the sharing URL once ("url"/"urlSharing", sharingURLType).
+    void InitSharingURL();
     void InitURL();
     bool ParseProtocol();
     bool ParseHostAndPort();
@@ -62,6 +62,10 @@ public:
     Json::Value sharingInfo;
     std::string sharingID;
     std::string sharingSID;
+    sharing::record::Entry sharingEntry;
+    sharing::record::Session sharingSession;
+    sharing::record::Token sharingToken;
+    sharing::_tag_SHARING_URL_TYPE sharingURLType = sharing::SHARING_URL_TYPE_NONE;
 };
 
 }  // namespace VELA

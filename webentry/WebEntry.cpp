@@ -12,11 +12,13 @@
 #include <string>
 #include <unistd.h>
 
+#include "access/SharingCheck.h"
 #include "request/APIRequestPrivate.h"
 #include "request/EncryptedParams.h"
 #include "request/RequestFacts.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
+#include "vela/sharing.h"
 #include "vela/upload.h"
 #include "vela/vlibc.h"
 #include "vela/uploaddir.h"
@@ -154,7 +156,7 @@ bool MoveSharingParams(const IdentityParams& p, bool cookieCameIn, APIResponse* 
         return true;
     }
     sharingHeader = p.sharingId;
-    if (!SetEnv(kSharingHeaderEnv, sharingHeader, resp)) {
+    if (!SetEnv(SZ_X_SHARING_HEADER, sharingHeader, resp)) {
         return false;
     }
     if (!p.hasSharingSid) {
@@ -163,7 +165,7 @@ bool MoveSharingParams(const IdentityParams& p, bool cookieCameIn, APIResponse* 
     if (cookieCameIn) {
         cookie += "; ";
     }
-    cookie += std::string(kSharingSidCookie) + "=" + p.sharingSid;
+    cookie += std::string(sharing::SZK_SHARING_SID) + "=" + p.sharingSid;
     return SetEnv("HTTP_COOKIE", cookie, resp);
 }
 
@@ -209,7 +211,7 @@ bool MoveIdentityParams(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)
     }
 
     std::string cookie = RequestFacts::Text(req->GetEnv("HTTP_COOKIE"));
-    std::string sharingHeader = RequestFacts::Text(req->GetEnv(kSharingHeaderEnv));
+    std::string sharingHeader = RequestFacts::Text(req->GetEnv(SZ_X_SHARING_HEADER));
     const bool cookieCameIn = !cookie.empty();
     if (!MoveSharingParams(p, cookieCameIn, resp, cookie, sharingHeader) ||
         !MoveSessionParams(p, cookieCameIn, resp, cookie)) {
@@ -220,7 +222,7 @@ bool MoveIdentityParams(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)
     VelaCgiLoadInCookies(cgi);
     Json::Value env(Json::objectValue);
     env["HTTP_COOKIE"] = cookie;
-    env[kSharingHeaderEnv] = sharingHeader;
+    env[SZ_X_SHARING_HEADER] = sharingHeader;
     req->InitEnv(env);
     return true;
 }
@@ -483,7 +485,39 @@ bool WebEntry::ProcessRelay(APIRequest* req, APIResponse* resp)
 
 bool WebEntry::CheckSharingPermission(APIRequest* req, APIResponse* resp)
 {
-    return PermissionCheck::CheckSharingPermission(req, resp);
+    return SharingCheck::CheckSharingPermission(*this, req, resp, cgi_);
+}
+
+std::string WebEntry::GetSharingCheckLibPath(APIRequest* req) { return SharingCheck::GetSharingCheckLibPath(req); }
+
+bool WebEntry::OpenSharingCheckLib(APIRequest* req, _tag_API_SHARING_CHECK_TABLE** table)
+{
+    return SharingCheck::OpenSharingCheckLib(req, table);
+}
+
+bool WebEntry::GetSharingCheckTableFunc(void* handle, _tag_API_SHARING_CHECK_TABLE** table)
+{
+    return SharingCheck::GetSharingCheckTableFunc(handle, table);
+}
+
+bool WebEntry::GetSharingCheckFunc(APIRequest* req, _tag_API_SHARING_CHECK_TABLE* table,
+                                   bool (**check)(APIRequest*, APIResponse*))
+{
+    return SharingCheck::GetSharingCheckFunc(req, table, check);
+}
+
+int WebEntry::RegexMatch(const char* pattern, const char* text) { return SharingCheck::RegexMatch(pattern, text); }
+
+bool WebEntry::CheckSharingAppPermission(APIRequest* req, APIResponse* resp)
+{
+    return SharingCheck::CheckSharingAppPermission(req, resp);
+}
+
+void WebEntry::InitSharingSession(APIRequest* req) { SharingCheck::InitSharingSession(req, cgi_); }
+
+bool SharingChecker::Run(const Json::Value& unused)
+{
+    return Initialize(unused) && CheckSharingAppPermission(GetRequest(), GetResponseObject());
 }
 
 bool WebEntry::NeedPermission(APIRequest* req) { return PermissionCheck::NeedPermission(req); }

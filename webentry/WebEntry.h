@@ -11,6 +11,7 @@
 #include <string>
 
 #include "access/PermissionCheck.h"
+#include "webapi/APITable.h"
 #include "vela/cgi.h"
 #include "webapi/APIRunner.h"
 
@@ -33,6 +34,16 @@ public:
     // The session check itself: the error code for the platform's verdict
     // (0 allowed), computed at most once per value of `allowTimeout`.
     int CheckPermission(bool allowTimeout);
+
+    // ---- Sharing links: answered by SharingCheck (access/SharingCheck.h) ----
+    std::string GetSharingCheckLibPath(APIRequest* req);
+    bool OpenSharingCheckLib(APIRequest* req, _tag_API_SHARING_CHECK_TABLE** table);
+    bool GetSharingCheckTableFunc(void* handle, _tag_API_SHARING_CHECK_TABLE** table);
+    bool GetSharingCheckFunc(APIRequest* req, _tag_API_SHARING_CHECK_TABLE* table,
+                             bool (**check)(APIRequest*, APIResponse*));
+    int RegexMatch(const char* pattern, const char* text);
+    bool CheckSharingAppPermission(APIRequest* req, APIResponse* resp);
+    void InitSharingSession(APIRequest* req);
 
     // ---- Uploads ----
     bool HandleUpload(APIRequest* req, APIResponse* resp) override;
@@ -63,6 +74,14 @@ protected:
     VELACGI_CTX* cgi_;
     Json::Value uploadedFiles_;   // stored files of the upload, in body order
     PermissionCheck permission_;  // the session check and its verdict cache
+};
+
+// A front end that only asks the sharing check library of a link whether
+// the call the CGI environment names may be made: Run is Initialize, then
+// CheckSharingAppPermission on the request and response.
+class SharingChecker : public WebEntry {
+public:
+    bool Run(const Json::Value& unused) override;
 };
 
 // After-reply callback: asks the platform to restart the web server.

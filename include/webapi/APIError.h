@@ -25,6 +25,13 @@ enum _tag_WEBAPI_ERR {
     WEBAPI_ERR_NOT_AUTHENTICATED = 119,     // not logged in
     WEBAPI_ERR_METHOD_NOT_IN_TABLE = 121,   // method missing from the library's table
     WEBAPI_ERR_SHARING_FIRST = 122,         // 122..127: sharing-link refusals
+    WEBAPI_ERR_SHARING_NO_LINK = 122,       // no such link, or a malformed link id
+    WEBAPI_ERR_SHARING_LINK_ENDED = 123,    // link revoked, expired, or every use spent
+    WEBAPI_ERR_SHARING_NO_SESSION = 124,    // no visitor session of this link: open the link again
+    WEBAPI_ERR_SHARING_SESSION_TIMEOUT = 125, // the visitor session ended: open the link again
+    WEBAPI_ERR_SHARING_REFUSED = 126,       // not a sharing call, the method or the application refuses it,
+                                            // or the link could not be checked
+    WEBAPI_ERR_SHARING_REMOTE_IP = 127,     // the session belongs to another client address
     WEBAPI_ERR_SHARING_LAST = 127,
     WEBAPI_ERR_REMOTE_IP = 150,             // client address refused for this session
     // Background tasks (APIPolling), named after what went wrong:

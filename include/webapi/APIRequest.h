@@ -14,6 +14,7 @@
 #include <sys/types.h>
 
 #include "vela/authresult.h"
+#include "vela/sharing.h"
 #include "webapi/APIParameter.h"
 
 namespace VELA {
@@ -148,9 +149,24 @@ public:
     bool IsSliceUploadRequest() const;
 
     // ---- Sharing link ----
+    // A request is a sharing request when it names a link (the sharing
+    // header, or "_sharing_id" moved there by the front end). The records
+    // are those the sharing database held when the environment was set;
+    // a record that was not found is empty. Nothing here says whether the
+    // visitor may go on: the sharing permission check judges the records.
     bool IsSharing() const;
     std::string GetSharingID() const;
     std::string GetSharingSID() const;
+    sharing::record::Entry GetSharingEntry() const;
+    sharing::record::Session GetSharingSession() const;
+    sharing::record::Token GetSharingToken() const;
+    // The URL under which visitors reach this server's sharing page, derived
+    // once from the request's host, port and scheme and the application
+    // ("HOST", else "REWRITE_APP"), or `def` when no URL is stored. The
+    // URL is "" when the platform refused the host, port or name, with the
+    // type SHARING_URL_TYPE_NONE.
+    std::string GetSharingURL(const std::string& def = "") const;
+    sharing::_tag_SHARING_URL_TYPE GetSharingURLType() const;
 
     // ---- Typed parameters ----
     // Each looks `name` up in the parameters and returns it typed, with its

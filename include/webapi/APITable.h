@@ -44,10 +44,37 @@ typedef struct _tag_API_CHECK_TABLE {
     void* reserved2;      // set to null
 } API_CHECK_TABLE;
 
+// A sharing check library (<root>/usr/lib/sharing/permission_lib/<project>.so,
+// one per application that makes sharing links) decides which calls a
+// visitor of its links may make. It exports, with C linkage:
+//   int GetAPISharingCheckTable(_tag_API_SHARING_CHECK_TABLE** table);
+// which stores the first entry of a static array (ended by an entry whose
+// api pattern is null) and returns non-zero. The first entry that matches
+// the call (version, then api, then method) gives the check; a call that no
+// entry matches is refused. Patterns are POSIX extended regular expressions,
+// unanchored unless written with ^ and $, or "*" for every name:
+//
+//   static _tag_API_SHARING_CHECK_TABLE table[] = {
+//       {"^VELA\\.Sample\\.Share$", 1, "^download$", CheckDownload},
+//       {"^VELA\\.Sample\\.Share$", 0, "*", CheckAny},
+//       {nullptr, 0, nullptr, nullptr},
+//   };
+//
+// The check runs as the owner and group of the library file and returns
+// true to let the visitor go on.
+typedef struct _tag_API_SHARING_CHECK_TABLE {
+    const char* api;      // api pattern or "*"; null ends the table
+    int version;          // 0: every version
+    const char* method;   // method pattern or "*"
+    APICheckFn check;
+} API_SHARING_CHECK_TABLE;
+
 static_assert(sizeof(_tag_API_TABLE) == 4 * sizeof(void*), "API table entries are four words");
+static_assert(sizeof(_tag_API_SHARING_CHECK_TABLE) == 4 * sizeof(void*), "sharing check entries are four words");
 static_assert(sizeof(_tag_API_CHECK_TABLE) == 6 * sizeof(void*), "check table entries are six words");
 
 extern "C" {
 typedef _tag_API_TABLE* (*GetAPITableFn)(void);
 typedef _tag_API_CHECK_TABLE* (*GetAPICheckTableFn)(void);
+typedef int (*GetAPISharingCheckTableFn)(_tag_API_SHARING_CHECK_TABLE** table);
 }

@@ -388,8 +388,8 @@ TEST_F(PermissionCheckTest, WebEntryHooksCheckTheSessionOfItsRequest)
 
     LogCapture log;
     EXPECT_FALSE(entry.CheckSharingPermission(req, resp));
-    EXPECT_EQ(105, resp->GetError());
-    EXPECT_TRUE(log.Contains("sharing links are not available"));
+    EXPECT_EQ(126, resp->GetError());
+    EXPECT_TRUE(log.Contains("not a sharing request"));
 }
 
 }  // namespace
