@@ -617,9 +617,13 @@ bool ReadPassword(int fd, std::string& out, std::string& problem)
         --end;
     }
     out.assign(buf, end);
-    if (out.empty() || out.size() > VELA::sharing::kMaxPassword || Printable(out) != out) {
+    bool control = false;
+    for (unsigned char c : out) {
+        control = control || c < 0x20 || c == 0x7f;
+    }
+    if (out.empty() || out.size() > VELA::sharing::kMaxPassword || control) {
         problem = "the password must be 1 to " + std::to_string(VELA::sharing::kMaxPassword) +
-                  " printable bytes on its first line";
+                  " bytes without control characters on its first line";
         return false;
     }
     return true;

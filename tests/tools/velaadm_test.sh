@@ -159,8 +159,13 @@ refused 2 "\-\-uses must be" link create --owner nobody --project p --path /srv/
 refused 1 "No such file" link create --owner nobody --project p --path /srv/none
 refused 1 "no user" link create --owner vela-no-such-user --project p --path /srv/photos
 expect 1 link create --owner nobody --project ../p --path /srv/photos
-: | "$ADM" link create --owner nobody --project p --path /srv/photos --password-stdin >"$OUT" 2>"$ERR" &&
-    fail "an empty password was taken"
+for pw in '' 'a\tb' "$(head -c 300 /dev/zero | tr '\0' x)"; do
+    printf "$pw\n" | "$ADM" link create --owner nobody --project p --path /srv/photos --password-stdin \
+        >"$OUT" 2>"$ERR" && fail "the password \"$pw\" was taken"
+    stderr_has "the password must be 1 to 256 bytes"
+done
+printf 'p\303\244ss\n' | "$ADM" link create --owner nobody --project p --path /srv/photos --password-stdin \
+    >"$OUT" 2>"$ERR" || fail "a UTF-8 password was refused"
 
 expect 0 link create --owner nobody --project vela.photos --path /srv/photos/alias --expires 3600 \
     --uses 5 --match-ip --password-file "$VELA_ROOT/srv/pw"
@@ -174,6 +179,7 @@ lid2=$(sed -n 's/^id=//p' "$OUT")
 expect 0 link list
 stdout_has "^$lid *nobody *vela.photos .* 0/5 *active */srv/photos/a.txt \[password\] \[match-ip\]$"
 stdout_has "^$lid2 *root .* never *0 *active */srv/photos \[password\]$"
+stdout_has "^[A-Za-z0-9_-]* *nobody *p .* never *0 *active */srv/photos \[password\]$"
 expect 0 link list --owner nobody
 stdout_lacks "$lid2"
 expect 0 link show "$lid"
