@@ -1,5 +1,5 @@
-// velaadm: administration of login sessions, access tokens and background
-// tasks, and the server's public key. Works on the state under VELA_ROOT
+// velaadm: administration of login sessions, access tokens, background
+// tasks and sharing links, and the server's public key. Works on the state under VELA_ROOT
 // ("/" by default).
 //
 // Exit status: 0 success, 1 the operation failed, 2 a usage error.
@@ -10,6 +10,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <fcntl.h>
 #include <json/json.h>
 #include <memory>
 #include <string>
@@ -23,8 +24,10 @@
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/session.h"
+#include "vela/sharing.h"
 #include "vela/task.h"
 #include "vela/token.h"
+#include "vela/user.h"
 
 namespace {
 
@@ -56,6 +59,20 @@ const char kUsage[] =
     "  task stop <OWNER/ID> [--remove]\n"
     "        Sends SIGTERM to the task's worker when it still runs and marks the\n"
     "        task finished; --remove deletes its record instead.\n"
+    "  link create --owner USER --project NAME --path PATH [--expires SECONDS]\n"
+    "              [--password-file FILE | --password-stdin] [--uses N] [--match-ip]\n"
+    "        Creates a sharing link to the file or folder PATH (absolute, under\n"
+    "        VELA_ROOT) for visitors without an account, and prints its id and the\n"
+    "        path of its sharing URL. --expires: lifetime in seconds (default:\n"
+    "        none); the password is read from FILE or standard input (its first\n"
+    "        line), never from the command line; --uses limits the visitor\n"
+    "        sessions it may open; --match-ip keeps a visitor to the address that\n"
+    "        opened the session.\n"
+    "  link list [--owner USER]\n"
+    "  link show <id>\n"
+    "        Prints the link's record (JSON), without the password's hash.\n"
+    "  link revoke <id>\n"
+    "        Ends the link and every visitor session of it.\n"
     "  pubkey\n"
     "        Prints the server's public key for encrypted parameters (PEM).\n"
     "\n"
@@ -505,6 +522,307 @@ int TaskStop(int argc, char** argv)
     return 0;
 }
 
+// ---- Sharing links -------------------------------------------------------------
+
+namespace sdb = VELA::sharing::db;
+namespace srec = VELA::sharing::record;
+
+// Ten years: --expires counts from now.
+constexpr long long kLinkExpiresMax = 10LL * 366 * 86400;
+
+std::string Printable(const std::string& text)
+{
+    std::string out = text;
+    for (char& c : out) {
+        if (c < 0x20 || c > 0x7e) {
+            c = '?';
+        }
+    }
+    return out;
+}
+
+bool IsLinkId(const std::string& id)
+{
+    return id.size() == 22 && VELA::System::IsCheckedName(id, VELA::System::kNameId, 22);
+}
+
+// A system path as links keep it: absolute, printable, no "." or ".." part.
+bool IsLinkPath(const std::string& path)
+{
+    if (path.empty() || path.size() > VELA::sharing::kMaxPath || path[0] != '/' || Printable(path) != path) {
+        return false;
+    }
+    const std::string padded = path + "/";
+    return padded.find("/./") == std::string::npos && padded.find("/../") == std::string::npos;
+}
+
+// `path` resolved under the root with every link on the way followed, as a
+// system path again. False (with `problem`) unless it is an existing file
+// or directory inside the root.
+bool ResolveLinkPath(const std::string& path, std::string& stored, std::string& problem)
+{
+    char* real = realpath(VELA::System::Path(path).c_str(), nullptr);
+    const int err = errno;
+    char* root = realpath(VELA::System::Root().c_str(), nullptr);
+    struct stat st;
+    std::string r = real != nullptr ? real : "";
+    const std::string top = root != nullptr ? root : "";
+    free(real);
+    free(root);
+    if (r.empty() || top.empty()) {
+        problem = path + ": " + strerror(err);
+        return false;
+    }
+    if (stat(r.c_str(), &st) != 0 || (!S_ISDIR(st.st_mode) && !S_ISREG(st.st_mode))) {
+        problem = path + ": not a file or directory";
+        return false;
+    }
+    if (top != "/") {
+        if (r.compare(0, top.size() + 1, top + "/") != 0) {
+            problem = path + ": leads out of the system root";
+            return false;
+        }
+        r.erase(0, top.size());
+    }
+    stored = r;
+    return true;
+}
+
+// The password: the first line of `fd`, without its line end, 1 to
+// kMaxPassword bytes. False (with `problem`) otherwise.
+bool ReadPassword(int fd, std::string& out, std::string& problem)
+{
+    char buf[VELA::sharing::kMaxPassword + 2];
+    size_t len = 0;
+    while (len < sizeof(buf)) {
+        const ssize_t n = read(fd, buf + len, sizeof(buf) - len);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n < 0) {
+            problem = std::string("cannot read the password: ") + strerror(errno);
+            return false;
+        }
+        if (n == 0) {
+            break;
+        }
+        len += static_cast<size_t>(n);
+        if (memchr(buf, '\n', len) != nullptr) {
+            break;
+        }
+    }
+    const char* nl = static_cast<const char*>(memchr(buf, '\n', len));
+    size_t end = nl != nullptr ? static_cast<size_t>(nl - buf) : len;
+    if (end > 0 && buf[end - 1] == '\r') {
+        --end;
+    }
+    out.assign(buf, end);
+    bool control = false;
+    for (unsigned char c : out) {
+        control = control || c < 0x20 || c == 0x7f;
+    }
+    if (out.empty() || out.size() > VELA::sharing::kMaxPassword || control) {
+        problem = "the password must be 1 to " + std::to_string(VELA::sharing::kMaxPassword) +
+                  " bytes without control characters on its first line";
+        return false;
+    }
+    return true;
+}
+
+bool ReadPasswordFile(const std::string& file, std::string& out, std::string& problem)
+{
+    const int fd = open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
+    struct stat st;
+    if (fd < 0 || fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+        problem = file + ": " + (fd < 0 ? strerror(errno) : "not a regular file");
+        if (fd >= 0) {
+            close(fd);
+        }
+        return false;
+    }
+    const bool ok = ReadPassword(fd, out, problem);
+    close(fd);
+    return ok;
+}
+
+std::string LinkUrlPath(const srec::Entry& e) { return "/sharing/" + e.get_project_name() + "/" + e.get_hash(); }
+
+int LinkCreate(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {"--owner", "--project", "--path", "--expires", "--password-file", "--uses"},
+                   {"--password-stdin", "--match-ip"}, args, problem)) {
+        return Usage(problem.c_str());
+    }
+    if (!args.positional.empty()) {
+        return Usage("link create takes no positional arguments");
+    }
+    sdb::LinkSpec spec;
+    std::string path;
+    std::string passwordFile;
+    bool passwordStdin = false;
+    long long expires = 0;
+    for (const auto& opt : args.options) {
+        if (opt.first == "--owner") {
+            spec.userName = opt.second;
+        } else if (opt.first == "--project") {
+            spec.projectName = opt.second;
+        } else if (opt.first == "--path") {
+            path = opt.second;
+        } else if (opt.first == "--expires") {
+            if (!ParseSeconds(opt.second.c_str(), kLinkExpiresMax, expires)) {
+                return Usage(("--expires must be 1 to " + std::to_string(kLinkExpiresMax) + " seconds").c_str());
+            }
+        } else if (opt.first == "--uses") {
+            if (!ParseSeconds(opt.second.c_str(), VELA::sharing::kMaxUseLimit, spec.useLimit)) {
+                return Usage(("--uses must be 1 to " + std::to_string(VELA::sharing::kMaxUseLimit)).c_str());
+            }
+        } else if (opt.first == "--password-file") {
+            passwordFile = opt.second;
+        } else if (opt.first == "--password-stdin") {
+            passwordStdin = true;
+        } else if (opt.first == "--match-ip") {
+            spec.enableMatchIP = true;
+        }
+    }
+    if (spec.userName.empty() || spec.projectName.empty() || path.empty()) {
+        return Usage("link create needs --owner, --project and --path");
+    }
+    if (passwordStdin && !passwordFile.empty()) {
+        return Usage("--password-file and --password-stdin exclude each other");
+    }
+    if (!IsLinkPath(path)) {
+        return Usage("--path must be an absolute path of printable bytes without \".\" or \"..\" parts");
+    }
+    gid_t gid = 0;
+    if (VELAUserGetUGID(spec.userName.c_str(), &spec.uid, &gid) != 0) {
+        return Fail("no user \"" + Printable(spec.userName) + "\"");
+    }
+    if (!ResolveLinkPath(path, spec.path, problem)) {
+        return Fail(Printable(problem));
+    }
+    if ((passwordStdin && !ReadPassword(STDIN_FILENO, spec.password, problem)) ||
+        (!passwordFile.empty() && !ReadPasswordFile(passwordFile, spec.password, problem))) {
+        return Fail(problem);
+    }
+    spec.expireTime = expires == 0 ? 0 : static_cast<long long>(time(nullptr)) + expires;
+    srec::Entry entry;
+    if (!sdb::EntryDB(sdb::SharingDB::Instance()).Create(spec, entry)) {
+        return Fail("cannot create the link");
+    }
+    printf("id=%s\nurl=%s\n", entry.get_hash().c_str(), LinkUrlPath(entry).c_str());
+    return 0;
+}
+
+int LinkList(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {"--owner"}, {}, args, problem)) {
+        return Usage(problem.c_str());
+    }
+    if (!args.positional.empty() || args.options.size() > 1) {
+        return Usage("link list takes at most one --owner");
+    }
+    sdb::EntryDB entries(sdb::SharingDB::Instance());
+    std::vector<srec::Entry> links;
+    bool ok = false;
+    if (args.options.empty()) {
+        ok = entries.ListAll(links);
+    } else {
+        uid_t uid = 0;
+        gid_t gid = 0;
+        if (VELAUserGetUGID(args.options[0].second.c_str(), &uid, &gid) != 0) {
+            return Fail("no user \"" + Printable(args.options[0].second) + "\"");
+        }
+        ok = entries.ListByOwner(uid, links);
+    }
+    if (!ok) {
+        return Fail("cannot list the sharing links");
+    }
+    const long long now = static_cast<long long>(time(nullptr));
+    printf("%-22s  %-16s  %-16s  %-20s  %-20s  %-11s  %-8s  %s\n", "ID", "OWNER", "PROJECT", "CREATED", "EXPIRES",
+           "USES", "STATE", "PATH");
+    for (const srec::Entry& e : links) {
+        const char* state = "active";
+        if (e.is_revoked()) {
+            state = "revoked";
+        } else if (e.get_expire_time() != 0 && e.get_expire_time() <= now) {
+            state = "expired";
+        }
+        std::string uses = std::to_string(e.get_use_count());
+        if (e.get_use_limit() != 0) {
+            uses += "/" + std::to_string(e.get_use_limit());
+        }
+        printf("%-22s  %-16s  %-16s  %-20s  %-20s  %-11s  %-8s  %s%s%s\n", e.get_hash().c_str(),
+               Printable(e.get_user_name()).c_str(), e.get_project_name().c_str(),
+               FormatTime(e.get_create_time()).c_str(),
+               e.get_expire_time() == 0 ? "never" : FormatTime(e.get_expire_time()).c_str(), uses.c_str(), state,
+               Printable(e.get_path()).c_str(), e.has_password() ? " [password]" : "",
+               e.get_enable_match_ip() ? " [match-ip]" : "");
+    }
+    return 0;
+}
+
+// The link named by the one positional argument. Its exit status on
+// failure, 0 when `entry` is loaded.
+int OpenLink(int argc, char** argv, const char* action, srec::Entry& entry)
+{
+    if (argc != 4) {
+        return Usage((std::string("link ") + action + " needs exactly one link id").c_str());
+    }
+    if (!IsLinkId(argv[3])) {
+        return Usage("invalid link id: 22 characters of letters, digits, '-' and '_'");
+    }
+    if (!sdb::EntryDB(sdb::SharingDB::Instance()).GetByHash(argv[3], entry)) {
+        return Fail("no link with that id");
+    }
+    return 0;
+}
+
+int LinkShow(int argc, char** argv)
+{
+    srec::Entry e;
+    const int rc = OpenLink(argc, argv, "show", e);
+    if (rc != 0) {
+        return rc;
+    }
+    Json::Value out(Json::objectValue);
+    out["id"] = e.get_hash();
+    out["url"] = LinkUrlPath(e);
+    out["project"] = e.get_project_name();
+    out["path"] = e.get_path();
+    out["owner"] = e.get_user_name();
+    out["uid"] = static_cast<Json::UInt>(e.get_uid());
+    out["created"] = static_cast<Json::Int64>(e.get_create_time());
+    out["expires"] = static_cast<Json::Int64>(e.get_expire_time());
+    out["hasPassword"] = e.has_password();
+    out["useLimit"] = static_cast<Json::Int64>(e.get_use_limit());
+    out["useCount"] = static_cast<Json::Int64>(e.get_use_count());
+    out["matchIP"] = e.get_enable_match_ip();
+    out["revoked"] = e.is_revoked();
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "  ";
+    builder["emitUTF8"] = false;
+    printf("%s\n", Json::writeString(builder, out).c_str());
+    return 0;
+}
+
+int LinkRevoke(int argc, char** argv)
+{
+    srec::Entry e;
+    const int rc = OpenLink(argc, argv, "revoke", e);
+    if (rc != 0) {
+        return rc;
+    }
+    if (!e.is_revoked() && !sdb::EntryDB(sdb::SharingDB::Instance()).Revoke(e.get_hash())) {
+        return Fail("cannot revoke the link");
+    }
+    printf("link revoked\n");
+    return 0;
+}
+
 int PublicKey(int argc, char** argv)
 {
     if (argc != 2) {
@@ -549,6 +867,23 @@ int Run(int argc, char** argv)
             return TaskStop(argc, argv);
         }
         return Usage(("unknown action \"" + action + "\" for task").c_str());
+    }
+    if (command == "link") {
+        const std::string action = argc < 3 ? "" : argv[2];
+        if (action == "create") {
+            return LinkCreate(argc, argv);
+        }
+        if (action == "list") {
+            return LinkList(argc, argv);
+        }
+        if (action == "show") {
+            return LinkShow(argc, argv);
+        }
+        if (action == "revoke") {
+            return LinkRevoke(argc, argv);
+        }
+        return Usage(argc < 3 ? "link needs an action: create, list, show or revoke"
+                              : ("unknown action \"" + action + "\" for link").c_str());
     }
     if (command != "session" && command != "token") {
         return Usage(("unknown command \"" + command + "\"").c_str());

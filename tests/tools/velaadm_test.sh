@@ -144,6 +144,60 @@ wait "$worker"
 worker=
 [ ! -e "$tasks/alice/sum-1" ] || fail "stop --remove left the record"
 
+# ---- sharing links. The password never reaches the command line; list and
+# show never print its hash; a path must exist below the root.
+mkdir -p "$VELA_ROOT/srv/photos" && echo data >"$VELA_ROOT/srv/photos/a.txt"
+ln -s ../photos/a.txt "$VELA_ROOT/srv/photos/alias"
+printf 'Pw-one\nsecond line\n' >"$VELA_ROOT/srv/pw"
+refused 2 "needs --owner, --project and --path" link create --owner nobody --path /srv/photos
+refused 2 "exclude each other" link create --owner nobody --project p --path /srv/photos \
+    --password-stdin --password-file "$VELA_ROOT/srv/pw"
+refused 2 "unknown option --password" link create --owner nobody --project p --path /srv/photos --password x
+refused 2 "\-\-path must be" link create --owner nobody --project p --path srv/photos
+refused 2 "\-\-path must be" link create --owner nobody --project p --path /srv/../etc
+refused 2 "\-\-uses must be" link create --owner nobody --project p --path /srv/photos --uses 0
+refused 1 "No such file" link create --owner nobody --project p --path /srv/none
+refused 1 "no user" link create --owner vela-no-such-user --project p --path /srv/photos
+expect 1 link create --owner nobody --project ../p --path /srv/photos
+for pw in '' 'a\tb' "$(head -c 300 /dev/zero | tr '\0' x)"; do
+    printf "$pw\n" | "$ADM" link create --owner nobody --project p --path /srv/photos --password-stdin \
+        >"$OUT" 2>"$ERR" && fail "the password \"$pw\" was taken"
+    stderr_has "the password must be 1 to 256 bytes"
+done
+printf 'p\303\244ss\n' | "$ADM" link create --owner nobody --project p --path /srv/photos --password-stdin \
+    >"$OUT" 2>"$ERR" || fail "a UTF-8 password was refused"
+
+expect 0 link create --owner nobody --project vela.photos --path /srv/photos/alias --expires 3600 \
+    --uses 5 --match-ip --password-file "$VELA_ROOT/srv/pw"
+lid=$(sed -n 's/^id=//p' "$OUT")
+echo "$lid" | grep -Eq '^[A-Za-z0-9_-]{22}$' || fail "link id \"$lid\" has the wrong form"
+stdout_has "^url=/sharing/vela.photos/$lid$"
+printf 'Pw-two\n' | "$ADM" link create --owner root --project p --path /srv/photos --password-stdin >"$OUT" 2>"$ERR" ||
+    fail "link create with --password-stdin failed"
+lid2=$(sed -n 's/^id=//p' "$OUT")
+
+expect 0 link list
+stdout_has "^$lid *nobody *vela.photos .* 0/5 *active */srv/photos/a.txt \[password\] \[match-ip\]$"
+stdout_has "^$lid2 *root .* never *0 *active */srv/photos \[password\]$"
+stdout_has "^[A-Za-z0-9_-]* *nobody *p .* never *0 *active */srv/photos \[password\]$"
+expect 0 link list --owner nobody
+stdout_lacks "$lid2"
+expect 0 link show "$lid"
+stdout_has '"hasPassword" : true'
+stdout_has '"useLimit" : 5'
+stdout_lacks "Pw-one"
+grep -q '"path" : "/srv/photos/a.txt"' "$OUT" || fail "the link does not keep the resolved path"
+# The stored hash is not printed: nothing but the known members.
+[ "$(grep -c ' : ' "$OUT")" -eq 13 ] || fail "link show prints other members"
+refused 2 "invalid link id" link show "../$lid"
+refused 1 "no link with that id" link show AAAAAAAAAAAAAAAAAAAAAA
+expect 0 link revoke "$lid"
+expect 0 link list --owner nobody
+stdout_has "^$lid .* revoked "
+expect 0 link revoke "$lid"
+expect 2 link frobnicate
+expect 2 link
+
 # ---- public key: printed as PEM, or a clear refusal while none is available
 "$ADM" pubkey >"$OUT" 2>"$ERR"
 case $? in
@@ -157,7 +211,8 @@ expect 2 pubkey extra
 extra=$(find "$VELA_ROOT" -mindepth 1 \( -path "$VELA_ROOT/run" -o -path "$VELA_ROOT/run/vela" \
     -o -path "$VELA_ROOT/run/vela/sessions*" -o -path "$VELA_ROOT/var" -o -path "$VELA_ROOT/var/lib" \
     -o -path "$VELA_ROOT/var/lib/vela" -o -path "$VELA_ROOT/var/lib/vela/tokens*" \
-    -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$tasks*" -o -path "$VELA_ROOT/etc*" \) \
+    -o -path "$VELA_ROOT/var/lib/vela/keys*" -o -path "$VELA_ROOT/var/lib/vela/sharing*" \
+    -o -path "$VELA_ROOT/srv*" -o -path "$tasks*" -o -path "$VELA_ROOT/etc*" \) \
     -prune -o -print)
 [ -z "$extra" ] || fail "unexpected files: $extra"
 finish velaadm
