@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
-#include <climits>
 #include <cstring>
 #include <iostream>
 #include <memory>
@@ -68,12 +67,6 @@ public:
         return uploadOk;
     }
 };
-
-std::string Cwd()
-{
-    char buf[PATH_MAX];
-    return getcwd(buf, sizeof(buf)) ? buf : "";
-}
 
 // A handler that answers nothing, or throws, leaves the preset 117; one that
 // answers is heard.

@@ -1,7 +1,7 @@
 // WebapiDirFixture: a fresh system root whose web-API directory is the
 // working directory for the test's duration. PipeFixture, of the pipeline,
-// counter and identity tests: that directory holds lib.def and the
-// descriptions of the test handler libraries
+// counter, identity, exec handler and compound tests: that directory holds
+// lib.def and the descriptions of the test handler libraries
 // (tests/dispatcher/libs/pipe_*.cpp).
 #pragma once
 
@@ -23,9 +23,8 @@ protected:
     void SetUp() override
     {
         StateRootTest::SetUp();
-        char buf[PATH_MAX];
-        ASSERT_NE(nullptr, getcwd(buf, sizeof(buf)));
-        oldCwd_ = buf;
+        oldCwd_ = Cwd();
+        ASSERT_FALSE(oldCwd_.empty());
         webapiDir_ = root_.Path() + "/usr/vela/velaman/webapi";
         ASSERT_EQ(0, system(("mkdir -p '" + webapiDir_ + "'").c_str()));
         ASSERT_EQ(0, chdir(webapiDir_.c_str()));
@@ -55,21 +54,10 @@ protected:
         return request;
     }
 
-    std::string oldCwd_;
-    std::string webapiDir_;
-};
-
-class PipeFixture : public WebapiDirFixture {
-protected:
-    void SetUp() override
+    static std::string Cwd()
     {
-        WebapiDirFixture::SetUp();
-        WriteJson("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0,
-                                   "methods": {"allowDemo": false}})"));
-        WriteJson("VELA.Pipe.lib", Descriptions());
-        WriteJson("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": ")" + Lib("pipe_handlers") + R"(",
-            "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(",
-            "methods": {"1": ["request", "other"]}}})"));
+        char buf[PATH_MAX];
+        return getcwd(buf, sizeof(buf)) ? buf : "";
     }
 
     // Path of a test handler library lib<name>.so.
@@ -87,12 +75,39 @@ protected:
         return pw ? pw->pw_name : "system";
     }
 
+    std::string oldCwd_;
+    std::string webapiDir_;
+};
+
+class PipeFixture : public WebapiDirFixture {
+protected:
+    void SetUp() override
+    {
+        WebapiDirFixture::SetUp();
+        WriteJson("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0,
+                                   "methods": {"allowDemo": false}})"));
+        WriteJson("VELA.Pipe.lib", Descriptions());
+        WriteJson("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": ")" + Lib("pipe_handlers") + R"(",
+            "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(",
+            "methods": {"1": ["request", "other"]}}})"));
+    }
+
+    // VELA.Pipe.SubAs runs as `user` from now on.
+    void SubAs(const std::string& user)
+    {
+        Json::Value desc = Descriptions();
+        desc["VELA.Pipe.SubAs"]["runAs"] = user;
+        WriteJson("VELA.Pipe.lib", desc);
+    }
+
     // The descriptions of VELA.Pipe.lib; tests add to them and write again.
+    // VELA.Pipe.Sub and VELA.Pipe.SubAs (of the exec handler and compound
+    // tests) list the same methods.
     Json::Value Descriptions() const
     {
         const std::string handlers = Lib("pipe_handlers");
         const std::string runAs = RunAs();
-        return J(R"({
+        Json::Value desc = J(R"({
             "VELA.Pipe.Test": {"lib": ")" + handlers + R"(", "minVersion": 1, "maxVersion": 2,
                 "runAs": ")" + runAs + R"(",
                 "methods": {
@@ -112,7 +127,14 @@ protected:
             "VELA.Pipe.NoTable": {"lib": ")" + Lib("pipe_notable") + R"(", "minVersion": 1, "maxVersion": 1,
                 "methods": {"1": ["get"]}},
             "VELA.Pipe.NullTable": {"lib": ")" + Lib("pipe_nulltable") + R"(", "minVersion": 1,
-                "maxVersion": 1, "methods": {"1": ["get"]}}
+                "maxVersion": 1, "methods": {"1": ["get"]}},
+            "VELA.Pipe.Sub": {"lib": ")" + handlers + R"(", "minVersion": 1, "maxVersion": 1,
+                "runAs": ")" + runAs + R"(", "methods": {"1": ["report", "fail", "sleep", "crash", "orphan",
+                    {"reportGrantable": {"grantable": true}}, {"reportDefault": {"grantByDefault": true}},
+                    {"callback": {"grantByDefault": true}}, {"noisy": {"allowDownload": true}},
+                    {"output": {"grantable": true, "allowDownload": true}}]}}
         })");
+        desc["VELA.Pipe.SubAs"] = desc["VELA.Pipe.Sub"];
+        return desc;
     }
 };
