@@ -4,15 +4,14 @@
 // test process keeps root. Needs root: skipped otherwise.
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <functional>
 #include <regex>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
-#include <vector>
 
 #include "dispatcher/PipeFixture.h"
+#include "dispatcher/libs/ProcessIds.h"
 #include "platform/IdentityTestUtil.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
@@ -33,32 +32,7 @@ using VELA::Test::InChild;
 // Ids as parsed from a report: JSON integers.
 Json::Value Triple(unsigned r, unsigned e, unsigned s)
 {
-    Json::Value v(Json::arrayValue);
-    for (unsigned id : {r, e, s}) {
-        v.append(static_cast<Json::Int>(id));
-    }
-    return v;
-}
-
-// {"uid": [r, e, s], "gid": [r, e, s], "groups": [...]}, as the test
-// handler reports them.
-Json::Value Ids()
-{
-    uid_t us[3];
-    gid_t gs[3];
-    getresuid(&us[0], &us[1], &us[2]);
-    getresgid(&gs[0], &gs[1], &gs[2]);
-    Json::Value ids(Json::objectValue);
-    ids["uid"] = Triple(us[0], us[1], us[2]);
-    ids["gid"] = Triple(gs[0], gs[1], gs[2]);
-    std::vector<gid_t> groups(static_cast<size_t>(getgroups(0, nullptr)));
-    groups.resize(static_cast<size_t>(getgroups(static_cast<int>(groups.size()), groups.data())));
-    std::sort(groups.begin(), groups.end());
-    ids["groups"] = Json::Value(Json::arrayValue);
-    for (gid_t g : groups) {
-        ids["groups"].append(static_cast<Json::Int>(g));
-    }
-    return ids;
+    return J("[" + std::to_string(r) + ", " + std::to_string(e) + ", " + std::to_string(s) + "]");
 }
 
 bool HasGroup(const Json::Value& ids, unsigned gid)
@@ -103,7 +77,7 @@ protected:
                 {"byDefault": {"grantByDefault": true}},
                 {"unknownUser": {"runAs": "vela-no-such-user-x", "grantable": true}}]}})");
         WriteJson("VELA.Pipe.lib", desc);
-        rootIds_ = Ids();
+        rootIds_ = ProcessIds();
     }
     void TearDown() override
     {
@@ -131,7 +105,7 @@ protected:
                 report["result"] = runner.Run(request);
                 report["answer"] = runner.GetResponse();
             }
-            report["after"] = Ids();
+            report["after"] = ProcessIds();
             VELA::System::LogSetSink(nullptr, nullptr);
             report["log"] = log;
             return VELA::JsonToString(report);
@@ -273,9 +247,9 @@ TEST_F(Identity, RootGuardAndSetVelaInfo)
         VELA::System::LogSetSink(Collect, &log);
         // As root the guard changes nothing and logs nothing.
         {
-            const Json::Value before = Ids();
+            const Json::Value before = ProcessIds();
             VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
-            if (!guard.Ok() || Ids() != before) {
+            if (!guard.Ok() || ProcessIds() != before) {
                 errors += "guard as root changed the ids; ";
             }
         }

@@ -124,7 +124,7 @@ protected:
                 "runAs": ")" + runAs + R"(", "methods": {"1": ["open", "guarded", "unlisted"]}},
             "VELA.Pipe.NoLib": {"lib": ")" + Lib("pipe_missing") + R"(", "minVersion": 1, "maxVersion": 1,
                 "methods": {"1": ["get"]}},
-            "VELA.Pipe.NoTable": {"lib": ")" + Lib("pipe_notable") + R"(", "minVersion": 1, "maxVersion": 1,
+            "VELA.Pipe.NoTable": {"lib": ")" + Lib("reg_notable") + R"(", "minVersion": 1, "maxVersion": 1,
                 "methods": {"1": ["get"]}},
             "VELA.Pipe.NullTable": {"lib": ")" + Lib("pipe_nulltable") + R"(", "minVersion": 1,
                 "maxVersion": 1, "methods": {"1": ["get"]}},

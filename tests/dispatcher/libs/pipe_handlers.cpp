@@ -9,13 +9,11 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
-#include <grp.h>
 #include <iostream>
 #include <stdexcept>
 #include <string>
 #include <sys/resource.h>
 #include <unistd.h>
-#include <vector>
 
 #include <json/json.h>
 
@@ -23,6 +21,8 @@
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APITable.h"
+
+#include "ProcessIds.h"
 
 #define HANDLER_EXPORT extern "C" __attribute__((visibility("default")))
 
@@ -182,22 +182,10 @@ void Stream(APIRequest* req, APIResponse* resp)
 // The ids and groups the handler runs with, and the method it serves.
 void Ids(APIRequest* req, APIResponse* resp)
 {
-    uid_t u[3];
-    gid_t g[3];
-    if (getresuid(&u[0], &u[1], &u[2]) != 0 || getresgid(&g[0], &g[1], &g[2]) != 0) {
+    Json::Value data = ProcessIds();
+    if (data.empty()) {
         resp->SetError(500);
         return;
-    }
-    Json::Value data(Json::objectValue);
-    for (int i = 0; i < 3; ++i) {
-        data["uid"].append(static_cast<Json::UInt>(u[i]));
-        data["gid"].append(static_cast<Json::UInt>(g[i]));
-    }
-    std::vector<gid_t> groups(static_cast<size_t>(getgroups(0, nullptr)));
-    groups.resize(static_cast<size_t>(getgroups(static_cast<int>(groups.size()), groups.data())));
-    data["groups"] = Json::Value(Json::arrayValue);
-    for (gid_t group : groups) {
-        data["groups"].append(static_cast<Json::UInt>(group));
     }
     data["method"] = req->GetAPIMethod();
     data["methodParam"] = req->GetParam("method", "");
