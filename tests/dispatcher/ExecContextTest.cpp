@@ -1,6 +1,7 @@
 // The identity a handler runs with ("runAs", "grantable", "grantByUser",
-// "grantByDefault") and its restoration, the root guard and SetVelaInfo, on
-// a real unprivileged account. Every case runs in a forked child so the
+// "grantByDefault") and its restoration, through the pipeline, for a user
+// (APIRunner::Exec) and in compounds, the root guard and SetVelaInfo, on a
+// real unprivileged account. Every case runs in a forked child so the
 // test process keeps root. Needs root: skipped otherwise.
 #include <gtest/gtest.h>
 
@@ -89,9 +90,11 @@ protected:
         }
     }
 
-    // Runs `request` in a forked child after `before`; reports Run's
-    // result, the answer, the ids afterwards and the log lines.
-    Json::Value RunInChild(const Json::Value& request, const std::function<void()>& before = nullptr)
+    // Runs `call` (which answers into its argument) in a forked child after
+    // `before`; reports the call's result, the answer, the child's pid and
+    // USERNAME, its ids afterwards and the log lines.
+    Json::Value ReportOfChild(const std::function<bool(Json::Value&)>& call,
+                              const std::function<void()>& before = nullptr)
     {
         const std::string text = InChild([&] {
             std::string log;
@@ -100,12 +103,11 @@ protected:
                 before();
             }
             Json::Value report(Json::objectValue);
-            {
-                APIRunner runner;
-                report["result"] = runner.Run(request);
-                report["answer"] = runner.GetResponse();
-            }
+            const bool result = call(report["answer"]);
+            report["result"] = result;
             report["after"] = ProcessIds();
+            report["pid"] = static_cast<Json::Int>(getpid());
+            report["USERNAME"] = getenv("USERNAME") != nullptr ? getenv("USERNAME") : "(unset)";
             VELA::System::LogSetSink(nullptr, nullptr);
             report["log"] = log;
             return VELA::JsonToString(report);
@@ -113,6 +115,18 @@ protected:
         Json::Value report;
         EXPECT_TRUE(VELA::JsonParse(text, report)) << text;
         return report;
+    }
+    // The report of Run on `request`.
+    Json::Value RunInChild(const Json::Value& request, const std::function<void()>& before = nullptr)
+    {
+        return ReportOfChild(
+            [&](Json::Value& answer) {
+                APIRunner runner;
+                const bool result = runner.Run(request);
+                answer = runner.GetResponse();
+                return result;
+            },
+            before);
     }
 
     Json::Value IdsCall(const std::string& method, const Json::Value& session = Json::Value())
@@ -235,6 +249,57 @@ TEST_F(Identity, UploadFieldsCannotChangeTheCheckedMethod)
         return VELA::JsonToString(runner.GetResponse()["data"]["uid"]);
     });
     EXPECT_EQ(VELA::JsonToString(Triple(u, u, u)), seen);
+}
+
+// APIRunner::Exec for the account: the handler runs with the identity of
+// its method and for that user, in this process when the method is
+// grantable or grantByDefault, in a child otherwise; the caller keeps its
+// ids and its USERNAME.
+TEST_F(Identity, ExecForAUserLeavesTheCallerAsItWas)
+{
+    const unsigned u = account_.uid, g = account_.gid;
+    const struct {
+        const char* method;
+        bool here;
+        Json::Value uid, gid;
+    } cases[] = {
+        {"dropped", false, Triple(u, u, u), Triple(g, g, g)},
+        {"grantable", true, Triple(u, u, 0), Triple(g, g, g)},
+        {"byDefault", true, Triple(0, 0, 0), Triple(0, 0, 0)},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.method);
+        const Json::Value report = ReportOfChild([&](Json::Value& answer) {
+            setenv("USERNAME", "caller-u", 1);
+            APIRunner().Exec(answer, "VELA.Pipe.Ids", 1, c.method, Json::Value(), account_.user.c_str());
+            return true;
+        });
+        const Json::Value& seen = report["answer"]["data"];
+        ASSERT_EQ(Json::Value(true), report["answer"]["success"]) << report["answer"];
+        EXPECT_EQ(c.here, seen["pid"] == report["pid"]);
+        EXPECT_EQ(c.uid, seen["uid"]);
+        EXPECT_EQ(c.gid, seen["gid"]);
+        EXPECT_EQ(Json::Value(account_.user), seen["USERNAME"]);
+        EXPECT_EQ(Json::Value(account_.user), seen["user"]);
+        EXPECT_EQ(rootIds_, report["after"]);
+        EXPECT_EQ(Json::Value("caller-u"), report["USERNAME"]);
+    }
+}
+
+// The calls of a compound: one in a child takes the identity of its
+// method, one in this process (grantable) switches and comes back.
+TEST_F(Identity, CompoundCallsTakeTheIdentityOfTheirMethod)
+{
+    const unsigned u = account_.uid;
+    Json::Value request = Call("VELA.Entry.Request", 1, "request");
+    request["getParam"]["compound"] = J(R"([{"api": "VELA.Pipe.Ids", "version": 1, "method": "dropped"},
+                                           {"api": "VELA.Pipe.Ids", "version": 1, "method": "grantable"}])");
+    const Json::Value report = RunInChild(request);
+    const Json::Value& result = report["answer"]["data"]["result"];
+    EXPECT_EQ(Triple(u, u, u), result[0]["data"]["uid"]) << report["answer"];
+    EXPECT_NE(report["pid"], result[0]["data"]["pid"]);
+    EXPECT_EQ(Triple(u, u, 0), result[1]["data"]["uid"]);
+    EXPECT_EQ(rootIds_, report["after"]);
 }
 
 TEST_F(Identity, RootGuardAndSetVelaInfo)

@@ -92,22 +92,13 @@ protected:
             "methods": {"1": ["request", "other"]}}})"));
     }
 
-    // VELA.Pipe.SubAs runs as `user` from now on.
-    void SubAs(const std::string& user)
-    {
-        Json::Value desc = Descriptions();
-        desc["VELA.Pipe.SubAs"]["runAs"] = user;
-        WriteJson("VELA.Pipe.lib", desc);
-    }
-
     // The descriptions of VELA.Pipe.lib; tests add to them and write again.
-    // VELA.Pipe.Sub and VELA.Pipe.SubAs (of the exec handler and compound
-    // tests) list the same methods.
+    // VELA.Pipe.Sub is the API of the exec handler and compound tests.
     Json::Value Descriptions() const
     {
         const std::string handlers = Lib("pipe_handlers");
         const std::string runAs = RunAs();
-        Json::Value desc = J(R"({
+        return J(R"({
             "VELA.Pipe.Test": {"lib": ")" + handlers + R"(", "minVersion": 1, "maxVersion": 2,
                 "runAs": ")" + runAs + R"(",
                 "methods": {
@@ -134,7 +125,5 @@ protected:
                     {"callback": {"grantByDefault": true}}, {"noisy": {"allowDownload": true}},
                     {"output": {"grantable": true, "allowDownload": true}}]}}
         })");
-        desc["VELA.Pipe.SubAs"] = desc["VELA.Pipe.Sub"];
-        return desc;
     }
 };

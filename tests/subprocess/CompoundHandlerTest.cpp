@@ -1,11 +1,11 @@
 // Compound requests run through a runner over the web-API directory of
 // PipeFixture, whose VELA.Pipe.Sub handlers
 // (tests/dispatcher/libs/pipe_handlers.cpp) report the process and the
-// identity they ran with.
+// identity they ran with. (The identity of the calls, with real accounts:
+// ExecContextTest.cpp.)
 #include <gtest/gtest.h>
 
 #include <memory>
-#include <pwd.h>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -238,24 +238,6 @@ TEST_F(CompoundTest, CallsPassOnRestartServerErrorAndCallbacks)
     EXPECT_EQ(1u, runner_->GetResponseObject()->GetCallbackFuncs().size());
 
     EXPECT_EQ(J(R"({"has_fail": false, "result": []})"), Run(Compound(Json::Value(Json::arrayValue))));
-}
-
-TEST_F(CompoundTest, ChildTakesTheIdentityOfItsMethod)
-{
-    if (geteuid() != 0) {
-        GTEST_SKIP() << "needs root to switch identity";
-    }
-    const struct passwd* nobody = getpwnam("nobody");
-    ASSERT_NE(nullptr, nobody);
-    SubAs("nobody");
-    Json::Value calls(Json::arrayValue);
-    calls.append(SubCall("report", 0));
-    calls[0]["api"] = "VELA.Pipe.SubAs";
-    calls.append(SubCall("reportGrantable", 1));
-    const Json::Value data = Run(Compound(calls));
-    EXPECT_EQ(nobody->pw_uid, data["result"][0]["data"]["euid"].asUInt()) << data;
-    EXPECT_EQ(0u, data["result"][1]["data"]["euid"].asUInt());
-    EXPECT_EQ(0u, geteuid());
 }
 
 }  // namespace

@@ -3,7 +3,8 @@
 // (tests/dispatcher/libs/pipe_handlers.cpp): the refusals of missing
 // arguments, the request it builds, where a method runs (this process or a
 // child) and as whom, what the caller keeps, children that die, and the
-// forwarding of a child's output.
+// forwarding of a child's output. (As whom, with real accounts:
+// ExecContextTest.cpp.)
 #include <gtest/gtest.h>
 
 #include <csignal>
@@ -16,10 +17,8 @@
 #include <unistd.h>
 
 #include "dispatcher/PipeFixture.h"
-#include "platform/IdentityTestUtil.h"
 #include "support/TestSupport.h"
 #include "webapi/APIRunner.h"
-#include "webapi/JsonUtil.h"
 
 namespace {
 
@@ -176,67 +175,6 @@ TEST_F(ExecHandlerTest, GrantableRunsHereOthersInAChildAndTheEnvironmentComesBac
             EXPECT_STREQ(callerHasNames ? "caller-w" : nullptr, w) << m.first;
         }
     }
-}
-
-// As root, on a real unprivileged account: the identity inside the handler,
-// and the caller's own afterwards. Runs in a forked child, so that a switch
-// that is not undone cannot leak into later tests.
-TEST_F(ExecHandlerTest, IdentityInsideTheHandlerAndTheCallerKeepsItsOwn)
-{
-    if (geteuid() != 0) {
-        GTEST_SKIP() << "identity switches need root";
-    }
-    VELA::Test::TestAccount account;
-    if (!account.Create()) {
-        account.Remove();
-        FAIL() << "useradd/groupadd failed";
-    }
-    SubAs(account.user);
-    const std::string failures = VELA::Test::InChild([&] {
-        std::string out;
-        setenv("USERNAME", "caller-u", 1);
-        struct {
-            const char* method;
-            bool here;
-            uid_t euid;
-            gid_t egid;
-        } cases[] = {
-            {"report", false, account.uid, account.gid},
-            {"reportGrantable", true, account.uid, account.gid},
-            {"reportDefault", true, 0, 0},
-        };
-        for (const auto& c : cases) {
-            const Json::Value result = Exec("VELA.Pipe.SubAs", c.method, Json::Value(), account.user.c_str());
-            const Json::Value& data = result["data"];
-            const std::string m = c.method;
-            if (result["success"] != Json::Value(true)) {
-                out += m + " failed: " + VELA::JsonToString(result) + "\n";
-                continue;
-            }
-            if ((data["pid"].asInt() == getpid()) != c.here) {
-                out += m + " ran in the wrong process\n";
-            }
-            if (data["euid"].asUInt() != c.euid || data["egid"].asUInt() != c.egid) {
-                out += m + " ran as " + VELA::JsonToString(data) + "\n";
-            }
-            if (data["USERNAME"].asString() != account.user || data["user"].asString() != account.user) {
-                out += m + " saw the user " + data["USERNAME"].asString() + "\n";
-            }
-            uid_t r, e, s;
-            gid_t rg, eg, sg;
-            getresuid(&r, &e, &s);
-            getresgid(&rg, &eg, &sg);
-            if ((r | e | s | rg | eg | sg) != 0) {
-                out += m + " left the caller as another identity\n";
-            }
-            if (getenv("USERNAME") == nullptr || std::string(getenv("USERNAME")) != "caller-u") {
-                out += m + " changed the caller's USERNAME\n";
-            }
-        }
-        return out;
-    });
-    account.Remove();
-    EXPECT_EQ("", failures);
 }
 
 TEST_F(ExecHandlerTest, ChildThatDiesBeforeAnsweringIs117)

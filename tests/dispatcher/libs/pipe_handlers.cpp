@@ -1,6 +1,5 @@
 // Handlers of the dispatcher tests (VELA.Pipe.*), of the exec handler and
-// compound tests (VELA.Pipe.Sub, VELA.Pipe.SubAs) and of the end-to-end
-// tests. Each reports what it saw from inside the call through the
+// compound tests (VELA.Pipe.Sub) and of the end-to-end tests. Each reports what it saw from inside the call through the
 // response, so the tests read the facts of the call itself, or misbehaves
 // on purpose.
 #include <cerrno>
@@ -179,7 +178,8 @@ void Stream(APIRequest* req, APIResponse* resp)
     pclose(pipe);
 }
 
-// The ids and groups the handler runs with, and the method it serves.
+// The ids and groups the handler runs with, its process, the user it runs
+// for, and the method it serves.
 void Ids(APIRequest* req, APIResponse* resp)
 {
     Json::Value data = ProcessIds();
@@ -187,6 +187,9 @@ void Ids(APIRequest* req, APIResponse* resp)
         resp->SetError(500);
         return;
     }
+    data["pid"] = static_cast<Json::Int>(getpid());
+    data["USERNAME"] = Env("USERNAME");
+    data["user"] = req->GetLoginUserName();
     data["method"] = req->GetAPIMethod();
     data["methodParam"] = req->GetParam("method", "");
     resp->SetSuccess(data);
@@ -350,9 +353,6 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Pipe.Sub", 1, "crash", Crash},
     {"VELA.Pipe.Sub", 1, "output", Output},
     {"VELA.Pipe.Sub", 1, "orphan", Orphan},
-    {"VELA.Pipe.SubAs", 1, "report", Report},
-    {"VELA.Pipe.SubAs", 1, "reportGrantable", Report},
-    {"VELA.Pipe.SubAs", 1, "reportDefault", Report},
     {nullptr, 0, nullptr, nullptr},
 };
 
