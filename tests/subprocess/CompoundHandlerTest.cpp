@@ -5,6 +5,7 @@
 // ExecContextTest.cpp.)
 #include <gtest/gtest.h>
 
+#include <initializer_list>
 #include <memory>
 #include <string>
 #include <sys/stat.h>
@@ -49,6 +50,16 @@ Json::Value SubCall(const std::string& method, int n, Json::Value params = Json:
     return params;
 }
 
+Json::Value List(std::initializer_list<Json::Value> items)
+{
+    Json::Value list(Json::arrayValue);
+    for (const Json::Value& item : items) {
+        list.append(item);
+    }
+    return list;
+}
+
+// The call of the entry API that runs `calls` (a list, or its JSON text).
 Json::Value Compound(const Json::Value& calls)
 {
     Json::Value params(Json::objectValue);
@@ -84,15 +95,10 @@ protected:
 
 TEST_F(CompoundTest, SequentialCallsRunInProcessOnlyWhenGrantable)
 {
-    Json::Value calls(Json::arrayValue);
-    calls.append(SubCall("report", 0));
-    calls.append(SubCall("reportGrantable", 1));
-    calls.append(SubCall("fail", 2));
-    calls.append(SubCall("noisy", 3));  // a download
-    calls.append(J("{}"));
-    calls.append(SubCall("report", 5, J(R"({"pad": 262144})")));
-    calls.append(SubCall("report", 6, J(R"({"refuse": true})")));
-    const Json::Value data = Run(Compound(calls));
+    // The fourth call is a download; the fifth names no call.
+    const Json::Value data = Run(Compound(List({SubCall("report", 0), SubCall("reportGrantable", 1),
+        SubCall("fail", 2), SubCall("noisy", 3), J("{}"), SubCall("report", 5, J(R"({"pad": 262144})")),
+        SubCall("report", 6, J(R"({"refuse": true})"))})));
     ASSERT_TRUE(answer_["success"].asBool()) << answer_;
     EXPECT_TRUE(data["has_fail"].asBool());
     const Json::Value& r = data["result"];
@@ -117,10 +123,8 @@ TEST_F(CompoundTest, SequentialCallsRunInProcessOnlyWhenGrantable)
 TEST_F(CompoundTest, StopWhenErrorSkipsTheRestOnlyInSequence)
 {
     const std::string mark = root_.Path() + "/ran";
-    Json::Value calls(Json::arrayValue);
-    calls.append(SubCall("report", 0));
-    calls.append(SubCall("fail", 1));
-    calls.append(SubCall("report", 2, J(R"({"marker": ")" + mark + R"("})")));
+    const Json::Value calls =
+        List({SubCall("report", 0), SubCall("fail", 1), SubCall("report", 2, J(R"({"marker": ")" + mark + R"("})"))});
     // From a form: the list and the flag arrive as text.
     Json::Value params = Compound(VELA::JsonToString(calls));
     params["stop_when_error"] = "true";
@@ -138,13 +142,9 @@ TEST_F(CompoundTest, StopWhenErrorSkipsTheRestOnlyInSequence)
 
 TEST_F(CompoundTest, ParallelAnswersKeepTheirPlaceWhateverTheChildrenDo)
 {
-    Json::Value calls(Json::arrayValue);
-    calls.append(SubCall("sleep", 0, J(R"({"ms": 100})")));
-    calls.append(SubCall("report", 1));
-    calls.append(SubCall("crash", 2));
-    calls.append(SubCall("report", 3, J(R"({"pad": 262144})")));
-    calls.append(SubCall("fail", 4));
-    calls.append(SubCall("reportGrantable", 5));
+    const Json::Value calls = List({SubCall("sleep", 0, J(R"({"ms": 100})")), SubCall("report", 1),
+        SubCall("crash", 2), SubCall("report", 3, J(R"({"pad": 262144})")), SubCall("fail", 4),
+        SubCall("reportGrantable", 5)});
     for (const char* children : {"1", "2", "16"}) {
         SCOPED_TRACE(children);
         Conf("webapi.conf", std::string("compound_max_children=") + children + "\n");
@@ -170,23 +170,21 @@ TEST_F(CompoundTest, ChildPastItsTimeIsKilledAndTheOthersStillAnswer)
 {
     Conf("webapi.conf", "compound_child_seconds=1\n");
     const std::string pidFile = root_.Path() + "/sleeper";
-    Json::Value calls(Json::arrayValue);
-    calls.append(SubCall("sleep", 0, J(R"({"ms": 10000, "pidfile": ")" + pidFile + R"("})")));
-    calls.append(SubCall("report", 1));
     VELA::Test::LogCapture log;
-    const Json::Value data = Run(Compound(calls));
+    const Json::Value sleeper = SubCall("sleep", 0, J(R"({"ms": 10000, "pidfile": ")" + pidFile + R"("})"));
+    const Json::Value data = Run(Compound(List({sleeper, SubCall("report", 1)})));
     EXPECT_TRUE(data["has_fail"].asBool());
     EXPECT_TRUE(data["result"][0].isNull()) << data;
     EXPECT_TRUE(data["result"][1]["success"].asBool());
     EXPECT_TRUE(log.Contains("call 0 gave no answer in 1 s: killed"));
-    const pid_t sleeper = static_cast<pid_t>(atoi(VELA::Test::ReadText(pidFile).c_str()));
-    ASSERT_GT(sleeper, 0);
+    const pid_t pid = static_cast<pid_t>(atoi(VELA::Test::ReadText(pidFile).c_str()));
+    ASSERT_GT(pid, 0);
     // Gone, or a zombie of whoever adopted it: killed either way. The kill
     // takes effect asynchronously; a sleeper that was not killed would
     // still be asleep ten seconds from now.
     std::string stat;
     for (int i = 0; i < 200; ++i) {
-        stat = VELA::Test::ReadText("/proc/" + std::to_string(sleeper) + "/stat");
+        stat = VELA::Test::ReadText("/proc/" + std::to_string(pid) + "/stat");
         if (stat.empty() || stat.find(") Z ") != std::string::npos) {
             break;
         }
@@ -200,19 +198,10 @@ TEST_F(CompoundTest, BoundsRefuseTheWholeCompoundBeforeAnythingRuns)
     Conf("webapi.conf", "compound_max_calls=3\ncompound_max_depth=2\n");
     const std::string mark = root_.Path() + "/ran";
     const Json::Value marked = SubCall("report", 0, J(R"({"marker": ")" + mark + R"("})"));
-    Json::Value four(Json::arrayValue);
-    for (int i = 0; i < 4; ++i) {
-        four.append(marked);
-    }
-    Json::Value one(Json::arrayValue);
-    one.append(marked);
-    Json::Value nested2(Json::arrayValue);
-    nested2.append(Compound(one));  // two levels: allowed
-    Json::Value nested3(Json::arrayValue);
-    nested3.append(Compound(nested2));  // three: refused
-    Json::Value nestedTooMany(Json::arrayValue);
-    nestedTooMany.append(Compound(one));
-    nestedTooMany.append(Compound(one));  // 2 + 2 calls
+    const Json::Value four = List({marked, marked, marked, marked});
+    const Json::Value nested2 = List({Compound(List({marked}))});  // two levels: allowed
+    const Json::Value nested3 = List({Compound(nested2)});         // three: refused
+    const Json::Value nestedTooMany = List({Compound(List({marked})), Compound(List({marked}))});  // 2 + 2 calls
 
     for (const Json::Value* calls : {&four, &nested3, &nestedTooMany}) {
         Run(Compound(*calls));
@@ -229,15 +218,14 @@ TEST_F(CompoundTest, BoundsRefuseTheWholeCompoundBeforeAnythingRuns)
 // error and callbacks to the compound's reply.
 TEST_F(CompoundTest, CallsPassOnRestartServerErrorAndCallbacks)
 {
-    Json::Value calls(Json::arrayValue);
-    calls.append(SubCall("callback", 0, J(R"({"restart": "1", "error": "disk busy"})")));
-    const Json::Value data = Run(Compound(calls));
+    const Json::Value call = SubCall("callback", 0, J(R"({"restart": "1", "error": "disk busy"})"));
+    const Json::Value data = Run(Compound(List({call})));
     EXPECT_FALSE(data["has_fail"].asBool()) << data;
     EXPECT_TRUE(answer_["httpd_restart"].asBool());
     EXPECT_EQ("disk busy", runner_->GetResponseObject()->GetServerError());
     EXPECT_EQ(1u, runner_->GetResponseObject()->GetCallbackFuncs().size());
 
-    EXPECT_EQ(J(R"({"has_fail": false, "result": []})"), Run(Compound(Json::Value(Json::arrayValue))));
+    EXPECT_EQ(J(R"({"has_fail": false, "result": []})"), Run(Compound(List({}))));
 }
 
 }  // namespace

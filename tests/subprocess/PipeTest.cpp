@@ -17,21 +17,6 @@ namespace {
 using VELA::Pipe;
 using VELA::Test::LogCapture;
 
-// Runs `child` in a forked child that keeps only the write end, while the
-// test (the parent) keeps the read end.
-template <typename F>
-pid_t ForkWriter(Pipe& pipe, F child)
-{
-    const pid_t pid = fork();
-    if (pid == 0) {
-        pipe.WriteOnly(-1);
-        child();
-        _exit(0);
-    }
-    pipe.ReadOnly(-1);
-    return pid;
-}
-
 void Reap(pid_t pid)
 {
     int status = 0;
@@ -48,13 +33,18 @@ TEST(Pipe, DocumentsCrossInOrderWhateverTheirSize)
     const Json::Value docs[] = {Json::Value(), Json::Value(Json::objectValue), big, Json::Value("\xc3\xa9t\xc3\xa9")};
     Pipe pipe;
     ASSERT_TRUE(pipe.Init());
-    const pid_t pid = ForkWriter(pipe, [&] {
+    // The child keeps only the write end, the parent only the read end.
+    const pid_t pid = fork();
+    if (pid == 0) {
+        pipe.WriteOnly(-1);
         for (const Json::Value& doc : docs) {
             if (!pipe.WriteJson(doc)) {
                 _exit(1);
             }
         }
-    });
+        _exit(0);
+    }
+    pipe.ReadOnly(-1);
     for (const Json::Value& doc : docs) {
         Json::Value got(42);
         ASSERT_TRUE(pipe.ReadJson(got));
