@@ -143,21 +143,6 @@ protected:
     Json::Value rootIds_;
 };
 
-TEST_F(Identity, GrantableSwitchComesBackToRoot)
-{
-    const unsigned u = account_.uid, g = account_.gid;
-    for (const char* method : {"grantable", "byUser"}) {
-        const Json::Value report = RunInChild(IdsCall(method, J(R"({"username": ")" + account_.user + R"("})")));
-        const Json::Value& seen = report["answer"]["data"];
-        EXPECT_EQ(Triple(u, u, 0), seen["uid"]) << method;
-        EXPECT_EQ(Triple(g, g, g), seen["gid"]) << method;
-        EXPECT_TRUE(HasGroup(seen, account_.suppGid)) << method;
-        EXPECT_EQ(rootIds_, report["after"]) << method;
-        EXPECT_TRUE(Logged(report["log"].asString(), kAuthInfo, "ExecContext:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n"))
-            << report["log"].asString();
-    }
-}
-
 TEST_F(Identity, NotGrantableStaysTheUser)
 {
     const unsigned u = account_.uid, g = account_.gid;
@@ -252,20 +237,23 @@ TEST_F(Identity, UploadFieldsCannotChangeTheCheckedMethod)
 }
 
 // APIRunner::Exec for the account: the handler runs with the identity of
-// its method and for that user, in this process when the method is
-// grantable or grantByDefault, in a child otherwise; the caller keeps its
-// ids and its USERNAME.
+// its method (by "runAs", or by the session's user) and for that user, in
+// this process when the method is grantable or grantByDefault, in a child
+// otherwise; a grantable switch comes back to root and says so; the caller
+// keeps its ids and its USERNAME.
 TEST_F(Identity, ExecForAUserLeavesTheCallerAsItWas)
 {
     const unsigned u = account_.uid, g = account_.gid;
     const struct {
         const char* method;
         bool here;
+        bool grantable;
         Json::Value uid, gid;
     } cases[] = {
-        {"dropped", false, Triple(u, u, u), Triple(g, g, g)},
-        {"grantable", true, Triple(u, u, 0), Triple(g, g, g)},
-        {"byDefault", true, Triple(0, 0, 0), Triple(0, 0, 0)},
+        {"dropped", false, false, Triple(u, u, u), Triple(g, g, g)},
+        {"grantable", true, true, Triple(u, u, 0), Triple(g, g, g)},
+        {"byUser", true, true, Triple(u, u, 0), Triple(g, g, g)},
+        {"byDefault", true, false, Triple(0, 0, 0), Triple(0, 0, 0)},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.method);
@@ -279,10 +267,14 @@ TEST_F(Identity, ExecForAUserLeavesTheCallerAsItWas)
         EXPECT_EQ(c.here, seen["pid"] == report["pid"]);
         EXPECT_EQ(c.uid, seen["uid"]);
         EXPECT_EQ(c.gid, seen["gid"]);
+        EXPECT_EQ(c.uid[0].asUInt() == u, HasGroup(seen, account_.suppGid));
         EXPECT_EQ(Json::Value(account_.user), seen["USERNAME"]);
         EXPECT_EQ(Json::Value(account_.user), seen["user"]);
         EXPECT_EQ(rootIds_, report["after"]);
         EXPECT_EQ(Json::Value("caller-u"), report["USERNAME"]);
+        EXPECT_EQ(c.grantable,
+                  Logged(report["log"].asString(), kAuthInfo, "ExecContext:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n"))
+            << report["log"].asString();
     }
 }
 

@@ -178,36 +178,21 @@ void Stream(APIRequest* req, APIResponse* resp)
     pclose(pipe);
 }
 
-// The ids and groups the handler runs with, its process, the user it runs
-// for, and the method it serves.
-void Ids(APIRequest* req, APIResponse* resp)
-{
-    Json::Value data = ProcessIds();
-    if (data.empty()) {
-        resp->SetError(500);
-        return;
-    }
-    data["pid"] = static_cast<Json::Int>(getpid());
-    data["USERNAME"] = Env("USERNAME");
-    data["user"] = req->GetLoginUserName();
-    data["method"] = req->GetAPIMethod();
-    data["methodParam"] = req->GetParam("method", "");
-    resp->SetSuccess(data);
-}
-
-// The process, identity and environment of the call, and what it was given,
-// with "pad" bytes of padding. With a "marker" parameter, first creates
-// that file (the tests' witness that a call ran).
+// The ids, groups, process and environment of the call, and what it was
+// given, with "pad" bytes of padding. With a "marker" parameter, first
+// creates that file (the tests' witness that a call ran).
 void Report(APIRequest* req, APIResponse* resp)
 {
     const std::string marker = req->GetParam("marker", "").asString();
     if (!marker.empty()) {
         close(open(marker.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
     }
-    Json::Value data(Json::objectValue);
+    Json::Value data = ProcessIds();
+    if (data.empty()) {
+        resp->SetError(500);
+        return;
+    }
     data["pid"] = static_cast<Json::Int>(getpid());
-    data["euid"] = static_cast<Json::UInt>(geteuid());
-    data["egid"] = static_cast<Json::UInt>(getegid());
     data["USERNAME"] = Env("USERNAME");
     data["VELA_WEBAPI_USERNAME"] = Env("VELA_WEBAPI_USERNAME");
     data["user"] = req->GetLoginUserName();
@@ -216,6 +201,7 @@ void Report(APIRequest* req, APIResponse* resp)
     data["version"] = req->GetAPIVersion();
     data["method"] = req->GetAPIMethod();
     data["params"] = req->GetParam("", Json::Value(Json::objectValue));
+    data["methodParam"] = req->GetParam("method", "");
     data["attr"] = req->GetAttr("mark");
     data["requestMethod"] = req->GetRequestMethod();
     data["cwd"] = Cwd();
@@ -337,12 +323,12 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Pipe.Nice", 1, "fail", NiceFail},
     {"VELA.Entry.Request", 1, "request", Echo},
     {"VELA.Entry.Request", 1, "other", Echo},
-    {"VELA.Pipe.Ids", 1, "grantable", Ids},
-    {"VELA.Pipe.Ids", 1, "dropped", Ids},
-    {"VELA.Pipe.Ids", 1, "byUser", Ids},
-    {"VELA.Pipe.Ids", 1, "byDefault", Ids},
-    {"VELA.Pipe.Ids", 1, "unknownUser", Ids},
-    {"VELA.Pipe.Ids", 1, "upload", Ids},
+    {"VELA.Pipe.Ids", 1, "grantable", Report},
+    {"VELA.Pipe.Ids", 1, "dropped", Report},
+    {"VELA.Pipe.Ids", 1, "byUser", Report},
+    {"VELA.Pipe.Ids", 1, "byDefault", Report},
+    {"VELA.Pipe.Ids", 1, "unknownUser", Report},
+    {"VELA.Pipe.Ids", 1, "upload", Report},
     {"VELA.Pipe.Sub", 1, "report", Report},
     {"VELA.Pipe.Sub", 1, "reportGrantable", Report},
     {"VELA.Pipe.Sub", 1, "reportDefault", Report},
