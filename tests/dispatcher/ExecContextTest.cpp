@@ -294,60 +294,57 @@ TEST_F(Identity, CompoundCallsTakeTheIdentityOfTheirMethod)
     EXPECT_EQ(rootIds_, report["after"]);
 }
 
+// The root guard as root changes nothing and logs nothing; from the user's
+// effective ids with a saved uid 0 it gives root inside and the user again
+// afterwards (SetVelaInfo writes); with no way back to root it skips the
+// guarded statements and says so (SetVelaInfo refuses).
 TEST_F(Identity, RootGuardAndSetVelaInfo)
 {
     ASSERT_EQ(0, system(("mkdir -p '" + root_.Path() + "/etc'").c_str()));
     const unsigned u = account_.uid, g = account_.gid;
-    const std::string checks = InChild([&] {
-        std::string errors;
-        std::string log;
-        VELA::System::LogSetSink(Collect, &log);
-        // As root the guard changes nothing and logs nothing.
-        {
-            const Json::Value before = ProcessIds();
-            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
-            if (!guard.Ok() || ProcessIds() != before) {
-                errors += "guard as root changed the ids; ";
+    const Json::Value report = ReportOfChild([&](Json::Value& seen) {
+        // Whether the guard let the statements run, the ids inside and
+        // afterwards, the lines logged and the guard's error line.
+        const auto guarded = [&seen](const char* step) {
+            Json::Value& s = seen[step];
+            VELA::Test::LogCapture log;
+            {
+                VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
+                s["ok"] = guard.Ok();
+                s["inside"] = ProcessIds();
             }
-        }
-        if (!log.empty()) {
-            errors += "guard as root logged: " + log;
-        }
-        // From the user's effective ids with a saved uid 0: root inside,
-        // the user again afterwards.
+            s["after"] = ProcessIds();
+            s["lines"] = static_cast<Json::UInt>(log.Lines().size());
+            s["error"] = log.PriorityOf({"ExecContextTest:", " ERROR: IF_RUN_AS(0, 0)"});
+        };
+        guarded("root");
         setresgid(g, g, g);
         setresuid(u, u, 0);
-        {
-            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
-            if (!guard.Ok() || geteuid() != 0 || getegid() != 0) {
-                errors += "guard did not gain root; ";
-            }
-        }
-        if (geteuid() != u || getegid() != g) {
-            errors += "guard did not restore the user; ";
-        }
-        if (!VELA::APIUtils::SetVelaInfo("pipe_test_key", "written") || geteuid() != u) {
-            errors += "SetVelaInfo as the user failed; ";
-        }
-        // No way back to root: the guarded statements must be skipped.
+        guarded("user");
+        seen["user"]["written"] = VELA::APIUtils::SetVelaInfo("pipe_test_key", "written");
+        seen["user"]["afterWrite"] = ProcessIds();
         setresuid(u, u, u);
-        log.clear();
-        {
-            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
-            if (guard.Ok()) {
-                errors += "guard claims root without a way back; ";
-            }
-        }
-        if (!Logged(log, kAuthErr, "ExecContextTest:\\d+ ERROR: IF_RUN_AS\\(0, 0\\)\n")) {
-            errors += "no guard error line: " + log;
-        }
-        if (VELA::APIUtils::SetVelaInfo("pipe_test_key", "refused")) {
-            errors += "SetVelaInfo succeeded without rights; ";
-        }
-        VELA::System::LogSetSink(nullptr, nullptr);
-        return errors;
+        guarded("stuck");
+        seen["stuck"]["written"] = VELA::APIUtils::SetVelaInfo("pipe_test_key", "refused");
+        return true;
     });
-    EXPECT_EQ("", checks);
+    const Json::Value& root = report["answer"]["root"];
+    const Json::Value& user = report["answer"]["user"];
+    const Json::Value& stuck = report["answer"]["stuck"];
+    EXPECT_EQ(Json::Value(true), root["ok"]) << report;
+    EXPECT_EQ(rootIds_, root["inside"]);
+    EXPECT_EQ(rootIds_, root["after"]);
+    EXPECT_EQ(Json::Value(0), root["lines"]);
+    EXPECT_EQ(Json::Value(true), user["ok"]);
+    EXPECT_EQ(Json::Value(0), user["inside"]["uid"][1]);
+    EXPECT_EQ(Json::Value(0), user["inside"]["gid"][1]);
+    EXPECT_EQ(u, user["after"]["uid"][1].asUInt());
+    EXPECT_EQ(g, user["after"]["gid"][1].asUInt());
+    EXPECT_EQ(Json::Value(true), user["written"]);
+    EXPECT_EQ(u, user["afterWrite"]["uid"][1].asUInt());
+    EXPECT_EQ(Json::Value(false), stuck["ok"]);
+    EXPECT_EQ(Json::Value(kAuthErr), stuck["error"]);
+    EXPECT_EQ(Json::Value(false), stuck["written"]);
     EXPECT_EQ(1, VLIBCFileCheckKeyValue((root_.Path() + "/etc/velainfo.conf").c_str(), "pipe_test_key", "written", 0));
 }
 
