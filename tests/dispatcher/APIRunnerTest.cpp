@@ -5,11 +5,9 @@
 #include <cerrno>
 #include <cstring>
 #include <iostream>
-#include <memory>
 #include <sstream>
 #include <string>
 #include <sys/resource.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 

@@ -5,9 +5,6 @@
 #include <dlfcn.h>
 #include <memory>
 #include <string>
-#include <unistd.h>
-#include <utility>
-#include <vector>
 
 #include "dispatcher/APIRunnerPrivate.h"
 #include "dispatcher/PipeFixture.h"

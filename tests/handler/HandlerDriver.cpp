@@ -10,6 +10,7 @@
 
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
+#include "webapi/JsonUtil.h"
 
 namespace {
 
@@ -18,10 +19,7 @@ typedef void (*HandlerFn)(VELA::APIRequest*, VELA::APIResponse*);
 Json::Value Parse(const std::string& text)
 {
     Json::Value out;
-    Json::CharReaderBuilder builder;
-    std::string errors;
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    EXPECT_TRUE(reader->parse(text.data(), text.data() + text.size(), &out, &errors)) << errors;
+    EXPECT_TRUE(VELA::JsonParse(text, out)) << text;
     return out;
 }
 
