@@ -50,11 +50,6 @@ TEST(Pipe, DocumentsCrossInOrderWhateverTheirSize)
         ASSERT_TRUE(pipe.ReadJson(got));
         EXPECT_EQ(doc, got);
     }
-    LogCapture log;
-    Json::Value after;
-    EXPECT_FALSE(pipe.ReadJson(after));  // the child is gone: end of file
-    EXPECT_TRUE(log.Contains("APIUtilsPrivate:")) << (log.Lines().empty() ? "" : log.Lines()[0]);
-    EXPECT_TRUE(log.Contains("protocol failed"));
     Reap(pid);
 }
 
@@ -73,7 +68,7 @@ std::string Frame(uint32_t len, const std::string& text)
 TEST(Pipe, ReaderRefusesBrokenFramesAndSaysWhy)
 {
     const BrokenFrame frames[] = {
-        {"nothing at all", "", "protocol failed"},
+        {"nothing at all (the writer is gone)", "", "protocol failed"},
         {"half a length", std::string("\x05\x00", 2), "protocol failed"},
         {"text cut short", Frame(10, "{\"a\":"), "read json 10 failed, got 5"},
         {"not json", Frame(5, "{{{{{"), nullptr},
@@ -90,7 +85,8 @@ TEST(Pipe, ReaderRefusesBrokenFramesAndSaysWhy)
         Json::Value out("unchanged");
         EXPECT_FALSE(pipe.ReadJson(out));
         if (frame.logged != nullptr) {
-            EXPECT_TRUE(log.Contains(frame.logged)) << (log.Lines().empty() ? "(no line)" : log.Lines()[0]);
+            EXPECT_NE(-1, log.PriorityOf({"APIUtilsPrivate:", frame.logged}))
+                << (log.Lines().empty() ? "(no line)" : log.Lines()[0]);
         }
     }
 }
