@@ -37,9 +37,11 @@ protected:
         StateRootTest::TearDown();
     }
 
+    // Writes the file `name`, relative to the working directory: the web-API
+    // directory, unless the test went elsewhere.
     void WriteJson(const std::string& name, const Json::Value& value)
     {
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + name, value, 0644)) << name;
+        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(name, value, 0644)) << name;
     }
 
     // A request JSON for one call.
