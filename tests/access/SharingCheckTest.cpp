@@ -200,7 +200,7 @@ TEST_F(SharingCheckTest, LibrariesAreFoundUnderTheRootAndOpenedOnce)
     Copy(libDir_ + "probe.so", libDir_ + "loose.so", 0775);  // group-writable: never loaded
     Prepare("probe", Link("loose").get_hash(), "");
     EXPECT_FALSE(E().OpenSharingCheckLib(E().GetRequest(), &table));
-    Copy(Built("/tests/dispatcher/libs/libreg_tables.so"), libDir_ + "notable.so", 0755);
+    Copy(Built("/tests/dispatcher/libs/libreg_notable.so"), libDir_ + "notable.so", 0755);
     Prepare("probe", Link("notable").get_hash(), "");
     EXPECT_FALSE(E().OpenSharingCheckLib(E().GetRequest(), &table));
     EXPECT_TRUE(log.Contains("Get Sharing Check Table Fail"));

@@ -1,18 +1,18 @@
 // The identity a handler runs with ("runAs", "grantable", "grantByUser",
-// "grantByDefault") and its restoration, the root guard and SetVelaInfo, on
-// a real unprivileged account. Every case runs in a forked child so the
+// "grantByDefault") and its restoration, through the pipeline, for a user
+// (APIRunner::Exec) and in compounds, the root guard and SetVelaInfo, on a
+// real unprivileged account. Every case runs in a forked child so the
 // test process keeps root. Needs root: skipped otherwise.
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <functional>
 #include <regex>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
-#include <vector>
 
 #include "dispatcher/PipeFixture.h"
+#include "dispatcher/libs/ProcessIds.h"
 #include "platform/IdentityTestUtil.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
@@ -33,32 +33,7 @@ using VELA::Test::InChild;
 // Ids as parsed from a report: JSON integers.
 Json::Value Triple(unsigned r, unsigned e, unsigned s)
 {
-    Json::Value v(Json::arrayValue);
-    for (unsigned id : {r, e, s}) {
-        v.append(static_cast<Json::Int>(id));
-    }
-    return v;
-}
-
-// {"uid": [r, e, s], "gid": [r, e, s], "groups": [...]}, as the test
-// handler reports them.
-Json::Value Ids()
-{
-    uid_t us[3];
-    gid_t gs[3];
-    getresuid(&us[0], &us[1], &us[2]);
-    getresgid(&gs[0], &gs[1], &gs[2]);
-    Json::Value ids(Json::objectValue);
-    ids["uid"] = Triple(us[0], us[1], us[2]);
-    ids["gid"] = Triple(gs[0], gs[1], gs[2]);
-    std::vector<gid_t> groups(static_cast<size_t>(getgroups(0, nullptr)));
-    groups.resize(static_cast<size_t>(getgroups(static_cast<int>(groups.size()), groups.data())));
-    std::sort(groups.begin(), groups.end());
-    ids["groups"] = Json::Value(Json::arrayValue);
-    for (gid_t g : groups) {
-        ids["groups"].append(static_cast<Json::Int>(g));
-    }
-    return ids;
+    return J("[" + std::to_string(r) + ", " + std::to_string(e) + ", " + std::to_string(s) + "]");
 }
 
 bool HasGroup(const Json::Value& ids, unsigned gid)
@@ -103,7 +78,7 @@ protected:
                 {"byDefault": {"grantByDefault": true}},
                 {"unknownUser": {"runAs": "vela-no-such-user-x", "grantable": true}}]}})");
         WriteJson("VELA.Pipe.lib", desc);
-        rootIds_ = Ids();
+        rootIds_ = ProcessIds();
     }
     void TearDown() override
     {
@@ -115,9 +90,11 @@ protected:
         }
     }
 
-    // Runs `request` in a forked child after `before`; reports Run's
-    // result, the answer, the ids afterwards and the log lines.
-    Json::Value RunInChild(const Json::Value& request, const std::function<void()>& before = nullptr)
+    // Runs `call` (which answers into its argument) in a forked child after
+    // `before`; reports the call's result, the answer, the child's pid and
+    // USERNAME, its ids afterwards and the log lines.
+    Json::Value ReportOfChild(const std::function<bool(Json::Value&)>& call,
+                              const std::function<void()>& before = nullptr)
     {
         const std::string text = InChild([&] {
             std::string log;
@@ -126,12 +103,11 @@ protected:
                 before();
             }
             Json::Value report(Json::objectValue);
-            {
-                APIRunner runner;
-                report["result"] = runner.Run(request);
-                report["answer"] = runner.GetResponse();
-            }
-            report["after"] = Ids();
+            const bool result = call(report["answer"]);
+            report["result"] = result;
+            report["after"] = ProcessIds();
+            report["pid"] = static_cast<Json::Int>(getpid());
+            report["USERNAME"] = getenv("USERNAME") != nullptr ? getenv("USERNAME") : "(unset)";
             VELA::System::LogSetSink(nullptr, nullptr);
             report["log"] = log;
             return VELA::JsonToString(report);
@@ -139,6 +115,18 @@ protected:
         Json::Value report;
         EXPECT_TRUE(VELA::JsonParse(text, report)) << text;
         return report;
+    }
+    // The report of Run on `request`.
+    Json::Value RunInChild(const Json::Value& request, const std::function<void()>& before = nullptr)
+    {
+        return ReportOfChild(
+            [&](Json::Value& answer) {
+                APIRunner runner;
+                const bool result = runner.Run(request);
+                answer = runner.GetResponse();
+                return result;
+            },
+            before);
     }
 
     Json::Value IdsCall(const std::string& method, const Json::Value& session = Json::Value())
@@ -154,21 +142,6 @@ protected:
     bool created_ = false;
     Json::Value rootIds_;
 };
-
-TEST_F(Identity, GrantableSwitchComesBackToRoot)
-{
-    const unsigned u = account_.uid, g = account_.gid;
-    for (const char* method : {"grantable", "byUser"}) {
-        const Json::Value report = RunInChild(IdsCall(method, J(R"({"username": ")" + account_.user + R"("})")));
-        const Json::Value& seen = report["answer"]["data"];
-        EXPECT_EQ(Triple(u, u, 0), seen["uid"]) << method;
-        EXPECT_EQ(Triple(g, g, g), seen["gid"]) << method;
-        EXPECT_TRUE(HasGroup(seen, account_.suppGid)) << method;
-        EXPECT_EQ(rootIds_, report["after"]) << method;
-        EXPECT_TRUE(Logged(report["log"].asString(), kAuthInfo, "ExecContext:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n"))
-            << report["log"].asString();
-    }
-}
 
 TEST_F(Identity, NotGrantableStaysTheUser)
 {
@@ -263,60 +236,115 @@ TEST_F(Identity, UploadFieldsCannotChangeTheCheckedMethod)
     EXPECT_EQ(VELA::JsonToString(Triple(u, u, u)), seen);
 }
 
+// APIRunner::Exec for the account: the handler runs with the identity of
+// its method (by "runAs", or by the session's user) and for that user, in
+// this process when the method is grantable or grantByDefault, in a child
+// otherwise; a grantable switch comes back to root and says so; the caller
+// keeps its ids and its USERNAME.
+TEST_F(Identity, ExecForAUserLeavesTheCallerAsItWas)
+{
+    const unsigned u = account_.uid, g = account_.gid;
+    const struct {
+        const char* method;
+        bool here;
+        bool grantable;
+        Json::Value uid, gid;
+    } cases[] = {
+        {"dropped", false, false, Triple(u, u, u), Triple(g, g, g)},
+        {"grantable", true, true, Triple(u, u, 0), Triple(g, g, g)},
+        {"byUser", true, true, Triple(u, u, 0), Triple(g, g, g)},
+        {"byDefault", true, false, Triple(0, 0, 0), Triple(0, 0, 0)},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.method);
+        const Json::Value report = ReportOfChild([&](Json::Value& answer) {
+            setenv("USERNAME", "caller-u", 1);
+            APIRunner().Exec(answer, "VELA.Pipe.Ids", 1, c.method, Json::Value(), account_.user.c_str());
+            return true;
+        });
+        const Json::Value& seen = report["answer"]["data"];
+        ASSERT_EQ(Json::Value(true), report["answer"]["success"]) << report["answer"];
+        EXPECT_EQ(c.here, seen["pid"] == report["pid"]);
+        EXPECT_EQ(c.uid, seen["uid"]);
+        EXPECT_EQ(c.gid, seen["gid"]);
+        EXPECT_EQ(c.uid[0].asUInt() == u, HasGroup(seen, account_.suppGid));
+        EXPECT_EQ(Json::Value(account_.user), seen["USERNAME"]);
+        EXPECT_EQ(Json::Value(account_.user), seen["user"]);
+        EXPECT_EQ(rootIds_, report["after"]);
+        EXPECT_EQ(Json::Value("caller-u"), report["USERNAME"]);
+        EXPECT_EQ(c.grantable,
+                  Logged(report["log"].asString(), kAuthInfo, "ExecContext:\\d+ WARNING: setresuid\\(-1, 0, -1\\)\n"))
+            << report["log"].asString();
+    }
+}
+
+// The calls of a compound: one in a child takes the identity of its
+// method, one in this process (grantable) switches and comes back.
+TEST_F(Identity, CompoundCallsTakeTheIdentityOfTheirMethod)
+{
+    const unsigned u = account_.uid;
+    Json::Value request = Call("VELA.Entry.Request", 1, "request");
+    request["getParam"]["compound"] = J(R"([{"api": "VELA.Pipe.Ids", "version": 1, "method": "dropped"},
+                                           {"api": "VELA.Pipe.Ids", "version": 1, "method": "grantable"}])");
+    const Json::Value report = RunInChild(request);
+    const Json::Value& result = report["answer"]["data"]["result"];
+    EXPECT_EQ(Triple(u, u, u), result[0]["data"]["uid"]) << report["answer"];
+    EXPECT_NE(report["pid"], result[0]["data"]["pid"]);
+    EXPECT_EQ(Triple(u, u, 0), result[1]["data"]["uid"]);
+    EXPECT_EQ(rootIds_, report["after"]);
+}
+
+// The root guard as root changes nothing and logs nothing; from the user's
+// effective ids with a saved uid 0 it gives root inside and the user again
+// afterwards (SetVelaInfo writes); with no way back to root it skips the
+// guarded statements and says so (SetVelaInfo refuses).
 TEST_F(Identity, RootGuardAndSetVelaInfo)
 {
     ASSERT_EQ(0, system(("mkdir -p '" + root_.Path() + "/etc'").c_str()));
     const unsigned u = account_.uid, g = account_.gid;
-    const std::string checks = InChild([&] {
-        std::string errors;
-        std::string log;
-        VELA::System::LogSetSink(Collect, &log);
-        // As root the guard changes nothing and logs nothing.
-        {
-            const Json::Value before = Ids();
-            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
-            if (!guard.Ok() || Ids() != before) {
-                errors += "guard as root changed the ids; ";
+    const Json::Value report = ReportOfChild([&](Json::Value& seen) {
+        // Whether the guard let the statements run, the ids inside and
+        // afterwards, the lines logged and the guard's error line.
+        const auto guarded = [&seen](const char* step) {
+            Json::Value& s = seen[step];
+            VELA::Test::LogCapture log;
+            {
+                VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
+                s["ok"] = guard.Ok();
+                s["inside"] = ProcessIds();
             }
-        }
-        if (!log.empty()) {
-            errors += "guard as root logged: " + log;
-        }
-        // From the user's effective ids with a saved uid 0: root inside,
-        // the user again afterwards.
+            s["after"] = ProcessIds();
+            s["lines"] = static_cast<Json::UInt>(log.Lines().size());
+            s["error"] = log.PriorityOf({"ExecContextTest:", " ERROR: IF_RUN_AS(0, 0)"});
+        };
+        guarded("root");
         setresgid(g, g, g);
         setresuid(u, u, 0);
-        {
-            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
-            if (!guard.Ok() || geteuid() != 0 || getegid() != 0) {
-                errors += "guard did not gain root; ";
-            }
-        }
-        if (geteuid() != u || getegid() != g) {
-            errors += "guard did not restore the user; ";
-        }
-        if (!VELA::APIUtils::SetVelaInfo("pipe_test_key", "written") || geteuid() != u) {
-            errors += "SetVelaInfo as the user failed; ";
-        }
-        // No way back to root: the guarded statements must be skipped.
+        guarded("user");
+        seen["user"]["written"] = VELA::APIUtils::SetVelaInfo("pipe_test_key", "written");
+        seen["user"]["afterWrite"] = ProcessIds();
         setresuid(u, u, u);
-        log.clear();
-        {
-            VELA::RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
-            if (guard.Ok()) {
-                errors += "guard claims root without a way back; ";
-            }
-        }
-        if (!Logged(log, kAuthErr, "ExecContextTest:\\d+ ERROR: IF_RUN_AS\\(0, 0\\)\n")) {
-            errors += "no guard error line: " + log;
-        }
-        if (VELA::APIUtils::SetVelaInfo("pipe_test_key", "refused")) {
-            errors += "SetVelaInfo succeeded without rights; ";
-        }
-        VELA::System::LogSetSink(nullptr, nullptr);
-        return errors;
+        guarded("stuck");
+        seen["stuck"]["written"] = VELA::APIUtils::SetVelaInfo("pipe_test_key", "refused");
+        return true;
     });
-    EXPECT_EQ("", checks);
+    const Json::Value& root = report["answer"]["root"];
+    const Json::Value& user = report["answer"]["user"];
+    const Json::Value& stuck = report["answer"]["stuck"];
+    EXPECT_EQ(Json::Value(true), root["ok"]) << report;
+    EXPECT_EQ(rootIds_, root["inside"]);
+    EXPECT_EQ(rootIds_, root["after"]);
+    EXPECT_EQ(Json::Value(0), root["lines"]);
+    EXPECT_EQ(Json::Value(true), user["ok"]);
+    EXPECT_EQ(Json::Value(0), user["inside"]["uid"][1]);
+    EXPECT_EQ(Json::Value(0), user["inside"]["gid"][1]);
+    EXPECT_EQ(u, user["after"]["uid"][1].asUInt());
+    EXPECT_EQ(g, user["after"]["gid"][1].asUInt());
+    EXPECT_EQ(Json::Value(true), user["written"]);
+    EXPECT_EQ(u, user["afterWrite"]["uid"][1].asUInt());
+    EXPECT_EQ(Json::Value(false), stuck["ok"]);
+    EXPECT_EQ(Json::Value(kAuthErr), stuck["error"]);
+    EXPECT_EQ(Json::Value(false), stuck["written"]);
     EXPECT_EQ(1, VLIBCFileCheckKeyValue((root_.Path() + "/etc/velainfo.conf").c_str(), "pipe_test_key", "written", 0));
 }
 

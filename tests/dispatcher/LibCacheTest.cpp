@@ -5,9 +5,6 @@
 #include <dlfcn.h>
 #include <memory>
 #include <string>
-#include <unistd.h>
-#include <utility>
-#include <vector>
 
 #include "dispatcher/APIRunnerPrivate.h"
 #include "dispatcher/PipeFixture.h"
@@ -66,9 +63,9 @@ protected:
 // CloseLib gives back every open it made.
 TEST_F(LibCache, OneOpenPerPath)
 {
-    const std::string path = Lib("reg_tables");
+    const std::string path = Lib("pipe_handlers");
     const std::string dir = path.substr(0, path.rfind('/'));
-    const std::string alias = dir + "/./libreg_tables.so";
+    const std::string alias = dir + "/./libpipe_handlers.so";
     ASSERT_FALSE(Loaded(path));
     {
         CacheRunner runner;
@@ -117,11 +114,11 @@ TEST_F(LibCache, TablesOfALoadedLibrary)
     _tag_API_CHECK_TABLE untouched{};
 
     // No check table: a normal library; the output is left alone.
-    void* tables = Cache(runner, Lib("reg_tables"));
+    void* tables = Cache(runner, Lib("pipe_handlers"));
     ASSERT_TRUE(runner.GetTableFunc(tables, &table));
-    EXPECT_STREQ("Reg.Cache.One", table[0].api);
-    EXPECT_STREQ("Reg.Cache.Two", table[1].api);
-    EXPECT_EQ(nullptr, table[2].api);
+    EXPECT_STREQ("VELA.Pipe.Test", table[0].api);
+    EXPECT_STREQ("silent", table[0].method);
+    EXPECT_STREQ("echo", table[1].method);
     check = &untouched;
     EXPECT_TRUE(runner.GetCheckTableFunc(tables, &check));
     EXPECT_EQ(&untouched, check);
@@ -164,25 +161,21 @@ TEST_F(LibCache, TablesOfALoadedLibrary)
 // library whose check table is null still serves its calls.
 TEST_F(LibCache, CallsThroughTheRunner)
 {
-    const std::string runAs = RunAs();
-    WriteJson("Reg.Cache.lib", J(R"({
-        "Reg.Cache.One": {"lib": ")" + Lib("reg_tables") + R"(", "minVersion": 1, "maxVersion": 1,
-                    "runAs": ")" + runAs + R"(", "methods": {"1": ["get"]}},
-        "Reg.Cache.Two": {"lib": ")" + Lib("reg_tables") + R"(", "minVersion": 1, "maxVersion": 1,
-                    "runAs": ")" + runAs + R"(", "methods": {"1": ["get"]}},
-        "Reg.Cache.NullCheck": {"lib": ")" + Lib("reg_nullcheck") + R"(", "minVersion": 1, "maxVersion": 1,
-                    "runAs": ")" + runAs + R"(", "methods": {"1": ["get"]}}})"));
-    CacheRunner runner;
+    WriteJson("Reg.Cache.lib", J(R"({"Reg.Cache.NullCheck": {"lib": ")" + Lib("reg_nullcheck") + R"(",
+        "minVersion": 1, "maxVersion": 1, "runAs": ")" + RunAs() + R"(", "methods": {"1": ["get"]}}})"));
+    const std::string echoed = R"(", "cwd": ")" + webapiDir_ + R"(", "user": ""})";
     const struct {
         const char* api;
-        const char* data;
+        const char* method;
+        std::string data;
     } calls[] = {
-        {"Reg.Cache.One", R"({"api": "Reg.Cache.One", "method": "get"})"},
-        {"Reg.Cache.Two", R"({"api": "Reg.Cache.Two", "method": "get"})"},
-        {"Reg.Cache.NullCheck", R"("unchecked")"},
+        {"VELA.Pipe.Test", "echo", R"({"api": "VELA.Pipe.Test", "method": "echo)" + echoed},
+        {"VELA.Pipe.Uncounted", "get", R"({"api": "VELA.Pipe.Uncounted", "method": "get)" + echoed},
+        {"Reg.Cache.NullCheck", "get", R"("unchecked")"},
     };
+    CacheRunner runner;
     for (const auto& c : calls) {
-        APIRequest req(Call(c.api, 1, "get"));
+        APIRequest req(Call(c.api, 1, c.method));
         VELA::APIResponse resp(&req);
         EXPECT_TRUE(runner.Process(&req, &resp)) << c.api;
         EXPECT_EQ(J(c.data), resp.GetBody()["data"]) << c.api;

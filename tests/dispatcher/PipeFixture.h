@@ -1,7 +1,7 @@
 // WebapiDirFixture: a fresh system root whose web-API directory is the
 // working directory for the test's duration. PipeFixture, of the pipeline,
-// counter and identity tests: that directory holds lib.def and the
-// descriptions of the test handler libraries
+// counter, identity, exec handler and compound tests: that directory holds
+// lib.def and the descriptions of the test handler libraries
 // (tests/dispatcher/libs/pipe_*.cpp).
 #pragma once
 
@@ -23,9 +23,8 @@ protected:
     void SetUp() override
     {
         StateRootTest::SetUp();
-        char buf[PATH_MAX];
-        ASSERT_NE(nullptr, getcwd(buf, sizeof(buf)));
-        oldCwd_ = buf;
+        oldCwd_ = Cwd();
+        ASSERT_FALSE(oldCwd_.empty());
         webapiDir_ = root_.Path() + "/usr/vela/velaman/webapi";
         ASSERT_EQ(0, system(("mkdir -p '" + webapiDir_ + "'").c_str()));
         ASSERT_EQ(0, chdir(webapiDir_.c_str()));
@@ -38,9 +37,11 @@ protected:
         StateRootTest::TearDown();
     }
 
+    // Writes the file `name`, relative to the working directory: the web-API
+    // directory, unless the test went elsewhere.
     void WriteJson(const std::string& name, const Json::Value& value)
     {
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(webapiDir_ + "/" + name, value, 0644)) << name;
+        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(name, value, 0644)) << name;
     }
 
     // A request JSON for one call.
@@ -53,6 +54,27 @@ protected:
         request["getParam"]["version"] = version;
         request["getParam"]["method"] = method;
         return request;
+    }
+
+    static std::string Cwd()
+    {
+        char buf[PATH_MAX];
+        return getcwd(buf, sizeof(buf)) ? buf : "";
+    }
+
+    // Path of a test handler library lib<name>.so.
+    static std::string Lib(const std::string& name)
+    {
+        const char* dir = getenv("VELA_TEST_BINARY_DIR");
+        return std::string(dir ? dir : ".") + "/tests/dispatcher/libs/lib" + name + ".so";
+    }
+
+    // The user the handlers run as: the test's own, so the switch needs no
+    // rights the test lacks.
+    static std::string RunAs()
+    {
+        const struct passwd* pw = getpwuid(geteuid());
+        return pw ? pw->pw_name : "system";
     }
 
     std::string oldCwd_;
@@ -72,22 +94,8 @@ protected:
             "methods": {"1": ["request", "other"]}}})"));
     }
 
-    // Path of a test handler library lib<name>.so.
-    static std::string Lib(const std::string& name)
-    {
-        const char* dir = getenv("VELA_TEST_BINARY_DIR");
-        return std::string(dir ? dir : ".") + "/tests/dispatcher/libs/lib" + name + ".so";
-    }
-
-    // The user the handlers run as: the test's own, so the switch needs no
-    // rights the test lacks.
-    static std::string RunAs()
-    {
-        const struct passwd* pw = getpwuid(geteuid());
-        return pw ? pw->pw_name : "system";
-    }
-
     // The descriptions of VELA.Pipe.lib; tests add to them and write again.
+    // VELA.Pipe.Sub is the API of the exec handler and compound tests.
     Json::Value Descriptions() const
     {
         const std::string handlers = Lib("pipe_handlers");
@@ -109,10 +117,15 @@ protected:
                 "runAs": ")" + runAs + R"(", "methods": {"1": ["open", "guarded", "unlisted"]}},
             "VELA.Pipe.NoLib": {"lib": ")" + Lib("pipe_missing") + R"(", "minVersion": 1, "maxVersion": 1,
                 "methods": {"1": ["get"]}},
-            "VELA.Pipe.NoTable": {"lib": ")" + Lib("pipe_notable") + R"(", "minVersion": 1, "maxVersion": 1,
+            "VELA.Pipe.NoTable": {"lib": ")" + Lib("reg_notable") + R"(", "minVersion": 1, "maxVersion": 1,
                 "methods": {"1": ["get"]}},
             "VELA.Pipe.NullTable": {"lib": ")" + Lib("pipe_nulltable") + R"(", "minVersion": 1,
-                "maxVersion": 1, "methods": {"1": ["get"]}}
+                "maxVersion": 1, "methods": {"1": ["get"]}},
+            "VELA.Pipe.Sub": {"lib": ")" + handlers + R"(", "minVersion": 1, "maxVersion": 1,
+                "runAs": ")" + runAs + R"(", "methods": {"1": ["report", "fail", "sleep", "crash", "orphan",
+                    {"reportGrantable": {"grantable": true}}, {"reportDefault": {"grantByDefault": true}},
+                    {"callback": {"grantByDefault": true}}, {"noisy": {"allowDownload": true}},
+                    {"output": {"grantable": true, "allowDownload": true}}]}}
         })");
     }
 };

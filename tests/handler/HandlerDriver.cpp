@@ -1,139 +1,96 @@
-// Opens the test handler library with dlopen(), runs its functions on
-// requests built from JSON and compares what they answered. Exit status 0
-// when everything matched, 1 otherwise (each mismatch is printed).
+// Opens the test handler library (VELA_TEST_HANDLER) with dlopen(), runs its
+// functions on requests built from JSON and compares what they answered.
+// Built, like the library, with nothing but include/, JsonCpp and the two
+// framework libraries.
 #include <dlfcn.h>
-#include <iostream>
-#include <memory>
+#include <gtest/gtest.h>
 #include <json/json.h>
+#include <memory>
 #include <string>
 
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
+#include "webapi/JsonUtil.h"
 
 namespace {
 
 typedef void (*HandlerFn)(VELA::APIRequest*, VELA::APIResponse*);
 
-int g_failures = 0;
-
-void Check(bool ok, const std::string& what)
-{
-    if (!ok) {
-        std::cerr << "mismatch: " << what << "\n";
-        ++g_failures;
-    }
-}
-
-void CheckJson(const Json::Value& expected, const Json::Value& actual, const std::string& what)
-{
-    if (expected != actual) {
-        std::cerr << "mismatch: " << what << "\n  expected " << expected.toStyledString()
-                  << "  actual   " << actual.toStyledString();
-        ++g_failures;
-    }
-}
-
-Json::Value Parse(const char* text)
+Json::Value Parse(const std::string& text)
 {
     Json::Value out;
-    Json::CharReaderBuilder builder;
-    std::string errors;
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    const std::string s(text);
-    if (!reader->parse(s.data(), s.data() + s.size(), &out, &errors)) {
-        std::cerr << "bad JSON in the driver: " << errors << "\n";
-        ++g_failures;
-    }
+    EXPECT_TRUE(VELA::JsonParse(text, out)) << text;
     return out;
 }
 
-HandlerFn Lookup(void* lib, const char* name)
-{
-    void* sym = dlsym(lib, name);
-    Check(sym != nullptr, std::string("symbol ") + name);
-    return reinterpret_cast<HandlerFn>(sym);
-}
+class HandlerLibrary : public ::testing::Test {
+protected:
+    void SetUp() override
+    {
+        lib_ = dlopen(VELA_TEST_HANDLER, RTLD_NOW | RTLD_LOCAL);
+        ASSERT_NE(nullptr, lib_) << dlerror();
+    }
+    void TearDown() override
+    {
+        if (lib_ != nullptr) {
+            EXPECT_EQ(0, dlclose(lib_)) << dlerror();
+        }
+    }
+
+    // Runs the library's function `name` on the request JSON `request`.
+    void Run(const char* name, const char* request)
+    {
+        const HandlerFn fn = reinterpret_cast<HandlerFn>(dlsym(lib_, name));
+        ASSERT_NE(nullptr, fn) << name;
+        req_.reset(new VELA::APIRequest(Parse(request)));
+        resp_.reset(new VELA::APIResponse(req_.get()));
+        fn(req_.get(), resp_.get());
+    }
+
+    void* lib_ = nullptr;
+    std::unique_ptr<VELA::APIRequest> req_;
+    std::unique_ptr<VELA::APIResponse> resp_;
+};
 
 // Each parameter the handler read answers [value, flags]: S set, R reset,
 // I invalid, D default.
-void RunParams(HandlerFn fn)
+TEST_F(HandlerLibrary, TypedParameters)
 {
-    VELA::APIRequest req(Parse(R"({"getParam": {
+    Run("HandlerParams", R"({"getParam": {
         "count": 5, "negative": -1, "wrongtype": "x", "enabled": true, "ratio": 0.5,
         "name": "disk1", "cleared": null, "ids": [1, 2], "opts": {"a": 1}, "paths": "single",
-        "big": -9000000000, "mask": 4294967295, "size": 18446744073709551615}})"));
-    VELA::APIResponse resp(&req);
-    fn(&req, &resp);
-    Check(resp.GetError() == 0, "params: error code");
-    CheckJson(Parse(R"({"success": true, "data": {
+        "big": -9000000000, "mask": 4294967295, "size": 18446744073709551615}})");
+    EXPECT_EQ(0, resp_->GetError());
+    EXPECT_EQ(Parse(R"({"success": true, "data": {
         "count": [5, "S"], "negative": [-1, "SI"], "wrongtype": [0, "SI"], "enabled": [true, "S"],
         "ratio": [0.5, "S"], "name": ["disk1", "S"], "cleared": ["", "SR"], "missing_req": ["", "I"],
         "ids": [[1, 2], "S"], "opts": [{"a": 1}, "S"], "paths": [["single"], "S"], "limit": [7, "SD"],
         "big": [-9000000000, "S"], "mask": [4294967295, "S"], "size": [18446744073709551615, "S"]}})"),
-              resp.GetBody(), "params: body");
+              resp_->GetBody());
 }
 
-void RunRefuse(HandlerFn fn)
+TEST_F(HandlerLibrary, Refusal)
 {
-    VELA::APIRequest req(Parse(R"({"environ": {"HTTP_HOST": "nas"}})"));
-    VELA::APIResponse resp(&req);
-    fn(&req, &resp);
-    CheckJson(Parse(R"({"success": false, "error": {"code": 105, "errors": {"reason": "not admin", "verdict": -4}}})"),
-              resp.GetBody(), "refuse: body");
-    Check(resp.GetError() == 105, "refuse: error code");
-    Check(resp.GetStatus() == 403, "refuse: status");
-    Check(resp.GetServerError() == "admin only", "refuse: server error");
-    Check(resp.HasServerError(), "refuse: has server error");
+    Run("HandlerRefuse", R"({"environ": {"HTTP_HOST": "nas"}})");
+    EXPECT_EQ(Parse(R"({"success": false, "error": {"code": 105, "errors": {"reason": "not admin", "verdict": -4}}})"),
+              resp_->GetBody());
+    EXPECT_EQ(105, resp_->GetError());
+    EXPECT_EQ(403, resp_->GetStatus());
+    EXPECT_EQ("admin only", resp_->GetServerError());
+    EXPECT_TRUE(resp_->HasServerError());
 }
 
-void RunLogin(HandlerFn fn)
+TEST_F(HandlerLibrary, LoginCookieHeadersAndRedirect)
 {
-    VELA::APIRequest req(Parse(R"({"environ": {"HTTPS": "on", "HTTP_HOST": "nas:5001"},
-                                   "getParam": {"client_time": 0}})"));
-    VELA::APIResponse resp(&req);
-    fn(&req, &resp);
-    CheckJson(Parse(R"({"success": true, "data": {"injection_refused": true}})"), resp.GetBody(),
-              "login: body");
-    CheckJson(Parse(R"(["id=s%201; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT; secure; httponly"])"),
-              resp.GetCookies(), "login: cookies");
-    Check(resp.GetHeader("Location") == "https://nas:5001/index.html", "login: location");
-    Check(resp.GetStatus() == 302, "login: status");
-    Check(resp.GetHeader("X-Handler") == "login", "login: own header");
-    Check(!resp.HasHeader("X-Evil"), "login: injected header");
-    Check(resp.GetHeader("Content-type") == "application/json; charset=\"UTF-8\"",
-          "login: content type");
+    Run("HandlerLogin", R"({"environ": {"HTTPS": "on", "HTTP_HOST": "nas:5001"}, "getParam": {"client_time": 0}})");
+    EXPECT_EQ(Parse(R"({"success": true, "data": {"injection_refused": true}})"), resp_->GetBody());
+    EXPECT_EQ(Parse(R"(["id=s%201; path=/; expires=Thu, 01-Jan-1970 00:10:00 GMT; secure; httponly"])"),
+              resp_->GetCookies());
+    EXPECT_EQ("https://nas:5001/index.html", resp_->GetHeader("Location"));
+    EXPECT_EQ(302, resp_->GetStatus());
+    EXPECT_EQ("login", resp_->GetHeader("X-Handler"));
+    EXPECT_FALSE(resp_->HasHeader("X-Evil"));
+    EXPECT_EQ("application/json; charset=\"UTF-8\"", resp_->GetHeader("Content-type"));
 }
 
 }  // namespace
-
-int main(int argc, char** argv)
-{
-    if (argc != 2) {
-        std::cerr << "usage: " << argv[0] << " <handler library>\n";
-        return 2;
-    }
-    void* lib = dlopen(argv[1], RTLD_NOW | RTLD_LOCAL);
-    if (!lib) {
-        const char* err = dlerror();
-        std::cerr << "dlopen failed: " << (err ? err : "unknown error") << "\n";
-        return 1;
-    }
-    HandlerFn params = Lookup(lib, "HandlerParams");
-    HandlerFn refuse = Lookup(lib, "HandlerRefuse");
-    HandlerFn login = Lookup(lib, "HandlerLogin");
-    if (params && refuse && login) {
-        RunParams(params);
-        RunRefuse(refuse);
-        RunLogin(login);
-    }
-    if (dlclose(lib) != 0) {
-        const char* err = dlerror();
-        Check(false, std::string("dlclose: ") + (err ? err : "unknown error"));
-    }
-    if (g_failures != 0) {
-        std::cerr << g_failures << " mismatch(es)\n";
-        return 1;
-    }
-    std::cout << "handler results as expected\n";
-    return 0;
-}

@@ -1,22 +1,17 @@
-// Compound requests run through a runner over a staged web-API directory
-// whose handlers (tests/dispatcher/libs/compound_calls.cpp) report the
-// process and the identity they ran with.
+// Compound requests run through a runner over the web-API directory of
+// PipeFixture, whose VELA.Pipe.Sub handlers
+// (tests/dispatcher/libs/pipe_handlers.cpp) report the process and the
+// identity they ran with. (The identity of the calls, with real accounts:
+// ExecContextTest.cpp.)
 #include <gtest/gtest.h>
 
-#include <climits>
-#include <csignal>
-#include <cstdlib>
-#include <fstream>
+#include <initializer_list>
 #include <memory>
-#include <pwd.h>
 #include <string>
-#include <sys/stat.h>
 #include <unistd.h>
 
-#include "platform/StateRootTest.h"
-#include "support/JsonLiteral.h"
+#include "dispatcher/PipeFixture.h"
 #include "support/TestSupport.h"
-#include "vela/webapiutil.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APIRunner.h"
@@ -26,14 +21,15 @@ namespace {
 using VELA::APIRequest;
 using VELA::APIResponse;
 
-// A runner whose permission check refuses the method "adminonly", as the
-// session check refuses a method the caller's class may not call.
+// A runner whose permission check refuses the calls that ask for it with
+// "refuse", as the session check refuses a method the caller's class may
+// not call.
 class GuardedRunner : public VELA::APIRunner {
 public:
     bool NeedPermission(APIRequest*) override { return true; }
     bool CheckPermission(APIRequest* req, APIResponse* resp) override
     {
-        if (req->GetAPIMethod() == "adminonly") {
+        if (req->GetParam("refuse", false) == Json::Value(true)) {
             resp->SetError(105);
             return false;
         }
@@ -42,27 +38,27 @@ public:
     bool SkipPermission(APIRequest*) override { return false; }
 };
 
-std::string Lib()
+// One call of VELA.Pipe.Sub; the handlers answer "n" back among their
+// parameters.
+Json::Value SubCall(const std::string& method, int n, Json::Value params = Json::Value(Json::objectValue))
 {
-    const char* dir = getenv("VELA_TEST_BINARY_DIR");
-    return std::string(dir ? dir : ".") + "/tests/dispatcher/libs/libcompound_calls.so";
-}
-
-std::string Self()
-{
-    const struct passwd* pw = getpwuid(geteuid());
-    return pw ? pw->pw_name : "system";
-}
-
-Json::Value Call(const std::string& method, int n, Json::Value params = Json::Value(Json::objectValue))
-{
-    params["api"] = "VELA.Comp";
+    params["api"] = "VELA.Pipe.Sub";
     params["version"] = 1;
     params["method"] = method;
     params["n"] = n;
     return params;
 }
 
+Json::Value List(std::initializer_list<Json::Value> items)
+{
+    Json::Value list(Json::arrayValue);
+    for (const Json::Value& item : items) {
+        list.append(item);
+    }
+    return list;
+}
+
+// The call of the entry API that runs `calls` (a list, or its JSON text).
 Json::Value Compound(const Json::Value& calls)
 {
     Json::Value params(Json::objectValue);
@@ -73,47 +69,8 @@ Json::Value Compound(const Json::Value& calls)
     return params;
 }
 
-bool Exists(const std::string& path)
-{
-    struct stat st;
-    return stat(path.c_str(), &st) == 0;
-}
-
-class CompoundTest : public StateRootTest {
+class CompoundTest : public PipeFixture {
 protected:
-    void SetUp() override
-    {
-        StateRootTest::SetUp();
-        char buf[PATH_MAX];
-        ASSERT_NE(nullptr, getcwd(buf, sizeof(buf)));
-        oldCwd_ = buf;
-        const std::string dir = root_.Path() + "/usr/vela/velaman/webapi";
-        ASSERT_EQ(0, system(("mkdir -p '" + dir + "' '" + root_.Path() + "/etc/vela'").c_str()));
-        ASSERT_EQ(0, chdir(dir.c_str()));
-        Write("lib.def", J(R"({"authLevel": 1, "allowUser": ["admin.local"], "priority": 0, "methods": {}})"));
-        Write("VELA.Entry.lib", J(R"({"VELA.Entry.Request": {"lib": "none.so", "minVersion": 1,
-            "maxVersion": 1, "methods": {"1": ["request"]}}})"));
-        Write("VELA.Comp.lib", J(R"({"VELA.Comp": {"lib": ")" + Lib() + R"(", "minVersion": 1, "maxVersion": 1,
-            "runAs": ")" + Self() + R"(", "methods": {"1": ["echo", "fail", "crash", "sleep", "big", "adminonly",
-              {"here": {"grantable": true}}, {"later": {"grantByDefault": true}},
-              {"restart": {"grantable": true}}, {"asNobody": {"runAs": "nobody"}},
-              {"download": {"allowDownload": true}}]}}})"));
-    }
-    void TearDown() override
-    {
-        EXPECT_EQ(0, chdir(oldCwd_.c_str()));
-        StateRootTest::TearDown();
-    }
-
-    void Write(const std::string& name, const Json::Value& value)
-    {
-        ASSERT_TRUE(VELA::WebAPIUtil::WriteJsonFileAtomic(name, value, 0644)) << name;
-    }
-    void Configure(const std::string& lines)
-    {
-        std::ofstream(root_.Path() + "/etc/vela/webapi.conf") << lines;
-    }
-
     // Runs the compound through a fresh runner; the answer's "data".
     Json::Value Run(const Json::Value& params)
     {
@@ -125,22 +82,16 @@ protected:
         return answer_["data"];
     }
 
-    std::string oldCwd_;
     std::unique_ptr<GuardedRunner> runner_;
     Json::Value answer_;
 };
 
 TEST_F(CompoundTest, SequentialCallsRunInProcessOnlyWhenGrantable)
 {
-    Json::Value calls(Json::arrayValue);
-    calls.append(Call("echo", 0));
-    calls.append(Call("here", 1));
-    calls.append(Call("fail", 2));
-    calls.append(Call("download", 3));
-    calls.append(J("{}"));
-    calls.append(Call("big", 5));
-    calls.append(Call("adminonly", 6));
-    const Json::Value data = Run(Compound(calls));
+    // The fourth call is a download; the fifth names no call.
+    const Json::Value data = Run(Compound(List({SubCall("report", 0), SubCall("reportGrantable", 1),
+        SubCall("fail", 2), SubCall("noisy", 3), J("{}"), SubCall("report", 5, J(R"({"pad": 262144})")),
+        SubCall("report", 6, J(R"({"refuse": true})"))})));
     ASSERT_TRUE(answer_["success"].asBool()) << answer_;
     EXPECT_TRUE(data["has_fail"].asBool());
     const Json::Value& r = data["result"];
@@ -151,11 +102,11 @@ TEST_F(CompoundTest, SequentialCallsRunInProcessOnlyWhenGrantable)
     for (int i : {0, 1, 5}) {
         SCOPED_TRACE(i);
         EXPECT_TRUE(r[i]["success"].asBool());
-        EXPECT_EQ(i, r[i]["data"]["n"].asInt());
-        EXPECT_EQ("VELA.Comp", r[i]["api"].asString());
+        EXPECT_EQ(i, r[i]["data"]["params"]["n"].asInt());
+        EXPECT_EQ("VELA.Pipe.Sub", r[i]["api"].asString());
         EXPECT_EQ(1, r[i]["version"].asInt());
     }
-    EXPECT_EQ(256u * 1024u, r[5]["data"]["blob"].asString().size());
+    EXPECT_EQ(256u * 1024u, r[5]["data"]["pad"].asString().size());
     EXPECT_EQ(1001, r[2]["error"]["code"].asInt());
     EXPECT_EQ(113, r[3]["error"]["code"].asInt());
     EXPECT_EQ(J(R"({"success": false, "error": {"code": 101}})"), r[4]);  // names no API: none added
@@ -165,10 +116,8 @@ TEST_F(CompoundTest, SequentialCallsRunInProcessOnlyWhenGrantable)
 TEST_F(CompoundTest, StopWhenErrorSkipsTheRestOnlyInSequence)
 {
     const std::string mark = root_.Path() + "/ran";
-    Json::Value calls(Json::arrayValue);
-    calls.append(Call("echo", 0));
-    calls.append(Call("fail", 1));
-    calls.append(Call("echo", 2, J(R"({"mark": ")" + mark + R"("})")));
+    const Json::Value calls =
+        List({SubCall("report", 0), SubCall("fail", 1), SubCall("report", 2, J(R"({"marker": ")" + mark + R"("})"))});
     // From a form: the list and the flag arrive as text.
     Json::Value params = Compound(VELA::JsonToString(calls));
     params["stop_when_error"] = "true";
@@ -176,26 +125,22 @@ TEST_F(CompoundTest, StopWhenErrorSkipsTheRestOnlyInSequence)
     EXPECT_TRUE(data["has_fail"].asBool());
     EXPECT_TRUE(data["result"][0]["success"].asBool());
     EXPECT_EQ(112, data["result"][2]["error"]["code"].asInt()) << data;
-    EXPECT_FALSE(Exists(mark));
+    EXPECT_NE(0, access(mark.c_str(), F_OK));
 
     params["mode"] = "parallel";
     data = Run(params);
     EXPECT_TRUE(data["result"][2]["success"].asBool()) << data;
-    EXPECT_TRUE(Exists(mark));
+    EXPECT_EQ(0, access(mark.c_str(), F_OK));
 }
 
 TEST_F(CompoundTest, ParallelAnswersKeepTheirPlaceWhateverTheChildrenDo)
 {
-    Json::Value calls(Json::arrayValue);
-    calls.append(Call("sleep", 0, J(R"({"ms": 100})")));
-    calls.append(Call("echo", 1));
-    calls.append(Call("crash", 2));
-    calls.append(Call("big", 3));
-    calls.append(Call("fail", 4));
-    calls.append(Call("here", 5));
+    const Json::Value calls = List({SubCall("sleep", 0, J(R"({"ms": 100})")), SubCall("report", 1),
+        SubCall("crash", 2), SubCall("report", 3, J(R"({"pad": 262144})")), SubCall("fail", 4),
+        SubCall("reportGrantable", 5)});
     for (const char* children : {"1", "2", "16"}) {
         SCOPED_TRACE(children);
-        Configure(std::string("compound_max_children=") + children + "\n");
+        Conf("webapi.conf", std::string("compound_max_children=") + children + "\n");
         VELA::Test::LogCapture log;
         Json::Value params = Compound(calls);
         params["mode"] = "parallel";
@@ -205,7 +150,7 @@ TEST_F(CompoundTest, ParallelAnswersKeepTheirPlaceWhateverTheChildrenDo)
         EXPECT_TRUE(data["has_fail"].asBool());
         for (int i : {0, 1, 3, 5}) {
             EXPECT_TRUE(r[i]["success"].asBool()) << i;
-            EXPECT_EQ(i, r[i]["data"]["n"].asInt());
+            EXPECT_EQ(i, r[i]["data"]["params"]["n"].asInt());
             EXPECT_NE(static_cast<int>(getpid()), r[i]["data"]["pid"].asInt());  // every call forks
         }
         EXPECT_TRUE(r[2].isNull());  // died without answering
@@ -216,25 +161,23 @@ TEST_F(CompoundTest, ParallelAnswersKeepTheirPlaceWhateverTheChildrenDo)
 
 TEST_F(CompoundTest, ChildPastItsTimeIsKilledAndTheOthersStillAnswer)
 {
-    Configure("compound_child_seconds=1\n");
+    Conf("webapi.conf", "compound_child_seconds=1\n");
     const std::string pidFile = root_.Path() + "/sleeper";
-    Json::Value calls(Json::arrayValue);
-    calls.append(Call("sleep", 0, J(R"({"ms": 10000, "mark": ")" + pidFile + R"("})")));
-    calls.append(Call("echo", 1));
     VELA::Test::LogCapture log;
-    const Json::Value data = Run(Compound(calls));
+    const Json::Value sleeper = SubCall("sleep", 0, J(R"({"ms": 10000, "pidfile": ")" + pidFile + R"("})"));
+    const Json::Value data = Run(Compound(List({sleeper, SubCall("report", 1)})));
     EXPECT_TRUE(data["has_fail"].asBool());
     EXPECT_TRUE(data["result"][0].isNull()) << data;
     EXPECT_TRUE(data["result"][1]["success"].asBool());
     EXPECT_TRUE(log.Contains("call 0 gave no answer in 1 s: killed"));
-    const pid_t sleeper = static_cast<pid_t>(atoi(VELA::Test::ReadText(pidFile).c_str()));
-    ASSERT_GT(sleeper, 0);
+    const pid_t pid = static_cast<pid_t>(atoi(VELA::Test::ReadText(pidFile).c_str()));
+    ASSERT_GT(pid, 0);
     // Gone, or a zombie of whoever adopted it: killed either way. The kill
     // takes effect asynchronously; a sleeper that was not killed would
     // still be asleep ten seconds from now.
     std::string stat;
     for (int i = 0; i < 200; ++i) {
-        stat = VELA::Test::ReadText("/proc/" + std::to_string(sleeper) + "/stat");
+        stat = VELA::Test::ReadText("/proc/" + std::to_string(pid) + "/stat");
         if (stat.empty() || stat.find(") Z ") != std::string::npos) {
             break;
         }
@@ -245,62 +188,37 @@ TEST_F(CompoundTest, ChildPastItsTimeIsKilledAndTheOthersStillAnswer)
 
 TEST_F(CompoundTest, BoundsRefuseTheWholeCompoundBeforeAnythingRuns)
 {
-    Configure("compound_max_calls=3\ncompound_max_depth=2\n");
+    Conf("webapi.conf", "compound_max_calls=3\ncompound_max_depth=2\n");
     const std::string mark = root_.Path() + "/ran";
-    const Json::Value marked = Call("echo", 0, J(R"({"mark": ")" + mark + R"("})"));
-    Json::Value four(Json::arrayValue);
-    for (int i = 0; i < 4; ++i) {
-        four.append(marked);
-    }
-    Json::Value one(Json::arrayValue);
-    one.append(marked);
-    Json::Value nested2(Json::arrayValue);
-    nested2.append(Compound(one));  // two levels: allowed
-    Json::Value nested3(Json::arrayValue);
-    nested3.append(Compound(nested2));  // three: refused
-    Json::Value nestedTooMany(Json::arrayValue);
-    nestedTooMany.append(Compound(one));
-    nestedTooMany.append(Compound(one));  // 2 + 2 calls
+    const Json::Value marked = SubCall("report", 0, J(R"({"marker": ")" + mark + R"("})"));
+    const Json::Value four = List({marked, marked, marked, marked});
+    const Json::Value nested2 = List({Compound(List({marked}))});  // two levels: allowed
+    const Json::Value nested3 = List({Compound(nested2)});         // three: refused
+    const Json::Value nestedTooMany = List({Compound(List({marked})), Compound(List({marked}))});  // 2 + 2 calls
 
     for (const Json::Value* calls : {&four, &nested3, &nestedTooMany}) {
         Run(Compound(*calls));
         EXPECT_EQ(110, answer_["error"]["code"].asInt()) << answer_;
         EXPECT_TRUE(answer_["error"]["errors"].isString());
-        EXPECT_FALSE(Exists(mark));
+        EXPECT_NE(0, access(mark.c_str(), F_OK));
     }
     const Json::Value data = Run(Compound(nested2));
     EXPECT_TRUE(data["result"][0]["data"]["result"][0]["success"].asBool()) << data;
-    EXPECT_TRUE(Exists(mark));
+    EXPECT_EQ(0, access(mark.c_str(), F_OK));
 }
 
+// A call run in this process (grantByDefault) hands its restart, server
+// error and callbacks to the compound's reply.
 TEST_F(CompoundTest, CallsPassOnRestartServerErrorAndCallbacks)
 {
-    Json::Value calls(Json::arrayValue);
-    calls.append(Call("restart", 0));
-    calls.append(Call("later", 1));
-    const Json::Value data = Run(Compound(calls));
+    const Json::Value call = SubCall("callback", 0, J(R"({"restart": "1", "error": "disk busy"})"));
+    const Json::Value data = Run(Compound(List({call})));
     EXPECT_FALSE(data["has_fail"].asBool()) << data;
     EXPECT_TRUE(answer_["httpd_restart"].asBool());
     EXPECT_EQ("disk busy", runner_->GetResponseObject()->GetServerError());
     EXPECT_EQ(1u, runner_->GetResponseObject()->GetCallbackFuncs().size());
 
-    EXPECT_EQ(J(R"({"has_fail": false, "result": []})"), Run(Compound(Json::Value(Json::arrayValue))));
-}
-
-TEST_F(CompoundTest, ChildTakesTheIdentityOfItsMethod)
-{
-    if (geteuid() != 0) {
-        GTEST_SKIP() << "needs root to switch identity";
-    }
-    const struct passwd* nobody = getpwnam("nobody");
-    ASSERT_NE(nullptr, nobody);
-    Json::Value calls(Json::arrayValue);
-    calls.append(Call("asNobody", 0));
-    calls.append(Call("here", 1));
-    const Json::Value data = Run(Compound(calls));
-    EXPECT_EQ(nobody->pw_uid, data["result"][0]["data"]["euid"].asUInt()) << data;
-    EXPECT_EQ(0u, data["result"][1]["data"]["euid"].asUInt());
-    EXPECT_EQ(0u, geteuid());
+    EXPECT_EQ(J(R"({"has_fail": false, "result": []})"), Run(Compound(List({}))));
 }
 
 }  // namespace

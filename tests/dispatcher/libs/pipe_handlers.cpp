@@ -1,16 +1,18 @@
-// Handlers of the pipeline and identity tests. Each reports what it saw
-// through the response, so the tests read the facts of the call itself.
+// Handlers of the dispatcher tests (VELA.Pipe.*), of the exec handler and
+// compound tests (VELA.Pipe.Sub) and of the end-to-end tests. Each reports what it saw from inside the call through the
+// response, so the tests read the facts of the call itself, or misbehaves
+// on purpose.
 #include <cerrno>
 #include <climits>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
-#include <grp.h>
+#include <fcntl.h>
 #include <iostream>
 #include <stdexcept>
 #include <string>
 #include <sys/resource.h>
 #include <unistd.h>
-#include <vector>
 
 #include <json/json.h>
 
@@ -18,6 +20,8 @@
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APITable.h"
+
+#include "ProcessIds.h"
 
 #define HANDLER_EXPORT extern "C" __attribute__((visibility("default")))
 
@@ -30,6 +34,42 @@ std::string Cwd()
 {
     char buf[PATH_MAX];
     return getcwd(buf, sizeof(buf)) ? buf : "";
+}
+
+std::string Env(const char* name)
+{
+    const char* value = getenv(name);
+    return value ? value : "(unset)";
+}
+
+// A bounded count from a parameter; `def` when absent or out of range.
+long long Count(APIRequest* req, const char* name, long long def)
+{
+    const Json::Value value = req->GetParam(name, static_cast<Json::Int64>(def));
+    if (!value.isIntegral()) {
+        return def;
+    }
+    const long long n = value.asInt64();
+    return n >= 0 && n <= (64LL << 20) ? n : def;
+}
+
+// "pad" bytes of padding, to make an answer as large as a test needs.
+std::string Pad(APIRequest* req)
+{
+    return std::string(static_cast<size_t>(Count(req, "pad", 0)), 'p');
+}
+
+bool WriteAll(int fd, const char* data, size_t len)
+{
+    while (len > 0) {
+        const ssize_t n = write(fd, data, len);
+        if (n <= 0) {
+            return false;
+        }
+        data += n;
+        len -= static_cast<size_t>(n);
+    }
+    return true;
 }
 
 void Silent(APIRequest*, APIResponse*) {}
@@ -109,6 +149,10 @@ void Callback(APIRequest* req, APIResponse* resp)
     if (req->GetParam("restart", "0").asString() == "1") {
         resp->SetHttpdRestart(true);
     }
+    // "error": a server error for the reply's header as well.
+    if (req->HasParam("error")) {
+        resp->SetServerError(req->GetParam("error").asString());
+    }
     resp->SetSuccess();
 }
 
@@ -134,28 +178,132 @@ void Stream(APIRequest* req, APIResponse* resp)
     pclose(pipe);
 }
 
-// The ids and groups the handler runs with, and the method it serves.
-void Ids(APIRequest* req, APIResponse* resp)
+// The ids, groups, process and environment of the call, and what it was
+// given, with "pad" bytes of padding. With a "marker" parameter, first
+// creates that file (the tests' witness that a call ran).
+void Report(APIRequest* req, APIResponse* resp)
 {
-    uid_t u[3];
-    gid_t g[3];
-    if (getresuid(&u[0], &u[1], &u[2]) != 0 || getresgid(&g[0], &g[1], &g[2]) != 0) {
+    const std::string marker = req->GetParam("marker", "").asString();
+    if (!marker.empty()) {
+        close(open(marker.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
+    }
+    Json::Value data = ProcessIds();
+    if (data.empty()) {
         resp->SetError(500);
         return;
     }
-    Json::Value data(Json::objectValue);
-    for (int i = 0; i < 3; ++i) {
-        data["uid"].append(static_cast<Json::UInt>(u[i]));
-        data["gid"].append(static_cast<Json::UInt>(g[i]));
-    }
-    std::vector<gid_t> groups(static_cast<size_t>(getgroups(0, nullptr)));
-    groups.resize(static_cast<size_t>(getgroups(static_cast<int>(groups.size()), groups.data())));
-    data["groups"] = Json::Value(Json::arrayValue);
-    for (gid_t group : groups) {
-        data["groups"].append(static_cast<Json::UInt>(group));
-    }
+    data["pid"] = static_cast<Json::Int>(getpid());
+    data["USERNAME"] = Env("USERNAME");
+    data["VELA_WEBAPI_USERNAME"] = Env("VELA_WEBAPI_USERNAME");
+    data["user"] = req->GetLoginUserName();
+    data["isAdmin"] = req->IsAdmin();
+    data["api"] = req->GetAPIClass();
+    data["version"] = req->GetAPIVersion();
     data["method"] = req->GetAPIMethod();
+    data["params"] = req->GetParam("", Json::Value(Json::objectValue));
     data["methodParam"] = req->GetParam("method", "");
+    data["attr"] = req->GetAttr("mark");
+    data["requestMethod"] = req->GetRequestMethod();
+    data["cwd"] = Cwd();
+    data["pad"] = Pad(req);
+    resp->SetSuccess(data);
+}
+
+void Fail(APIRequest*, APIResponse* resp) { resp->SetError(1001); }
+
+// Writes its pid into the file named by "pidfile", sleeps "ms"
+// milliseconds (at most 10 s), then reports.
+void Sleep(APIRequest* req, APIResponse* resp)
+{
+    const std::string pidfile = req->GetParam("pidfile", "").asString();
+    if (FILE* f = pidfile.empty() ? nullptr : fopen(pidfile.c_str(), "we")) {
+        fprintf(f, "%d\n", static_cast<int>(getpid()));
+        fclose(f);
+    }
+    const int ms = req->GetParam("ms", 0).asInt();
+    usleep(static_cast<useconds_t>(ms > 0 && ms <= 10000 ? ms : 0) * 1000u);
+    Report(req, resp);
+}
+
+// Writes to its standard output, both through the descriptor and the stream
+// object, and reads what its standard input holds.
+void Noisy(APIRequest*, APIResponse* resp)
+{
+    WriteAll(STDOUT_FILENO, "noise on fd 1\n", 14);
+    std::cout << "noise on std::cout" << std::endl;
+    char buf[256] = {0};
+    const ssize_t n = read(STDIN_FILENO, buf, sizeof(buf) - 1);
+    Json::Value data(Json::objectValue);
+    data["stdin"] = std::string(buf, n > 0 ? static_cast<size_t>(n) : 0);
+    resp->SetSuccess(data);
+}
+
+// Dies before answering: killed by SIGKILL ("how": "kill", the default) or
+// by SIGSEGV ("segv"), or exiting at once ("exit").
+void Crash(APIRequest* req, APIResponse*)
+{
+    const std::string how = req->GetParam("how", "kill").asString();
+    if (how == "exit") {
+        _exit(3);
+    }
+    raise(how == "segv" ? SIGSEGV : SIGKILL);
+    _exit(4);
+}
+
+// A CGI reply on standard output: "raw" alone, exactly as given; otherwise
+// the header block (one write, ending in an empty line) followed by "size"
+// bytes of body. Answers with its pid and "pad" bytes of padding.
+void Output(APIRequest* req, APIResponse* resp)
+{
+    if (req->HasParam("raw")) {
+        const std::string raw = req->GetParam("raw", "").asString();
+        WriteAll(STDOUT_FILENO, raw.data(), raw.size());
+    } else {
+        const std::string header = "Status: 200 OK\r\nContent-Type: application/octet-stream\r\n\r\n";
+        WriteAll(STDOUT_FILENO, header.data(), header.size());
+        const long long size = Count(req, "size", 0);
+        std::string chunk;
+        for (long long at = 0; at < size;) {
+            chunk.clear();
+            for (int i = 0; i < 65536 && at < size; ++i, ++at) {
+                // Every byte value, NUL included, and now and then an empty
+                // line inside the body.
+                chunk += at % 1000 < 4 ? "\r\n\r\n"[at % 1000] : static_cast<char>((at * 7 + at / 251) & 0xff);
+            }
+            if (!WriteAll(STDOUT_FILENO, chunk.data(), chunk.size())) {
+                break;
+            }
+        }
+    }
+    Json::Value data(Json::objectValue);
+    data["pid"] = static_cast<Json::Int>(getpid());
+    data["pad"] = Pad(req);
+    resp->SetSuccess(data);
+}
+
+// Leaves a process behind that holds every descriptor of the call (its
+// standard output and its answer pipe) until someone opens the FIFO named
+// by "fifo" for writing and closes it. Then dies ("how": "kill"), or writes
+// a CGI reply ("X: 1", an empty line, "before") and answers with "pad"
+// bytes of padding.
+void Orphan(APIRequest* req, APIResponse* resp)
+{
+    const std::string fifo = req->GetParam("fifo", "").asString();
+    const pid_t pid = fork();
+    if (pid == 0) {
+        const int fd = open(fifo.c_str(), O_RDONLY);
+        char c;
+        while (fd >= 0 && read(fd, &c, 1) > 0) {
+        }
+        _exit(0);
+    }
+    if (pid < 0 || req->GetParam("how", "kill").asString() == "kill") {
+        raise(SIGKILL);
+    }
+    const std::string reply = "X: 1\r\n\r\nbefore";
+    WriteAll(STDOUT_FILENO, reply.data(), reply.size());
+    Json::Value data(Json::objectValue);
+    data["pad"] = Pad(req);
     resp->SetSuccess(data);
 }
 
@@ -175,12 +323,22 @@ _tag_API_TABLE g_table[] = {
     {"VELA.Pipe.Nice", 1, "fail", NiceFail},
     {"VELA.Entry.Request", 1, "request", Echo},
     {"VELA.Entry.Request", 1, "other", Echo},
-    {"VELA.Pipe.Ids", 1, "grantable", Ids},
-    {"VELA.Pipe.Ids", 1, "dropped", Ids},
-    {"VELA.Pipe.Ids", 1, "byUser", Ids},
-    {"VELA.Pipe.Ids", 1, "byDefault", Ids},
-    {"VELA.Pipe.Ids", 1, "unknownUser", Ids},
-    {"VELA.Pipe.Ids", 1, "upload", Ids},
+    {"VELA.Pipe.Ids", 1, "grantable", Report},
+    {"VELA.Pipe.Ids", 1, "dropped", Report},
+    {"VELA.Pipe.Ids", 1, "byUser", Report},
+    {"VELA.Pipe.Ids", 1, "byDefault", Report},
+    {"VELA.Pipe.Ids", 1, "unknownUser", Report},
+    {"VELA.Pipe.Ids", 1, "upload", Report},
+    {"VELA.Pipe.Sub", 1, "report", Report},
+    {"VELA.Pipe.Sub", 1, "reportGrantable", Report},
+    {"VELA.Pipe.Sub", 1, "reportDefault", Report},
+    {"VELA.Pipe.Sub", 1, "fail", Fail},
+    {"VELA.Pipe.Sub", 1, "sleep", Sleep},
+    {"VELA.Pipe.Sub", 1, "callback", Callback},
+    {"VELA.Pipe.Sub", 1, "noisy", Noisy},
+    {"VELA.Pipe.Sub", 1, "crash", Crash},
+    {"VELA.Pipe.Sub", 1, "output", Output},
+    {"VELA.Pipe.Sub", 1, "orphan", Orphan},
     {nullptr, 0, nullptr, nullptr},
 };
 
