@@ -44,14 +44,14 @@ async function shown(page, until) {
   return handle.jsonValue();
 }
 
-async function newPage(context, hash) {
+async function newPage(context, where) {
   const page = await context.newPage();
   page.setDefaultTimeout(STEP_MS);
   page.on("console", (m) => pageLog.push(`console.${m.type()}: ${m.text()}`));
   page.on("pageerror", (e) => pageLog.push(`page error: ${e.message}`));
   page.on("response", (r) => pageLog.push(`${r.status()} ${r.request().method()} ${r.url()}`));
   page.on("dialog", (d) => { check(false, `the page opened a dialog: ${d.message()}`); d.dismiss(); });
-  const reply = await page.goto(`${base}/share.html#${hash}`);
+  const reply = await page.goto(`${base}/share.html${where}`);
   check(reply && reply.status() === 200, `share.html: HTTP ${reply && reply.status()}`);
   return page;
 }
@@ -65,12 +65,14 @@ async function run() {
   try {
     const context = await browser.newContext({ acceptDownloads: true });
 
-    // A well-formed id no link has.
-    const unknown = await shown(await newPage(context, "A".repeat(22)), "error");
+    // A well-formed id no link has (the link in the query), and junk.
+    const unknown = await shown(await newPage(context, `?link=${"A".repeat(22)}`), "error");
     check(/no such link/i.test(unknown.error) && !unknown.asked, `unknown link shows ${JSON.stringify(unknown)}`);
+    const junk = await shown(await newPage(context, "#%E0%A4%A"), "error");
+    check(/does not name a sharing link/i.test(junk.error), `a malformed id shows ${JSON.stringify(junk)}`);
 
     // The link asks for its password; a wrong one is refused, no folder shown.
-    const page = await newPage(context, link);
+    const page = await newPage(context, `#${link}`);
     const asked = await shown(page, "asked");
     check(asked.asked && asked.error === "", `the link first shows ${JSON.stringify(asked)}`);
     await page.fill("#password", `x${password}`);
