@@ -111,6 +111,7 @@ call -H "X-Vela-Sharing: $SHARED" "$SHARE_API&method=list"
 expect_error "list without the cookie" 124
 call -H "X-Vela-Sharing: $SHARED" -H "Range: bytes=2-8" "$SHARE_API&method=download&path=cat.jpg"
 expect_error "download without the cookie" 124
+expect_header "download without the cookie" "Accept-Ranges: none"
 call -b "id=$OWNER" --data "id=$SHARED" "$SHARING&method=revoke"
 expect "revoke sample-share" '"success":true'
 through "$SHARE_API&method=list"
