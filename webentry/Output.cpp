@@ -15,7 +15,12 @@ namespace VELA {
 namespace {
 
 // Written after the response's own headers; a handler cannot remove them.
+// "Accept-Ranges: none": a JSON answer is whole or nothing. Without it the
+// web server cuts a short answer that is complete before it starts sending
+// to the byte range the client asked for, so a refused ranged download
+// would get a piece of its error as "206 Partial Content".
 const char* const kFixedHeaders[] = {
+    "Accept-Ranges: none",
     "X-Content-Type-Options: nosniff",
     "X-XSS-Protection: 1; mode=block",
     "Cache-Control: max-age=0, no-cache, no-store, must-revalidate",

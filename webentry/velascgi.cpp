@@ -21,6 +21,7 @@ namespace {
 const char kSetupFailedReply[] =
     "Status: 500 Internal Server Error\r\n"
     "Content-type: application/json; charset=\"UTF-8\"\r\n"
+    "Accept-Ranges: none\r\n"
     "X-Content-Type-Options: nosniff\r\n"
     "X-XSS-Protection: 1; mode=block\r\n"
     "Cache-Control: max-age=0, no-cache, no-store, must-revalidate\r\n"

@@ -334,7 +334,7 @@ TEST_F(SharingCheckTest, SampleShareStaysInsideTheSharedFolder)
     ASSERT_EQ(0, system(("mkdir -p '" + share + "/sub' && echo secret > '" + In("/secret") + "' && echo hi > '" +
                          share + "/sub/a.txt' && ln -s ../secret '" + share + "/out' && ln -s sub '" + share +
                          "/inner'").c_str()));
-    const record::Entry e = Link("sample-share", share);
+    const record::Entry e = Link("sample-share", "/share");  // as the system sees it
     const std::string sid = Visit(e);
 
     auto run = [&](int which, const Json::Value& params) {

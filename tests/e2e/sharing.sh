@@ -17,17 +17,17 @@ mkdir -p "$ROOT/usr/lib/sharing/permission_lib" &&
   install -m 0755 "$CHECKLIB" "$ROOT/usr/lib/sharing/permission_lib/sample-share.so" || exit 1
 srv_serve
 
-# The shared folder, readable by its owner "nobody"; a root-only file beside
-# it and a link to that file inside it.
-SHARE=$TMP/share
-mkdir -p "$SHARE/sub" && printf '0123456789' >"$SHARE/sub/digits.txt" && echo topsecret >"$TMP/secret" &&
-  chmod 0600 "$TMP/secret" && ln -s ../secret "$SHARE/out" && chmod -R a+rX "$SHARE" &&
+# The shared folder /share of the system root, readable by its owner
+# "nobody"; a root-only file beside it and a link to that file inside it.
+SHARE=$ROOT/share
+mkdir -p "$SHARE/sub" && printf '0123456789' >"$SHARE/sub/digits.txt" && echo topsecret >"$ROOT/secret" &&
+  chmod 0600 "$ROOT/secret" && ln -s ../secret "$SHARE/out" && chmod -R a+rX "$SHARE" &&
   echo rootonly >"$SHARE/rootonly" && chmod 0600 "$SHARE/rootonly" || exit 1
 link() { VELA_ROOT=$ROOT "$LINKTOOL" "$@"; }
-HASH=$(link create sample-share "$SHARE" nobody | sed -n 's/^hash=//p')
+HASH=$(link create sample-share /share nobody | sed -n 's/^hash=//p')
 SID=$(link session "$HASH" 127.0.0.1 | sed -n 's/^sid=//p')
 [ -n "$HASH" ] && [ -n "$SID" ] || { fail "no link or visitor session was made"; exit 1; }
-OTHER=$(link create sample-share "$SHARE" nobody | sed -n 's/^hash=//p')
+OTHER=$(link create sample-share /share nobody | sed -n 's/^hash=//p')
 OTHER_SID=$(link session "$OTHER" 127.0.0.1 | sed -n 's/^sid=//p')
 
 SHARE_API="$URL?api=VELA.Sample.Share&version=1"

@@ -4,17 +4,20 @@
 # without an account opens it with curl, with and without the right
 # password, and gets the session cookie; revoking ends the visitor's session
 # at once; expired and used-up links are refused; repeated wrong passwords
-# block the address. Sessions of the owner and of an administrator (root)
-# come from velaadm.
+# block the address. A link of the file-sharing sample is used end to end:
+# made, opened, listed and downloaded from through the link, revoked. Sessions
+# of the owner and of an administrator (root) come from velaadm.
 #
-# usage: sharing_links.sh VELASCGI VELAADM STAGED_WEBAPI_DIR SOURCE_DIR
+# usage: sharing_links.sh VELASCGI VELAADM CHECK_LIBRARY STAGED_WEBAPI_DIR SOURCE_DIR
 set -u
 
 . "$(dirname "$0")/server.sh"
-srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
+srv_args VELASCGI VELAADM CHECKLIB WEBAPI SRC -- "$@"
 srv_require "the owner's identity is taken to open the shared item"
 srv_traps
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
+mkdir -p "$ROOT/usr/lib/sharing/permission_lib" &&
+  install -m 0755 "$CHECKLIB" "$ROOT/usr/lib/sharing/permission_lib/sample-share.so" || exit 1
 
 # Error codes of VELA.Sharing (webapi/sharing/).
 ERR_NO_LINK=470 ERR_EXPIRED=471 ERR_USE_LIMIT=472 ERR_BAD_PASSWORD=473 ERR_BLOCKED=474
@@ -82,6 +85,38 @@ expect "revoke" '"success":true'
 call -b "$JAR" --data "link=$LINK" "$OPEN"
 refused "open after revoke" $ERR_NO_LINK
 VELA_ROOT=$ROOT "$VELAADM" link show "$LINK" | grep -q '"revoked" : true' || fail "velaadm does not show the link revoked"
+
+# ---- The file-sharing sample through a link: the visitor's cookie and the
+# link header (or the link as a query parameter, as a plain download link
+# sends it) let it list and download; without the cookie it is refused, and
+# revoking ends it.
+create "create sample-share" "project=sample-share&path=/volume1/photos"
+SHARED=$link
+SHARE_API="$URL?api=VELA.Sample.Share&version=1"
+call -c "$TMP/shared" --data "link=$SHARED" "$OPEN"
+expect "open sample-share" '"success":true' '"project":"sample-share"' '"name":"photos"'
+through() { call -b "$TMP/shared" -H "X-Vela-Sharing: $SHARED" "$@"; }
+through "$SHARE_API&method=list"
+expect "list through the link" '"success":true' '"name":"cat.jpg","size":10,'
+for how in header query; do
+  if [ $how = header ]; then
+    through -H "Range: bytes=2-8" "$SHARE_API&method=download&path=cat.jpg"
+  else
+    call -b "$TMP/shared" -H "Range: bytes=2-8" "$SHARE_API&method=download&path=cat.jpg&_sharing_id=$SHARED"
+  fi
+  expect_status "ranged download, link in the $how" 206
+  [ "$(cat "$TMP/body")" = picture ] || fail "ranged download, link in the $how: $(head -c 100 "$TMP/body")"
+done
+call -H "X-Vela-Sharing: $SHARED" "$SHARE_API&method=list"
+expect_error "list without the cookie" 124
+call -H "X-Vela-Sharing: $SHARED" -H "Range: bytes=2-8" "$SHARE_API&method=download&path=cat.jpg"
+expect_error "download without the cookie" 124
+expect_header "download without the cookie" "Accept-Ranges: none"
+call -b "id=$OWNER" --data "id=$SHARED" "$SHARING&method=revoke"
+expect "revoke sample-share" '"success":true'
+through "$SHARE_API&method=list"
+expect_error "list after revoke" 123
+grep -q '"name":"cat.jpg"' "$TMP/body" && fail "list after revoke still lists the folder"
 
 # ---- A link of one use, and one that expires two seconds after it is made
 # (the wait only ever makes it more expired).

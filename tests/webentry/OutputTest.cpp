@@ -18,6 +18,7 @@
 namespace {
 
 const char kFixed[] =
+    "Accept-Ranges: none\r\n"
     "X-Content-Type-Options: nosniff\r\n"
     "X-XSS-Protection: 1; mode=block\r\n"
     "Cache-Control: max-age=0, no-cache, no-store, must-revalidate\r\n"

@@ -25,6 +25,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "vela/vlibc.h"
 #include "webapi/APIDownload.h"
 #include "webapi/APIError.h"
 #include "webapi/APIParameter.h"
@@ -90,14 +91,15 @@ bool IsRelativeName(const std::string& path)
 }
 
 // The shared folder of the request's link, opened as a directory without
-// following a link in its last part. -1 when there is none.
+// following a link in its last part. -1 when there is none. The store keeps
+// the path as the system sees it, so it is taken under the system root.
 int OpenShare(APIRequest* req)
 {
     const std::string root = req->GetSharingEntry().get_path();
     if (root.empty() || root[0] != '/') {
         return -1;
     }
-    return open(root.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    return open(VELA::System::Path(root).c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
 }
 
 // `path` below the folder `dirfd`, never above it, through no link.
