@@ -658,16 +658,16 @@ int LinkCreate(int argc, char** argv)
     if (!args.positional.empty()) {
         return Usage("link create takes no positional arguments");
     }
-    sdb::LinkSpec spec;
+    sdb::LinkSpec link;
     std::string path;
     std::string passwordFile;
     bool passwordStdin = false;
     long long expires = 0;
     for (const auto& opt : args.options) {
         if (opt.first == "--owner") {
-            spec.userName = opt.second;
+            link.userName = opt.second;
         } else if (opt.first == "--project") {
-            spec.projectName = opt.second;
+            link.projectName = opt.second;
         } else if (opt.first == "--path") {
             path = opt.second;
         } else if (opt.first == "--expires") {
@@ -675,7 +675,7 @@ int LinkCreate(int argc, char** argv)
                 return Usage(("--expires must be 1 to " + std::to_string(kLinkExpiresMax) + " seconds").c_str());
             }
         } else if (opt.first == "--uses") {
-            if (!ParseSeconds(opt.second.c_str(), VELA::sharing::kMaxUseLimit, spec.useLimit)) {
+            if (!ParseSeconds(opt.second.c_str(), VELA::sharing::kMaxUseLimit, link.useLimit)) {
                 return Usage(("--uses must be 1 to " + std::to_string(VELA::sharing::kMaxUseLimit)).c_str());
             }
         } else if (opt.first == "--password-file") {
@@ -683,10 +683,10 @@ int LinkCreate(int argc, char** argv)
         } else if (opt.first == "--password-stdin") {
             passwordStdin = true;
         } else if (opt.first == "--match-ip") {
-            spec.enableMatchIP = true;
+            link.enableMatchIP = true;
         }
     }
-    if (spec.userName.empty() || spec.projectName.empty() || path.empty()) {
+    if (link.userName.empty() || link.projectName.empty() || path.empty()) {
         return Usage("link create needs --owner, --project and --path");
     }
     if (passwordStdin && !passwordFile.empty()) {
@@ -696,19 +696,19 @@ int LinkCreate(int argc, char** argv)
         return Usage("--path must be an absolute path of printable bytes without \".\" or \"..\" parts");
     }
     gid_t gid = 0;
-    if (VELAUserGetUGID(spec.userName.c_str(), &spec.uid, &gid) != 0) {
-        return Fail("no user \"" + Printable(spec.userName) + "\"");
+    if (VELAUserGetUGID(link.userName.c_str(), &link.uid, &gid) != 0) {
+        return Fail("no user \"" + Printable(link.userName) + "\"");
     }
-    if (!ResolveLinkPath(path, spec.path, problem)) {
+    if (!ResolveLinkPath(path, link.path, problem)) {
         return Fail(Printable(problem));
     }
-    if ((passwordStdin && !ReadPassword(STDIN_FILENO, spec.password, problem)) ||
-        (!passwordFile.empty() && !ReadPasswordFile(passwordFile, spec.password, problem))) {
+    if ((passwordStdin && !ReadPassword(STDIN_FILENO, link.password, problem)) ||
+        (!passwordFile.empty() && !ReadPasswordFile(passwordFile, link.password, problem))) {
         return Fail(problem);
     }
-    spec.expireTime = expires == 0 ? 0 : static_cast<long long>(time(nullptr)) + expires;
+    link.expireTime = expires == 0 ? 0 : static_cast<long long>(time(nullptr)) + expires;
     srec::Entry entry;
-    if (!sdb::EntryDB(sdb::SharingDB::Instance()).Create(spec, entry)) {
+    if (!sdb::EntryDB(sdb::SharingDB::Instance()).Create(link, entry)) {
         return Fail("cannot create the link");
     }
     printf("id=%s\nurl=%s\n", entry.get_hash().c_str(), LinkUrlPath(entry).c_str());

@@ -235,9 +235,9 @@ public:
     using Table::Table;
     // The link `hash`; false (entry empty) when there is none.
     bool GetByHash(const std::string& hash, record::Entry& entry) const;
-    // A new link with a fresh hash. False (logged) when the spec is
+    // A new link with a fresh hash. False (logged) when the link is
     // refused (bounds, names, an expiry in the past) or on a database error.
-    bool Create(const LinkSpec& spec, record::Entry& entry) const;
+    bool Create(const LinkSpec& link, record::Entry& entry) const;
     // The links of `uid`, or all of them, oldest first; revoked ones too.
     bool ListByOwner(uid_t uid, std::vector<record::Entry>& out) const;
     bool ListAll(std::vector<record::Entry>& out) const;

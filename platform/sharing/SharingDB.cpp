@@ -466,18 +466,18 @@ bool EntryDB::GetByHash(const std::string& hash, Entry& entry) const
     return c && LoadEntry(c, hash, entry) == 1;
 }
 
-bool EntryDB::Create(const LinkSpec& spec, Entry& entry) const
+bool EntryDB::Create(const LinkSpec& link, Entry& entry) const
 {
     entry = Entry();
     const long long now = VELA::Session::Now();
-    if (!IsProjectName(spec.projectName) || !IsItemPath(spec.path) || !IsOwnerName(spec.userName) ||
-        spec.uid == static_cast<uid_t>(-1) || !IsExpiry(spec.expireTime, now) || !IsUseLimit(spec.useLimit) ||
-        spec.password.size() > kMaxPassword) {
+    if (!IsProjectName(link.projectName) || !IsItemPath(link.path) || !IsOwnerName(link.userName) ||
+        link.uid == static_cast<uid_t>(-1) || !IsExpiry(link.expireTime, now) || !IsUseLimit(link.useLimit) ||
+        link.password.size() > kMaxPassword) {
         VELA_LOG_ERR("sharing link refused: project, path, owner, expiry, use limit or password out of bounds");
         return false;
     }
     std::string password;
-    if (!spec.password.empty() && !HashLinkPassword(spec.password, password)) {
+    if (!link.password.empty() && !HashLinkPassword(link.password, password)) {
         return false;
     }
     std::lock_guard<std::recursive_mutex> hold(g_lock);
@@ -493,9 +493,9 @@ bool EntryDB::Create(const LinkSpec& spec, Entry& entry) const
         }
         Stmt st(*c.api, c.db,
                 "INSERT OR IGNORE INTO entry(" ENTRY_COLUMNS ") VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, 0, 0)");
-        st.Text(1, hash).Text(2, spec.projectName).Text(3, spec.path).Int(4, static_cast<long long>(spec.uid));
-        st.Text(5, spec.userName).Int(6, now).Int(7, spec.expireTime).Int(8, spec.enableMatchIP ? 1 : 0);
-        st.Text(9, password).Int(10, spec.useLimit);
+        st.Text(1, hash).Text(2, link.projectName).Text(3, link.path).Int(4, static_cast<long long>(link.uid));
+        st.Text(5, link.userName).Int(6, now).Int(7, link.expireTime).Int(8, link.enableMatchIP ? 1 : 0);
+        st.Text(9, password).Int(10, link.useLimit);
         if (st.Step() != 0) {
             return false;
         }

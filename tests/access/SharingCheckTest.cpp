@@ -77,16 +77,16 @@ protected:
     record::Entry Link(const std::string& project, const std::string& path = "/volume1/share",
                        bool matchIP = false, long long expire = 0, long long limit = 0)
     {
-        db::LinkSpec spec;
-        spec.projectName = project;
-        spec.path = path;
-        spec.uid = owner_;
-        spec.userName = "daemon";
-        spec.enableMatchIP = matchIP;
-        spec.expireTime = expire;
-        spec.useLimit = limit;
+        db::LinkSpec link;
+        link.projectName = project;
+        link.path = path;
+        link.uid = owner_;
+        link.userName = "daemon";
+        link.enableMatchIP = matchIP;
+        link.expireTime = expire;
+        link.useLimit = limit;
         record::Entry e;
-        EXPECT_TRUE(db::EntryDB(db::SharingDB::Instance()).Create(spec, e));
+        EXPECT_TRUE(db::EntryDB(db::SharingDB::Instance()).Create(link, e));
         return e;
     }
     std::string Visit(const record::Entry& e, long long lifetime = 600)

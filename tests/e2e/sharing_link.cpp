@@ -21,13 +21,13 @@ int main(int argc, char** argv)
         if (pw == nullptr) {
             return 1;
         }
-        db::LinkSpec spec;
-        spec.projectName = argv[2];
-        spec.path = argv[3];
-        spec.uid = pw->pw_uid;
-        spec.userName = argv[4];
+        db::LinkSpec link;
+        link.projectName = argv[2];
+        link.path = argv[3];
+        link.uid = pw->pw_uid;
+        link.userName = argv[4];
         record::Entry e;
-        if (!db::EntryDB(store).Create(spec, e)) {
+        if (!db::EntryDB(store).Create(link, e)) {
             return 1;
         }
         printf("hash=%s\n", e.get_hash().c_str());

@@ -27,13 +27,13 @@ TEST_F(SharingContext, RecordsOfTheNamedLinkAndTheirCopies)
     EXPECT_TRUE(plain.GetSharingEntry().empty());
     EXPECT_FALSE(SqliteMapped());
 
-    db::LinkSpec spec;
-    spec.projectName = "photo";
-    spec.path = "/volume1/photo";
-    spec.uid = 1;
-    spec.userName = "daemon";
+    db::LinkSpec link;
+    link.projectName = "photo";
+    link.path = "/volume1/photo";
+    link.uid = 1;
+    link.userName = "daemon";
     record::Entry e;
-    ASSERT_TRUE(db::EntryDB(db::SharingDB::Instance()).Create(spec, e));
+    ASSERT_TRUE(db::EntryDB(db::SharingDB::Instance()).Create(link, e));
     record::Session s;
     record::Token t;
     ASSERT_EQ(SHARING_STATUS_VALID,

@@ -219,14 +219,14 @@ TEST_F(SharingAPI, CreateRefusesWhatTheOwnerMayNotShare)
         VELA::Test::ScopedEnv env("VELA_ROOT", root_.Path().c_str());
         VELA::System::RootReset();
         sdb::EntryDB entries(sdb::SharingDB::Instance());
-        sdb::LinkSpec spec;
-        spec.projectName = "p";
-        spec.path = "/volume1/share";
-        spec.uid = 1;
-        spec.userName = "daemon";
+        sdb::LinkSpec link;
+        link.projectName = "p";
+        link.path = "/volume1/share";
+        link.uid = 1;
+        link.userName = "daemon";
         VELA::sharing::record::Entry e;
         for (int i = 0; i < 200; ++i) {
-            ASSERT_TRUE(entries.Create(spec, e));
+            ASSERT_TRUE(entries.Create(link, e));
         }
         VELA::System::RootReset();
     }
@@ -289,14 +289,14 @@ TEST_F(SharingAPI, ExpiredAndUsedUpLinksAreRefused)
         const long long now = static_cast<long long>(time(nullptr));
         g_fakeNow = now - 60;
         VELA::Session::SetClockForTest(FakeClock);
-        sdb::LinkSpec spec;
-        spec.projectName = "p";
-        spec.path = "/volume1/share/doc.txt";
-        spec.uid = 65534;
-        spec.userName = "nobody";
-        spec.expireTime = now - 30;
+        sdb::LinkSpec link;
+        link.projectName = "p";
+        link.path = "/volume1/share/doc.txt";
+        link.uid = 65534;
+        link.userName = "nobody";
+        link.expireTime = now - 30;
         VELA::sharing::record::Entry e;
-        EXPECT_TRUE(sdb::EntryDB(sdb::SharingDB::Instance()).Create(spec, e));
+        EXPECT_TRUE(sdb::EntryDB(sdb::SharingDB::Instance()).Create(link, e));
         VELA::Session::SetClockForTest(nullptr);
         VELA::System::RootReset();
         expired = e.get_hash();

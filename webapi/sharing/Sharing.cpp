@@ -419,17 +419,17 @@ void Create(APIRequest* req, APIResponse* resp)
             resp->SetError(kErrTooManyLinks);
             return;
         }
-        sdb::LinkSpec spec;
-        spec.projectName = project;
-        spec.path = stored;
-        spec.uid = req->GetLoginUID();
-        spec.userName = req->GetLoginUserName();
-        spec.expireTime = ExpireTime(limits, now);
-        spec.enableMatchIP = limits.enableMatchIP;
-        spec.password = password;
-        spec.useLimit = limits.useLimit;
+        sdb::LinkSpec link;
+        link.projectName = project;
+        link.path = stored;
+        link.uid = req->GetLoginUID();
+        link.userName = req->GetLoginUserName();
+        link.expireTime = ExpireTime(limits, now);
+        link.enableMatchIP = limits.enableMatchIP;
+        link.password = password;
+        link.useLimit = limits.useLimit;
         record::Entry entry;
-        if (!entries.Create(spec, entry)) {
+        if (!entries.Create(link, entry)) {
             resp->SetError(kErrServer);
             return;
         }

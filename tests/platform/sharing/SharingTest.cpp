@@ -29,13 +29,13 @@ bool SqliteMapped() { return ReadText("/proc/self/maps").find("libsqlite3") != s
     printf("status=%d good=%d\n", CheckSharing("AAAAAAAAAAAAAAAAAAAAAA", "", "127.0.0.1"),
            SharingDB::Instance().IsGood() ? 1 : 0);
     EntryDB entries(SharingDB::Instance());
-    LinkSpec spec;
-    spec.projectName = "photo";
-    spec.path = "/volume1/a";
-    spec.uid = 1000;
-    spec.userName = "alice";
+    LinkSpec link;
+    link.projectName = "photo";
+    link.path = "/volume1/a";
+    link.uid = 1000;
+    link.userName = "alice";
     record::Entry e;
-    printf("created=%d sqlite=%d\n", entries.Create(spec, e) ? 1 : 0, SqliteMapped() ? 1 : 0);
+    printf("created=%d sqlite=%d\n", entries.Create(link, e) ? 1 : 0, SqliteMapped() ? 1 : 0);
     fflush(stdout);
     _exit(0);
 }();
@@ -48,17 +48,17 @@ protected:
 
     record::Entry Link(long long expire = 0, bool matchIP = false, long long limit = 0, const std::string& pw = "")
     {
-        LinkSpec spec;
-        spec.projectName = "photo";
-        spec.path = "/volume1/photo/trip";
-        spec.uid = 1000;
-        spec.userName = "alice";
-        spec.expireTime = expire;
-        spec.enableMatchIP = matchIP;
-        spec.useLimit = limit;
-        spec.password = pw;
+        LinkSpec link;
+        link.projectName = "photo";
+        link.path = "/volume1/photo/trip";
+        link.uid = 1000;
+        link.userName = "alice";
+        link.expireTime = expire;
+        link.enableMatchIP = matchIP;
+        link.useLimit = limit;
+        link.password = pw;
         record::Entry e;
-        EXPECT_TRUE(entries_.Create(spec, e));
+        EXPECT_TRUE(entries_.Create(link, e));
         return e;
     }
     // Opens a visitor session; its id, "" when refused (status in `status`).
@@ -225,16 +225,16 @@ TEST_F(Sharing, PasswordAndTheGuard)
 TEST_F(Sharing, HostileTextsAreRefusedOrStoredLiterally)
 {
     const std::string sql = "x'); DROP TABLE entry; --\"";
-    LinkSpec spec;
-    spec.projectName = "photo";
-    spec.path = "/volume1/" + sql;
-    spec.uid = 1000;
-    spec.userName = sql;
-    spec.password = sql;
+    LinkSpec link;
+    link.projectName = "photo";
+    link.path = "/volume1/" + sql;
+    link.uid = 1000;
+    link.userName = sql;
+    link.password = sql;
     record::Entry e, got;
-    ASSERT_TRUE(entries_.Create(spec, e));
+    ASSERT_TRUE(entries_.Create(link, e));
     ASSERT_TRUE(entries_.GetByHash(e.get_hash(), got));
-    EXPECT_EQ(spec.path, got.get_path());
+    EXPECT_EQ(link.path, got.get_path());
     EXPECT_EQ(sql, got.get_user_name());
     EXPECT_FALSE(Visit(e, "10.0.0.1", sql).empty());
 
@@ -247,7 +247,7 @@ TEST_F(Sharing, HostileTextsAreRefusedOrStoredLiterally)
         {"password", std::string(kMaxPassword + 1, 'p')},
     };
     for (const auto& r : refused) {
-        LinkSpec bad = spec;
+        LinkSpec bad = link;
         (r.first == "projectName" ? bad.projectName : r.first == "path" ? bad.path
                                                       : r.first == "userName" ? bad.userName : bad.password) = r.second;
         EXPECT_FALSE(entries_.Create(bad, got)) << r.first << " " << r.second.substr(0, 40);
@@ -281,13 +281,13 @@ TEST_F(Sharing, ProcessesAtOnceLoseNothing)
             uses += sessions.Create(shared.get_hash(), "", "10.0.0.1", 0, s, t) == SHARING_STATUS_VALID ? 1 : 0;
         }
         for (int n = 0; n < 5; ++n) {
-            LinkSpec spec;
-            spec.projectName = "photo";
-            spec.path = "/volume1/" + std::to_string(i) + "/" + std::to_string(n);
-            spec.uid = 2000 + i;
-            spec.userName = "child";
+            LinkSpec link;
+            link.projectName = "photo";
+            link.path = "/volume1/" + std::to_string(i) + "/" + std::to_string(n);
+            link.uid = 2000 + i;
+            link.userName = "child";
             record::Entry e;
-            if (!entries.Create(spec, e) || sessions.Create(e.get_hash(), "", "10.0.0.1", 0, s, t) != 1) {
+            if (!entries.Create(link, e) || sessions.Create(e.get_hash(), "", "10.0.0.1", 0, s, t) != 1) {
                 return 100;
             }
         }
