@@ -162,15 +162,25 @@ bool OpenSharingCheckLib(APIRequest* req, _tag_API_SHARING_CHECK_TABLE** table)
     auto found = libraries.find(path);
     void* handle = found != libraries.end() ? found->second : nullptr;
     if (handle == nullptr) {
-        // Loading runs the library's constructors with the rights of this
-        // process: only a file its owner alone can change is loaded.
+        // Only a file its owner alone can change is loaded, and it is loaded
+        // with its owner's rights: its constructors never run as root.
         struct stat st;
         if (stat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || (st.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
             System::LogAt(LOG_ERR, kSource, 931, "cannot open library: %s. error = %s", path.c_str(),
                           "not a regular file writable by its owner only");
             return false;
         }
+        SavedIds saved;
+        if (!saved.Save()) {
+            System::LogAt(LOG_ERR, kSource, 1060, "cannot read the process ids [%m]");
+            return false;
+        }
+        if (!InitCredentialsByExecutable(path.c_str(), 1)) {
+            saved.Restore();
+            return false;
+        }
         handle = dlopen(path.c_str(), RTLD_LAZY);
+        saved.Restore();
         if (handle == nullptr) {
             const char* err = dlerror();
             System::LogAt(LOG_ERR, kSource, 931, "cannot open library: %s. error = %s", path.c_str(),

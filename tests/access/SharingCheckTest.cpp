@@ -70,6 +70,9 @@ protected:
             {"skip": {"allowSharing": true, "skipSharingAppCheck": true}}]}}})"));
         libDir_ = In("/usr/lib/sharing/permission_lib/");
         ASSERT_EQ(0, system(("mkdir -p '" + libDir_ + "'").c_str()));
+        // The library is loaded as its owner, who must reach it: searchable
+        // like the real root.
+        ASSERT_EQ(0, chmod(In("").c_str(), 0755));
         Copy(Built("/tests/dispatcher/libs/libsharing_probe.so"), libDir_ + "probe.so", 0755);
         ASSERT_EQ(0, chown((libDir_ + "probe.so").c_str(), owner_, ownerGid_));
     }
@@ -277,6 +280,8 @@ TEST_F(SharingCheckTest, HookRefusesWithTheStatusCodeAndRunsTheCheckAsTheLibrary
     Prepare("probe", e.get_hash(), sid, J(R"({"x": "1"})"));
     ASSERT_TRUE(Check()) << Error();
     EXPECT_EQ(static_cast<int>(owner_), E().GetRequest()->GetAttr("checkEuid").asInt());
+    // Its constructors ran as the owner too, never as root.
+    EXPECT_EQ(static_cast<int>(owner_), E().GetRequest()->GetAttr("loadEuid").asInt());
     EXPECT_EQ(static_cast<int>(ownerGid_), E().GetRequest()->GetAttr("checkEgid").asInt());
     EXPECT_EQ(0u, geteuid());
     EXPECT_EQ(0u, getegid());

@@ -1,7 +1,8 @@
 // A sharing check library for the tests: its table skips two broken entries
 // (an empty api pattern, an empty method pattern), then lets "probe" calls
 // of any API whose name starts with "VELA.Test." through while recording
-// the effective ids the check ran with; "deny" is refused with code 1234.
+// the effective ids the check ran with and the effective user id the
+// library was loaded with; "deny" is refused with code 1234.
 #include <json/json.h>
 #include <unistd.h>
 
@@ -11,8 +12,12 @@
 
 namespace {
 
+// Set while the library is loaded, by its constructors.
+const int g_loadEuid = static_cast<int>(geteuid());
+
 bool Probe(VELA::APIRequest* req, VELA::APIResponse*)
 {
+    req->SetAttr("loadEuid", g_loadEuid);
     req->SetAttr("checkEuid", static_cast<int>(geteuid()));
     req->SetAttr("checkEgid", static_cast<int>(getegid()));
     return true;
