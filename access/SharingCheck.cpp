@@ -130,6 +130,26 @@ struct SavedIds {
     }
 };
 
+// Runs `step` with the owner and group of the file `path` (the saved user
+// id stays 0), then puts every id and group back. False, with nothing run,
+// when the switch fails (logged by it).
+template <typename Step>
+bool AsOwnerOf(const std::string& path, Step step)
+{
+    SavedIds saved;
+    if (!saved.Save()) {
+        System::LogAt(LOG_ERR, kSource, 1060, "cannot read the process ids [%m]");
+        return false;
+    }
+    if (!InitCredentialsByExecutable(path.c_str(), 1)) {
+        saved.Restore();
+        return false;
+    }
+    step();
+    saved.Restore();
+    return true;
+}
+
 }  // namespace
 
 std::string PermissionLibDir() { return System::Path(kPermissionLibDir); }
@@ -170,17 +190,9 @@ bool OpenSharingCheckLib(APIRequest* req, _tag_API_SHARING_CHECK_TABLE** table)
                           "not a regular file writable by its owner only");
             return false;
         }
-        SavedIds saved;
-        if (!saved.Save()) {
-            System::LogAt(LOG_ERR, kSource, 1060, "cannot read the process ids [%m]");
+        if (!AsOwnerOf(path, [&] { handle = dlopen(path.c_str(), RTLD_LAZY); })) {
             return false;
         }
-        if (!InitCredentialsByExecutable(path.c_str(), 1)) {
-            saved.Restore();
-            return false;
-        }
-        handle = dlopen(path.c_str(), RTLD_LAZY);
-        saved.Restore();
         if (handle == nullptr) {
             const char* err = dlerror();
             System::LogAt(LOG_ERR, kSource, 931, "cannot open library: %s. error = %s", path.c_str(),
@@ -282,24 +294,15 @@ bool CheckSharingAppPermission(APIRequest* req, APIResponse* resp)
                             LogSafe(req != nullptr ? req->GetAPIMethod() : "").c_str());
         return false;
     }
-    SavedIds saved;
-    if (!saved.Save()) {
-        System::LogAt(LOG_ERR, kSource, 1060, "cannot read the process ids [%m]");
-        return false;
-    }
-    if (!InitCredentialsByExecutable(path.c_str(), 1)) {
-        // Logged by the switch; whatever it changed is put back.
-        saved.Restore();
-        return false;
-    }
     bool allowed = false;
-    try {
-        allowed = check(req, resp);
-    } catch (...) {
-        System::LogAt(LOG_ERR, kSource, 1070, "sharing check of %s failed", path.c_str());
-        allowed = false;
-    }
-    saved.Restore();
+    AsOwnerOf(path, [&] {
+        try {
+            allowed = check(req, resp);
+        } catch (...) {
+            System::LogAt(LOG_ERR, kSource, 1070, "sharing check of %s failed", path.c_str());
+            allowed = false;
+        }
+    });
     return allowed;
 }
 
