@@ -17,6 +17,7 @@
 #include <string>
 
 #include "webapi/APIError.h"
+#include "webapi/APIGuard.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APITable.h"
@@ -74,19 +75,9 @@ void Echo(APIRequest* req, APIResponse* resp)
     resp->SetSuccess(req->GetParam("", Json::Value(Json::objectValue)));
 }
 
-template <void (*Handler)(APIRequest*, APIResponse*)>
-void Guarded(APIRequest* req, APIResponse* resp)
-{
-    try {
-        Handler(req, resp);
-    } catch (...) {
-        resp->SetError(WEBAPI_ERR_NO_RESPONSE);
-    }
-}
-
 _tag_API_TABLE g_table[] = {
-    {"VELA.Bench.Compound", 1, "sleep", Guarded<Sleep>},
-    {"VELA.Bench.Compound", 1, "echo", Guarded<Echo>},
+    {"VELA.Bench.Compound", 1, "sleep", VELA::APIGuarded<Sleep>},
+    {"VELA.Bench.Compound", 1, "echo", VELA::APIGuarded<Echo>},
     {nullptr, 0, nullptr, nullptr},
 };
 

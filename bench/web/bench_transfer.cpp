@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include "webapi/APIError.h"
+#include "webapi/APIGuard.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APITable.h"
@@ -57,17 +58,8 @@ void Receive(APIRequest* req, APIResponse* resp)
     resp->SetSuccess(data);
 }
 
-void Guarded(APIRequest* req, APIResponse* resp)
-{
-    try {
-        Receive(req, resp);
-    } catch (...) {
-        resp->SetError(WEBAPI_ERR_NO_RESPONSE);
-    }
-}
-
 _tag_API_TABLE g_table[] = {
-    {"VELA.Bench.Transfer", 1, "receive", Guarded},
+    {"VELA.Bench.Transfer", 1, "receive", VELA::APIGuarded<Receive>},
     {nullptr, 0, nullptr, nullptr},
 };
 

@@ -33,6 +33,7 @@
 #include "vela/user.h"
 #include "vela/webapiutil.h"
 #include "webapi/APIError.h"
+#include "webapi/APIGuard.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APITable.h"
@@ -315,22 +316,10 @@ void Key(APIRequest*, APIResponse* resp)
     resp->SetSuccess(data);
 }
 
-// Handlers must not let an exception reach the framework.
-template <void (*Handler)(APIRequest*, APIResponse*)>
-void Guarded(APIRequest* req, APIResponse* resp)
-{
-    try {
-        Handler(req, resp);
-    } catch (const std::exception& e) {
-        VELA_LOG_ERR("VELA.Auth: %s", e.what());
-        resp->SetError(kErrServer);
-    }
-}
-
 _tag_API_TABLE g_table[] = {
-    {"VELA.Auth", 1, "login", Guarded<Login>},
-    {"VELA.Auth", 1, "logout", Guarded<Logout>},
-    {"VELA.Auth", 1, "key", Guarded<Key>},
+    {"VELA.Auth", 1, "login", VELA::APIGuarded<Login, kErrServer>},
+    {"VELA.Auth", 1, "logout", VELA::APIGuarded<Logout, kErrServer>},
+    {"VELA.Auth", 1, "key", VELA::APIGuarded<Key, kErrServer>},
     {nullptr, 0, nullptr, nullptr},
 };
 

@@ -21,6 +21,7 @@
 #include <unistd.h>
 
 #include "webapi/APIError.h"
+#include "webapi/APIGuard.h"
 #include "webapi/APIParameter.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
@@ -152,31 +153,20 @@ void Status(APIRequest* req, APIResponse* resp)
     resp->SetSuccess(data);
 }
 
-// Handlers must not let an exception reach the framework.
-template <void (*Handler)(APIRequest*, APIResponse*)>
-void Guarded(APIRequest* req, APIResponse* resp)
-{
-    try {
-        Handler(req, resp);
-    } catch (...) {
-        resp->SetError(WEBAPI_ERR_NO_RESPONSE);
-    }
-}
-
 _tag_API_TABLE g_table[] = {
-    {"VELA.Sample", 1, "echo", Guarded<Echo>},
-    {"VELA.Sample", 1, "fail", Guarded<Fail>},
-    {"VELA.Sample", 1, "typed", Guarded<Typed>},
-    {"VELA.Sample", 1, "whoami", Guarded<WhoAmI>},
-    {"VELA.Sample", 1, "adminonly", Guarded<AdminOnly>},
-    {"VELA.Sample", 1, "status", Guarded<Status>},
-    {"VELA.Sample", 1, "upload", Guarded<Sample::Upload>},
-    {"VELA.Sample", 1, "download", Guarded<Sample::Download>},
-    {"VELA.Sample", 1, "checksum", Guarded<Sample::Checksum>},
-    {"VELA.Sample", 1, "taskstatus", Guarded<Sample::TaskStatus>},
-    {"VELA.Sample", 1, "taskstop", Guarded<Sample::TaskStop>},
-    {"VELA.Sample", 1, "tasklist", Guarded<Sample::TaskList>},
-    {"VELA.Sample.Echo", 1, "echo", Guarded<Echo>},
+    {"VELA.Sample", 1, "echo", VELA::APIGuarded<Echo>},
+    {"VELA.Sample", 1, "fail", VELA::APIGuarded<Fail>},
+    {"VELA.Sample", 1, "typed", VELA::APIGuarded<Typed>},
+    {"VELA.Sample", 1, "whoami", VELA::APIGuarded<WhoAmI>},
+    {"VELA.Sample", 1, "adminonly", VELA::APIGuarded<AdminOnly>},
+    {"VELA.Sample", 1, "status", VELA::APIGuarded<Status>},
+    {"VELA.Sample", 1, "upload", VELA::APIGuarded<Sample::Upload>},
+    {"VELA.Sample", 1, "download", VELA::APIGuarded<Sample::Download>},
+    {"VELA.Sample", 1, "checksum", VELA::APIGuarded<Sample::Checksum>},
+    {"VELA.Sample", 1, "taskstatus", VELA::APIGuarded<Sample::TaskStatus>},
+    {"VELA.Sample", 1, "taskstop", VELA::APIGuarded<Sample::TaskStop>},
+    {"VELA.Sample", 1, "tasklist", VELA::APIGuarded<Sample::TaskList>},
+    {"VELA.Sample.Echo", 1, "echo", VELA::APIGuarded<Echo>},
     {nullptr, 0, nullptr, nullptr},
 };
 

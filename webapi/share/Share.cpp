@@ -28,6 +28,7 @@
 #include "vela/vlibc.h"
 #include "webapi/APIDownload.h"
 #include "webapi/APIError.h"
+#include "webapi/APIGuard.h"
 #include "webapi/APIParameter.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
@@ -214,8 +215,8 @@ void Download(APIRequest* req, APIResponse* resp)
 }
 
 _tag_API_TABLE g_table[] = {
-    {"VELA.Sample.Share", 1, "list", List},
-    {"VELA.Sample.Share", 1, "download", Download},
+    {"VELA.Sample.Share", 1, "list", VELA::APIGuarded<List>},
+    {"VELA.Sample.Share", 1, "download", VELA::APIGuarded<Download>},
     {nullptr, 0, nullptr, nullptr},
 };
 

@@ -59,6 +59,7 @@
 #include "vela/vlibc.h"
 #include "vela/webapiutil.h"
 #include "webapi/APIError.h"
+#include "webapi/APIGuard.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
 #include "webapi/APITable.h"
@@ -602,24 +603,12 @@ void Open(APIRequest* req, APIResponse* resp)
     resp->SetSuccess(data);
 }
 
-// Handlers must not let an exception reach the framework.
-template <void (*Handler)(APIRequest*, APIResponse*)>
-void Guarded(APIRequest* req, APIResponse* resp)
-{
-    try {
-        Handler(req, resp);
-    } catch (const std::exception& e) {
-        VELA_LOG_ERR("VELA.Sharing: %s", e.what());
-        resp->SetError(kErrServer);
-    }
-}
-
 _tag_API_TABLE g_table[] = {
-    {"VELA.Sharing", 1, "create", Guarded<Create>},
-    {"VELA.Sharing", 1, "list", Guarded<List>},
-    {"VELA.Sharing", 1, "update", Guarded<Update>},
-    {"VELA.Sharing", 1, "revoke", Guarded<Revoke>},
-    {"VELA.Sharing.Visitor", 1, "open", Guarded<Open>},
+    {"VELA.Sharing", 1, "create", VELA::APIGuarded<Create, kErrServer>},
+    {"VELA.Sharing", 1, "list", VELA::APIGuarded<List, kErrServer>},
+    {"VELA.Sharing", 1, "update", VELA::APIGuarded<Update, kErrServer>},
+    {"VELA.Sharing", 1, "revoke", VELA::APIGuarded<Revoke, kErrServer>},
+    {"VELA.Sharing.Visitor", 1, "open", VELA::APIGuarded<Open, kErrServer>},
     {nullptr, 0, nullptr, nullptr},
 };
 
