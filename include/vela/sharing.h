@@ -44,6 +44,10 @@ constexpr long long kMaxUseLimit = 1000000000;
 // beyond the link's expiry.
 constexpr long long kSessionLifetimeDefault = 3600;
 constexpr long long kSessionLifetimeMax = 7 * 86400;
+// Live visitor sessions one link may have at once by default (sessions that
+// ended are removed before counting); the key sharing_max_sessions of
+// /etc/vela/webapi.conf sets another bound.
+constexpr long long kMaxLiveSessions = 1024;
 
 namespace record {
 
@@ -132,6 +136,7 @@ enum _tag_SHARING_STATUS {
     SHARING_STATUS_IP_MISMATCH = 8,      // match-ip link, request from another address than the session's
     SHARING_STATUS_BAD_PASSWORD = 9,     // Create only: password missing or wrong
     SHARING_STATUS_BLOCKED = 10,         // Create only: the brute-force guard refused the address
+    SHARING_STATUS_BUSY = 11,            // Create only: the link has as many live sessions as it may
 };
 
 // Whether a request that names link `sharingId` and visitor session
@@ -259,7 +264,9 @@ public:
     // beyond the link's expiry. The link must exist, not be revoked or
     // expired, have a use left (this counts one) and, when it has a
     // password, `password` must match: the attempt goes through the login
-    // brute-force guard under the account "link:<hash>". Returns a
+    // brute-force guard under the account "link:<hash>". The link's ended
+    // sessions are removed first, and a link with as many live ones as the bound
+    // opens no more (BUSY, no use counted). Returns a
     // _tag_SHARING_STATUS; on VALID, `session` and `token` are the new records.
     int Create(const std::string& hash, const std::string& password, const std::string& clientIP,
                long long lifetime, record::Session& session, record::Token& token) const;

@@ -16,6 +16,7 @@
 #include "sharing/LazySqlite.h"
 #include "sharing/LinkPassword.h"
 #include "vela/log.h"
+#include "vela/sysfile.h"
 #include "vela/loginguard.h"
 #include "vela/sharing.h"
 #include "vela/vlibc.h"
@@ -89,6 +90,8 @@ const char kSchema[] =
     "CREATE INDEX IF NOT EXISTS token_hash ON token(hash);";
 
 #define ENTRY_COLUMNS "hash, project, path, uid, owner, created, expire, match_ip, password, use_limit, uses, revoked"
+const char kConfPath[] = "/etc/vela/webapi.conf";
+
 #define SESSION_COLUMNS "sid, hash, uid, ip, created, timeout"
 
 // One prepared statement; a failed prepare, bind or step is logged once and
@@ -665,6 +668,30 @@ int SessionDB::Create(const std::string& hash, const std::string& password, cons
     Txn txn(*c.api, c.db);
     if (!txn.Open()) {
         return SHARING_STATUS_ERROR;
+    }
+    // Sessions of this link that ended go; those still live are bounded, so
+    // visitors who drop their cookie cannot grow the database without end.
+    {
+        Stmt tokens(*c.api, c.db,
+                    "DELETE FROM token WHERE sid IN (SELECT sid FROM session WHERE hash = ?1 AND timeout <= ?2)");
+        Stmt sessions(*c.api, c.db, "DELETE FROM session WHERE hash = ?1 AND timeout <= ?2");
+        Stmt live(*c.api, c.db, "SELECT COUNT(*) FROM session WHERE hash = ?1");
+        if (tokens.Text(1, hash).Int(2, now).Step() != 0 || sessions.Text(1, hash).Int(2, now).Step() != 0 ||
+            live.Text(1, hash).Step() != 1) {
+            return SHARING_STATUS_ERROR;
+        }
+        std::vector<std::string> t;
+        std::vector<long long> n;
+        live.Row(1, t, n);
+        long long bound = kMaxLiveSessions;
+        std::vector<std::pair<std::string, std::string>> settings;
+        if (VELA::System::ReadKeyValueFile(kConfPath, settings) > 0) {
+            VELA::System::NumberSetting(settings, kConfPath, "sharing_max_sessions", 1, 1000000, bound);
+        }
+        if (n[0] >= bound) {
+            VELA_LOG_ERR("sharing link %s has %lld live visitor sessions; no more opened", hash.c_str(), n[0]);
+            return SHARING_STATUS_BUSY;
+        }
     }
     // The link may have changed since it was read: count the use only when
     // it still allows one, in the transaction that makes the session.

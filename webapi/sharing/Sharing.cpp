@@ -41,6 +41,7 @@
 //   472  open: every allowed use of the link is spent
 //   473  open: the password is missing or wrong
 //   474  open: too many wrong passwords from this address: blocked
+//   475  open: the link has as many live visitor sessions as it may have
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
@@ -87,6 +88,7 @@ constexpr int kErrOpenExpired = 471;
 constexpr int kErrOpenUseLimit = 472;
 constexpr int kErrOpenBadPassword = 473;
 constexpr int kErrOpenBlocked = 474;
+constexpr int kErrOpenBusy = 475;
 
 constexpr size_t kMaxLinksPerOwner = 200;
 // Ten years: "expires" is counted from now.
@@ -550,6 +552,8 @@ int OpenError(int status)
         return kErrOpenBadPassword;
     case sharing::SHARING_STATUS_BLOCKED:
         return kErrOpenBlocked;
+    case sharing::SHARING_STATUS_BUSY:
+        return kErrOpenBusy;
     default:
         return kErrServer;
     }

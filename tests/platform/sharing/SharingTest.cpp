@@ -195,6 +195,26 @@ TEST_F(Sharing, UseLimitExpiryAndPurge)
     EXPECT_FALSE(sessions_.GetBySessionId(first, s));
 }
 
+TEST_F(Sharing, LiveVisitorSessionsOfALinkAreBounded)
+{
+    // Visitors who drop their cookie and open again cannot grow the store
+    // without end: a link holds the configured number of live sessions,
+    // and one that ended makes room again. A refused open spends no use.
+    Conf("webapi.conf", "sharing_max_sessions=2\n");
+    const record::Entry e = Link(0, false, 5);
+    ASSERT_FALSE(Visit(e).empty());
+    Now() += 100;
+    ASSERT_FALSE(Visit(e).empty());
+    int status = 0;
+    EXPECT_EQ("", Visit(e, "10.0.0.2", "", &status));
+    EXPECT_EQ(SHARING_STATUS_BUSY, status);
+    Now() += kSessionLifetimeDefault - 50;  // the first one has ended
+    EXPECT_FALSE(Visit(e).empty());
+    record::Entry now;
+    ASSERT_TRUE(entries_.GetByHash(e.get_hash(), now));
+    EXPECT_EQ(3, now.get_use_count());
+}
+
 TEST_F(Sharing, PasswordAndTheGuard)
 {
     Conf("webapi.conf", "login_max_failures=\"3\"\n");
