@@ -1,9 +1,8 @@
 #include "session/LazyCrypto.h"
 
 #include <cstring>
-#include <dlfcn.h>
-#include <mutex>
 
+#include "system/LazyLibrary.h"
 #include "vela/log.h"
 
 namespace VELA {
@@ -11,60 +10,18 @@ namespace Session {
 
 namespace {
 
-const char kLibrary[] = "libcrypto.so.3";
-
-CryptoApi g_api;
-bool g_loaded = false;
-std::once_flag g_once;
-
 // Resolves every function into `api`. On failure names the missing symbol.
 bool Resolve(void* handle, CryptoApi& api, const char*& missing)
 {
-#define VELA_CRYPTO_RESOLVE(name)                                        \
-    {                                                                    \
-        void* sym = dlsym(handle, #name);                                \
-        if (sym == nullptr) {                                            \
-            missing = #name;                                             \
-            return false;                                                \
-        }                                                                \
-        api.name = reinterpret_cast<decltype(api.name)>(sym);            \
-    }
-    VELA_CRYPTO_FUNCTIONS(VELA_CRYPTO_RESOLVE)
-#undef VELA_CRYPTO_RESOLVE
+    VELA_CRYPTO_FUNCTIONS(VELA_LAZY_RESOLVE)
     return true;
 }
 
-void Load()
-{
-    dlerror();
-    // RTLD_LOCAL: the symbols stay out of the global namespace, so nothing
-    // else in the process binds to this copy by accident.
-    void* handle = dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
-    if (handle == nullptr) {
-        const char* why = dlerror();
-        VELA_LOG_ERR("encrypted parameters unavailable: cannot load %s: %s", kLibrary,
-                     why != nullptr ? why : "unknown error");
-        return;
-    }
-    CryptoApi api;
-    const char* missing = "";
-    if (!Resolve(handle, api, missing)) {
-        VELA_LOG_ERR("encrypted parameters unavailable: %s lacks %s", kLibrary, missing);
-        // The handle is kept: unloading a library that ran its initialisers
-        // gains nothing in a process that lives for one request.
-        return;
-    }
-    g_api = api;
-    g_loaded = true;
-}
+System::LazyLibrary<CryptoApi> g_crypto("libcrypto.so.3", "encrypted parameters", Resolve);
 
 }  // namespace
 
-const CryptoApi* LazyCrypto()
-{
-    std::call_once(g_once, Load);
-    return g_loaded ? &g_api : nullptr;
-}
+const CryptoApi* LazyCrypto() { return g_crypto.Get(); }
 
 void LogCryptoError(const CryptoApi& api, const char* what)
 {
