@@ -153,6 +153,9 @@ RequestLimits LoadRequestLimits()
     Setting(settings, "request_body_idle_seconds", 1, 3600, limits.bodyIdleSeconds);
     Setting(settings, "request_body_min_rate", 1, 1LL << 40, limits.bodyMinRate);
     Setting(settings, "request_max_per_client", 0, 4096, limits.maxPerClient);
+    Setting(settings, "fcgi_parents", 0, 64, limits.fcgiParents);
+    Setting(settings, "fcgi_max_children", 1, 4096, limits.fcgiMaxChildren);
+    Setting(settings, "fcgi_param_seconds", 1, 3600, limits.fcgiParamSeconds);
     return limits;
 }
 

@@ -21,11 +21,18 @@ struct RequestLimits {
     // Requests one client address may have under way at once; 0 for no
     // limit.
     int maxPerClient = 16;
+
+    // velafcgi: warm parents (0: one per online core), children at once in
+    // all, and the seconds a request's parameters may take to arrive.
+    int fcgiParents = 0;
+    int fcgiMaxChildren = 64;
+    int fcgiParamSeconds = 10;
 };
 
 // The limits of <root>/etc/vela/webapi.conf (request_cpu_seconds,
 // request_time_seconds, request_body_idle_seconds, request_body_min_rate,
-// request_max_per_client); a key that is absent or not a number in range
+// request_max_per_client, fcgi_parents, fcgi_max_children,
+// fcgi_param_seconds); a key that is absent or not a number in range
 // keeps its default (and a bad one is logged).
 RequestLimits LoadRequestLimits();
 

@@ -7,6 +7,9 @@
 //            [--tcp 127.0.0.1:PORT] [--parents N] [--max-children N]
 //            [--param-seconds N] [--stderr FILE] [--keep-env NAME]...
 //
+// The numbers default to fcgi_parents, fcgi_max_children and
+// fcgi_param_seconds of /etc/vela/webapi.conf, else one parent per core, 64
+// children and 10 seconds.
 // Without --socket or --tcp the listening socket is standard input, as a
 // web server that starts FastCGI programs itself hands it over.
 #include <arpa/inet.h>
@@ -32,6 +35,7 @@
 #include "vela/log.h"
 #include "vela/vlibc.h"
 #include "webentry/Fcgi.h"
+#include "webentry/RequestLimits.h"
 
 namespace {
 
@@ -169,6 +173,10 @@ int main(int argc, char** argv)
     std::string socketPath, socketGroup, tcp, errFile;
     int socketMode = 0660;
     VELA::Fcgi::Options options;
+    const VELA::RequestLimits conf = VELA::LoadRequestLimits();
+    options.parents = conf.fcgiParents;
+    options.maxChildren = conf.fcgiMaxChildren;
+    options.paramSeconds = conf.fcgiParamSeconds;
     std::vector<std::string> keep = {"PATH", "VELA_ROOT", "VELA_LOG_STDERR", "TZ", "LANG", "LC_ALL"};
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];

@@ -220,7 +220,8 @@ void Sleep(APIRequest* req, APIResponse* resp)
         fprintf(f, "%d\n", static_cast<int>(getpid()));
         fclose(f);
     }
-    const int ms = req->GetParam("ms", 0).asInt();
+    const Json::Value given = req->GetParam("ms", 0);  // a number, or the text of one from a query
+    const int ms = given.isString() ? atoi(given.asCString()) : given.asInt();
     usleep(static_cast<useconds_t>(ms > 0 && ms <= 10000 ? ms : 0) * 1000u);
     Report(req, resp);
 }
