@@ -27,6 +27,7 @@ public:
     // Closes every cached library and empties the cache.
     void CloseAll();
     size_t Size() const { return handles_.size(); }
+    void Swap(LibCache& other) { handles_.swap(other.handles_); }
 
 private:
     std::map<std::string, void*> handles_;  // "lib" path -> dlopen handle

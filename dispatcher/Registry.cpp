@@ -367,6 +367,37 @@ bool APIRunner::AddAPIInfo(APIRequest* req)
     return true;
 }
 
+bool APIRunner::ServesInProcess(const std::string& api, int version, const std::string& method) const
+{
+    try {
+        const Registry& registry = d_->registry;
+        const Json::Value* desc = registry.Find(api);
+        if (desc == nullptr || !Registry::Lists(*desc, version, method)) {
+            return false;
+        }
+        const Json::Value& attrs = registry.MethodOf(*desc, version, method);
+        const Json::Value& flags = registry.FlagsOf(attrs);
+        auto flag = [&flags](const char* name) { return JsonFlag(JsonMember(flags, name)); };
+        if (!flag("inProcess") || flag("grantByUser") || flag("grantByDefault") || flag("allowUpload")) {
+            return false;
+        }
+        const Json::Value& methodRunAs = JsonMember(attrs, "runAs");
+        const Json::Value& apiRunAs = JsonMember(*desc, "runAs");
+        const std::string runAs = methodRunAs.isString() ? methodRunAs.asString()
+                                  : apiRunAs.isString()  ? apiRunAs.asString()
+                                                         : std::string(VELA_RUNAS_SUPERUSER);
+        return runAs == VELA_RUNAS_SUPERUSER;
+    } catch (const std::exception&) {
+        return false;
+    }
+}
+
+void APIRunner::SwapWarmState(APIRunner& other)
+{
+    d_->registry.Swap(other.d_->registry);
+    d_->libs.Swap(other.d_->libs);
+}
+
 // ---- The first check of a request -----------------------------------------------
 
 // The description of the call: the file of its (checked) API loaded, the

@@ -61,6 +61,12 @@ public:
     // when it is not an object.
     const Json::Value& FlagsOf(const Json::Value& method) const;
 
+    void Swap(Registry& other)
+    {
+        defaults_.swap(other.defaults_);
+        table_.swap(other.table_);
+    }
+
 private:
     Json::Value defaults_;  // lib.def
     Json::Value table_;     // API name -> merged description

@@ -5,7 +5,8 @@
 // libraries it has seen loaded and bound, and the API descriptions parsed;
 // it reads the parameters of one request at a time and forks a child that
 // serves it exactly as velascgi would. The parent never runs handler code
-// and never changes identity.
+// and never changes identity, except for the methods whose description asks
+// for "inProcess" (see APIRunner::ServesInProcess), which it serves itself.
 #pragma once
 
 #include <atomic>
@@ -53,6 +54,13 @@ int RunParent(int listenFd, const Options& options, int argc, char** argv);
 // descriptors of the parent the child must not keep.
 [[noreturn]] void ServeChild(FCGX_Request& req, WebEntry& entry, Slot& slot, const Options& options,
                              const std::vector<int>& closeFds, int argc, char** argv);
+
+// The environment of a request: only the server's own variables of
+// `options`, then the request's parameters, except names that a request
+// never sets (VELA_*, LD_*, PATH, TZ, IFS, HTTP_PROXY) and names that are not
+// plain variable names. False, logged, when the parameters are more than
+// 1000 or 1 MiB.
+bool SetRequestEnvironment(char** params, const Options& options);
 
 // Writes a whole reply (CGI header lines and body) to a FastCGI connection as
 // one stdout stream followed by the end of the request. False when the

@@ -64,32 +64,6 @@ size_t NameLength(const char* entry)
     return static_cast<size_t>(eq - entry);
 }
 
-// The environment of the call: the server's own variables, then the
-// request's parameters. False when the parameters are out of bounds.
-bool SetEnvironment(char** params, const Options& options)
-{
-    clearenv();
-    for (const std::string& kept : options.environment) {
-        putenv(const_cast<char*>(kept.c_str()));  // lives as long as the process
-    }
-    size_t count = 0;
-    size_t bytes = 0;
-    for (char** p = params; p != nullptr && *p != nullptr; ++p) {
-        bytes += strlen(*p) + 1;
-        if (++count > kMaxParams || bytes > kMaxParamBytes) {
-            VELA_LOG_ERR("request refused: more than %zu parameters or %zu bytes of them", kMaxParams,
-                         kMaxParamBytes);
-            return false;
-        }
-        const size_t nameLen = NameLength(*p);
-        if (nameLen == 0 || Protected(*p, nameLen)) {
-            continue;
-        }
-        putenv(*p);  // owned by the request, which lives as long as the process
-    }
-    return true;
-}
-
 bool WriteAll(int fd, const char* p, size_t left)
 {
     while (left > 0) {
@@ -289,6 +263,32 @@ bool Plumb(Bridge& b, FCGX_Request& req, Slot& slot)
 
 }  // namespace
 
+// The environment of the call: the server's own variables, then the
+// request's parameters. False when the parameters are out of bounds.
+bool SetRequestEnvironment(char** params, const Options& options)
+{
+    clearenv();
+    for (const std::string& kept : options.environment) {
+        putenv(const_cast<char*>(kept.c_str()));  // lives as long as the process
+    }
+    size_t count = 0;
+    size_t bytes = 0;
+    for (char** p = params; p != nullptr && *p != nullptr; ++p) {
+        bytes += strlen(*p) + 1;
+        if (++count > kMaxParams || bytes > kMaxParamBytes) {
+            VELA_LOG_ERR("request refused: more than %zu parameters or %zu bytes of them", kMaxParams,
+                         kMaxParamBytes);
+            return false;
+        }
+        const size_t nameLen = NameLength(*p);
+        if (nameLen == 0 || Protected(*p, nameLen)) {
+            continue;
+        }
+        putenv(*p);  // owned by the request, which lives as long as the process
+    }
+    return true;
+}
+
 void ServeChild(FCGX_Request& req, WebEntry& entry, Slot& slot, const Options& options,
                 const std::vector<int>& closeFds, int argc, char** argv)
 {
@@ -306,7 +306,7 @@ void ServeChild(FCGX_Request& req, WebEntry& entry, Slot& slot, const Options& o
     }
 
     Bridge& b = g_bridge;
-    const bool ready = SetEnvironment(req.envp, options) && Plumb(b, req, slot);
+    const bool ready = SetRequestEnvironment(req.envp, options) && Plumb(b, req, slot);
     atexit(FinishReply);
     if (!ready) {
         WriteReply(kSetupFailedReply, kSetupFailedReplyLength);

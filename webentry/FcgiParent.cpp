@@ -13,6 +13,7 @@
 #include <poll.h>
 #include <set>
 #include <string>
+#include <iostream>
 #include <sys/mman.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -22,6 +23,7 @@
 #include <vector>
 
 #include "vela/log.h"
+#include "vela/webapiutil.h"
 #include "webentry/Fcgi.h"
 #include "webentry/Serve.h"
 #include "webentry/WebEntry.h"
@@ -127,6 +129,9 @@ private:
     void Ended(Child& child, int status);
     void Accept();
     int FreeSlot() const;
+    bool InProcess(FCGX_Request& req) const;
+    void ServeHere(FCGX_Request& req);
+    void KeepOwnEnvironment();
 
     int listenFd_;
     const Options& options_;
@@ -233,6 +238,111 @@ void Parent::Reap(bool wait)
     }
 }
 
+// The parent's environment is only the server's own variables, the same
+// every request starts from.
+void Parent::KeepOwnEnvironment()
+{
+    clearenv();
+    for (const std::string& kept : options_.environment) {
+        putenv(const_cast<char*>(kept.c_str()));
+    }
+}
+
+// Whether the request names, in its query string, a method this process may
+// serve itself: a GET without a body, of an API already warm.
+bool Parent::InProcess(FCGX_Request& req) const
+{
+    const char* method = FCGX_GetParam("REQUEST_METHOD", req.envp);
+    const char* length = FCGX_GetParam("CONTENT_LENGTH", req.envp);
+    const char* query = FCGX_GetParam("QUERY_STRING", req.envp);
+    if (geteuid() != 0 || method == nullptr || strcmp(method, "GET") != 0 || query == nullptr ||
+        strlen(query) > 8192 || (length != nullptr && length[0] != '\0' && strcmp(length, "0") != 0)) {
+        return false;
+    }
+    try {
+        Json::Value params(Json::objectValue);
+        if (!WebAPIUtil::strPairToJsonObj(query, params, true, true)) {
+            return false;
+        }
+        const Json::Value& api = params["api"];
+        const Json::Value& version = params["version"];
+        const Json::Value& name = params["method"];
+        if (!api.isString() || !version.isString() || !name.isString() || warmApis_.count(api.asString()) == 0) {
+            return false;
+        }
+        const std::string v = version.asString();
+        if (v.empty() || v.size() > 6 || v.find_first_not_of("0123456789") != std::string::npos) {
+            return false;
+        }
+        return entry_->ServesInProcess(api.asString(), std::stoi(v), name.asString());
+    } catch (const std::exception&) {
+        return false;
+    }
+}
+
+// Serves a request in this process: its environment, standard input from
+// /dev/null, the reply gathered in memory, then everything put back (the
+// environment, the standard streams, the signal actions the call changed).
+// The process's road restores identity, priority and working directory on
+// its own; the per-client slots and the time limits of a child do not apply.
+void Parent::ServeHere(FCGX_Request& req)
+{
+    struct sigaction saved[NSIG];
+    for (int sig = 1; sig < NSIG; ++sig) {
+        sigaction(sig, nullptr, &saved[sig]);
+    }
+    const int reply = memfd_create("velafcgi-reply", MFD_CLOEXEC);
+    const int null = open("/dev/null", O_RDONLY | O_CLOEXEC);
+    const int savedIn = fcntl(STDIN_FILENO, F_DUPFD_CLOEXEC, 3);
+    const int savedOut = fcntl(STDOUT_FILENO, F_DUPFD_CLOEXEC, 3);
+    if (reply < 0 || null < 0 || savedIn < 0 || savedOut < 0 || !SetRequestEnvironment(req.envp, options_)) {
+        VELA_LOG_ERR("cannot serve a request in process[%m]");
+        WriteWholeReply(req.ipcFd, req.requestId, kSetupFailedReply, kSetupFailedReplyLength);
+    } else {
+        dup2(null, STDIN_FILENO);
+        dup2(reply, STDOUT_FILENO);
+        {
+            WebEntry serving;
+            serving.SwapWarmState(*entry_);
+            try {
+                serving.Run(Json::Value());
+            } catch (...) {
+                VELA_LOG_ERR("request aborted");
+            }
+            fflush(stdout);
+            std::cout.flush();
+            serving.SwapWarmState(*entry_);
+        }
+        dup2(savedIn, STDIN_FILENO);
+        dup2(savedOut, STDOUT_FILENO);
+        static char buffer[64 * 1024];
+        lseek(reply, 0, SEEK_SET);
+        ssize_t n;
+        bool sent = true;
+        while (sent && (n = read(reply, buffer, sizeof(buffer))) > 0) {
+            sent = FCGX_PutStr(buffer, static_cast<int>(n), req.out) == n;
+        }
+        if (sent) {
+            FCGX_FClose(req.err);
+            FCGX_FClose(req.out);
+        }
+    }
+    KeepOwnEnvironment();
+    for (int sig = 1; sig < NSIG; ++sig) {
+        if (sig != SIGKILL && sig != SIGSTOP) {
+            sigaction(sig, &saved[sig], nullptr);
+        }
+    }
+    for (int fd : {reply, null, savedIn, savedOut}) {
+        if (fd >= 0) {
+            close(fd);
+        }
+    }
+    close(req.ipcFd);
+    req.ipcFd = -1;
+    FCGX_Free(&req, 0);
+}
+
 void Parent::Accept()
 {
     FCGX_Request req;
@@ -249,6 +359,10 @@ void Parent::Accept()
             req.ipcFd = -1;
         }
         FCGX_Free(&req, 0);
+        return;
+    }
+    if (InProcess(req)) {
+        ServeHere(req);
         return;
     }
     const int slot = FreeSlot();
@@ -321,6 +435,7 @@ int Parent::Run()
     sigdelset(&waiting, SIGINT);
     sigdelset(&waiting, SIGCHLD);
 
+    KeepOwnEnvironment();
     Rebuild();
     while (!g_stop) {
         Reap(false);

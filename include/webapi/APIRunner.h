@@ -113,6 +113,16 @@ public:
     bool WarmUp(const std::string& api, std::string* lib = nullptr);
     // How many handler libraries this runner has opened.
     size_t OpenedLibraries() const;
+    // Whether a warm process may serve this method itself, without a child:
+    // its API's description is loaded already, lists the method, and the
+    // method says "inProcess", runs as the superuser (the warm process's
+    // own identity) with none of "grantByUser", "grantByDefault" and
+    // "allowUpload".
+    bool ServesInProcess(const std::string& api, int version, const std::string& method) const;
+    // Exchanges the descriptions and the handler libraries with `other`, so
+    // that a fresh runner can serve one request with a warm one's state and
+    // hand it back afterwards.
+    void SwapWarmState(APIRunner& other);
 
     APIRequest* GetRequest() const { return request_; }
     APIResponse* GetResponseObject() const { return response_; }

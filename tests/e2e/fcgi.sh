@@ -71,6 +71,24 @@ described() {
 }
 srv_wait 50 0.1 described || fail "the new method is still unknown: $(cat "$TMP/body")"
 
+# ---- A method that asks to run in process is served by a parent itself
+# once its API is warm there (a child's first call warms it up), and the
+# parent goes on serving children afterwards.
+describe '"crash", "sleep", "report", "fail", {"reportDefault": {"inProcess": true}}'
+touch -d '+4 seconds' "$ROOT/usr/vela/velaman/webapi/VELA.Pipe.Sub.lib"
+in_process() {
+  call "$SUB&method=reportDefault&x=1"
+  local pid
+  pid=$(sed -n 's/.*"pid":\([0-9]*\).*/\1/p' "$TMP/body")
+  [ -n "$pid" ] && parents | grep -qx "$pid"
+}
+srv_wait 40 0.1 in_process || fail "never served in process: $(cat "$TMP/body")"
+expect "in process" '"success":true' '"uid":[0,0,0]' '"params":{"api":"VELA.Pipe.Sub","method":"reportDefault","version":"1","x":"1"}'
+call "$SUB&method=reportDefault"
+expect "in process again, the earlier call's parameters gone" '"params":{"api":"VELA.Pipe.Sub","method":"reportDefault","version":"1"}'
+call "$SUB&method=report"
+expect "a child after calls in process" '"success":true'
+
 # ---- At most two children at once (one per parent): two sleeping requests
 # hold them, a third is refused with 503 and a JSON error.
 curl -s -o "$TMP/sleep1" --max-time 30 "$SUB&method=sleep&ms=3000" &
