@@ -11,6 +11,9 @@
 
 #include "vela/authresult.h"
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // Handle of the CGI library: the parsed cookies of the process environment
 // and what later calls fill in.
 typedef struct _tag_VELACGI_CTX_ VELACGI_CTX;
@@ -176,3 +179,5 @@ namespace CredRequestUtil {
 bool GetDecryptAESString(const std::string& key, const std::string& cipher, std::string& plain);
 }  // namespace CredRequestUtil
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -22,6 +22,11 @@
 #include <string>
 #include <vector>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // Characters of a session id and of an anti-forgery token.
 #define VELA_SESSION_ID_LEN 32
 #define VELA_SESSION_TOKEN_LEN 32
@@ -37,7 +42,7 @@ namespace Session {
 
 // What a new session holds besides its user and client address. Zero-filled
 // (Options{}) it gives the defaults.
-struct Options {
+struct VELA_EXPORT Options {
     int idleTimeout = 0;        // 0: VELA_SESSION_IDLE_DEFAULT; else 1 .. VELA_SESSION_IDLE_MAX
     int lifetime = 0;           // 0: VELA_SESSION_LIFETIME_DEFAULT; else 1 .. VELA_SESSION_LIFETIME_MAX
     bool skipIP = false;        // do not compare the client address on later requests
@@ -48,7 +53,7 @@ struct Options {
 };
 
 // A session as List reports it (the anti-forgery token is left out).
-struct Record {
+struct VELA_EXPORT Record {
     std::string sid;
     std::string user;
     std::string clientIP;  // "" when the session is bound to no address
@@ -92,3 +97,5 @@ void SetClockForTest(long long (*now)(void));
 
 }  // namespace Session
 }  // namespace VELA
+
+#pragma GCC visibility pop
