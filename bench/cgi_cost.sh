@@ -6,8 +6,10 @@
 #
 #   instructions  of one whole velascgi process and of one minimal CGI
 #                 process (callgrind, dynamic loader included; the median of
-#                 BENCH_CALLGRIND_RUNS runs), and their ratio. Unlike the
-#                 times, this count does not move with the machine's load;
+#                 BENCH_CALLGRIND_RUNS runs, the fewest and most beside it:
+#                 now and then a call does more work, such as housekeeping
+#                 of the state root), and their ratio. Unlike the times,
+#                 this count does not move with the machine's load;
 #   wall time     of a call of each, posix_spawn to wait4, interleaved
 #                 (vela-bench-process, several rounds).
 #
@@ -16,7 +18,7 @@
 # helper programs (minimal CGI, log sink, timer) come from the last.
 #
 # usage: bench/cgi_cost.sh [build-dir [build-dir]]      (default: build)
-# Environment: BENCH_RUNS=200 BENCH_ROUNDS=3 BENCH_CALLGRIND_RUNS=3
+# Environment: BENCH_RUNS=200 BENCH_ROUNDS=3 BENCH_CALLGRIND_RUNS=5
 #   BENCH_QUERY (default api=VELA.Sample&version=1&method=echo&text=hi)
 #
 # Each build's staged root (<build>/root) is copied into a temporary state
@@ -43,7 +45,7 @@ done
 
 RUNS=${BENCH_RUNS:-200}
 ROUNDS=${BENCH_ROUNDS:-3}
-CG_RUNS=${BENCH_CALLGRIND_RUNS:-3}
+CG_RUNS=${BENCH_CALLGRIND_RUNS:-5}
 QUERY=${BENCH_QUERY:-api=VELA.Sample&version=1&method=echo&text=hi}
 for n in "$RUNS" "$ROUNDS" "$CG_RUNS"; do
     case $n in '' | *[!0-9]* | 0) die "counts must be positive numbers" ;; esac
@@ -115,15 +117,15 @@ elif [ ! -S /dev/log ]; then
     NOTE="$NOTE; no log daemon, so every log line goes to /dev/console (slow)"
 fi
 
-# instructions PROGRAM ENV...: median over CG_RUNS whole runs of PROGRAM
-# under `env -i ENV...`.
+# instructions PROGRAM ENV...: "median fewest most" over CG_RUNS whole runs
+# of PROGRAM under `env -i ENV...`.
 instructions() {
     local program=$1 i out=$work/callgrind.txt
     shift
     for ((i = 0; i < CG_RUNS; i++)); do
         env -i "$@" valgrind --tool=callgrind --callgrind-out-file=/dev/null "$program" 2>"$out" >/dev/null
         sed -n 's/.*Collected : *\([0-9]*\).*/\1/p' "$out"
-    done | sort -n | awk '{ v[NR] = $1 } END { print v[int((NR + 1) / 2)] }'
+    done | sort -n | awk '{ v[NR] = $1 } END { print v[int((NR + 1) / 2)], v[1], v[NR] }'
 }
 ratio() { awk -v a="$1" -v b="$2" 'BEGIN { if (b <= 0) print "n/a"; else printf "%.3f", a / b }'; }
 mi() { awk -v n="$1" 'BEGIN { printf "%.3f M", n / 1e6 }'; }
@@ -153,10 +155,11 @@ for b in "${builds[@]}"; do
     *'"success":true'*) echo "velascgi answer: $answer" ;;
     *) die "the echo with a session fails in $b: $answer" ;;
     esac
-    vela=$(instructions "$b/velascgi" "${cgi_env[@]}")
-    minimal=$(instructions "$MINIMAL" "${cgi_env[@]}")
+    read -r vela vela_min vela_max <<<"$(instructions "$b/velascgi" "${cgi_env[@]}")"
+    read -r minimal minimal_min minimal_max <<<"$(instructions "$MINIMAL" "${cgi_env[@]}")"
     [ -n "$vela" ] && [ -n "$minimal" ] || die "callgrind gave no count"
-    echo "instructions (callgrind, whole process): velascgi $(mi "$vela") | minimal CGI $(mi "$minimal") | ratio $(ratio "$vela" "$minimal")x"
+    echo "instructions (callgrind, whole process, median of $CG_RUNS): velascgi $(mi "$vela") ($(mi "$vela_min") .. $(mi "$vela_max"))" \
+        "| minimal CGI $(mi "$minimal") ($(mi "$minimal_min") .. $(mi "$minimal_max")) | ratio $(ratio "$vela" "$minimal")x"
     times=$(env -i "${cgi_env[@]}" "$PROCESS" --any-output --runs "$RUNS" --rounds "$ROUNDS" "$b/velascgi" "$MINIMAL" "") ||
         die "vela-bench-process failed on $b"
     printf '%s\n' "$times"
