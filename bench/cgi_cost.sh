@@ -6,11 +6,11 @@
 #
 #   instructions  of one whole velascgi process and of one minimal CGI
 #                 process (callgrind, dynamic loader included), and their
-#                 ratio. Of BENCH_CALLGRIND_RUNS runs (about a second apart)
-#                 the fewest is a call that leaves the session file alone,
-#                 the most one that rewrites its last use (done when the
-#                 second has changed since the last write). Unlike the
-#                 times, these counts do not move with the machine's load;
+#                 ratio: the fewest and the most of BENCH_CALLGRIND_RUNS runs
+#                 (about a second apart). They differ when some calls
+#                 rewrite the session's last use and others do not (how
+#                 often depends on the build). Unlike the times, these
+#                 counts do not move with the machine's load;
 #   wall time     of a call of each, posix_spawn to wait4, interleaved
 #                 (vela-bench-process, several rounds).
 #
@@ -159,14 +159,14 @@ for b in "${builds[@]}"; do
     read -r vela vela_max <<<"$(instructions "$b/velascgi" "${cgi_env[@]}")"
     read -r minimal minimal_max <<<"$(instructions "$MINIMAL" "${cgi_env[@]}")"
     [ -n "$vela" ] && [ -n "$minimal" ] || die "callgrind gave no count"
-    echo "instructions (callgrind, whole process, fewest and most of $CG_RUNS runs): velascgi $(mi "$vela")," \
-        "$(mi "$vela_max") with the last-use rewrite | minimal CGI $(mi "$minimal") .. $(mi "$minimal_max")" \
+    echo "instructions (callgrind, whole process, fewest and most of $CG_RUNS runs): velascgi $(mi "$vela")" \
+        ".. $(mi "$vela_max") | minimal CGI $(mi "$minimal") .. $(mi "$minimal_max")" \
         "| ratio $(ratio "$vela" "$minimal")x, $(ratio "$vela_max" "$minimal")x"
     times=$(env -i "${cgi_env[@]}" "$PROCESS" --any-output --runs "$RUNS" --rounds "$ROUNDS" "$b/velascgi" "$MINIMAL" "") ||
         die "vela-bench-process failed on $b"
     printf '%s\n' "$times"
     wall=$(printf '%s\n' "$times" | sed -n 's/^all .*: velascgi median \([0-9]*\) us.*| vela-bench-minimal-cgi median \([0-9]*\) us.*/\1 \2/p')
-    summary+=("$(printf '%-32s instructions %s (%sx of the minimal CGI), %s with the last-use rewrite (%sx)  wall median %s us (minimal %s us)' \
+    summary+=("$(printf '%-32s instructions %s (%sx of the minimal CGI), most %s (%sx)  wall median %s us (minimal %s us)' \
         "$b" "$(mi "$vela")" "$(ratio "$vela" "$minimal")" "$(mi "$vela_max")" "$(ratio "$vela_max" "$minimal")" ${wall:-? ?})")
 done
 echo

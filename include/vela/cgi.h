@@ -85,7 +85,9 @@ typedef struct _tag_VELACGI_SESSION_INFO_ {
 //                              idle timeout, the skip-IP flag and the options
 //                              read by VelaCgiGetOption and VelaCgiGetLang;
 //                              the last use becomes now unless `flags` holds
-//                              VELACGI_AUTH_NO_REFRESH.
+//                              VELACGI_AUTH_NO_REFRESH, once it is at least
+//                              VELA_SESSION_LAST_USE_STEP seconds old
+//                              (vela/session.h).
 // A last use or creation time in the future (the clock went back) counts as
 // now and is written back as now. `ctx`, `user` and `info` may be null.
 // `user` is "" unless the verdict is 1.

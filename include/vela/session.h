@@ -37,6 +37,12 @@
 #define VELA_SESSION_LIFETIME_DEFAULT 86400    // 24 hours after the login
 #define VELA_SESSION_LIFETIME_MAX (366 * 86400)
 
+// A request moves a session's "lastUse" only when it is at least this many
+// seconds old, so that a busy session's file is rewritten at most once per
+// step, not on every request. The idle timeout is counted from the last use
+// written: a session may be taken for idle up to this many seconds early.
+#define VELA_SESSION_LAST_USE_STEP 30
+
 namespace VELA {
 namespace Session {
 
