@@ -75,7 +75,7 @@ const _tag_API_TABLE* EntryOf(const _tag_API_TABLE* table, const ResolvedCall& c
 
 // ---- The cache ------------------------------------------------------------------------
 
-void* LibCache::Open(const std::string& path, APIResponse* resp)
+void* LibCache::Open(const std::string& path, APIResponse* resp, int mode)
 {
     if (path.empty()) {
         VELA_REFUSE(resp, WEBAPI_ERR_LOAD_LIBRARY, "library path empty");
@@ -85,7 +85,7 @@ void* LibCache::Open(const std::string& path, APIResponse* resp)
     if (cached != handles_.end()) {
         return cached->second;
     }
-    void* opened = dlopen(path.c_str(), RTLD_LAZY);
+    void* opened = dlopen(path.c_str(), mode);
     if (!opened) {
         const char* err = dlerror();
         VELA_REFUSE(resp, WEBAPI_ERR_LOAD_LIBRARY, "cannot open library: %s. error = %s", path.c_str(),
@@ -125,6 +125,33 @@ _tag_API_TABLE* FetchAPITable(void* handle, std::string& why, int& priority)
 }
 
 // ---- The members of APIRunner that reach the cache --------------------------------------
+
+bool APIRunner::WarmUp(const std::string& api, std::string* lib)
+{
+    try {
+        APIName name;
+        if (!APIName::Check(api, name) || !d_->registry.Load(d_->registry.Table(), name, nullptr)) {
+            return false;
+        }
+        const Json::Value* desc = d_->registry.Find(api);
+        if (desc == nullptr) {
+            return false;
+        }
+        const Json::Value& path = JsonMember(*desc, "lib");
+        if (!path.isString() || d_->libs.Open(path.asString(), nullptr, RTLD_NOW) == nullptr) {
+            return false;
+        }
+        if (lib != nullptr) {
+            *lib = path.asString();
+        }
+        return true;
+    } catch (const std::exception& e) {
+        VELA_LOG_ERR("cannot warm up %s: %s", LogSafe(api).c_str(), e.what());
+        return false;
+    }
+}
+
+size_t APIRunner::OpenedLibraries() const { return d_->libs.Size(); }
 
 bool APIRunner::CacheLib(APIRequest* req, void** handle)
 {

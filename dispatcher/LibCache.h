@@ -3,6 +3,7 @@
 // written, kept until the runner is destroyed.
 #pragma once
 
+#include <dlfcn.h>
 #include <map>
 #include <string>
 
@@ -21,7 +22,8 @@ public:
 
     // The handle of the library at `path`, opened on first use; null on
     // failure, which is one line and, with `resp`, error 111 on `resp`.
-    void* Open(const std::string& path, APIResponse* resp);
+    // `mode` is dlopen's (RTLD_NOW binds every symbol at once).
+    void* Open(const std::string& path, APIResponse* resp, int mode = RTLD_LAZY);
     // Closes every cached library and empties the cache.
     void CloseAll();
     size_t Size() const { return handles_.size(); }

@@ -9,6 +9,7 @@ packages=(
   libssl-dev openssl passwd
   libpam0g-dev
   libsqlite3-dev
+  libfcgi-dev libfcgi-bin
   libgtest-dev libgmock-dev googletest
   libbenchmark-dev
   clang libclang-rt-dev

@@ -3,9 +3,13 @@
 #
 #   lighttpd-conf.sh --out FILE --port N --run DIR --pidfile FILE --docroot DIR
 #                    --velascgi PATH [--bind ADDR] [--env NAME=VALUE]... [--xsendfile-dir DIR]...
-#                    [--errors DIR]
+#                    [--errors DIR] [--front-end cgi|fcgi] [--velafcgi PATH]
 #
-# --env adds a variable to the environment of velascgi (VELA_ROOT, ...).
+# --front-end chooses who serves the web API: fcgi (velafcgi, the FastCGI
+# server lighttpd starts; --velafcgi names it, default: velafcgi beside
+# velascgi) or cgi (velascgi run for every request). Default: the
+# environment's VELA_FRONT_END, else fcgi.
+# --env adds a variable to the environment of the front end (VELA_ROOT, ...).
 # --xsendfile-dir allows X-Sendfile answers for files under DIR; without any,
 # X-Sendfile is off. --errors names the folder of the JSON error answers
 # (default deploy/errors). The run directory gets the upload buffer directory; the
@@ -14,7 +18,8 @@ set -euo pipefail
 
 repo="$(cd "$(dirname "$0")/.." && pwd)"
 template="$repo/deploy/lighttpd.conf.in"
-out="" port="" run="" pidfile="" docroot="" velascgi="" bind="127.0.0.1" errors="$repo/deploy/errors"
+out="" port="" run="" pidfile="" docroot="" velascgi="" velafcgi="" bind="127.0.0.1" errors="$repo/deploy/errors"
+front="${VELA_FRONT_END:-fcgi}"
 envs=() sendfile_dirs=()
 
 die() { echo "lighttpd-conf.sh: $*" >&2; exit 1; }
@@ -32,6 +37,8 @@ while [ $# -gt 0 ]; do
     --env) envs+=("$2") ;;
     --xsendfile-dir) sendfile_dirs+=("$2") ;;
     --errors) errors="$2" ;;
+    --front-end) front="$2" ;;
+    --velafcgi) velafcgi="$2" ;;
     *) die "unknown option $1" ;;
   esac
   shift 2
@@ -46,6 +53,18 @@ for p in "$run" "$pidfile" "$docroot" "$velascgi" "$errors"; do
   case "$p" in /*) ;; *) die "\"$p\" is not an absolute path" ;; esac
 done
 [ -x "$velascgi" ] || die "$velascgi is not an executable"
+case "$front" in
+  cgi) module=mod_cgi ;;
+  fcgi)
+    module=mod_fastcgi
+    [ -n "$velafcgi" ] || velafcgi="$(dirname "$velascgi")/velafcgi"
+    case "$velafcgi" in /*) ;; *) die "\"$velafcgi\" is not an absolute path" ;; esac
+    [ -x "$velafcgi" ] || die "$velafcgi is not an executable"
+    # lighttpd splits the program's command line at spaces.
+    case "$velafcgi$run" in *[[:space:]]*) die "the paths of velafcgi and the run directory may not hold spaces" ;; esac
+    ;;
+  *) die "--front-end takes cgi or fcgi, not \"$front\"" ;;
+esac
 
 # Every text goes into a lighttpd string literal as it is: refuse the
 # characters that would end or escape it.
@@ -56,7 +75,7 @@ plain() {
 }
 quote() { plain "$1"; printf '"%s"' "$1"; }
 
-for p in "$run" "$pidfile" "$docroot" "$velascgi" "$bind" "$errors"; do
+for p in "$run" "$pidfile" "$docroot" "$velascgi" "$velafcgi" "$bind" "$errors"; do
   plain "$p"
 done
 
@@ -77,6 +96,17 @@ mkdir -p "$run/upload"
 chmod 0700 "$run/upload"
 tmp="$(mktemp "$out.XXXXXX")"
 trap 'rm -f "$tmp"' EXIT
+# The template with the front end's block in place of @ENTRY@.
+expanded() {
+  local line
+  while IFS= read -r line || [ -n "$line" ]; do
+    if [ "$line" = "@ENTRY@" ]; then
+      cat "$repo/deploy/entry-$front.conf.in"
+    else
+      printf '%s\n' "$line"
+    fi
+  done <"$template"
+}
 while IFS= read -r line || [ -n "$line" ]; do
   # Text inside quotes of the template takes the raw value; the lists take
   # entries already quoted.
@@ -86,12 +116,14 @@ while IFS= read -r line || [ -n "$line" ]; do
   line="${line//@RUN_DIR@/"$run"}"
   line="${line//@DOCROOT@/"$docroot"}"
   line="${line//@VELASCGI@/"$velascgi"}"
+  line="${line//@VELAFCGI@/"$velafcgi"}"
+  line="${line//@ENTRY_MODULE@/"$module"}"
   line="${line//@CGI_ENV@/"$cgi_env"}"
   line="${line//@XSENDFILE_DOCROOT@/"$xsendfile_docroot"}"
   line="${line//@XSENDFILE@/"$xsendfile"}"
   line="${line//@ERRORS_DIR@/"$errors"}"
   printf '%s\n' "$line"
-done <"$template" >"$tmp"
+done < <(expanded) >"$tmp"
 if ! lighttpd -tt -f "$tmp" >/dev/null 2>"$tmp.err"; then
   cat "$tmp.err" >&2
   rm -f "$tmp.err"

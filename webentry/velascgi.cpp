@@ -1,105 +1,10 @@
 // velascgi: the CGI program the web server runs for every web-API call.
 // It works in the web-API directory, where the API descriptions and handler
 // libraries are named relative to, and hands the call to one WebEntry.
-#include <climits>
-#include <cstdlib>
-#include <cstring>
-#include <exception>
-#include <string>
-#include <unistd.h>
-
-#include "vela/cgi.h"
-#include "vela/log.h"
-#include "vela/vlibc.h"
-#include "webentry/RequestLimits.h"
-#include "webentry/WebEntry.h"
-
-namespace {
-
-// The reply when the program cannot even start serving: a CGI status line,
-// the usual headers and a JSON error (117: set-up failed).
-const char kSetupFailedReply[] =
-    "Status: 500 Internal Server Error\r\n"
-    "Content-type: application/json; charset=\"UTF-8\"\r\n"
-    "Accept-Ranges: none\r\n"
-    "X-Content-Type-Options: nosniff\r\n"
-    "X-XSS-Protection: 1; mode=block\r\n"
-    "Cache-Control: max-age=0, no-cache, no-store, must-revalidate\r\n"
-    "Pragma: no-cache\r\n"
-    "Expires: 0\r\n"
-    "\r\n"
-    "{\"error\":{\"code\":117},\"success\":false}";
-
-// The reply when the client already has as many requests under way as it
-// may: try again shortly.
-const char kBusyReply[] =
-    "Status: 503 Service Unavailable\r\n"
-    "Retry-After: 5\r\n"
-    "Content-type: application/json; charset=\"UTF-8\"\r\n"
-    "X-Content-Type-Options: nosniff\r\n"
-    "Cache-Control: max-age=0, no-cache, no-store, must-revalidate\r\n"
-    "\r\n"
-    "{\"error\":{\"code\":117},\"success\":false}";
-
-void Reply(const char* p, size_t left)
-{
-    while (left > 0) {
-        const ssize_t n = write(STDOUT_FILENO, p, left);
-        if (n <= 0) {
-            return;
-        }
-        p += n;
-        left -= static_cast<size_t>(n);
-    }
-}
-
-void ReplySetupFailed() { Reply(kSetupFailedReply, sizeof(kSetupFailedReply) - 1); }
-
-// Arms this request's CPU and wall-clock limits and takes its client's
-// slot. False when the client has too many requests under way (answered).
-bool LimitRequest()
-{
-    const VELA::RequestLimits limits = VELA::LoadRequestLimits();
-    const char* text = getenv("CONTENT_LENGTH");
-    long long length = VELA::System::ContentLength(text, text != nullptr ? strlen(text) : 0, LLONG_MAX);
-    if (length < 0) {
-        length = 0;  // the front end refuses it later, with the request's own answer
-    }
-    VELA::ArmRequestLimits(limits, length);
-    char address[64] = "";
-    if (VelaCgiGetRemoteIP(address, sizeof(address)) != 0) {
-        address[0] = '\0';
-    }
-    if (VELA::TakeClientSlot(limits, address) == 0) {
-        VELA_LOG_ERR("refused: %s already has %d requests under way", address[0] ? address : "(unknown client)",
-                     limits.maxPerClient);
-        Reply(kBusyReply, sizeof(kBusyReply) - 1);
-        return false;
-    }
-    return true;
-}
-
-}  // namespace
+#include "webentry/Serve.h"
 
 int main(int argc, char** argv)
 {
-    try {
-        const std::string dir = VELA::System::Path("/usr/vela/velaman/webapi");
-        if (chdir(dir.c_str()) != 0) {
-            VELA_LOG_ERR("cannot enter the web-API directory %s[%m]", dir.c_str());
-            ReplySetupFailed();
-            return 0;
-        }
-        if (!LimitRequest()) {
-            return 0;
-        }
-        VELA::WebEntry entry;
-        entry.SetArgs(argc, argv);
-        entry.Run(Json::Value());
-    } catch (const std::exception& e) {
-        VELA_LOG_ERR("request aborted: %s", e.what());
-    } catch (...) {
-        VELA_LOG_ERR("request aborted");
-    }
+    VELA::ServeCgiRequest(argc, argv, nullptr);
     return 0;
 }

@@ -113,6 +113,15 @@ public:
     // Loads (or finds) the handler library of the request's API.
     bool CacheLib(APIRequest* req, void** handle);
 
+    // ---- Warm processes (a front end that forks one child per request) ----
+    // Loads the description of `api` and opens its handler library with
+    // every symbol bound now, so that processes forked from this one find
+    // both ready. The library's path, as the description names it, goes to
+    // `lib`. False when the name, the description or the library fails.
+    bool WarmUp(const std::string& api, std::string* lib = nullptr);
+    // How many handler libraries this runner has opened.
+    size_t OpenedLibraries() const;
+
     APIRequest* GetRequest() const { return request_; }
     APIResponse* GetResponseObject() const { return response_; }
 

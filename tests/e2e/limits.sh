@@ -17,18 +17,7 @@ CONF
 srv_serve
 port=${BASE##*:}
 
-# velascgi processes this test's lighttpd is running (by their executable:
-# the process renames itself after the API it serves; by their parent: other
-# tests run servers of their own at the same time).
-cgi_count() {
-  local dir ppid n=0
-  for dir in /proc/[0-9]*; do
-    [ "$(readlink "$dir/exe" 2>/dev/null)" = "$VELASCGI" ] || continue
-    ppid=$(awk '/^PPid:/ { print $2 }' "$dir/status" 2>/dev/null)
-    [ "$ppid" = "$LPID" ] && n=$((n + 1))
-  done
-  echo "$n"
-}
+cgi_count() { srv_request_count; }
 cgi_at_least() { [ "$(cgi_count)" -ge "$1" ]; }
 cgi_none() { [ "$(cgi_count)" -eq 0 ]; }
 
@@ -92,7 +81,7 @@ for f in "$TMP/slow1" "$TMP/slow2" "$TMP/slow3"; do
 done
 grep -q 'nothing arrived for 3 s' "$RUN/cgi.log" || fail "slow body: no log line"
 # Gone once their answers are out (a sanitizer build takes a moment to exit).
-srv_wait 100 0.1 cgi_none || fail "velascgi processes left: $(cgi_count)"
+srv_wait 100 0.1 cgi_none || fail "request processes left: $(cgi_count)"
 # Slots come back when their requests end.
 call "$URL?api=VELA.Sample&version=1&method=echo"
 expect "after the slow bodies" '"code":119'

@@ -21,6 +21,8 @@
 #                                  BASE and URL (the entry), or 1; srv_stop
 #   srv_serve [ARG...]             srv_start RUN/www, or exit 1
 #   srv_session                    sid: a session of root from 127.0.0.1
+#   srv_request_count              processes serving a request of this server
+#                                  now (velascgi programs, or velafcgi children)
 #   srv_pam                        the PAM service of deploy/pam in the root
 #   srv_add_user NAME PASS [GROUP] a Linux account with that password, or exit 1
 #   srv_password                   a password of letters and digits only
@@ -186,6 +188,29 @@ srv_start() {
 
 srv_serve() {
   srv_start "$RUN/www" "$@" || { failures=1; exit 1; }
+}
+
+# By executable and by ancestry, since other tests run servers of their own
+# at the same time: a velascgi program is lighttpd's child; a velafcgi child
+# is the child of a parent, the child of the master lighttpd started. (The
+# processes rename themselves after the API they serve.)
+srv_request_count() {
+  local dir n=0 exe want depth=1 pid i
+  if [ "${VELA_FRONT_END:-fcgi}" = fcgi ]; then
+    want=$(dirname "$SRV_VELASCGI")/velafcgi depth=3
+  else
+    want=$SRV_VELASCGI
+  fi
+  for dir in /proc/[0-9]*; do
+    exe=$(readlink "$dir/exe" 2>/dev/null) || continue
+    [ "$exe" = "$want" ] || continue
+    pid=${dir#/proc/}
+    for ((i = 0; i < depth; i++)); do
+      pid=$(awk '/^PPid:/ { print $2 }' "/proc/$pid/status" 2>/dev/null) || break
+    done
+    [ "$pid" = "$LPID" ] && n=$((n + 1))
+  done
+  echo "$n"
 }
 
 srv_session() {

@@ -1,0 +1,327 @@
+// The child of velafcgi that serves one request. It turns the FastCGI
+// request into the CGI setting velascgi runs in: the parameters become the
+// environment, the request body arrives on standard input through a pipe, and
+// what the call writes on standard output goes back to the web server
+// through another pipe. Two threads move the bytes; everything else is the
+// very road of velascgi, on the warm parent's runner.
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <iostream>
+#include <poll.h>
+#include <pthread.h>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include "vela/log.h"
+#include "vela/vlibc.h"
+#include "webapi/APIRequest.h"
+#include "webentry/Fcgi.h"
+#include "webentry/Serve.h"
+#include "webentry/WebEntry.h"
+
+namespace VELA {
+namespace Fcgi {
+
+namespace {
+
+// Bounds on what the web server may hand over as parameters.
+constexpr size_t kMaxParams = 1000;
+constexpr size_t kMaxParamBytes = 1 << 20;
+constexpr size_t kChunk = 64 * 1024;
+
+// The names a request's parameters never set: the server's own environment
+// (VELA_ROOT and the like), the dynamic loader's, and the proxy variable a
+// client's "Proxy" header would become.
+bool Protected(const char* entry, size_t nameLen)
+{
+    auto is = [&](const char* name) { return nameLen == strlen(name) && memcmp(entry, name, nameLen) == 0; };
+    auto starts = [&](const char* prefix) { return nameLen >= strlen(prefix) && memcmp(entry, prefix, strlen(prefix)) == 0; };
+    return starts("VELA_") || starts("LD_") || is("PATH") || is("HTTP_PROXY") || is("IFS") || is("TZ");
+}
+
+// Length of the name of "NAME=value" when NAME is a plain variable name,
+// else 0.
+size_t NameLength(const char* entry)
+{
+    const char* eq = strchr(entry, '=');
+    if (eq == nullptr || eq == entry) {
+        return 0;
+    }
+    for (const char* p = entry; p < eq; ++p) {
+        const unsigned char c = static_cast<unsigned char>(*p);
+        const bool ok = c == '_' || (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (p > entry && c >= '0' && c <= '9');
+        if (!ok) {
+            return 0;
+        }
+    }
+    return static_cast<size_t>(eq - entry);
+}
+
+// The environment of the call: the server's own variables, then the
+// request's parameters. False when the parameters are out of bounds.
+bool SetEnvironment(char** params, const Options& options)
+{
+    clearenv();
+    for (const std::string& kept : options.environment) {
+        putenv(const_cast<char*>(kept.c_str()));  // lives as long as the process
+    }
+    size_t count = 0;
+    size_t bytes = 0;
+    for (char** p = params; p != nullptr && *p != nullptr; ++p) {
+        bytes += strlen(*p) + 1;
+        if (++count > kMaxParams || bytes > kMaxParamBytes) {
+            VELA_LOG_ERR("request refused: more than %zu parameters or %zu bytes of them", kMaxParams,
+                         kMaxParamBytes);
+            return false;
+        }
+        const size_t nameLen = NameLength(*p);
+        if (nameLen == 0 || Protected(*p, nameLen)) {
+            continue;
+        }
+        putenv(*p);  // owned by the request, which lives as long as the process
+    }
+    return true;
+}
+
+bool WriteAll(int fd, const char* p, size_t left)
+{
+    while (left > 0) {
+        const ssize_t n = write(fd, p, left);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            return false;
+        }
+        p += n;
+        left -= static_cast<size_t>(n);
+    }
+    return true;
+}
+
+// The two directions of the reply and their threads.
+struct Bridge {
+    FCGX_Request* req = nullptr;
+    Slot* slot = nullptr;
+    int outRead = -1;      // standard output's pipe, read by the output thread
+    int finish = -1;       // eventfd: the call is over, drain and stop
+    pthread_t outThread{};
+    bool outStarted = false;
+    bool outFailed = false;
+    int inWrite = -1;      // standard input's pipe, written by the input thread
+    long long bodyLeft = 0;
+    pthread_t inThread{};
+    bool inStarted = false;
+    bool finished = false;
+};
+
+Bridge g_bridge;
+
+// Standard output to the web server, as stdout records, until the call is
+// over and the pipe holds nothing more.
+void* PumpOut(void* arg)
+{
+    Bridge& b = *static_cast<Bridge*>(arg);
+    static char buffer[kChunk];
+    bool draining = false;
+    for (;;) {
+        if (!draining) {
+            pollfd fds[2] = {{b.outRead, POLLIN, 0}, {b.finish, POLLIN, 0}};
+            if (poll(fds, 2, -1) < 0) {
+                if (errno == EINTR) {
+                    continue;
+                }
+                break;
+            }
+            if ((fds[1].revents & POLLIN) != 0 && (fds[0].revents & (POLLIN | POLLHUP)) == 0) {
+                // Over, and nothing waiting: what a process that has not
+                // let go of standard output writes later is not waited for.
+                break;
+            }
+            if ((fds[1].revents & POLLIN) != 0) {
+                draining = true;
+                fcntl(b.outRead, F_SETFL, fcntl(b.outRead, F_GETFL) | O_NONBLOCK);
+            }
+        }
+        const ssize_t n = read(b.outRead, buffer, sizeof(buffer));
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            break;  // end of output, or drained
+        }
+        int expected = kNothingSent;
+        b.slot->state.compare_exchange_strong(expected, kReplyStarted);
+        if (FCGX_PutStr(buffer, static_cast<int>(n), b.req->out) != n || FCGX_FFlush(b.req->out) != 0) {
+            // The web server went away: the call's next write fails, as a
+            // CGI program's does when its pipe is gone.
+            b.outFailed = true;
+            break;
+        }
+    }
+    close(b.outRead);
+    b.outRead = -1;
+    return nullptr;
+}
+
+// The request body from the web server to standard input.
+void* PumpIn(void* arg)
+{
+    Bridge& b = *static_cast<Bridge*>(arg);
+    static char buffer[kChunk];
+    while (b.bodyLeft > 0) {
+        const int want = static_cast<int>(std::min<long long>(b.bodyLeft, sizeof(buffer)));
+        const int n = FCGX_GetStr(buffer, want, b.req->in);
+        if (n <= 0 || !WriteAll(b.inWrite, buffer, static_cast<size_t>(n))) {
+            break;
+        }
+        b.bodyLeft -= n;
+    }
+    close(b.inWrite);
+    b.inWrite = -1;
+    return nullptr;
+}
+
+// Ends the reply: standard output closed, the rest of it sent, the request
+// ended, the body no longer read. Runs once, at the process's exit (a handler
+// that calls exit() still has its reply sent).
+void FinishReply()
+{
+    Bridge& b = g_bridge;
+    if (b.finished) {
+        return;
+    }
+    b.finished = true;
+    fflush(stdout);
+    std::cout.flush();
+    const int null = open("/dev/null", O_RDWR | O_CLOEXEC);
+    if (null >= 0) {
+        dup2(null, STDOUT_FILENO);
+    } else {
+        close(STDOUT_FILENO);
+    }
+    if (b.outStarted) {
+        const uint64_t one = 1;
+        (void)!write(b.finish, &one, sizeof(one));
+        pthread_join(b.outThread, nullptr);
+    }
+    if (!b.outFailed) {
+        FCGX_FClose(b.req->err);
+        if (FCGX_FClose(b.req->out) == 0) {
+            b.slot->state.store(kReplyEnded);
+        }
+    }
+    // Standard input goes too, so that an input thread blocked on a full
+    // pipe stops; one waiting for the web server is woken by the shutdown.
+    if (null >= 0) {
+        dup2(null, STDIN_FILENO);
+        close(null);
+    }
+    if (b.inStarted) {
+        shutdown(b.req->ipcFd, SHUT_RD);
+        pthread_join(b.inThread, nullptr);
+    }
+    close(b.req->ipcFd);
+}
+
+// Standard input and output become the pipes of the bridge. False when the
+// system refuses a pipe or a thread.
+bool Plumb(Bridge& b, FCGX_Request& req, Slot& slot)
+{
+    b.req = &req;
+    b.slot = &slot;
+    const char* text = getenv("CONTENT_LENGTH");
+    const long long length = System::ContentLength(text, text != nullptr ? strlen(text) : 0, LLONG_MAX);
+    b.bodyLeft = length > 0 ? length : 0;
+
+    // The threads never take SIGPIPE: a write to a reader that has gone
+    // fails instead, and the thread stops.
+    sigset_t pipeOnly, old;
+    sigemptyset(&pipeOnly);
+    sigaddset(&pipeOnly, SIGPIPE);
+    pthread_sigmask(SIG_BLOCK, &pipeOnly, &old);
+
+    int out[2];
+    if (pipe2(out, O_CLOEXEC) != 0 || (b.finish = eventfd(0, EFD_CLOEXEC)) < 0) {
+        VELA_LOG_ERR("cannot make the reply's pipe[%m]");
+        return false;
+    }
+    dup2(out[1], STDOUT_FILENO);
+    close(out[1]);
+    b.outRead = out[0];
+    if (pthread_create(&b.outThread, nullptr, PumpOut, &b) != 0) {
+        VELA_LOG_ERR("cannot start the reply's thread");
+        return false;
+    }
+    b.outStarted = true;
+
+    if (b.bodyLeft == 0) {
+        const int null = open("/dev/null", O_RDONLY | O_CLOEXEC);
+        if (null >= 0) {
+            dup2(null, STDIN_FILENO);
+            close(null);
+        }
+    } else {
+        int in[2];
+        if (pipe2(in, O_CLOEXEC) != 0) {
+            VELA_LOG_ERR("cannot make the body's pipe[%m]");
+            return false;
+        }
+        dup2(in[0], STDIN_FILENO);
+        close(in[0]);
+        b.inWrite = in[1];
+        if (pthread_create(&b.inThread, nullptr, PumpIn, &b) != 0) {
+            VELA_LOG_ERR("cannot start the body's thread");
+            return false;
+        }
+        b.inStarted = true;
+    }
+    pthread_sigmask(SIG_SETMASK, &old, nullptr);
+    return true;
+}
+
+}  // namespace
+
+void ServeChild(FCGX_Request& req, WebEntry& entry, Slot& slot, const Options& options,
+                const std::vector<int>& closeFds, int argc, char** argv)
+{
+    struct sigaction dfl {};
+    dfl.sa_handler = SIG_DFL;
+    for (int sig : {SIGTERM, SIGINT, SIGCHLD, SIGALRM, SIGPIPE, SIGHUP, SIGUSR1}) {
+        sigaction(sig, &dfl, nullptr);
+    }
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
+    setsid();  // a session of its own, as a CGI program has
+    for (int fd : closeFds) {
+        close(fd);
+    }
+
+    Bridge& b = g_bridge;
+    const bool ready = SetEnvironment(req.envp, options) && Plumb(b, req, slot);
+    atexit(FinishReply);
+    if (!ready) {
+        WriteReply(kSetupFailedReply, kSetupFailedReplyLength);
+        exit(0);
+    }
+    const size_t before = entry.OpenedLibraries();
+    ServeCgiRequest(argc, argv, &entry);
+    if (entry.OpenedLibraries() > before && entry.GetRequest() != nullptr) {
+        const std::string api = entry.GetRequest()->GetAPIClass();
+        if (api.size() < sizeof(slot.api)) {
+            memcpy(slot.api, api.c_str(), api.size() + 1);
+        }
+    }
+    exit(0);
+}
+
+}  // namespace Fcgi
+}  // namespace VELA
