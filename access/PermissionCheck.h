@@ -15,6 +15,7 @@
 #include <string>
 
 #include "vela/cgi.h"
+#include "vela/export.h"
 
 namespace VELA {
 
@@ -22,7 +23,8 @@ class APIRequest;
 class APIResponse;
 class APIRunner;
 
-class PermissionCheck {
+// Exported for the tests (VELA_EXPORT: see vela/export.h).
+class VELA_EXPORT PermissionCheck {
 public:
     // `runner` answers the method attributes the check reads ("allowTimeout",
     // "skipCheckIP", the method's own "allowUser") and holds the request

@@ -17,6 +17,7 @@
 #include <string>
 
 #include "vela/cgi.h"
+#include "vela/export.h"
 #include "webapi/APITable.h"
 
 namespace VELA {
@@ -26,6 +27,8 @@ class APIResponse;
 class APIRunner;
 
 namespace SharingCheck {
+
+// VELA_EXPORT: exported for the tests (see vela/export.h).
 
 // The permission directory, resolved under the system root.
 std::string PermissionLibDir();
@@ -49,12 +52,12 @@ bool GetSharingCheckTableFunc(void* handle, _tag_API_SHARING_CHECK_TABLE** table
 // The check of the first entry of `table` that matches `req`'s version,
 // api and method. False when none matches; entries with an empty pattern
 // are skipped with a warning.
-bool GetSharingCheckFunc(APIRequest* req, _tag_API_SHARING_CHECK_TABLE* table, APICheckFn* check);
+VELA_EXPORT bool GetSharingCheckFunc(APIRequest* req, _tag_API_SHARING_CHECK_TABLE* table, APICheckFn* check);
 
 // 0 when `text` matches `pattern`: "*" matches everything, anything else is
 // a POSIX extended regular expression (unanchored). Non-zero for no match,
 // a pattern that does not compile, or a null argument.
-int RegexMatch(const char* pattern, const char* text);
+VELA_EXPORT int RegexMatch(const char* pattern, const char* text);
 
 // Finds the check of `req`'s call in its library and runs it as the owner
 // of the library file; the process's ids and groups are put back after it.
@@ -78,7 +81,7 @@ bool CheckSharingPermission(APIRunner& runner, APIRequest* req, APIResponse* res
 int StatusToError(int status);
 
 // How many check libraries this process has opened.
-size_t OpenedLibraries();
+VELA_EXPORT size_t OpenedLibraries();
 
 }  // namespace SharingCheck
 }  // namespace VELA

@@ -7,9 +7,12 @@
 #include <json/json.h>
 #include <string>
 
+#include "vela/export.h"
+
 namespace VELA {
 
-class APIBase {
+// Exported for the tests (VELA_EXPORT: see vela/export.h).
+class VELA_EXPORT APIBase {
 public:
     APIBase();
     virtual ~APIBase();

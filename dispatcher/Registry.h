@@ -8,6 +8,8 @@
 #include <json/json.h>
 #include <string>
 
+#include "vela/export.h"
+
 namespace VELA {
 
 class APIResponse;
@@ -54,8 +56,8 @@ public:
     // defaults' "methods" when the method has none of its own.
     const Json::Value& MethodOf(const Json::Value& desc, int version, const std::string& method) const;
     // Whether `desc` lists `method` for `version` (a string entry or any
-    // member of an object entry).
-    static bool Lists(const Json::Value& desc, int version, const std::string& method);
+    // member of an object entry). Exported for the tests (vela/export.h).
+    VELA_EXPORT static bool Lists(const Json::Value& desc, int version, const std::string& method);
     // The object whose members are the flags of a method whose attribute
     // object (MethodOf) is `method`: itself, or the defaults' "methods"
     // when it is not an object.

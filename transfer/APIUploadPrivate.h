@@ -8,6 +8,7 @@
 #include <sys/types.h>
 
 #include "vela/cgi.h"
+#include "vela/export.h"
 #include "webapi/APIUpload.h"
 
 namespace VELA {
@@ -23,7 +24,8 @@ constexpr unsigned long long kUploadSizeMargin = 5ULL * 1024 * 1024;       // ad
 constexpr unsigned long long kUploadRootReserve = 200ULL * 1024 * 1024;    // kept free on "/"
 constexpr char kUploadDefaultsFile[] = "/etc.defaults/velainfo.conf";
 
-class APIUploadPrivate {
+// Exported for the tests (VELA_EXPORT: see vela/export.h).
+class VELA_EXPORT APIUploadPrivate {
 public:
     typedef void (*Progress)(unsigned long long, unsigned long long);
 

@@ -4,7 +4,11 @@
 // the number of requests one client address may have under way at once.
 #pragma once
 
+#include "vela/export.h"
 namespace VELA {
+
+// The functions below are exported for velascgi and the tests
+// (VELA_EXPORT: see vela/export.h).
 
 struct RequestLimits {
     // CPU seconds of the process; at the limit the kernel sends SIGXCPU,
@@ -34,21 +38,21 @@ struct RequestLimits {
 // request_max_per_client, fcgi_parents, fcgi_max_children,
 // fcgi_param_seconds); a key that is absent or not a number in range
 // keeps its default (and a bad one is logged).
-RequestLimits LoadRequestLimits();
+VELA_EXPORT RequestLimits LoadRequestLimits();
 
 // Wall-clock seconds a request with a body of `contentLength` bytes may
 // take: timeSeconds plus the body's allowance, at most a day.
-unsigned RequestWallSeconds(const RequestLimits& limits, long long contentLength);
+VELA_EXPORT unsigned RequestWallSeconds(const RequestLimits& limits, long long contentLength);
 
 // Arms the CPU limit and the alarm for this process. False (logged) when
 // the kernel refuses either.
-bool ArmRequestLimits(const RequestLimits& limits, long long contentLength);
+VELA_EXPORT bool ArmRequestLimits(const RequestLimits& limits, long long contentLength);
 
 // Takes one of the maxPerClient slots of the client `address` (text as
 // VelaCgiGetRemoteIP gives it; IPv6 addresses share the slots of their /64).
 // The slot is a lock held until the process ends. 1 when taken (or there is
 // no limit), 0 when every slot of the address is busy, -1 when the slots
 // cannot be used (logged; the caller lets the request through).
-int TakeClientSlot(const RequestLimits& limits, const char* address);
+VELA_EXPORT int TakeClientSlot(const RequestLimits& limits, const char* address);
 
 }  // namespace VELA

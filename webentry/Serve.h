@@ -5,26 +5,30 @@
 
 #include <cstddef>
 
+#include "vela/export.h"
+
 namespace VELA {
 
 class WebEntry;
 
+// Exported for velascgi and velafcgi (VELA_EXPORT: see vela/export.h).
+
 // The reply when a request cannot even start being served: a CGI status
 // line, the usual headers and a JSON error (117).
-extern const char kSetupFailedReply[];
-extern const size_t kSetupFailedReplyLength;
+VELA_EXPORT extern const char kSetupFailedReply[];
+VELA_EXPORT extern const size_t kSetupFailedReplyLength;
 // The reply when no more requests can be taken at the moment (the client's
 // own, or the server's): try again shortly.
-extern const char kBusyReply[];
-extern const size_t kBusyReplyLength;
+VELA_EXPORT extern const char kBusyReply[];
+VELA_EXPORT extern const size_t kBusyReplyLength;
 
 // Writes `length` bytes to standard output, as far as it takes them.
-void WriteReply(const char* text, size_t length);
+VELA_EXPORT void WriteReply(const char* text, size_t length);
 
 // Enters the web-API directory, arms the request's CPU and wall-clock limits,
 // takes one of its client's slots and runs the call through `entry`, or
 // through a WebEntry of its own when `entry` is null. Every failure is
 // answered on standard output and logged; nothing throws.
-void ServeCgiRequest(int argc, char** argv, WebEntry* entry);
+VELA_EXPORT void ServeCgiRequest(int argc, char** argv, WebEntry* entry);
 
 }  // namespace VELA

@@ -13,11 +13,13 @@
 #include "access/PermissionCheck.h"
 #include "webapi/APITable.h"
 #include "vela/cgi.h"
+#include "vela/export.h"
 #include "webapi/APIRunner.h"
 
 namespace VELA {
 
-class WebEntry : public APIRunner {
+// Exported for velascgi and the tests (VELA_EXPORT: see vela/export.h).
+class VELA_EXPORT WebEntry : public APIRunner {
 public:
     WebEntry();
     ~WebEntry() override;
@@ -79,7 +81,7 @@ protected:
 // A front end that only asks the sharing check library of a link whether
 // the call the CGI environment names may be made: Run is Initialize, then
 // CheckSharingAppPermission on the request and response.
-class SharingChecker : public WebEntry {
+class VELA_EXPORT SharingChecker : public WebEntry {
 public:
     bool Run(const Json::Value& unused) override;
 };

@@ -3,6 +3,9 @@
 // nothing else from the CGI library.
 #pragma once
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // Verdict of the login-session check (VelaCgiIsAuthorizedEx).
 enum _tag_authorized_result_ : int {
     AUTH_RESULT_AUTHORIZED = 1,       // valid session
@@ -19,3 +22,5 @@ typedef enum _tag_authorized_result_ AUTHORIZED_RESULT;
 // code uses: `_tag_authorized_result v = AUTH_RESULT_AUTHORIZED;` compiles
 // as with the name above.
 typedef enum _tag_authorized_result_ _tag_authorized_result;
+
+#pragma GCC visibility pop

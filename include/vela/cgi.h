@@ -11,6 +11,9 @@
 
 #include "vela/authresult.h"
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // Handle of the CGI library: the parsed cookies of the process environment
 // and what later calls fill in.
 typedef struct _tag_VELACGI_CTX_ VELACGI_CTX;
@@ -82,7 +85,9 @@ typedef struct _tag_VELACGI_SESSION_INFO_ {
 //                              idle timeout, the skip-IP flag and the options
 //                              read by VelaCgiGetOption and VelaCgiGetLang;
 //                              the last use becomes now unless `flags` holds
-//                              VELACGI_AUTH_NO_REFRESH.
+//                              VELACGI_AUTH_NO_REFRESH, once it is at least
+//                              VELA_SESSION_LAST_USE_STEP seconds old
+//                              (vela/session.h).
 // A last use or creation time in the future (the clock went back) counts as
 // now and is written back as now. `ctx`, `user` and `info` may be null.
 // `user` is "" unless the verdict is 1.
@@ -176,3 +181,5 @@ namespace CredRequestUtil {
 bool GetDecryptAESString(const std::string& key, const std::string& cipher, std::string& plain);
 }  // namespace CredRequestUtil
 }  // namespace VELA
+
+#pragma GCC visibility pop

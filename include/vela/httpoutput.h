@@ -71,7 +71,12 @@
 #include <cstdio>
 #include <string>
 
-class HTTPFileOutputer {
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
+class VELA_EXPORT HTTPFileOutputer {
 public:
     HTTPFileOutputer();
 
@@ -136,7 +141,7 @@ namespace VELA {
 namespace HTTP {
 
 // Fast output (X-Sendfile), process-wide.
-class FileOutputerHelper {
+class VELA_EXPORT FileOutputerHelper {
 public:
     // false switches fast output off for the rest of the process; true
     // lets it follow the deployment's configuration again (it cannot turn
@@ -148,3 +153,5 @@ public:
 
 }  // namespace HTTP
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -10,6 +10,9 @@
 
 #include <syslog.h>
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 namespace System {
 
@@ -32,3 +35,5 @@ void LogAt(int priority, const char* file, int line, const char* fmt, ...) __att
 
 #define VELA_LOG(priority, fmt, ...) ::VELA::System::LogAt((priority), __FILE__, __LINE__, fmt, ##__VA_ARGS__)
 #define VELA_LOG_ERR(fmt, ...) VELA_LOG(LOG_ERR, fmt, ##__VA_ARGS__)
+
+#pragma GCC visibility pop

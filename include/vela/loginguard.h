@@ -45,6 +45,11 @@
 // the session store's clock (VELA::Session::SetClockForTest in vela/session.h).
 #pragma once
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // Defaults and bounds of the settings.
 #define VELA_LOGIN_MAX_FAILURES_DEFAULT 5
 #define VELA_LOGIN_MAX_FAILURES_MAX 1000
@@ -69,7 +74,7 @@ namespace Session {
 //   session_lifetime       seconds, 1 .. VELA_SESSION_LIFETIME_MAX
 // A missing file or key keeps the default; a value that is not a decimal
 // number in range is logged and the default kept.
-struct LoginSettings {
+struct VELA_EXPORT LoginSettings {
     int maxFailures = VELA_LOGIN_MAX_FAILURES_DEFAULT;
     int windowMinutes = VELA_LOGIN_WINDOW_DEFAULT;
     int blockMinutes = VELA_LOGIN_BLOCK_DEFAULT;
@@ -114,3 +119,5 @@ int LoginGuardSucceeded(const LoginSettings* settings, const char* account, cons
 
 }  // namespace Session
 }  // namespace VELA
+
+#pragma GCC visibility pop

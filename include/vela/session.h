@@ -22,6 +22,11 @@
 #include <string>
 #include <vector>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // Characters of a session id and of an anti-forgery token.
 #define VELA_SESSION_ID_LEN 32
 #define VELA_SESSION_TOKEN_LEN 32
@@ -32,12 +37,18 @@
 #define VELA_SESSION_LIFETIME_DEFAULT 86400    // 24 hours after the login
 #define VELA_SESSION_LIFETIME_MAX (366 * 86400)
 
+// A request moves a session's "lastUse" only when it is at least this many
+// seconds old, so that a busy session's file is rewritten at most once per
+// step, not on every request. The idle timeout is counted from the last use
+// written: a session may be taken for idle up to this many seconds early.
+#define VELA_SESSION_LAST_USE_STEP 30
+
 namespace VELA {
 namespace Session {
 
 // What a new session holds besides its user and client address. Zero-filled
 // (Options{}) it gives the defaults.
-struct Options {
+struct VELA_EXPORT Options {
     int idleTimeout = 0;        // 0: VELA_SESSION_IDLE_DEFAULT; else 1 .. VELA_SESSION_IDLE_MAX
     int lifetime = 0;           // 0: VELA_SESSION_LIFETIME_DEFAULT; else 1 .. VELA_SESSION_LIFETIME_MAX
     bool skipIP = false;        // do not compare the client address on later requests
@@ -48,7 +59,7 @@ struct Options {
 };
 
 // A session as List reports it (the anti-forgery token is left out).
-struct Record {
+struct VELA_EXPORT Record {
     std::string sid;
     std::string user;
     std::string clientIP;  // "" when the session is bound to no address
@@ -92,3 +103,5 @@ void SetClockForTest(long long (*now)(void));
 
 }  // namespace Session
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -26,6 +26,11 @@
 #include <sys/types.h>
 #include <vector>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // The sharing-link header "X-Vela-Sharing" as the CGI environment presents it.
 #define SZ_X_SHARING_HEADER "HTTP_X_VELA_SHARING"
 
@@ -52,7 +57,7 @@ constexpr long long kMaxLiveSessions = 1024;
 namespace record {
 
 // One sharing link. Default-constructed: empty().
-class Entry {
+class VELA_EXPORT Entry {
 public:
     bool empty() const { return hash_.empty(); }
     const std::string& get_hash() const { return hash_; }
@@ -86,7 +91,7 @@ private:
 };
 
 // A visitor session. Default-constructed: empty().
-class Session {
+class VELA_EXPORT Session {
 public:
     bool empty() const { return sid_.empty(); }
     const std::string& get_session_id() const { return sid_; }
@@ -108,7 +113,7 @@ private:
 };
 
 // The binding of a visitor session to a link. Default-constructed: empty().
-class Token {
+class VELA_EXPORT Token {
 public:
     bool empty() const { return sid_.empty(); }
     const std::string& get_session_id() const { return sid_; }
@@ -173,7 +178,7 @@ namespace db {
 
 // The database handle, one per process, opened on the first Instance() (and
 // opened again in a child after fork, or when the system root changed).
-class SharingDB {
+class VELA_EXPORT SharingDB {
 public:
     static SharingDB& Instance();
     // True when the database is open and usable.
@@ -193,7 +198,7 @@ private:
 
 // Base of the table objects: opened on the handle, closed by Close() or
 // when destroyed.
-class Table {
+class VELA_EXPORT Table {
 public:
     explicit Table(SharingDB& db) : db_(&db) {}
     virtual ~Table() { Close(); }
@@ -212,7 +217,7 @@ private:
 };
 
 // What a new link is made of.
-struct LinkSpec {
+struct VELA_EXPORT LinkSpec {
     std::string projectName;
     std::string path;
     uid_t uid = static_cast<uid_t>(-1);
@@ -224,7 +229,7 @@ struct LinkSpec {
 };
 
 // A change of a link: only the members whose set* flag is true change.
-struct LinkUpdate {
+struct VELA_EXPORT LinkUpdate {
     bool setExpire = false;
     long long expireTime = 0;
     bool setPassword = false;
@@ -235,7 +240,7 @@ struct LinkUpdate {
     bool enableMatchIP = false;
 };
 
-class EntryDB : public Table {
+class VELA_EXPORT EntryDB : public Table {
 public:
     using Table::Table;
     // The link `hash`; false (entry empty) when there is none.
@@ -255,7 +260,7 @@ public:
     bool Revoke(const std::string& hash) const;
 };
 
-class SessionDB : public Table {
+class VELA_EXPORT SessionDB : public Table {
 public:
     using Table::Table;
     bool GetBySessionId(const std::string& sid, record::Session& session) const;
@@ -275,7 +280,7 @@ public:
     int PurgeExpired(long long graceSeconds) const;
 };
 
-class TokenDB : public Table {
+class VELA_EXPORT TokenDB : public Table {
 public:
     using Table::Table;
     // The token binding `session` to `entry`; false (token empty) when
@@ -286,3 +291,5 @@ public:
 }  // namespace db
 }  // namespace sharing
 }  // namespace VELA
+
+#pragma GCC visibility pop

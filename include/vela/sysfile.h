@@ -20,6 +20,9 @@
 #include <stddef.h>
 #include <sys/types.h>
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // ---- Last error ----------------------------------------------------------------
 // One record per process: the last failure a platform call (or a caller
 // through VLIBCErrSetEx) reported. Setting it replaces the previous record;
@@ -207,3 +210,5 @@ typedef struct _tag_VOLUME_INFO_ {
 // VLIBC_ERR_NOT_FOUND); -1 on invalid arguments (null info, unknown flags,
 // a sum that overflows).
 int VolumeAvailGet(unsigned long long bytes, PVOLUME_INFO info, unsigned long long reserveBytes, int flags);
+
+#pragma GCC visibility pop

@@ -33,9 +33,14 @@
 #include <sys/types.h>
 #include <vector>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace TARN {
 
-class Task {
+class VELA_EXPORT Task {
 public:
     // Names the task; nothing is read yet. isValid() tells whether owner and
     // id passed the name checks: every other call fails on an invalid task.
@@ -104,7 +109,7 @@ private:
     Json::Value record_;
 };
 
-class TaskUtil {
+class VELA_EXPORT TaskUtil {
 public:
     static const char* const kAdminOwner;  // "@administrators"
     static const char* const kUsersOwner;  // "@users"
@@ -125,7 +130,7 @@ public:
     static bool splitFullId(const std::string& full, std::string& owner, std::string& id);
 };
 
-class TaskMgr {
+class VELA_EXPORT TaskMgr {
 public:
     // The short ids of `owner`'s tasks, sorted; empty for an invalid owner.
     static std::vector<std::string> getAllTaskId(const std::string& owner);
@@ -137,3 +142,5 @@ public:
 };
 
 }  // namespace TARN
+
+#pragma GCC visibility pop

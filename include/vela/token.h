@@ -28,6 +28,11 @@
 #include <string>
 #include <vector>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 #define VELA_TOKEN_ID_LEN 22
 #define VELA_TOKEN_SECRET_LEN 43
 #define VELA_TOKEN_LEN (VELA_TOKEN_ID_LEN + 1 + VELA_TOKEN_SECRET_LEN)
@@ -36,7 +41,7 @@
 #define VELA_TOKEN_MAX_PATTERNS 32
 
 // A token as VelaAccessTokenList reports it (without its secret).
-struct VelaAccessTokenRecord {
+struct VELA_EXPORT VelaAccessTokenRecord {
     std::string id;
     std::string user;
     std::vector<std::string> apis;
@@ -75,3 +80,5 @@ int VelaAccessTokenRevoke(const char* id);
 
 // True when `pattern` is a valid api or method pattern as described above.
 bool VelaAccessTokenIsPattern(const std::string& pattern);
+
+#pragma GCC visibility pop

@@ -45,6 +45,9 @@
 #include "vela/cgi.h"
 #include "vela/vlibc.h"
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 namespace Transfer {
 // Progress of a read: `done` bytes of the body consumed out of `total`
@@ -178,3 +181,5 @@ PVLIBCSZHASH VelaCgiGetUploadFiles(VELACGI_CTX* ctx);
 // standard input afresh, and removes the process's private upload directory
 // (vela/uploaddir.h) with what it holds (tests).
 void VelaCgiUploadReset(void);
+
+#pragma GCC visibility pop

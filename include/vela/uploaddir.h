@@ -36,6 +36,9 @@
 
 #include <stddef.h>
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 #define VELA_UPLOAD_DIR_PREFIX "vela-upload-"
 #define VELA_UPLOAD_SWEEP_AGE 600
 
@@ -102,3 +105,5 @@ int UploadSweep(const char* base, unsigned minAgeSeconds);
 
 }  // namespace Transfer
 }  // namespace VELA
+
+#pragma GCC visibility pop

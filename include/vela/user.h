@@ -21,6 +21,9 @@
 
 #include <sys/types.h>
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // ---- Users ------------------------------------------------------------------------
 
 typedef struct _tag_VELAUSER_ {
@@ -133,3 +136,5 @@ bool ResetCredentialsForRunAs(const char* runAs, bool grantable);
 // that group when the owner has no NSS entry. `grantable` non-zero keeps the
 // saved user id 0. True on success.
 bool InitCredentialsByExecutable(const char* path, int grantable);
+
+#pragma GCC visibility pop

@@ -5,6 +5,9 @@
 #include <stddef.h>
 #include <string>
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 // ---- System root -----------------------------------------------------------
 
 namespace VELA {
@@ -167,3 +170,5 @@ int VELANetGetAddrType(const char* text);
 // the directory cannot be created or the buffer is too small.
 int VELAUserPreferenceDirGet(const char* user, char* buf, size_t size);
 int VELAGroupPreferenceDirGet(const char* group, char* buf, size_t size);
+
+#pragma GCC visibility pop

@@ -6,6 +6,9 @@
 
 #include "vela/vlibc.h"
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 namespace WebAPIUtil {
 
@@ -53,3 +56,5 @@ Json::Value SzHashToJsonObj(PVLIBCSZHASH hash);
 
 }  // namespace WebAPIUtil
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -14,11 +14,16 @@
 
 #include <string>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace velaw3 {
 
 // The web server the machine runs, as the configuration describes it. The
 // configuration is read by the constructor.
-class Engine {
+class VELA_EXPORT Engine {
 public:
     Engine();
 
@@ -38,7 +43,7 @@ private:
     int restartSignal_;
 };
 
-class TARN {
+class VELA_EXPORT TARN {
 public:
     explicit TARN(Engine& engine);
 
@@ -56,3 +61,5 @@ private:
 };
 
 }  // namespace velaw3
+
+#pragma GCC visibility pop

@@ -29,12 +29,20 @@
 #include <json/json.h>
 #include <string>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 class APIResponse;
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 class APIDownloadPrivate;
+#pragma GCC visibility pop
 
-class APIDownload {
+class VELA_EXPORT APIDownload {
 public:
     // With a response of its own, made without a request and deleted with
     // the download.
@@ -91,3 +99,5 @@ private:
 };
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -2,6 +2,9 @@
 // codes beside these; codes not listed here are theirs.
 #pragma once
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 enum _tag_WEBAPI_ERR {
     WEBAPI_ERR_NONE = 0,
     WEBAPI_ERR_BAD_REQUEST = 101,           // malformed request, or it could not be set up
@@ -58,3 +61,5 @@ enum _tag_HTTP_STATUS_CODE {
     HTTP_STATUS_INTERNAL_SERVER_ERROR = 500,
     HTTP_STATUS_SERVICE_UNAVAILABLE = 503,
 };
+
+#pragma GCC visibility pop

@@ -16,6 +16,9 @@
 #include "webapi/APIError.h"
 #include "webapi/APIResponse.h"
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 template <void (*Handler)(APIRequest*, APIResponse*), int code = WEBAPI_ERR_NO_RESPONSE>
@@ -33,3 +36,5 @@ void APIGuarded(APIRequest* req, APIResponse* resp)
 }
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

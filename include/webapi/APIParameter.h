@@ -14,6 +14,11 @@
 #include <json/json.h>
 #include <string>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 // Whether a parameter must be present: 0 means required, anything else
@@ -23,9 +28,12 @@ enum PARAM_NECESSITY {
     PARAM_OPTIONAL = 1,
 };
 
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 template <typename T> class APIParameterPrivate;
+#pragma GCC visibility pop
 
-template <typename T> class APIParameter {
+template <typename T> class VELA_EXPORT APIParameter {
 public:
     typedef bool (*Validator)(T const&);
 
@@ -74,34 +82,34 @@ private:
     APIParameterPrivate<T>* d_;
 };
 
-extern template class APIParameter<int>;
-extern template class APIParameter<long long>;
-extern template class APIParameter<unsigned int>;
-extern template class APIParameter<unsigned long long>;
-extern template class APIParameter<bool>;
-extern template class APIParameter<double>;
-extern template class APIParameter<std::string>;
-extern template class APIParameter<Json::Value>;
+extern template class VELA_EXPORT APIParameter<int>;
+extern template class VELA_EXPORT APIParameter<long long>;
+extern template class VELA_EXPORT APIParameter<unsigned int>;
+extern template class VELA_EXPORT APIParameter<unsigned long long>;
+extern template class VELA_EXPORT APIParameter<bool>;
+extern template class VELA_EXPORT APIParameter<double>;
+extern template class VELA_EXPORT APIParameter<std::string>;
+extern template class VELA_EXPORT APIParameter<Json::Value>;
 
 // Builds typed parameters from any JSON object (for example a sub-object of a
 // parameter). `obj` not an object: invalid. Member present: parsed and
 // validated as CheckValueTypeAndGet says. Member missing: invalid when
 // required, untouched when optional. Defaults are the caller's (SetDefault).
-template <typename T> class APIParameterFactoryBasicImpl {
+template <typename T> class VELA_EXPORT APIParameterFactoryBasicImpl {
 public:
     static APIParameter<T> FromJson(Json::Value const& obj, std::string const& name,
                                     PARAM_NECESSITY necessity, bool (*validator)(T const&) = nullptr);
 };
 
-extern template class APIParameterFactoryBasicImpl<int>;
-extern template class APIParameterFactoryBasicImpl<long long>;
-extern template class APIParameterFactoryBasicImpl<unsigned int>;
-extern template class APIParameterFactoryBasicImpl<unsigned long long>;
-extern template class APIParameterFactoryBasicImpl<bool>;
-extern template class APIParameterFactoryBasicImpl<double>;
-extern template class APIParameterFactoryBasicImpl<std::string>;
+extern template class VELA_EXPORT APIParameterFactoryBasicImpl<int>;
+extern template class VELA_EXPORT APIParameterFactoryBasicImpl<long long>;
+extern template class VELA_EXPORT APIParameterFactoryBasicImpl<unsigned int>;
+extern template class VELA_EXPORT APIParameterFactoryBasicImpl<unsigned long long>;
+extern template class VELA_EXPORT APIParameterFactoryBasicImpl<bool>;
+extern template class VELA_EXPORT APIParameterFactoryBasicImpl<double>;
+extern template class VELA_EXPORT APIParameterFactoryBasicImpl<std::string>;
 
-class APIParameterFactory {
+class VELA_EXPORT APIParameterFactory {
 public:
     // The member must be a JSON array.
     static APIParameter<Json::Value> ArrayFromJson(Json::Value const& obj, std::string const& name,
@@ -114,3 +122,5 @@ public:
 };
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -19,13 +19,21 @@
 #include <json/json.h>
 #include <string>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 class APIRequest;
 class APIResponse;
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 class APIPollingPrivate;
+#pragma GCC visibility pop
 
-class APIPolling {
+class VELA_EXPORT APIPolling {
 public:
     APIPolling();
     explicit APIPolling(APIRequest* request);
@@ -85,3 +93,5 @@ private:
 };
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

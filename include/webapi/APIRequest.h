@@ -17,9 +17,17 @@
 #include "vela/sharing.h"
 #include "webapi/APIParameter.h"
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 class APIRequestPrivate;
+#pragma GCC visibility pop
 
 // User classes an API admits (its description's "allowUser" list).
 enum {
@@ -39,7 +47,7 @@ enum {
     REQUEST_METHOD_HEAD = 3,
 };
 
-class APIRequest {
+class VELA_EXPORT APIRequest {
 public:
     typedef VELA::PARAM_NECESSITY PARAM_NECESSITY;
     static constexpr PARAM_NECESSITY REQUIRED = PARAM_REQUIRED;
@@ -207,3 +215,5 @@ extern template APIParameter<unsigned long long> APIRequest::GetAndCheckIntegral
     const std::string&, PARAM_NECESSITY, bool (*)(unsigned long long const&)) const;
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

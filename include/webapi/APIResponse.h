@@ -16,16 +16,24 @@
 
 #include "webapi/APIError.h"
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 class APIRequest;
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 class APIResponsePrivate;
+#pragma GCC visibility pop
 
 typedef void (*APICallbackFn)(void*);
 // Functions to run after the reply, in order, without duplicates.
 typedef std::vector<std::pair<APICallbackFn, void*>> APICallbackList;
 
-class APIResponse {
+class VELA_EXPORT APIResponse {
 public:
     // `request` may be null; it is not owned. The header "Content-type" starts
     // as JSON in UTF-8.
@@ -103,3 +111,5 @@ private:
 };
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -17,13 +17,21 @@
 
 #include "webapi/APITable.h"
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 class APIRequest;
 class APIResponse;
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 class APIRunnerPrivate;
+#pragma GCC visibility pop
 
-class APIRunner {
+class VELA_EXPORT APIRunner {
 public:
     // Creates an empty request and its response, makes the process lead a
     // new session and reads the defaults file lib.def.
@@ -167,3 +175,5 @@ protected:
 };
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

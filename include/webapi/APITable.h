@@ -20,6 +20,9 @@
 // other entry names.
 #pragma once
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 class APIRequest;
 class APIResponse;
@@ -78,3 +81,5 @@ typedef _tag_API_TABLE* (*GetAPITableFn)(void);
 typedef _tag_API_CHECK_TABLE* (*GetAPICheckTableFn)(void);
 typedef int (*GetAPISharingCheckTableFn)(_tag_API_SHARING_CHECK_TABLE** table);
 }
+
+#pragma GCC visibility pop

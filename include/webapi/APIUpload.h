@@ -23,10 +23,18 @@
 
 #include <json/json.h>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 class APIRequest;
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 class APIUploadPrivate;
+#pragma GCC visibility pop
 
 enum {
     UPLOAD_RESULT_SUCCESS = 1,
@@ -36,7 +44,7 @@ enum {
     UPLOAD_RESULT_MEMORY = -9,
 };
 
-class APIUpload {
+class VELA_EXPORT APIUpload {
 public:
     // `request` supplies the environment (CONTENT_LENGTH); it must outlive
     // this object.
@@ -65,3 +73,5 @@ private:
 };
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

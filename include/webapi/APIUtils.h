@@ -6,6 +6,11 @@
 #include <string>
 #include <sys/types.h>
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 // Gains effective uid and gid 0 for its scope and puts the recorded
@@ -14,7 +19,7 @@ namespace VELA {
 //
 //   RunAsRootGuard guard(__FILE__, __LINE__, "IF_RUN_AS");
 //   if (guard.Ok()) { ... }
-class RunAsRootGuard {
+class VELA_EXPORT RunAsRootGuard {
 public:
     RunAsRootGuard(const char* file, int line, const char* label);
     ~RunAsRootGuard();
@@ -35,7 +40,7 @@ private:
     if (::VELA::RunAsRootGuard _vela_root_guard{__FILE__, __LINE__, "IF_RUN_AS"}; \
         _vela_root_guard.Ok())
 
-class APIUtils {
+class VELA_EXPORT APIUtils {
 public:
     // Writes key="value" into the system information file
     // (<root>/etc/velainfo.conf) with full rights.
@@ -52,7 +57,7 @@ public:
 // compact JSON text. The ends are close-on-exec, so a program the child
 // starts does not keep the pipe open; an end put on a standard descriptor
 // with ReadOnly/WriteOnly is inherited as usual.
-class Pipe {
+class VELA_EXPORT Pipe {
 public:
     // The largest document ReadJson accepts (a bigger length is refused
     // before anything is allocated).
@@ -92,3 +97,5 @@ private:
 };
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -9,11 +9,19 @@
 
 #include "webapi/APIParameter.h"
 
+#include "vela/export.h"
+
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
+// Defined inside the library, not exported.
+#pragma GCC visibility push(hidden)
 class APIValidatorPrivate;
+#pragma GCC visibility pop
 
-class APIValidator {
+class VELA_EXPORT APIValidator {
 public:
     // The process-wide instance, created on first use (thread-safe).
     static APIValidator* GetInstance();
@@ -96,3 +104,5 @@ extern template bool APIValidator::IsLess<unsigned long long>(APIParameter<unsig
                                                               unsigned long long const&);
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

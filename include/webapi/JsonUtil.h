@@ -18,6 +18,9 @@
 #include <json/json.h>
 #include <string>
 
+// Exported from libwebapi-TARN5.so, whose other symbols are hidden.
+#pragma GCC visibility push(default)
+
 namespace VELA {
 
 // Parses `text` into `out`. Nesting deeper than 256 levels, trailing garbage
@@ -40,3 +43,5 @@ int JsonSearchArrayIndex(const Json::Value& array, const Json::Value& value);
 bool JsonFlag(const Json::Value& value, bool def = false);
 
 }  // namespace VELA
+
+#pragma GCC visibility pop

@@ -245,9 +245,14 @@ void FillInfo(const StoredSession& s, bool skip, VELACGI_SESSION_INFO* info)
     VELA::Session::CopyOut(s.lang, info->lang, sizeof(info->lang));
 }
 
+// True when a request at `now` moves a last use of `lastUse` forward: it is
+// at least VELA_SESSION_LAST_USE_STEP seconds old.
+bool LastUseDue(long long lastUse, long long now) { return now - lastUse >= VELA_SESSION_LAST_USE_STEP; }
+
 // Writes the new last use of session `sid` under the store lock: `now` when
-// `touch`, else only a last use in the future pulled back to now; a creation
-// time in the future becomes now as well. The file is read again under the
+// `touch` and the stored one is due (LastUseDue), else only a last use in
+// the future pulled back to now; a creation time in the future becomes now
+// as well. The file is read again under the
 // lock, so a session removed meanwhile stays removed: Load::NoSession then.
 // Load::Error when the lock or the write failed (logged).
 Load WriteLastUse(const std::string& sid, long long now, bool touch)
@@ -263,14 +268,15 @@ Load WriteLastUse(const std::string& sid, long long now, bool touch)
     if (loaded != Load::Ok) {
         return loaded;
     }
-    const long long lastUse = touch ? now : NotAfter(cur.lastUse, now);
+    const long long lastUse = touch && LastUseDue(cur.lastUse, now) ? now : NotAfter(cur.lastUse, now);
     const long long created = NotAfter(cur.created, now);
     if (lastUse == cur.lastUse && created == cur.created) {
         return Load::Ok;
     }
     doc["lastUse"] = static_cast<Json::Int64>(lastUse);
     doc["created"] = static_cast<Json::Int64>(created);
-    // Rewritten on nearly every request: no fsync (see WriteStateFile).
+    // Rewritten often (once per step of a busy session): no fsync (see
+    // WriteStateFile).
     return VELA::Session::WriteStateFile(SessionPath(sid), doc, false) ? Load::Ok : Load::Error;
 }
 
@@ -308,13 +314,13 @@ bool FromSessionAddress(const StoredSession& s, const std::string& id)
 }
 
 // Writes the use of the valid session `id` at `now` when there is anything
-// to write: the last use when `touch`, a time in the future pulled back in
-// any case. False when the session was removed meanwhile (logged). A failed
+// to write: the last use when `touch` and it is due (LastUseDue), a time in
+// the future pulled back in any case. False when the session was removed meanwhile (logged). A failed
 // write leaves the session as valid as it was read; the error is logged and
 // the request goes on.
 bool RecordUse(const StoredSession& s, const std::string& id, long long now, bool touch)
 {
-    if ((touch && s.lastUse != now) || s.lastUse > now || s.created > now) {
+    if ((touch && LastUseDue(s.lastUse, now)) || s.lastUse > now || s.created > now) {
         if (WriteLastUse(id, now, touch) == Load::NoSession) {
             VELA_LOG(kAuthLog, "session %s: removed during the check", LogId(id).c_str());
             return false;

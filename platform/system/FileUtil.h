@@ -7,8 +7,12 @@
 #include <sys/stat.h>
 #include <sys/types.h>
 
+#include "vela/export.h"
+
 namespace VELA {
 namespace System {
+
+// VELA_EXPORT: exported for the tests (see vela/export.h).
 
 // A file descriptor closed at the end of the scope.
 class ScopedFd {
@@ -65,11 +69,11 @@ enum class NoSymlinkResolve {
 // one before the last is not a directory, ENAMETOOLONG when `path` reaches
 // PATH_MAX, EINVAL when it is empty or holds a NUL, else the errno of the
 // failing open. Nothing is logged.
-int OpenNoSymlinks(const std::string& path, int flags, NoSymlinkResolve how = NoSymlinkResolve::kAuto);
+VELA_EXPORT int OpenNoSymlinks(const std::string& path, int flags, NoSymlinkResolve how = NoSymlinkResolve::kAuto);
 
 // write(2) until all `len` bytes are written, retrying on EINTR. False with
 // errno set on failure.
-bool WriteAll(int fd, const char* data, size_t len);
+VELA_EXPORT bool WriteAll(int fd, const char* data, size_t len);
 
 // Fills the new temporary file `fd` of an atomic replacement: fchmod to
 // `mode` (whatever the umask was), fchown to `uid`/`gid` unless both are -1,

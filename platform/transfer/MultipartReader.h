@@ -11,6 +11,7 @@
 #include <string>
 
 #include "vela/upload.h"
+#include "vela/export.h"
 
 namespace VELA {
 namespace Transfer {
@@ -29,7 +30,8 @@ constexpr size_t kMaxTransportPadding = 256;
 // string, other parameters ignored). False (and logged) for another type, a
 // missing or repeated boundary, or one that is not 1 to 70 RFC 2046 bchars
 // ending in a non-space.
-bool ParseMultipartContentType(const char* contentType, std::string& boundary);
+// Exported for the tests (vela/export.h).
+VELA_EXPORT bool ParseMultipartContentType(const char* contentType, std::string& boundary);
 
 // What the headers of one part say.
 struct MultipartPart {

@@ -197,6 +197,29 @@ TEST_F(SessionTest, IdleTimeoutAndLifetime)
     EXPECT_EQ(Now(), Read(used)["lastUse"].asInt64());
 }
 
+// A check moves the last use only once it is a step old; the idle timeout
+// counts from the last use written, so a session may time out up to a step
+// early.
+TEST_F(SessionTest, LastUseMovesInSteps)
+{
+    const int step = VELA_SESSION_LAST_USE_STEP;
+    const std::string sid = Create(Timed(100));
+    Steps(sid, {{step - 1, AUTH_RESULT_AUTHORIZED}});
+    EXPECT_EQ(kStart, Read(sid)["lastUse"].asInt64());
+    Steps(sid, {{1, AUTH_RESULT_AUTHORIZED}});
+    const long long written = Now();
+    EXPECT_EQ(written, Read(sid)["lastUse"].asInt64());
+    Steps(sid, {{step - 1, AUTH_RESULT_AUTHORIZED}});  // used, not written
+    EXPECT_EQ(written, Read(sid)["lastUse"].asInt64());
+    Steps(sid, {{100 - (step - 1) + 1, AUTH_RESULT_TIMEOUT}});  // idle for 101 s by the file, less in truth
+    EXPECT_EQ(written, Read(sid)["lastUse"].asInt64());
+
+    // A check without refresh never moves it, a step or not.
+    const std::string polled = Create(Timed(100));
+    Steps(polled, {{step, AUTH_RESULT_AUTHORIZED, VELACGI_AUTH_NO_REFRESH}});
+    EXPECT_EQ(Now() - step, Read(polled)["lastUse"].asInt64());
+}
+
 // The clock went back: a last use in the future counts as now, with a
 // refresh or without, and a creation in the future starts the lifetime now.
 TEST_F(SessionTest, TimesInTheFutureCountAsNow)
@@ -474,12 +497,15 @@ TEST_F(SessionTest, LanguageFromSessionOrHeader)
 // file must stay a valid session.
 TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
 {
-    const std::string sid = Create();
+    // Idle for a day at most: the processes' clocks drift apart by far more
+    // than the default idle timeout.
+    const std::string sid = Create(Timed(86400));
     const int kChecks = 50;
+    const long long step = VELA_SESSION_LAST_USE_STEP;
     const std::vector<int> failures = InChildren(8, [&](int) {
         int failed = 0;
         for (int i = 0; i < kChecks; ++i) {
-            Now() = kStart + i;  // every check has a new time to write
+            Now() = kStart + i * step;  // every check has a new time to write
             char user[493];
             const int verdict = VelaCgiIsAuthorizedEx(nullptr, sid.c_str(), user, sizeof(user), nullptr, 0);
             failed += verdict != AUTH_RESULT_AUTHORIZED || strcmp(user, "root") != 0 ? 1 : 0;
@@ -490,8 +516,8 @@ TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
     const Json::Value doc = Read(sid);
     EXPECT_EQ(sid, doc["id"].asString());
     EXPECT_GE(doc["lastUse"].asInt64(), kStart);
-    EXPECT_LT(doc["lastUse"].asInt64(), kStart + kChecks);
-    Now() = kStart + kChecks;
+    EXPECT_LT(doc["lastUse"].asInt64(), kStart + kChecks * step);
+    Now() = kStart + kChecks * step;
     EXPECT_EQ(AUTH_RESULT_AUTHORIZED, Check(sid));
 
     // No temporary file is left behind.
@@ -505,11 +531,11 @@ TEST_F(SessionTest, ConcurrentProcessesShareOneSession)
 TEST_F(SessionTest, RemovalWinsOverConcurrentRefresh)
 {
     for (int round = 0; round < 5; ++round) {
-        const std::string sid = Create();
+        const std::string sid = Create(Timed(86400));  // see ConcurrentProcessesShareOneSession
         Children children(4, [&](int) {
             bool removed = false;
             for (int i = 1; i <= 200; ++i) {
-                Now() = kStart + i;
+                Now() = kStart + i * VELA_SESSION_LAST_USE_STEP;  // every check has a new time to write
                 const int verdict = Check(sid);
                 if (verdict == AUTH_RESULT_NO_SESSION) {
                     removed = true;

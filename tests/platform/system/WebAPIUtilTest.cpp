@@ -5,6 +5,9 @@
 #include "support/LinearTime.h"
 #include "vela/webapiutil.h"
 
+#include <thread>
+#include <vector>
+
 namespace {
 
 using namespace VELA::WebAPIUtil;
@@ -40,6 +43,30 @@ TEST(WebAPIUtil, ParseJsonStrictnessAndDepthLimit)
     for (const auto& [text, ok] : cases) {
         EXPECT_EQ(ok, ParseJson(text, out)) << text.substr(0, 40);
     }
+}
+
+// Each thread keeps one reader for all its parses: an answer must not depend
+// on what the thread parsed before (failures half-way through included).
+TEST(WebAPIUtil, ParseJsonAnswerDoesNotDependOnEarlierParses)
+{
+    const std::vector<std::string> texts = {
+        "{\"a\":[1,2,{\"b\":", "{\"a\":1}", "{\"a\":1,\"a\":2}", "[true,null]", "[1,]", "\"s\"", Nested(257, "1"),
+        Nested(256, "1"), "{\"k\":\"v\"} x", "{}", "\"\\u12\"", "-0.5e3",
+    };
+    // The answer of each text in a thread that parsed nothing before.
+    std::vector<std::pair<bool, Json::Value>> fresh(texts.size());
+    for (size_t i = 0; i < texts.size(); ++i) {
+        std::thread([&, i] { fresh[i].first = ParseJson(texts[i], fresh[i].second); }).join();
+    }
+    for (int round = 0; round < 2; ++round) {
+        for (size_t i = 0; i < texts.size(); ++i) {
+            Json::Value out;
+            EXPECT_EQ(fresh[i].first, ParseJson(texts[i], out)) << texts[i].substr(0, 40);
+            EXPECT_EQ(fresh[i].second, out) << texts[i].substr(0, 40);
+        }
+    }
+    EXPECT_TRUE(fresh[1].first);
+    EXPECT_FALSE(fresh[0].first);
 }
 
 TEST(WebAPIUtil, ReadJsonFileLimits)
