@@ -1,7 +1,9 @@
 #!/usr/bin/env bash
 # The main job: installs what is missing, builds, and serves the web API
 # through lighttpd at http://127.0.0.1:<port>/webapi/entry.cgi (port 8080, or
-# VELA_PORT). lighttpd runs in the background; scripts/stop.sh stops it.
+# VELA_PORT). lighttpd runs in the background; scripts/stop.sh stops it. The
+# front end is the FastCGI server velafcgi, which lighttpd starts and stops;
+# VELA_FRONT_END=cgi runs the CGI program velascgi for every request instead.
 #
 # The system root is VELA_ROOT when set, "/" when the web-API directory is
 # installed there (/usr/vela/velaman/webapi/lib.def), and otherwise
@@ -99,7 +101,8 @@ fi
 cat <<EOF
 The web API answers at $url
   lighttpd pid $(cat "$pidfile"), configuration $run/lighttpd.conf
-  logs $run/error.log (server) and $run/cgi.log (velascgi)
+  front end ${VELA_FRONT_END:-fcgi} (VELA_FRONT_END=cgi or fcgi)
+  logs $run/error.log (server) and $run/cgi.log (the front end)
   system root $root
 
 Every sample method needs a login. Without one the answer is error 119:

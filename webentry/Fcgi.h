@@ -49,11 +49,21 @@ struct Slot {
 // the process's exit status.
 int RunParent(int listenFd, const Options& options, int argc, char** argv);
 
+// The parent's slots: one page each, so that a child keeps its own page
+// mapped and no other.
+struct SlotArea {
+    char* base = nullptr;
+    size_t page = 0;
+    int count = 0;
+    Slot& At(int i) const { return *reinterpret_cast<Slot*>(base + static_cast<size_t>(i) * page); }
+};
+
 // The child's side: serves the request `req`, already accepted and with its
-// parameters read, through `entry`, then ends the process. `closeFds` are
-// descriptors of the parent the child must not keep.
-[[noreturn]] void ServeChild(FCGX_Request& req, WebEntry& entry, Slot& slot, const Options& options,
-                             const std::vector<int>& closeFds, int argc, char** argv);
+// parameters read, through `entry`, then ends the process. It keeps slot
+// `own` of `slots` and unmaps the others before anything else runs;
+// `closeFds` are descriptors of the parent it must not keep.
+[[noreturn]] void ServeChild(FCGX_Request& req, WebEntry& entry, const SlotArea& slots, int own,
+                             const Options& options, const std::vector<int>& closeFds, int argc, char** argv);
 
 // The environment of a request: only the server's own variables of
 // `options`, then the request's parameters, except names that a request

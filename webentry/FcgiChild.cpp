@@ -16,6 +16,7 @@
 #include <poll.h>
 #include <pthread.h>
 #include <sys/eventfd.h>
+#include <sys/mman.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -289,9 +290,19 @@ bool SetRequestEnvironment(char** params, const Options& options)
     return true;
 }
 
-void ServeChild(FCGX_Request& req, WebEntry& entry, Slot& slot, const Options& options,
+void ServeChild(FCGX_Request& req, WebEntry& entry, const SlotArea& slots, int own, const Options& options,
                 const std::vector<int>& closeFds, int argc, char** argv)
 {
+    // The other children's slots are no business of this one (nor of the
+    // handler it runs, whatever identity that takes).
+    if (own > 0) {
+        munmap(slots.base, static_cast<size_t>(own) * slots.page);
+    }
+    if (own + 1 < slots.count) {
+        munmap(slots.base + static_cast<size_t>(own + 1) * slots.page,
+               static_cast<size_t>(slots.count - own - 1) * slots.page);
+    }
+    Slot& slot = slots.At(own);
     struct sigaction dfl {};
     dfl.sa_handler = SIG_DFL;
     for (int sig : {SIGTERM, SIGINT, SIGCHLD, SIGALRM, SIGPIPE, SIGHUP, SIGUSR1}) {

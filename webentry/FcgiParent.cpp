@@ -138,7 +138,7 @@ private:
     int argc_;
     char** argv_;
     int cap_ = 1;
-    Slot* slots_ = nullptr;
+    SlotArea slots_;
     std::vector<Child> children_;
     std::unique_ptr<WebEntry> entry_;
     std::set<std::string> warmApis_;
@@ -186,7 +186,7 @@ int Parent::FreeSlot() const
 
 void Parent::Ended(Child& child, int status)
 {
-    Slot& slot = slots_[child.slot];
+    Slot& slot = slots_.At(child.slot);
     const int state = slot.state.load();
     if (state != kReplyEnded) {
         const std::string how = WIFSIGNALED(status) ? "was killed by signal " + std::to_string(WTERMSIG(status))
@@ -374,15 +374,15 @@ void Parent::Accept()
         FCGX_Free(&req, 0);
         return;
     }
-    slots_[slot].state.store(kNothingSent);
-    slots_[slot].api[0] = '\0';
+    slots_.At(slot).state.store(kNothingSent);
+    slots_.At(slot).api[0] = '\0';
     std::vector<int> closeFds{listenFd_};
     for (const Child& c : children_) {
         closeFds.push_back(c.fd);
     }
     const pid_t pid = fork();
     if (pid == 0) {
-        ServeChild(req, *entry_, slots_[slot], options_, closeFds, argc_, argv_);
+        ServeChild(req, *entry_, slots_, slot, options_, closeFds, argc_, argv_);
     }
     if (pid < 0) {
         VELA_LOG_ERR("cannot fork the request's child[%m]");
@@ -403,15 +403,18 @@ void Parent::Accept()
 int Parent::Run()
 {
     cap_ = std::max(1, options_.maxChildren);
-    void* page = mmap(nullptr, sizeof(Slot) * static_cast<size_t>(cap_), PROT_READ | PROT_WRITE,
+    const long pageSize = sysconf(_SC_PAGESIZE);
+    slots_.page = pageSize > static_cast<long>(sizeof(Slot)) ? static_cast<size_t>(pageSize) : 4096;
+    slots_.count = cap_;
+    void* area = mmap(nullptr, slots_.page * static_cast<size_t>(cap_), PROT_READ | PROT_WRITE,
                       MAP_SHARED | MAP_ANONYMOUS, -1, 0);
-    if (page == MAP_FAILED) {
+    if (area == MAP_FAILED) {
         VELA_LOG_ERR("cannot map the children's slots[%m]");
         return 1;
     }
-    slots_ = static_cast<Slot*>(page);
+    slots_.base = static_cast<char*>(area);
     for (int i = 0; i < cap_; ++i) {
-        new (&slots_[i]) Slot();
+        new (&slots_.At(i)) Slot();
     }
     children_.reserve(static_cast<size_t>(cap_));
 

@@ -308,7 +308,7 @@ int main(int argc, char** argv)
             sigaction(SIGTERM, &dfl, nullptr);
             sigaction(SIGINT, &dfl, nullptr);
             sigaction(SIGCHLD, &dfl, nullptr);
-            _exit(VELA::Fcgi::RunParent(listenFd, each, argc, argv));
+            exit(VELA::Fcgi::RunParent(listenFd, each, argc, argv));
         }
         if (pid < 0) {
             VELA_LOG_ERR("cannot fork a parent[%m]");
