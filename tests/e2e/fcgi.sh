@@ -13,6 +13,9 @@ srv_args VELASCGI WEBAPI PIPE_LIB SRC -- "$@"
 srv_require "velafcgi runs as root under the server" pgrep
 
 export VELA_FRONT_END=fcgi
+# A sanitizer build leaves the crash below to the kernel, so that the child
+# dies of SIGSEGV as it would in a plain build (and no report is written).
+[ -z "${ASAN_OPTIONS:-}" ] || export ASAN_OPTIONS="$ASAN_OPTIONS:handle_segv=0"
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 describe() {
   srv_api VELA.Pipe.Sub <<EOF
