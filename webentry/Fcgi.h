@@ -10,6 +10,7 @@
 #pragma once
 
 #include <atomic>
+#include <csignal>
 #include <cstddef>
 #include <string>
 #include <vector>
@@ -71,6 +72,16 @@ struct SlotArea {
 // plain variable names. False, logged, when the parameters are more than
 // 1000 or 1 MiB.
 bool SetRequestEnvironment(char** params, const Options& options);
+
+// Writes all of `length` bytes to `fd`, through interruptions. False when
+// the descriptor refused them (a reader gone: EPIPE, never SIGPIPE, since
+// the processes of velafcgi ignore or block it where they write).
+bool WriteFully(int fd, const void* data, size_t length);
+
+// Runs `onStop` for SIGTERM and SIGINT and `onChild` for SIGCHLD (no
+// restart of interrupted calls) and blocks the three; the mask from before
+// goes to `waiting` without them, for the waits that take them.
+void CatchStopAndChildren(void (*onStop)(int), void (*onChild)(int), sigset_t& blocked, sigset_t& waiting);
 
 // Writes a whole reply (CGI header lines and body) to a FastCGI connection as
 // one stdout stream followed by the end of the request. False when the

@@ -65,22 +65,6 @@ size_t NameLength(const char* entry)
     return static_cast<size_t>(eq - entry);
 }
 
-bool WriteAll(int fd, const char* p, size_t left)
-{
-    while (left > 0) {
-        const ssize_t n = write(fd, p, left);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return false;
-        }
-        p += n;
-        left -= static_cast<size_t>(n);
-    }
-    return true;
-}
-
 // The two directions of the reply and their threads.
 struct Bridge {
     FCGX_Request* req = nullptr;
@@ -154,7 +138,7 @@ void* PumpIn(void* arg)
     while (b.bodyLeft > 0) {
         const int want = static_cast<int>(std::min<long long>(b.bodyLeft, sizeof(buffer)));
         const int n = FCGX_GetStr(buffer, want, b.req->in);
-        if (n <= 0 || !WriteAll(b.inWrite, buffer, static_cast<size_t>(n))) {
+        if (n <= 0 || !WriteFully(b.inWrite, buffer, static_cast<size_t>(n))) {
             break;
         }
         b.bodyLeft -= n;

@@ -54,22 +54,6 @@ void Header(unsigned char* h, unsigned char type, int requestId, size_t length)
     h[7] = 0;
 }
 
-bool Send(int fd, const unsigned char* p, size_t left)
-{
-    while (left > 0) {
-        const ssize_t n = send(fd, p, left, MSG_NOSIGNAL);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return false;
-        }
-        p += n;
-        left -= static_cast<size_t>(n);
-    }
-    return true;
-}
-
 // What one child is doing.
 struct Child {
     pid_t pid = -1;
@@ -418,25 +402,15 @@ int Parent::Run()
     }
     children_.reserve(static_cast<size_t>(cap_));
 
-    struct sigaction sa {};
-    sigemptyset(&sa.sa_mask);
-    sa.sa_handler = OnStop;
-    sigaction(SIGTERM, &sa, nullptr);
-    sigaction(SIGINT, &sa, nullptr);
-    sa.sa_handler = OnWake;
-    sigaction(SIGCHLD, &sa, nullptr);
-    sigaction(SIGALRM, &sa, nullptr);
     // Stop and child signals only while waiting for work, so that no
-    // signal falls between a check and the wait.
+    // signal falls between a check and the wait; the alarm interrupts the
+    // reading of a request's parameters.
     sigset_t blocked, waiting;
-    sigemptyset(&blocked);
-    sigaddset(&blocked, SIGTERM);
-    sigaddset(&blocked, SIGINT);
-    sigaddset(&blocked, SIGCHLD);
-    sigprocmask(SIG_BLOCK, &blocked, &waiting);
-    sigdelset(&waiting, SIGTERM);
-    sigdelset(&waiting, SIGINT);
-    sigdelset(&waiting, SIGCHLD);
+    CatchStopAndChildren(OnStop, OnWake, blocked, waiting);
+    struct sigaction alarmAction {};
+    sigemptyset(&alarmAction.sa_mask);
+    alarmAction.sa_handler = OnWake;
+    sigaction(SIGALRM, &alarmAction, nullptr);
 
     KeepOwnEnvironment();
     Rebuild();
@@ -477,6 +451,42 @@ int Parent::Run()
 
 }  // namespace
 
+bool WriteFully(int fd, const void* data, size_t left)
+{
+    const char* p = static_cast<const char*>(data);
+    while (left > 0) {
+        const ssize_t n = write(fd, p, left);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            return false;
+        }
+        p += n;
+        left -= static_cast<size_t>(n);
+    }
+    return true;
+}
+
+void CatchStopAndChildren(void (*onStop)(int), void (*onChild)(int), sigset_t& blocked, sigset_t& waiting)
+{
+    struct sigaction sa {};
+    sigemptyset(&sa.sa_mask);
+    sa.sa_handler = onStop;
+    sigaction(SIGTERM, &sa, nullptr);
+    sigaction(SIGINT, &sa, nullptr);
+    sa.sa_handler = onChild;
+    sigaction(SIGCHLD, &sa, nullptr);
+    sigemptyset(&blocked);
+    sigaddset(&blocked, SIGTERM);
+    sigaddset(&blocked, SIGINT);
+    sigaddset(&blocked, SIGCHLD);
+    sigprocmask(SIG_BLOCK, &blocked, &waiting);
+    sigdelset(&waiting, SIGTERM);
+    sigdelset(&waiting, SIGINT);
+    sigdelset(&waiting, SIGCHLD);
+}
+
 bool WriteWholeReply(int fd, int requestId, const char* text, size_t length)
 {
     // The reply is small; a web server that does not read it within a few
@@ -487,7 +497,7 @@ bool WriteWholeReply(int fd, int requestId, const char* text, size_t length)
     while (length > 0) {
         const size_t part = std::min<size_t>(length, 65535);
         Header(h, kStdout, requestId, part);
-        if (!Send(fd, h, sizeof(h)) || !Send(fd, reinterpret_cast<const unsigned char*>(text), part)) {
+        if (!WriteFully(fd, h, sizeof(h)) || !WriteFully(fd, reinterpret_cast<const unsigned char*>(text), part)) {
             return false;
         }
         text += part;
@@ -497,7 +507,7 @@ bool WriteWholeReply(int fd, int requestId, const char* text, size_t length)
     Header(end, kStdout, requestId, 0);
     Header(end + 8, kEndRequest, requestId, 8);
     memset(end + 16, 0, 8);  // application status 0, request complete
-    return Send(fd, end, sizeof(end));
+    return WriteFully(fd, end, sizeof(end));
 }
 
 int RunParent(int listenFd, const Options& options, int argc, char** argv)

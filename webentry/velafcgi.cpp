@@ -283,19 +283,8 @@ int main(int argc, char** argv)
         return 1;
     }
 
-    struct sigaction sa {};
-    sigemptyset(&sa.sa_mask);
-    sa.sa_handler = OnStop;
-    sigaction(SIGTERM, &sa, nullptr);
-    sigaction(SIGINT, &sa, nullptr);
-    sa.sa_handler = OnChild;
-    sigaction(SIGCHLD, &sa, nullptr);
     sigset_t blocked, waiting;
-    sigemptyset(&blocked);
-    sigaddset(&blocked, SIGTERM);
-    sigaddset(&blocked, SIGINT);
-    sigaddset(&blocked, SIGCHLD);
-    sigprocmask(SIG_BLOCK, &blocked, &waiting);
+    VELA::Fcgi::CatchStopAndChildren(OnStop, OnChild, blocked, waiting);
 
     std::vector<pid_t> running(static_cast<size_t>(parents), -1);
     std::vector<time_t> started(static_cast<size_t>(parents), 0);
