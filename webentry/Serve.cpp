@@ -96,9 +96,12 @@ void ServeCgiRequest(int argc, char** argv, WebEntry* entry)
             entry->SetArgs(argc, argv);
             entry->Run(Json::Value());
         } else {
-            WebEntry own;
-            own.SetArgs(argc, argv);
-            own.Run(Json::Value());
+            // The process ends with the call: its runner is not taken apart
+            // piece by piece, the system takes the memory back at once.
+            static WebEntry* own = nullptr;
+            own = new WebEntry();
+            own->SetArgs(argc, argv);
+            own->Run(Json::Value());
         }
     } catch (const std::exception& e) {
         VELA_LOG_ERR("request aborted: %s", e.what());
