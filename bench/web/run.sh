@@ -840,28 +840,72 @@ remove_uploads() {
     fi
 }
 
+# ---- memory of a front end ---------------------------------------------------------
+
+# mem_begin FRONT / mem_end FRONT: around one transfer through FRONT, the
+# peak resident memory of every process of FRONT that took part goes to
+# PEAK ("velascgi N KiB", or "master N, parents N, request child N KiB")
+# and the largest of them (KiB) to PEAK_MAX; for velafcgi, NOCHILD is 1 when
+# the samples saw no request child.
+PEAK="" PEAK_MAX=0 NOCHILD=0
+mem_begin() {
+    if [ "$1" = cgi ]; then
+        : >"$MEMLOG"
+    else
+        fcgi_mem_start
+    fi
+}
+mem_end() {
+    local -a m
+    NOCHILD=0
+    if [ "$1" = cgi ]; then
+        PEAK_MAX=$(peak_kib "$MEMLOG")
+        PEAK="velascgi $PEAK_MAX KiB"
+    else
+        read -r -a m <<<"$(fcgi_mem_stop)"
+        PEAK="master ${m[0]}, parents ${m[1]}, request child ${m[2]} KiB"
+        [ "${m[3]}" = 0 ] && NOCHILD=1 && PEAK+=" (no request child sampled)"
+        PEAK_MAX=$(printf '%s\n' "${m[@]:0:3}" | largest)
+    fi
+}
+front_name() { if [ "$1" = cgi ]; then echo velascgi; else echo velafcgi; fi; }
+# serve_fronts XSENDFILE: a server for each front end measured, side by side.
+serve_fronts() {
+    uses fcgi && serve fcgi "$VELAFCGI" "$1" keep
+    uses cgi && serve cgi "$VELASCGI_MEM" "$1" keep
+    return 0
+}
+# mem_goal KIB NOCHILD: the verdict on peak memory under 16 MiB.
+mem_goal() {
+    if [ "$2" = 1 ]; then
+        echo "not known: a request child was not sampled"
+    else
+        verdict "$1" 16383 at-most
+    fi
+}
+
 # ---- upload ------------------------------------------------------------------------
 
-# upload_via QUERY NAME: one upload of the data file through velascgi; its
-# wall time goes to T, its peak RSS to PEAK; the first answer is printed.
-PEAK=0
+# upload_via QUERY NAME FRONT: one upload of the data file through FRONT;
+# its wall time goes to T, the peak memory to PEAK and PEAK_MAX (mem_end);
+# the first answer is printed.
 upload_via() {
-    local query=$1 name=$2 code answer=$work/upload-answer.txt t
-    : >"$MEMLOG"
+    local query=$1 name=$2 front=$3 code answer=$work/upload-answer.txt t
+    mem_begin "$front"
     timed curl -sS -o "$answer" -w '%{http_code}' -H 'Expect:' "${COOKIE_ARGS[@]}" \
-        -F "file=@$DATA;type=application/octet-stream" "$BASE/webapi/entry.cgi?$query" >"$work/code" ||
-        die "curl upload to $name failed"
+        -F "file=@$DATA;type=application/octet-stream" "${LT_BASE[$front]}/webapi/entry.cgi?$query" >"$work/code" ||
+        die "curl upload to $name through $(front_name "$front") failed"
     t=$T
+    mem_end "$front"
     code=$(cat "$work/code")
     if [ "$code" != 200 ] || ! grep -q '"success":true' "$answer"; then
         echo "upload answer of $name (HTTP $code): $(head -c 600 "$answer")" >&2
-        die "the upload through velascgi failed"
+        die "the upload through $(front_name "$front") failed"
     fi
     if [[ $ANSWERED != *" $name "* ]]; then
         echo "$name answer: $(head -c 300 "$answer")"
         ANSWERED+=" $name "
     fi
-    PEAK=$(peak_kib "$MEMLOG")
     remove_uploads
     sync
     T=$t
@@ -870,51 +914,74 @@ ANSWERED=" "
 
 bench_upload() {
     make_data
-    serve cgi "$VELASCGI_MEM" 0
+    serve_fronts 0
     prepare_login || true
-    echo "== upload of $SIZE_MB MiB: velascgi multipart vs cat into a file on the same disk =="
+    echo "== upload of $SIZE_MB MiB: $(for f in $FRONT_ENDS; do printf '%s ' "$(front_name "$f")"; done)multipart vs cat into a file on the same disk =="
     echo "lighttpd server.stream-request-body = $(server_setting server.stream-request-body)"
     echo "receive: VELA.Bench.Transfer receive, the framework's upload path and nothing else;"
     echo "sample:  VELA.Sample upload, which reads each stored file again for its cksum"
-    local r tc tr ts tsh pr ps all_c="" all_r="" all_s="" all_sh="" peaks=""
+    echo "peak RSS: velascgi's from wait4 (a wrapper); velafcgi's from VmHWM of every process, sampled every 50 ms"
+    local r tc tsh front q line
+    local -A all=() peaks=() nochild=()
     for r in $(seq 1 "$XROUNDS"); do
         sync
         timed cat "$DATA" >"$VOLUME/cat-copy.bin" || die "cat failed"
         tc=$T
         rm -f "$VOLUME/cat-copy.bin"
         sync
-        upload_via "$RECEIVE_QUERY" receive
-        tr=$T
-        pr=$PEAK
-        upload_via "$UPLOAD_QUERY" sample
-        ts=$T
-        ps=$PEAK
+        all[cat]+="$(mbps "$BYTES" "$tc") "
+        line=$(printf 'round %d: cat %.1f MB/s' "$r" "$(mbps "$BYTES" "$tc")")
+        for front in $FRONT_ENDS; do
+            for q in receive sample; do
+                if [ "$q" = receive ]; then
+                    upload_via "$RECEIVE_QUERY" receive "$front"
+                else
+                    upload_via "$UPLOAD_QUERY" sample "$front"
+                fi
+                all[$front-$q]+="$(mbps "$BYTES" "$T") "
+                peaks[$front]+="$PEAK_MAX "
+                [ "$NOCHILD" = 1 ] && nochild[$front]=1
+                line+=$(printf '\n  %s %-7s %7.1f MB/s (peak RSS %s)' "$(front_name "$front")" "$q" "$(mbps "$BYTES" "$T")" "$PEAK")
+            done
+        done
         timed curl -sS -o /dev/null -H 'Expect:' -F "file=@$DATA;type=application/octet-stream" \
             "$BASE/bench/cat_upload.sh" || die "curl upload to the shell CGI failed"
         tsh=$T
         rm -f "$work/cgi-upload.out"
         sync
-
-        printf 'round %d: cat %7.1f MB/s   receive %7.1f MB/s (peak RSS %s KiB)   sample %7.1f MB/s (peak RSS %s KiB)   shell CGI cat %7.1f MB/s\n' \
-            "$r" "$(mbps "$BYTES" "$tc")" "$(mbps "$BYTES" "$tr")" "$pr" "$(mbps "$BYTES" "$ts")" "$ps" "$(mbps "$BYTES" "$tsh")"
-        all_c+="$(mbps "$BYTES" "$tc") "
-        all_r+="$(mbps "$BYTES" "$tr") "
-        all_s+="$(mbps "$BYTES" "$ts") "
-        all_sh+="$(mbps "$BYTES" "$tsh") "
-        peaks+="$pr $ps "
+        all[shell]+="$(mbps "$BYTES" "$tsh") "
+        line+=$(printf '\n  shell CGI cat %7.1f MB/s' "$(mbps "$BYTES" "$tsh")")
+        echo "$line"
     done
-    local mc mr ms msh mp
-    mc=$(echo "$all_c" | median)
-    mr=$(echo "$all_r" | median)
-    ms=$(echo "$all_s" | median)
-    msh=$(echo "$all_sh" | median)
-    mp=$(echo "$peaks" | largest)
-    printf 'median:  cat %.1f MB/s   receive %.1f MB/s = %s (goal >= 85%%: %s)   sample %.1f MB/s = %s (%s)\n' \
-        "$mc" "$mr" "$(percent "$mr" "$mc")" "$(at_least "$(ratio "$mr" "$mc")" 0.85)" \
-        "$ms" "$(percent "$ms" "$mc")" "$(at_least "$(ratio "$ms" "$mc")" 0.85)"
-    printf '         shell CGI cat through the same lighttpd %.1f MB/s (receive is %s of it)\n' "$msh" "$(percent "$mr" "$msh")"
-    printf 'velascgi peak RSS: %s KiB = %.1f MiB (goal < 16 MiB: %s)\n' "$mp" "$(awk -v k="$mp" 'BEGIN { print k / 1024 }')" \
-        "$(awk -v k="$mp" 'BEGIN { print (k < 16384) ? "met" : "MISSED" }')"
+    local mc msh m mp rt
+    mc=$(echo "${all[cat]}" | median)
+    msh=$(echo "${all[shell]}" | median)
+    echo "median of $XROUNDS rounds:"
+    printf '  %-22s %7.1f MB/s\n' "cat into a file" "$mc"
+    printf '  %-22s %7.1f MB/s (the same bytes through the same lighttpd into a shell CGI)\n' "shell CGI cat" "$msh"
+    if [ "$(ratio "$msh" "$mc")" != n/a ] && [ "$(verdict "$(ratio "$msh" "$mc")" 0.85)" != "goal met" ]; then
+        echo "  lighttpd bounds the uploads here: a shell CGI that only runs cat reaches $(percent "$msh" "$mc") of cat,"
+        echo "  so the front ends are better judged against it than against cat"
+    fi
+    for front in $FRONT_ENDS; do
+        for q in receive sample; do
+            m=$(echo "${all[$front-$q]}" | median)
+            rt=$(ratio "$m" "$mc")
+            line=$(printf '  %-22s %7.1f MB/s = %s of cat (goal >= 85%%: %s), %s of the shell CGI cat' \
+                "$(front_name "$front") $q" "$m" "$(percent "$m" "$mc")" "$(verdict "$rt" 0.85)" "$(percent "$m" "$msh")")
+            if [ "$front" = fcgi ] && uses cgi; then
+                rt=$(ratio "$m" "$(echo "${all[cgi-$q]}" | median)")
+                line+=$(printf '; %sx velascgi (goal >= 1x: %s)' "$rt" "$(verdict "$rt" 1)")
+            fi
+            echo "$line"
+        done
+    done
+    for front in $FRONT_ENDS; do
+        mp=$(echo "${peaks[$front]}" | largest)
+        printf '  %s peak RSS, largest process of any upload: %s KiB = %.1f MiB (goal < 16 MiB in every process: %s)\n' \
+            "$(front_name "$front")" "$mp" "$(awk -v k="$mp" 'BEGIN { print k / 1024 }')" "$(mem_goal "$mp" "${nochild[$front]:-0}")"
+    done
+    echo "  (the machine is shared: load average $(loadavg))"
 }
 
 # ---- download ----------------------------------------------------------------------
@@ -926,55 +993,71 @@ bench_download() {
         label="X-Sendfile on: lighttpd sends the file"
         fast_output yes
     else
-        label="X-Sendfile off: velascgi streams the file"
+        label="X-Sendfile off: the front end streams the file"
         fast_output no
     fi
-    serve cgi "$VELASCGI_MEM" "$xsendfile"
+    serve_fronts "$xsendfile"
     prepare_login || true
     ln -sf "$DATA" "$DOCROOT/bench/static.bin"
-    echo "== download of $SIZE_MB MiB: velascgi ($label) vs cat of the file =="
+    echo "== download of $SIZE_MB MiB: $(for f in $FRONT_ENDS; do printf '%s ' "$(front_name "$f")"; done)($label) vs cat of the file =="
     echo "lighttpd server.stream-response-body = $(server_setting server.stream-response-body)"
-    local r meta tc tv ts tt peak all_c="" all_v="" all_s="" all_t="" peaks=""
+    local r meta tc ts tt front line
+    local -A all=() peaks=() nochild=()
     for r in $(seq 1 "$XROUNDS"); do
         timed cat "$DATA" >/dev/null || die "cat failed"
         tc=$T
-
-        : >"$MEMLOG"
-        timed curl -sS -o /dev/null -w '%{http_code} %{size_download}' "${COOKIE_ARGS[@]}" \
-            "$BASE/webapi/entry.cgi?$DOWNLOAD_QUERY" >"$work/meta" || die "curl download failed"
-        tv=$T
-        meta=$(cat "$work/meta")
-        if [ "$meta" != "200 $BYTES" ]; then
-            echo "download: HTTP status and size $meta, expected 200 $BYTES; the answer begins:" >&2
-            curl -s -i "${COOKIE_ARGS[@]}" -r 0-299 "$BASE/webapi/entry.cgi?$DOWNLOAD_QUERY" | head -c 900 >&2
-            die "the download through velascgi failed"
-        fi
-        peak=$(peak_kib "$MEMLOG")
-
+        all[cat]+="$(mbps "$BYTES" "$tc") "
+        line=$(printf 'round %d: cat %.1f MB/s' "$r" "$(mbps "$BYTES" "$tc")")
+        for front in $FRONT_ENDS; do
+            mem_begin "$front"
+            timed curl -sS -o /dev/null -w '%{http_code} %{size_download}' "${COOKIE_ARGS[@]}" \
+                "${LT_BASE[$front]}/webapi/entry.cgi?$DOWNLOAD_QUERY" >"$work/meta" || die "curl download failed"
+            mem_end "$front"
+            meta=$(cat "$work/meta")
+            if [ "$meta" != "200 $BYTES" ]; then
+                echo "download: HTTP status and size $meta, expected 200 $BYTES; the answer begins:" >&2
+                curl -s -i "${COOKIE_ARGS[@]}" -r 0-299 "${LT_BASE[$front]}/webapi/entry.cgi?$DOWNLOAD_QUERY" | head -c 900 >&2
+                die "the download through $(front_name "$front") failed"
+            fi
+            all[$front]+="$(mbps "$BYTES" "$T") "
+            peaks[$front]+="$PEAK_MAX "
+            [ "$NOCHILD" = 1 ] && nochild[$front]=1
+            line+=$(printf '\n  %s %7.1f MB/s (peak RSS %s)' "$(front_name "$front")" "$(mbps "$BYTES" "$T")" "$PEAK")
+        done
         timed curl -sS -o /dev/null "$BASE/bench/cat_download.sh" || die "curl download from the shell CGI failed"
         ts=$T
         timed curl -sS -o /dev/null "$BASE/bench/static.bin" || die "curl static download failed"
         tt=$T
-
-        printf 'round %d: velascgi %7.1f MB/s (peak RSS %s KiB)   cat %7.1f MB/s   shell CGI cat %7.1f MB/s   lighttpd static file %7.1f MB/s\n' \
-            "$r" "$(mbps "$BYTES" "$tv")" "$peak" "$(mbps "$BYTES" "$tc")" "$(mbps "$BYTES" "$ts")" "$(mbps "$BYTES" "$tt")"
-        all_v+="$(mbps "$BYTES" "$tv") "
-        all_c+="$(mbps "$BYTES" "$tc") "
-        all_s+="$(mbps "$BYTES" "$ts") "
-        all_t+="$(mbps "$BYTES" "$tt") "
-        peaks+="$peak "
+        all[shell]+="$(mbps "$BYTES" "$ts") "
+        all[static]+="$(mbps "$BYTES" "$tt") "
+        line+=$(printf '\n  shell CGI cat %7.1f MB/s   lighttpd static file %7.1f MB/s' "$(mbps "$BYTES" "$ts")" "$(mbps "$BYTES" "$tt")")
+        echo "$line"
     done
-    local mv mc ms mt mp
-    mv=$(echo "$all_v" | median)
-    mc=$(echo "$all_c" | median)
-    ms=$(echo "$all_s" | median)
-    mt=$(echo "$all_t" | median)
-    mp=$(echo "$peaks" | largest)
-    printf 'median:  velascgi %.1f MB/s   cat %.1f MB/s   ratio %s (goal >= 90%%: %s)\n' \
-        "$mv" "$mc" "$(percent "$mv" "$mc")" "$(at_least "$(ratio "$mv" "$mc")" 0.90)"
-    printf '         shell CGI cat %.1f MB/s (velascgi is %s of it), lighttpd static file %.1f MB/s (%s)\n' \
-        "$ms" "$(percent "$mv" "$ms")" "$mt" "$(percent "$mv" "$mt")"
-    printf 'velascgi peak RSS: %s KiB\n' "$mp"
+    local mc ms mt m rt mp
+    mc=$(echo "${all[cat]}" | median)
+    ms=$(echo "${all[shell]}" | median)
+    mt=$(echo "${all[static]}" | median)
+    echo "median of $XROUNDS rounds:"
+    printf '  %-22s %7.1f MB/s\n' "cat of the file" "$mc"
+    printf '  %-22s %7.1f MB/s\n' "shell CGI cat" "$ms"
+    printf '  %-22s %7.1f MB/s\n' "lighttpd static file" "$mt"
+    for front in $FRONT_ENDS; do
+        m=$(echo "${all[$front]}" | median)
+        rt=$(ratio "$m" "$mc")
+        line=$(printf '  %-22s %7.1f MB/s = %s of cat (goal >= 90%%: %s), %s of the shell CGI cat, %s of the static file' \
+            "$(front_name "$front")" "$m" "$(percent "$m" "$mc")" "$(verdict "$rt" 0.90)" "$(percent "$m" "$ms")" "$(percent "$m" "$mt")")
+        if [ "$front" = fcgi ] && uses cgi; then
+            rt=$(ratio "$m" "$(echo "${all[cgi]}" | median)")
+            line+=$(printf '; %sx velascgi (goal >= 1x: %s)' "$rt" "$(verdict "$rt" 1)")
+        fi
+        echo "$line"
+    done
+    for front in $FRONT_ENDS; do
+        mp=$(echo "${peaks[$front]}" | largest)
+        printf '  %s peak RSS, largest process of any download: %s KiB = %.1f MiB (goal < 16 MiB in every process: %s)\n' \
+            "$(front_name "$front")" "$mp" "$(awk -v k="$mp" 'BEGIN { print k / 1024 }')" "$(mem_goal "$mp" "${nochild[$front]:-0}")"
+    done
+    echo "  (the machine is shared: load average $(loadavg))"
 }
 
 # ---- compound requests -----------------------------------------------------------
