@@ -368,6 +368,12 @@ start_server() {
         if [ -n "${BENCH_LIGHTTPD_EXTRA:-}" ]; then
             printf '\n## Added by BENCH_LIGHTTPD_EXTRA.\n%s\n' "$BENCH_LIGHTTPD_EXTRA" >>"$conf"
         fi
+        # The baselines are CGI programs under either front end: mod_cgi
+        # beside mod_fastcgi, before mod_staticfile.
+        if [ "$front" = fcgi ]; then
+            sed -i 's/^\( *\)"mod_fastcgi",$/&\n\1"mod_cgi",/' "$conf"
+            grep -q '^ *"mod_cgi",$' "$conf" || die "cannot add mod_cgi to $conf"
+        fi
         printf '\n## Benchmark baselines.\n$HTTP["url"] =~ "^/bench/" {\n  cgi.assign = ( ".cgi" => "", ".sh" => "/bin/sh" )\n}\n' >>"$conf"
         lighttpd -tt -f "$conf" >"$work/lighttpd-check.log" 2>&1 || {
             cat "$work/lighttpd-check.log" >&2
@@ -586,7 +592,7 @@ fcgi_rss() { echo "master $(rss_of "$(fcgi_master)") KiB, parents $(for p in $(f
 
 bench_rps() {
     local -a rows=() label=()
-    local -A url=()
+    local -A urls=()
     local B
     # Both servers run side by side, each with the baseline under /bench/.
     # velafcgi starts afresh after the login is made: a parent warms an API
@@ -607,18 +613,18 @@ bench_rps() {
     B=${LT_BASE[cgi]:-${LT_BASE[fcgi]:-}}
     rows+=(minimal)
     label[0]="minimal CGI (baseline)"
-    url[minimal]="$B/bench/minimal.cgi?$ECHO_QUERY"
+    urls[minimal]="$B/bench/minimal.cgi?$ECHO_QUERY"
     if uses cgi; then
         rows+=(velascgi)
         label[${#rows[@]} - 1]="velascgi (CGI)"
-        url[velascgi]="${LT_BASE[cgi]}/webapi/entry.cgi?$ECHO_QUERY"
+        urls[velascgi]="${LT_BASE[cgi]}/webapi/entry.cgi?$ECHO_QUERY"
     fi
     if uses fcgi; then
         rows+=(fork inproc)
         label[${#rows[@]} - 2]="velafcgi, a child per request"
         label[${#rows[@]} - 1]="velafcgi, in process"
-        url[fork]="${LT_BASE[fcgi]}/webapi/entry.cgi?$ECHO_QUERY"
-        url[inproc]="${LT_BASE[fcgi]}/webapi/entry.cgi?$INPROC_QUERY"
+        urls[fork]="${LT_BASE[fcgi]}/webapi/entry.cgi?$ECHO_QUERY"
+        urls[inproc]="${LT_BASE[fcgi]}/webapi/entry.cgi?$INPROC_QUERY"
     fi
     echo "== requests per second: sample echo with a login session, minimal C++ CGI vs velascgi vs velafcgi =="
     echo "wrk -t$THREADS -c$CONNS -d${DURATION}s, $ROUNDS alternating rounds; $LOGIN_NOTE"
@@ -626,23 +632,23 @@ bench_rps() {
         echo "two lighttpd side by side: --front-end cgi on ${LT_BASE[cgi]#http://}, --front-end fcgi on ${LT_BASE[fcgi]#http://}"
     local row i answer
     for row in "${rows[@]}"; do
-        answer=$(curl -s "${COOKIE_ARGS[@]}" "${url[$row]}")
+        answer=$(curl -s "${COOKIE_ARGS[@]}" "${urls[$row]}")
         case $answer in *'"success":true'*) ;; *)
             echo "answer of $row: $answer" >&2
             die "the $row echo does not succeed"
             ;;
         esac
-        printf '  %-8s %s\n  %-8s -> %s\n' "$row" "${url[$row]#http://*/}" "" "$answer"
+        printf '  %-8s %s\n  %-8s -> %s\n' "$row" "${urls[$row]#http://*/}" "" "$answer"
     done
     # Warm-up: page cache, libraries, description files, warm parents.
     for row in "${rows[@]}"; do
-        wrk_rps "${url[$row]}" 2 >/dev/null || die "wrk failed on $row"
+        wrk_rps "${urls[$row]}" 2 >/dev/null || die "wrk failed on $row"
     done
     local inproc_note="" rss_warm=""
     if uses fcgi; then
         local f_fork f_in
-        f_fork=$(forks_for "${url[fork]}")
-        f_in=$(forks_for "${url[inproc]}")
+        f_fork=$(forks_for "${urls[fork]}")
+        f_in=$(forks_for "${urls[inproc]}")
         if [ -n "$INPROC_MARK" ]; then
             inproc_note="in-process not available: $INPROC_MARK"
         elif [ "$f_in" = 0 ] && [ "$f_fork" -gt 0 ]; then
@@ -658,7 +664,7 @@ bench_rps() {
     for r in $(seq 1 "$ROUNDS"); do
         line="round $r:"
         for row in "${rows[@]}"; do
-            v=$(wrk_rps "${url[$row]}") || die "wrk failed on $row"
+            v=$(wrk_rps "${urls[$row]}") || die "wrk failed on $row"
             all[$row]+="$v "
             line+=$(printf '  %s %.1f' "$row" "$v")
         done
@@ -760,7 +766,6 @@ fcgi_callgrind() {
         kill -KILL "$vpid"
     fi
     wait "$vpid" 2>/dev/null
-    FCGI_CG_MASTER=$vpid
 }
 
 rps_instructions() {
@@ -781,7 +786,7 @@ rps_instructions() {
         callgrind_run "$work/cg-velascgi" "$work/cap-echo"
         read -r -a tree <<<"$(callgrind_tree "$work/cg-velascgi")"
         rt=$(ratio "${tree[0]}" "$base")
-        printf '  %-32s %10s  %6sx in %d processes (goal <= 1.5x: %s)\n' "velascgi (CGI)" "$(mi "${tree[0]}")" "$rt" \
+        printf '  %-32s %10s  %6sx in %d process(es) (goal <= 1.5x: %s)\n' "velascgi (CGI)" "$(mi "${tree[0]}")" "$rt" \
             "${tree[1]}" "$(verdict "$rt" 1.5 at-most)"
     fi
     uses fcgi || return 0
