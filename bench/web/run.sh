@@ -1,12 +1,24 @@
 #!/usr/bin/env bash
-# Web-entry benchmarks: velascgi under lighttpd against baselines measured in
+# Web-entry benchmarks: the web API's two front ends under lighttpd, velascgi
+# (a CGI program run for every request) and velafcgi (a FastCGI server whose
+# warm parents fork one child per request), against baselines measured in
 # the same run, on the same server and the same disk.
 #
-#   rps       requests per second of the sample echo API against a minimal
-#             C++ CGI (JsonCpp only) that builds the same answer;
-#   upload    a multipart upload through velascgi against cat of the file
-#             into a file on the same disk, with velascgi's peak memory;
-#   download  a download through velascgi against cat of the file;
+#   rps       requests per second of the sample echo API, with a login
+#             session, against a minimal C++ CGI (JsonCpp only) that builds
+#             the same answer: through velascgi, through velafcgi forking a
+#             child per request, and through velafcgi serving the echo in
+#             its warm parent (the description of VELA.Sample in the state
+#             root marks its echo "inProcess"); two lighttpd side by side,
+#             one per front end, alternating rounds. Then the instructions
+#             (callgrind, whole process, dynamic loader included) of one
+#             request: the minimal CGI, velascgi, and velafcgi's request
+#             child (velafcgi run under callgrind with one parent, the
+#             requests sent with cgi-fcgi);
+#   upload    a multipart upload through each front end against cat of the
+#             file into a file on the same disk, with the peak memory of
+#             every process of the front end that took part;
+#   download  a download through each front end against cat of the file;
 #   compound  a compound request (VELA.Entry.Request) of 10 echo calls, in
 #             sequential and in parallel mode, against 10 separate requests
 #             of the same echo: wall time through lighttpd (alternating
@@ -21,38 +33,44 @@
 #             against the same in sequence and against one such call alone.
 #             The in-process and sleeping calls come from the benchmark's
 #             own API VELA.Bench.Compound (bench_compound.cpp), installed in
-#             the state root only. perf and valgrind are optional.
+#             the state root only. perf and valgrind are optional. This part
+#             measures velascgi only.
 #
 # usage: bench/web/run.sh [build-dir]          (default: build)
 #
 # Environment (all optional):
 #   BENCH_SIZE_MB=1024        size of the transferred file, MiB
 #   BENCH_PARTS="rps upload download compound"
+#   BENCH_FRONT_ENDS="cgi fcgi"
+#                             the front ends of the parts rps, upload and
+#                             download: cgi (velascgi), fcgi (velafcgi)
 #   BENCH_DURATION=10 BENCH_ROUNDS=3 BENCH_CONNECTIONS=8 BENCH_THREADS=2
 #                             wrk: seconds per run, alternating rounds
 #   BENCH_TRANSFER_ROUNDS=3   alternating rounds of each transfer
 #   BENCH_COMPOUND_ROUNDS=21  rounds of the compound's wall-time figures
 #   BENCH_SLEEP_ROUNDS=3      rounds of the sleeping calls
-#   BENCH_CALLGRIND=1         0 leaves out the compound's instruction counts
-#                             (they need valgrind and take a minute or two)
+#   BENCH_CALLGRIND=1         0 leaves out the instruction counts (they need
+#                             valgrind, and cgi-fcgi for velafcgi's, and
+#                             take a minute or two)
 #   BENCH_DIR=$TMPDIR         where the state root and the big files go
-#   BENCH_XSENDFILE=1         also download with X-Sendfile on; velascgi uses
-#                             it only when BENCH_DIR and every directory above
-#                             it are writable by root alone (not below /tmp),
-#                             and streams the file otherwise
+#   BENCH_XSENDFILE=1         also download with X-Sendfile on; the front
+#                             ends use it only when BENCH_DIR and every
+#                             directory above it are writable by root alone
+#                             (not below /tmp), and stream the file otherwise
 #   BENCH_STREAM_REQUEST_BODY, BENCH_STREAM_RESPONSE_BODY
 #                             override lighttpd's server.stream-*-body
 #   BENCH_LIGHTTPD_EXTRA      lines added to the lighttpd configuration
 #   BENCH_ECHO_QUERY, BENCH_UPLOAD_QUERY, BENCH_DOWNLOAD_QUERY
 #                             query strings of the sample's methods (the
 #                             echo's parameters are also each call of the
-#                             compound)
+#                             compound and of the in-process echo)
 #   BENCH_PLAIN=1             no private mount namespace (see below)
 #
-# The server is the project's own lighttpd configuration, written by
-# scripts/lighttpd-conf.sh, plus one block for the baselines under /bench/;
-# it runs on a free port of 127.0.0.1 under a temporary state root, and is
-# stopped, and every file made here removed, on every way out.
+# The servers are the project's own lighttpd configuration, written by
+# scripts/lighttpd-conf.sh with --front-end cgi or fcgi, plus one block for
+# the baselines under /bench/; each runs on a free port of 127.0.0.1 under
+# one temporary state root, and they are stopped, and every file made here
+# removed, on every way out.
 set -u -o pipefail
 
 here=$(cd "$(dirname "$0")" && pwd)
@@ -64,6 +82,7 @@ build=$(cd "${1:-$top/build}" 2>/dev/null && pwd) || {
 
 SIZE_MB=${BENCH_SIZE_MB:-1024}
 PARTS=${BENCH_PARTS:-rps upload download compound}
+FRONT_ENDS=${BENCH_FRONT_ENDS:-cgi fcgi}
 DURATION=${BENCH_DURATION:-10}
 ROUNDS=${BENCH_ROUNDS:-3}
 CONNS=${BENCH_CONNECTIONS:-8}
@@ -75,8 +94,14 @@ ECHO_QUERY=${BENCH_ECHO_QUERY:-api=VELA.Sample.Echo&version=1&method=echo&text=h
 UPLOAD_QUERY=${BENCH_UPLOAD_QUERY:-api=VELA.Sample&version=1&method=upload}
 DOWNLOAD_QUERY=${BENCH_DOWNLOAD_QUERY:-api=VELA.Sample&version=1&method=download&name=data.bin}
 RECEIVE_QUERY="api=VELA.Bench.Transfer&version=1&method=receive"
+# The echo's parameters, to the echo of VELA.Sample that velafcgi serves in
+# process.
+INPROC_QUERY="api=VELA.Sample&version=1&method=echo&$(printf '%s\n' "$ECHO_QUERY" | tr '&' '\n' |
+    grep -v -E '^(api|version|method)(=|$)' | paste -sd '&')"
+INPROC_MARK=""
 
 VELASCGI=$build/velascgi
+VELAFCGI=$build/velafcgi
 VELAADM=$build/velaadm
 MINIMAL=$build/bench/web/vela-bench-minimal-cgi
 BENCH_LIB=$build/bench/web/libvela-bench-transfer.so
@@ -99,6 +124,15 @@ for n in "$SIZE_MB" "$DURATION" "$ROUNDS" "$CONNS" "$THREADS" "$XROUNDS" "$CROUN
 done
 have_velascgi=0
 [ -x "$VELASCGI" ] && [ -d "$STAGE/usr/vela/velaman/webapi" ] && [ -f "$BENCH_LIB" ] && have_velascgi=1
+for front in $FRONT_ENDS; do
+    case $front in
+    cgi) ;;
+    fcgi) [ -x "$VELAFCGI" ] || die "velafcgi is not built in $build (BENCH_FRONT_ENDS=cgi leaves it out)" ;;
+    *) die "BENCH_FRONT_ENDS takes cgi and fcgi, not \"$front\"" ;;
+    esac
+done
+# uses FRONT: whether the parts rps, upload and download measure FRONT.
+uses() { [[ " $FRONT_ENDS " == *" $1 "* ]]; }
 
 # The surroundings of a production machine, where they are cheap to give:
 # the state root's /run is a tmpfs (session files are rewritten on every
@@ -111,22 +145,46 @@ if [ -z "${VELA_BENCH_NS:-}" ] && [ "${BENCH_PLAIN:-0}" != 1 ] && [ "$(id -u)" =
 fi
 
 work=$(mktemp -d "${BENCH_DIR:-${TMPDIR:-/tmp}}/vela-webbench-XXXXXX") || die "cannot make a work directory"
-ROOT=$work/root      # VELA_ROOT of velascgi
+ROOT=$work/root      # VELA_ROOT of the front ends
 DOCROOT=$work/htdocs # static files and the baselines under /bench/
 VOLUME=$ROOT/volume1 # the data volume: uploads land in its @tmp
 DATA=$VOLUME/sample/data.bin # where the sample's download method finds "data.bin"
 BYTES=$((SIZE_MB * 1024 * 1024))
 
-lt_pid=""
+# One lighttpd at most per front end ("cgi", "fcgi"): its process, what it
+# serves ("PROGRAM XSENDFILE") and its address.
+declare -A LT_PID=() LT_SERVED=() LT_BASE=()
 sink_pid=""
+sampler_pid=""
+# stop_server [FRONT]: stops the server of FRONT, or every server; lighttpd
+# stops the velafcgi it started. A velafcgi master seen while measuring that
+# is still there a few seconds later is stopped too.
+FCGI_MASTERS=""
 stop_server() {
-    if [ -n "$lt_pid" ]; then
-        kill "$lt_pid" 2>/dev/null
-        wait "$lt_pid" 2>/dev/null
-        lt_pid=""
-    fi
+    local front pid i
+    for front in ${1:-cgi fcgi}; do
+        pid=${LT_PID[$front]:-}
+        [ -n "$pid" ] || continue
+        kill "$pid" 2>/dev/null
+        wait "$pid" 2>/dev/null
+        LT_PID[$front]=""
+        LT_SERVED[$front]=""
+    done
+    [ "${1:-fcgi}" = fcgi ] || return 0
+    for pid in $FCGI_MASTERS; do
+        for i in $(seq 1 50); do
+            [ "$(readlink "/proc/$pid/exe" 2>/dev/null)" = "$VELAFCGI" ] || break
+            sleep 0.1
+        done
+        [ "$(readlink "/proc/$pid/exe" 2>/dev/null)" = "$VELAFCGI" ] && kill "$pid" 2>/dev/null
+    done
+    FCGI_MASTERS=""
 }
 cleanup() {
+    if [ -n "$sampler_pid" ]; then
+        kill "$sampler_pid" 2>/dev/null
+        wait "$sampler_pid" 2>/dev/null
+    fi
     stop_server
     if [ -n "$sink_pid" ]; then
         kill "$sink_pid" 2>/dev/null
@@ -191,6 +249,13 @@ if [ "$have_velascgi" = 1 ]; then
     }
 }
 EOF
+    # velafcgi's warm parents serve a method marked "inProcess" themselves:
+    # in this root only, the echo of VELA.Sample is (VELA.Sample.Echo, the
+    # echo of the other figures, stays as it is). The same handler answers
+    # both.
+    sed -i '0,/^\( *\)"echo",$/s//\1{"echo": {"inProcess": true}},/' "$WEBAPI_DIR/VELA.Sample.lib" ||
+        die "cannot edit $WEBAPI_DIR/VELA.Sample.lib"
+    grep -q '"inProcess": true' "$WEBAPI_DIR/VELA.Sample.lib" || INPROC_MARK="the echo of VELA.Sample could not be marked"
     # The compound benchmark's own API, in this root only: its "echo" is
     # grantable, so a sequential compound runs it in process.
     if [ -f "$COMPOUND_LIB" ]; then
@@ -276,18 +341,24 @@ EOF
 # ---- lighttpd --------------------------------------------------------------
 
 BASE=""
-SERVED=""
-# start_server PROGRAM XSENDFILE: one lighttpd on a free port running PROGRAM
-# as /webapi/entry.cgi, X-Sendfile allowed (1) or not (0) for the volume.
+# start_server FRONT PROGRAM XSENDFILE: one lighttpd on a free port whose
+# front end FRONT runs PROGRAM (velascgi, or a wrapper, for cgi; velafcgi for
+# fcgi) as /webapi/entry.cgi, X-Sendfile allowed (1) or not (0) for the
+# volume. Its address goes to BASE.
 start_server() {
-    local program=$1 xsendfile=$2 try port i conf=$work/lighttpd.conf
-    local -a args=(--env "VELA_ROOT=$ROOT")
+    local front=$1 program=$2 xsendfile=$3 try port i conf=$work/lighttpd-$1.conf run=$work/run-$1
+    local -a args=(--env "VELA_ROOT=$ROOT" --front-end "$front")
+    if [ "$front" = fcgi ]; then
+        args+=(--velascgi "$VELASCGI" --velafcgi "$program")
+    else
+        args+=(--velascgi "$program")
+    fi
     [ "$xsendfile" = 1 ] && args+=(--xsendfile-dir "$VOLUME")
     for try in 1 2 3 4 5 6 7 8 9 10; do
         port=$(shuf -i 20000-60999 -n 1)
         [ -z "$(ss -Htln "sport = :$port" 2>/dev/null)" ] || continue
-        "$top/scripts/lighttpd-conf.sh" --out "$conf" --port "$port" --run "$work/run" --pidfile "$work/run/lighttpd.pid" \
-            --docroot "$DOCROOT" --velascgi "$program" "${args[@]}" || die "cannot write the lighttpd configuration"
+        "$top/scripts/lighttpd-conf.sh" --out "$conf" --port "$port" --run "$run" --pidfile "$run/lighttpd.pid" \
+            --docroot "$DOCROOT" "${args[@]}" || die "cannot write the lighttpd configuration"
         if [ -n "${BENCH_STREAM_REQUEST_BODY:-}" ]; then
             sed -i "s/^server.stream-request-body *=.*/server.stream-request-body = $BENCH_STREAM_REQUEST_BODY/" "$conf"
         fi
@@ -297,38 +368,134 @@ start_server() {
         if [ -n "${BENCH_LIGHTTPD_EXTRA:-}" ]; then
             printf '\n## Added by BENCH_LIGHTTPD_EXTRA.\n%s\n' "$BENCH_LIGHTTPD_EXTRA" >>"$conf"
         fi
+        # The baselines are CGI programs under either front end: mod_cgi
+        # beside mod_fastcgi, before mod_staticfile.
+        if [ "$front" = fcgi ]; then
+            sed -i 's/^\( *\)"mod_fastcgi",$/&\n\1"mod_cgi",/' "$conf"
+            grep -q '^ *"mod_cgi",$' "$conf" || die "cannot add mod_cgi to $conf"
+        fi
         printf '\n## Benchmark baselines.\n$HTTP["url"] =~ "^/bench/" {\n  cgi.assign = ( ".cgi" => "", ".sh" => "/bin/sh" )\n}\n' >>"$conf"
         lighttpd -tt -f "$conf" >"$work/lighttpd-check.log" 2>&1 || {
             cat "$work/lighttpd-check.log" >&2
             die "lighttpd refuses $conf"
         }
         lighttpd -D -f "$conf" >>"$work/lighttpd-stdout.log" 2>&1 &
-        lt_pid=$!
+        LT_PID[$front]=$!
         for i in $(seq 1 100); do
-            if ! kill -0 "$lt_pid" 2>/dev/null; then
-                wait "$lt_pid" 2>/dev/null
-                lt_pid=""
+            if ! kill -0 "${LT_PID[$front]}" 2>/dev/null; then
+                wait "${LT_PID[$front]}" 2>/dev/null
+                LT_PID[$front]=""
                 break
             fi
             if curl -s -o /dev/null "http://127.0.0.1:$port/bench/minimal.cgi"; then
                 BASE="http://127.0.0.1:$port"
-                SERVED="$program $xsendfile"
+                LT_BASE[$front]=$BASE
+                LT_SERVED[$front]="$program $xsendfile"
+                [ "$front" = fcgi ] && FCGI_MASTERS+=" $(fcgi_master)"
                 return 0
             fi
             sleep 0.1
         done
-        stop_server
+        stop_server "$front"
     done
-    cat "$work/run/error.log" "$work/lighttpd-stdout.log" >&2 2>/dev/null
+    cat "$run/error.log" "$work/lighttpd-stdout.log" >&2 2>/dev/null
     die "lighttpd did not start"
 }
-# serve PROGRAM XSENDFILE: (re)starts the server unless it already runs so.
+# serve FRONT PROGRAM XSENDFILE [keep]: (re)starts the server of FRONT unless
+# it already runs so, and stops the other front end's server unless "keep"
+# is given; BASE is the server's address.
 serve() {
-    [ -n "$lt_pid" ] && [ "$SERVED" = "$1 $2" ] && return 0
-    stop_server
-    start_server "$1" "$2"
+    local other=cgi
+    [ "$1" = cgi ] && other=fcgi
+    [ "${4:-}" = keep ] || stop_server "$other"
+    if [ -n "${LT_PID[$1]:-}" ] && [ "${LT_SERVED[$1]}" = "$2 $3" ]; then
+        BASE=${LT_BASE[$1]}
+        return 0
+    fi
+    stop_server "$1"
+    start_server "$1" "$2" "$3"
 }
-server_setting() { sed -n "s/^$1 *= *//p" "$work/lighttpd.conf" | head -1; }
+# server_setting NAME: a setting of the last configuration written.
+server_setting() { sed -n "s/^$1 *= *//p" "$(ls -t "$work"/lighttpd-*.conf | head -1)" | head -1; }
+
+# ---- velafcgi's processes --------------------------------------------------------
+
+# children PID: the children of PID (none when it is gone).
+children() {
+    local list=""
+    read -r list <"/proc/$1/task/$1/children" 2>/dev/null
+    echo $list
+}
+# fcgi_master: the velafcgi master of the fcgi server (a child of lighttpd).
+fcgi_master() {
+    local pid
+    for pid in $(children "${LT_PID[fcgi]:-0}"); do
+        [ "$(readlink "/proc/$pid/exe" 2>/dev/null)" = "$VELAFCGI" ] && echo "$pid"
+    done
+}
+# fcgi_parents: velafcgi's warm parents (the master's children).
+fcgi_parents() {
+    local m
+    for m in $(fcgi_master); do
+        children "$m"
+    done
+}
+# children_faults: the page faults of the children the parents have reaped
+# (cminflt of /proc/PID/stat, summed over the parents); a request served in
+# process adds none.
+children_faults() {
+    local p line sum=0
+    for p in $(fcgi_parents); do
+        read -r line <"/proc/$p/stat" 2>/dev/null || continue
+        line=${line##*) }
+        set -- $line
+        sum=$((sum + $9))
+    done
+    echo "$sum"
+}
+# hwm PID: the peak resident memory (VmHWM, KiB) of PID so far, empty when
+# it is gone.
+hwm() {
+    local key value rest
+    while read -r key value rest; do
+        [ "$key" = VmHWM: ] && echo "$value" && return 0
+    done <"/proc/$1/status" 2>/dev/null
+}
+# fcgi_mem_start: samples every 50 ms, until fcgi_mem_stop, the peak
+# resident memory of the velafcgi master, of its parents and of their
+# request children into FCGI_MEMLOG as "role pid KiB" lines. A peak figure
+# only grows, so the last sample of a process is its peak up to then.
+FCGI_MEMLOG=$work/mem-velafcgi.log
+fcgi_mem_start() {
+    : >"$FCGI_MEMLOG"
+    (
+        local m p c k
+        while :; do
+            for m in $(fcgi_master); do
+                k=$(hwm "$m") && [ -n "$k" ] && echo "master $m $k"
+                for p in $(children "$m"); do
+                    k=$(hwm "$p") && [ -n "$k" ] && echo "parent $p $k"
+                    for c in $(children "$p"); do
+                        k=$(hwm "$c") && [ -n "$k" ] && echo "child $c $k"
+                    done
+                done
+            done
+            sleep 0.05
+        done >>"$FCGI_MEMLOG"
+    ) &
+    sampler_pid=$!
+}
+# fcgi_mem_stop: "master parents child children-seen": the largest peak of
+# each role (KiB) since fcgi_mem_start, and how many request children the
+# samples saw.
+fcgi_mem_stop() {
+    sleep 0.1
+    kill "$sampler_pid" 2>/dev/null
+    wait "$sampler_pid" 2>/dev/null
+    sampler_pid=""
+    awk '{ if ($3 > m[$1]) m[$1] = $3; if ($1 == "child") seen[$2] = 1 }
+        END { printf "%d %d %d %d\n", m["master"], m["parent"], m["child"], length(seen) }' "$FCGI_MEMLOG"
+}
 
 # ---- the echo call and its login ------------------------------------------------
 
@@ -388,42 +555,270 @@ wrk_rps() {
     printf '%s\n' "$out" | awk '/^Requests\/sec:/ { print $2 }'
 }
 
-bench_rps() {
-    serve "$VELASCGI" 0
-    prepare_login || die "the echo call does not succeed: set BENCH_ECHO_QUERY"
-    echo "== requests per second: sample echo through velascgi vs minimal C++ CGI =="
-    echo "wrk -t$THREADS -c$CONNS -d${DURATION}s, $ROUNDS alternating rounds; $LOGIN_NOTE"
-    local echo_url="$BASE/webapi/entry.cgi?$ECHO_QUERY"
-    local base_url="$BASE/bench/minimal.cgi?$ECHO_QUERY"
-    echo "velascgi answer: $(curl -s "${COOKIE_ARGS[@]}" "$echo_url")"
-    echo "baseline answer: $(curl -s "$base_url")"
-    # Warm-up: page cache, libraries, description files.
-    wrk_rps "$echo_url" 2 >/dev/null || die "wrk failed on the echo call"
-    wrk_rps "$base_url" 2 >/dev/null || die "wrk failed on the baseline"
-    local r a b all_a="" all_b=""
-    for r in $(seq 1 "$ROUNDS"); do
-        a=$(wrk_rps "$echo_url") || die "wrk failed on the echo call"
-        b=$(wrk_rps "$base_url") || die "wrk failed on the baseline"
-        printf 'round %d: velascgi echo %8.1f req/s   baseline %8.1f req/s\n' "$r" "$a" "$b"
-        all_a+="$a "
-        all_b+="$b "
+# verdict VALUE GOAL [at-most]: "goal met" when VALUE >= GOAL (<= with
+# at-most), else "goal not met".
+verdict() {
+    awk -v v="$1" -v g="$2" -v most="${3:-}" 'BEGIN {
+        ok = (most == "at-most") ? (v + 0 <= g + 0) : (v + 0 >= g + 0)
+        print ok ? "goal met" : "goal not met" }'
+}
+# get_n N URL: N GETs of URL, one after the other on one connection.
+get_n() {
+    local i
+    local -a args=()
+    for ((i = 0; i < $1; i++)); do
+        args+=(-o /dev/null "$2")
     done
-    a=$(echo "$all_a" | median)
-    b=$(echo "$all_b" | median)
-    printf 'median:  velascgi echo %8.1f req/s   baseline %8.1f req/s   ratio %sx (goal >= 0.85x: %s)\n' \
-        "$a" "$b" "$(ratio "$a" "$b")" "$(at_least "$(ratio "$a" "$b")" 0.85)"
+    curl -sS "${COOKIE_ARGS[@]}" "${args[@]}" || die "curl failed on $2"
+}
+# forks_for URL: how many page faults the children the velafcgi parents
+# reaped took over 20 calls of URL: none when the parents serve it in
+# process.
+forks_for() {
+    local before
+    before=$(children_faults)
+    get_n 20 "$1"
+    sleep 0.3 # a child is reaped just after its answer
+    echo $(($(children_faults) - before))
+}
+rss_of() {
+    local key value rest
+    while read -r key value rest; do
+        [ "$key" = VmRSS: ] && echo "$value" && return 0
+    done <"/proc/$1/status" 2>/dev/null
+}
+# fcgi_rss: the resident memory (KiB) of velafcgi's master and parents.
+fcgi_rss() { echo "master $(rss_of "$(fcgi_master)") KiB, parents $(for p in $(fcgi_parents); do printf '%s ' "$(rss_of "$p")"; done)KiB"; }
 
-    serve "$VELASCGI_MEM" 0
-    : >"$MEMLOG"
-    : >"$work/mem-minimal.log"
-    local lines=0
-    [ -f "$SYSLOG" ] && lines=$(wc -l <"$SYSLOG")
-    curl -s -o /dev/null "${COOKIE_ARGS[@]}" "$BASE/webapi/entry.cgi?$ECHO_QUERY"
-    curl -s -o /dev/null "$BASE/bench/minimal_mem.cgi?$ECHO_QUERY"
-    echo "peak RSS of one call: velascgi echo $(peak_kib "$MEMLOG") KiB, baseline $(peak_kib "$work/mem-minimal.log") KiB"
-    if [ -f "$SYSLOG" ]; then
-        sleep 0.5 # the sink may still be writing the last datagrams
-        echo "syslog lines of one echo call: $(($(wc -l <"$SYSLOG") - lines))"
+bench_rps() {
+    local -a rows=() label=()
+    local -A urls=()
+    local B
+    # Both servers run side by side, each with the baseline under /bench/.
+    # velafcgi starts afresh after the login is made: a parent warms an API
+    # (and may then serve its "inProcess" methods) only when a child of its
+    # own opened the API's library, and VELA.Sample.Echo shares its library
+    # with VELA.Sample, so the in-process echo is called first.
+    if uses cgi; then
+        serve cgi "$VELASCGI" 0 keep
+    else
+        serve fcgi "$VELAFCGI" 0 keep
+    fi
+    prepare_login || die "the echo call does not succeed: set BENCH_ECHO_QUERY"
+    if uses fcgi; then
+        stop_server fcgi
+        serve fcgi "$VELAFCGI" 0 keep
+        get_n 20 "${LT_BASE[fcgi]}/webapi/entry.cgi?$INPROC_QUERY"
+    fi
+    B=${LT_BASE[cgi]:-${LT_BASE[fcgi]:-}}
+    rows+=(minimal)
+    label[0]="minimal CGI (baseline)"
+    urls[minimal]="$B/bench/minimal.cgi?$ECHO_QUERY"
+    if uses cgi; then
+        rows+=(velascgi)
+        label[${#rows[@]} - 1]="velascgi (CGI)"
+        urls[velascgi]="${LT_BASE[cgi]}/webapi/entry.cgi?$ECHO_QUERY"
+    fi
+    if uses fcgi; then
+        rows+=(fork inproc)
+        label[${#rows[@]} - 2]="velafcgi, a child per request"
+        label[${#rows[@]} - 1]="velafcgi, in process"
+        urls[fork]="${LT_BASE[fcgi]}/webapi/entry.cgi?$ECHO_QUERY"
+        urls[inproc]="${LT_BASE[fcgi]}/webapi/entry.cgi?$INPROC_QUERY"
+    fi
+    echo "== requests per second: sample echo with a login session, minimal C++ CGI vs velascgi vs velafcgi =="
+    echo "wrk -t$THREADS -c$CONNS -d${DURATION}s, $ROUNDS alternating rounds; $LOGIN_NOTE"
+    [ -n "${LT_BASE[fcgi]:-}" ] && [ -n "${LT_BASE[cgi]:-}" ] &&
+        echo "two lighttpd side by side: --front-end cgi on ${LT_BASE[cgi]#http://}, --front-end fcgi on ${LT_BASE[fcgi]#http://}"
+    local row i answer
+    for row in "${rows[@]}"; do
+        answer=$(curl -s "${COOKIE_ARGS[@]}" "${urls[$row]}")
+        case $answer in *'"success":true'*) ;; *)
+            echo "answer of $row: $answer" >&2
+            die "the $row echo does not succeed"
+            ;;
+        esac
+        printf '  %-8s %s\n  %-8s -> %s\n' "$row" "${urls[$row]#http://*/}" "" "$answer"
+    done
+    # Warm-up: page cache, libraries, description files, warm parents.
+    for row in "${rows[@]}"; do
+        wrk_rps "${urls[$row]}" 2 >/dev/null || die "wrk failed on $row"
+    done
+    local inproc_note="" rss_warm=""
+    if uses fcgi; then
+        local f_fork f_in
+        f_fork=$(forks_for "${urls[fork]}")
+        f_in=$(forks_for "${urls[inproc]}")
+        if [ -n "$INPROC_MARK" ]; then
+            inproc_note="in-process not available: $INPROC_MARK"
+        elif [ "$f_in" = 0 ] && [ "$f_fork" -gt 0 ]; then
+            inproc_note="served in process: 20 calls, no child reaped by the parents (20 forked calls: $f_fork child page faults);"
+            inproc_note+=" VELA.Sample was called first on the fresh velafcgi, so that its parents warmed it and not VELA.Sample.Echo"
+        else
+            inproc_note="in-process not available in this build: the parents forked for it ($f_in child page faults over 20 calls, $f_fork for 20 forked calls)"
+        fi
+        rss_warm=$(fcgi_rss)
+    fi
+    local r v line
+    local -A all=()
+    for r in $(seq 1 "$ROUNDS"); do
+        line="round $r:"
+        for row in "${rows[@]}"; do
+            v=$(wrk_rps "${urls[$row]}") || die "wrk failed on $row"
+            all[$row]+="$v "
+            line+=$(printf '  %s %.1f' "$row" "$v")
+        done
+        echo "$line req/s"
+    done
+    local base med rt
+    base=$(echo "${all[minimal]}" | median)
+    echo "median of $ROUNDS rounds, and the ratio to the minimal CGI:"
+    for i in "${!rows[@]}"; do
+        row=${rows[$i]}
+        med=$(echo "${all[$row]}" | median)
+        rt=$(ratio "$med" "$base")
+        case $row in
+        minimal) printf '  %-32s %9.1f req/s\n' "${label[$i]}" "$med" ;;
+        velascgi) printf '  %-32s %9.1f req/s  %6sx (goal >= 0.85x: %s)\n' "${label[$i]}" "$med" "$rt" "$(verdict "$rt" 0.85)" ;;
+        fork) printf '  %-32s %9.1f req/s  %6sx (goal >= 3x: %s)\n' "${label[$i]}" "$med" "$rt" "$(verdict "$rt" 3)" ;;
+        inproc)
+            printf '  %-32s %9.1f req/s  %6sx (goal >= 10x: %s)\n' "${label[$i]}" "$med" "$rt" "$(verdict "$rt" 10)"
+            printf '  %-32s %s\n' "" "$inproc_note"
+            ;;
+        esac
+    done
+    echo "  (the machine is shared: load average $(loadavg))"
+    if uses fcgi; then
+        echo "velafcgi resident memory: after the warm-up $rss_warm; after the rounds $(fcgi_rss)"
+    fi
+
+    if uses cgi; then
+        serve cgi "$VELASCGI_MEM" 0
+        : >"$MEMLOG"
+        : >"$work/mem-minimal.log"
+        local lines=0
+        [ -f "$SYSLOG" ] && lines=$(wc -l <"$SYSLOG")
+        curl -s -o /dev/null "${COOKIE_ARGS[@]}" "$BASE/webapi/entry.cgi?$ECHO_QUERY"
+        curl -s -o /dev/null "$BASE/bench/minimal_mem.cgi?$ECHO_QUERY"
+        echo "peak RSS of one call: velascgi echo $(peak_kib "$MEMLOG") KiB, baseline $(peak_kib "$work/mem-minimal.log") KiB"
+        if [ -f "$SYSLOG" ]; then
+            sleep 0.5 # the sink may still be writing the last datagrams
+            echo "syslog lines of one echo call: $(($(wc -l <"$SYSLOG") - lines))"
+        fi
+    fi
+    if [ "${BENCH_CALLGRIND:-1}" != 1 ]; then
+        echo "instructions: left out (BENCH_CALLGRIND=${BENCH_CALLGRIND:-})"
+    elif ! VALGRIND=$(command -v valgrind); then
+        echo "instructions: valgrind is not installed"
+    else
+        rps_instructions
+    fi
+}
+
+# fcgi_request DIR CAPTURE N: N requests, with the environment and body
+# recorded in CAPTURE, to the velafcgi listening on DIR/fcgi.sock, through
+# cgi-fcgi; each must succeed.
+fcgi_request() {
+    local dir=$1 cap=$2 i
+    replay_env "$cap"
+    for ((i = 0; i < $3; i++)); do
+        CG_RUNS=$((CG_RUNS + 1))
+        env -i "${REPLAY_ENV[@]}" cgi-fcgi -bind -connect "$dir/fcgi.sock" <"$cap/body" >"$dir/answer.$CG_RUNS" 2>>"$dir/stderr"
+        grep -q '"success":true' "$dir/answer.$CG_RUNS" || {
+            head -c 600 "$dir/answer.$CG_RUNS" >&2
+            tail -n 20 "$dir/stderr" >&2
+            die "a request to velafcgi under callgrind did not succeed"
+        }
+    done
+}
+# fcgi_callgrind DIR FORKED INPROC: velafcgi with one parent under callgrind,
+# every process it forks followed (counts dumped and zeroed before each
+# fork, so a child counts only what it executes after the fork): 1 + INPROC
+# echo requests the parent may serve itself (the first goes to a child, as
+# the API is not warm yet), then FORKED echo requests, then SIGTERM. The
+# in-process echo comes first: its API shares its library with the other.
+fcgi_callgrind() {
+    local dir=$1 vpid i
+    mkdir -p "$dir"
+    env -i PATH="$PATH" VELA_ROOT="$ROOT" "$VALGRIND" --tool=callgrind --trace-children=yes --dump-before='*fork*' \
+        --log-file="$dir/valgrind.%p" --callgrind-out-file="$dir/callgrind.out.%p" \
+        "$VELAFCGI" --socket "$dir/fcgi.sock" --parents 1 --stderr "$dir/velafcgi.log" </dev/null >>"$dir/stderr" 2>&1 &
+    vpid=$!
+    for i in $(seq 1 600); do
+        [ -S "$dir/fcgi.sock" ] && break
+        kill -0 "$vpid" 2>/dev/null || break
+        sleep 0.1
+    done
+    [ -S "$dir/fcgi.sock" ] || {
+        tail -n 20 "$dir/stderr" "$dir"/velafcgi.log >&2
+        kill "$vpid" 2>/dev/null
+        die "velafcgi under callgrind did not start"
+    }
+    fcgi_request "$dir" "$work/cap-inproc" $((1 + $3))
+    fcgi_request "$dir" "$work/cap-echo" "$2"
+    kill -TERM "$vpid"
+    for i in $(seq 1 600); do
+        kill -0 "$vpid" 2>/dev/null || break
+        sleep 0.1
+    done
+    if kill -0 "$vpid" 2>/dev/null; then
+        echo "velafcgi under callgrind did not stop within 60 s of SIGTERM: killed" >&2
+        kill -KILL "$vpid"
+    fi
+    wait "$vpid" 2>/dev/null
+}
+
+rps_instructions() {
+    local forked=5 inproc=3
+    make_capture_wrapper
+    serve cgi "$CAPTURE_CGI" 0
+    capture echo "$BASE/webapi/entry.cgi?$ECHO_QUERY"
+    uses fcgi && capture inproc "$BASE/webapi/entry.cgi?$INPROC_QUERY"
+    stop_server
+    echo "instructions of one echo request with a session (callgrind, whole process, dynamic loader included; the"
+    echo "programs run directly with the environment lighttpd gave velascgi for the same request, recorded through a wrapper):"
+    local -a tree
+    callgrind_run "$work/cg-minimal" "$work/cap-echo" "$MINIMAL"
+    read -r -a tree <<<"$(callgrind_tree "$work/cg-minimal")"
+    local base=${tree[0]} rt
+    printf '  %-32s %10s\n' "minimal CGI (baseline)" "$(mi "$base")"
+    if uses cgi; then
+        callgrind_run "$work/cg-velascgi" "$work/cap-echo"
+        read -r -a tree <<<"$(callgrind_tree "$work/cg-velascgi")"
+        rt=$(ratio "${tree[0]}" "$base")
+        printf '  %-32s %10s  %6sx in %d process(es) (goal <= 1.5x: %s)\n' "velascgi (CGI)" "$(mi "${tree[0]}")" "$rt" \
+            "${tree[1]}" "$(verdict "$rt" 1.5 at-most)"
+    fi
+    uses fcgi || return 0
+    if ! command -v cgi-fcgi >/dev/null; then
+        echo "  velafcgi: cgi-fcgi is not installed (package libfcgi-bin)"
+        return 0
+    fi
+    local dir=$work/cg-velafcgi
+    fcgi_callgrind "$dir" "$forked" "$inproc"
+    # The request children, in the order they were forked: the first call
+    # of the in-process echo, any further one the parent did not serve
+    # itself, then the forked echoes.
+    local -a kids
+    mapfile -t kids < <(callgrind_procs "$dir" | awk '$2 == 2 { print $1, $3 }' | sort -n | awk '{ print $2 }')
+    local med first n=${#kids[@]}
+    [ "$n" -gt "$forked" ] || die "velafcgi under callgrind forked $n request children for $forked forked requests"
+    first=${kids[0]}
+    med=$(printf '%s\n' "${kids[@]:n-forked}" | median)
+    rt=$(ratio "$med" "$base")
+    printf '  %-32s %10s  %6sx median of %d children (goal <= 0.5x: %s)\n' \
+        "velafcgi request child" "$(mi "$med")" "$rt" "$forked" "$(verdict "$rt" 0.5 at-most)"
+    printf '  %-32s the first child, which opened the library before its parent warmed it: %s\n' "" "$(mi "$first")"
+    read -r -a tree <<<"$(callgrind_procs "$dir" | awk '{ n[$2]++; i[$2] += $3 } END { print n[0], i[0], n[1], i[1] }')"
+    printf '  %-32s master %s, parent %s over the whole run (%d + %d requests)\n' "" "$(mi "${tree[1]}")" "$(mi "${tree[3]}")" \
+        $((1 + inproc)) "$forked"
+    if [ "$n" = $((forked + 1)) ]; then
+        printf '  %-32s %d calls of the echo marked "inProcess": the parent served them, no child forked\n' "velafcgi in process" "$inproc"
+    elif [ "$n" = $((forked + 1 + inproc)) ]; then
+        printf '  %-32s in-process not available in this build: %d calls of the echo marked "inProcess" forked %d children\n' \
+            "velafcgi in process" "$inproc" "$inproc"
+    else
+        printf '  %-32s %d request children for %d requests\n' "velafcgi" "$n" $((forked + 1 + inproc))
     fi
 }
 
@@ -450,28 +845,72 @@ remove_uploads() {
     fi
 }
 
+# ---- memory of a front end ---------------------------------------------------------
+
+# mem_begin FRONT / mem_end FRONT: around one transfer through FRONT, the
+# peak resident memory of every process of FRONT that took part goes to
+# PEAK ("velascgi N KiB", or "master N, parents N, request child N KiB")
+# and the largest of them (KiB) to PEAK_MAX; for velafcgi, NOCHILD is 1 when
+# the samples saw no request child.
+PEAK="" PEAK_MAX=0 NOCHILD=0
+mem_begin() {
+    if [ "$1" = cgi ]; then
+        : >"$MEMLOG"
+    else
+        fcgi_mem_start
+    fi
+}
+mem_end() {
+    local -a m
+    NOCHILD=0
+    if [ "$1" = cgi ]; then
+        PEAK_MAX=$(peak_kib "$MEMLOG")
+        PEAK="velascgi $PEAK_MAX KiB"
+    else
+        read -r -a m <<<"$(fcgi_mem_stop)"
+        PEAK="master ${m[0]}, parents ${m[1]}, request child ${m[2]} KiB"
+        [ "${m[3]}" = 0 ] && NOCHILD=1 && PEAK+=" (no request child sampled)"
+        PEAK_MAX=$(printf '%s\n' "${m[@]:0:3}" | largest)
+    fi
+}
+front_name() { if [ "$1" = cgi ]; then echo velascgi; else echo velafcgi; fi; }
+# serve_fronts XSENDFILE: a server for each front end measured, side by side.
+serve_fronts() {
+    uses fcgi && serve fcgi "$VELAFCGI" "$1" keep
+    uses cgi && serve cgi "$VELASCGI_MEM" "$1" keep
+    return 0
+}
+# mem_goal KIB NOCHILD: the verdict on peak memory under 16 MiB.
+mem_goal() {
+    if [ "$2" = 1 ]; then
+        echo "not known: a request child was not sampled"
+    else
+        verdict "$1" 16383 at-most
+    fi
+}
+
 # ---- upload ------------------------------------------------------------------------
 
-# upload_via QUERY NAME: one upload of the data file through velascgi; its
-# wall time goes to T, its peak RSS to PEAK; the first answer is printed.
-PEAK=0
+# upload_via QUERY NAME FRONT: one upload of the data file through FRONT;
+# its wall time goes to T, the peak memory to PEAK and PEAK_MAX (mem_end);
+# the first answer is printed.
 upload_via() {
-    local query=$1 name=$2 code answer=$work/upload-answer.txt t
-    : >"$MEMLOG"
+    local query=$1 name=$2 front=$3 code answer=$work/upload-answer.txt t
+    mem_begin "$front"
     timed curl -sS -o "$answer" -w '%{http_code}' -H 'Expect:' "${COOKIE_ARGS[@]}" \
-        -F "file=@$DATA;type=application/octet-stream" "$BASE/webapi/entry.cgi?$query" >"$work/code" ||
-        die "curl upload to $name failed"
+        -F "file=@$DATA;type=application/octet-stream" "${LT_BASE[$front]}/webapi/entry.cgi?$query" >"$work/code" ||
+        die "curl upload to $name through $(front_name "$front") failed"
     t=$T
+    mem_end "$front"
     code=$(cat "$work/code")
     if [ "$code" != 200 ] || ! grep -q '"success":true' "$answer"; then
         echo "upload answer of $name (HTTP $code): $(head -c 600 "$answer")" >&2
-        die "the upload through velascgi failed"
+        die "the upload through $(front_name "$front") failed"
     fi
     if [[ $ANSWERED != *" $name "* ]]; then
         echo "$name answer: $(head -c 300 "$answer")"
         ANSWERED+=" $name "
     fi
-    PEAK=$(peak_kib "$MEMLOG")
     remove_uploads
     sync
     T=$t
@@ -480,51 +919,74 @@ ANSWERED=" "
 
 bench_upload() {
     make_data
-    serve "$VELASCGI_MEM" 0
+    serve_fronts 0
     prepare_login || true
-    echo "== upload of $SIZE_MB MiB: velascgi multipart vs cat into a file on the same disk =="
+    echo "== upload of $SIZE_MB MiB: $(for f in $FRONT_ENDS; do printf '%s ' "$(front_name "$f")"; done)multipart vs cat into a file on the same disk =="
     echo "lighttpd server.stream-request-body = $(server_setting server.stream-request-body)"
     echo "receive: VELA.Bench.Transfer receive, the framework's upload path and nothing else;"
     echo "sample:  VELA.Sample upload, which reads each stored file again for its cksum"
-    local r tc tr ts tsh pr ps all_c="" all_r="" all_s="" all_sh="" peaks=""
+    echo "peak RSS: velascgi's from wait4 (a wrapper); velafcgi's from VmHWM of every process, sampled every 50 ms"
+    local r tc tsh front q line
+    local -A all=() peaks=() nochild=()
     for r in $(seq 1 "$XROUNDS"); do
         sync
         timed cat "$DATA" >"$VOLUME/cat-copy.bin" || die "cat failed"
         tc=$T
         rm -f "$VOLUME/cat-copy.bin"
         sync
-        upload_via "$RECEIVE_QUERY" receive
-        tr=$T
-        pr=$PEAK
-        upload_via "$UPLOAD_QUERY" sample
-        ts=$T
-        ps=$PEAK
+        all[cat]+="$(mbps "$BYTES" "$tc") "
+        line=$(printf 'round %d: cat %.1f MB/s' "$r" "$(mbps "$BYTES" "$tc")")
+        for front in $FRONT_ENDS; do
+            for q in receive sample; do
+                if [ "$q" = receive ]; then
+                    upload_via "$RECEIVE_QUERY" receive "$front"
+                else
+                    upload_via "$UPLOAD_QUERY" sample "$front"
+                fi
+                all[$front-$q]+="$(mbps "$BYTES" "$T") "
+                peaks[$front]+="$PEAK_MAX "
+                [ "$NOCHILD" = 1 ] && nochild[$front]=1
+                line+=$(printf '\n  %s %-7s %7.1f MB/s (peak RSS %s)' "$(front_name "$front")" "$q" "$(mbps "$BYTES" "$T")" "$PEAK")
+            done
+        done
         timed curl -sS -o /dev/null -H 'Expect:' -F "file=@$DATA;type=application/octet-stream" \
             "$BASE/bench/cat_upload.sh" || die "curl upload to the shell CGI failed"
         tsh=$T
         rm -f "$work/cgi-upload.out"
         sync
-
-        printf 'round %d: cat %7.1f MB/s   receive %7.1f MB/s (peak RSS %s KiB)   sample %7.1f MB/s (peak RSS %s KiB)   shell CGI cat %7.1f MB/s\n' \
-            "$r" "$(mbps "$BYTES" "$tc")" "$(mbps "$BYTES" "$tr")" "$pr" "$(mbps "$BYTES" "$ts")" "$ps" "$(mbps "$BYTES" "$tsh")"
-        all_c+="$(mbps "$BYTES" "$tc") "
-        all_r+="$(mbps "$BYTES" "$tr") "
-        all_s+="$(mbps "$BYTES" "$ts") "
-        all_sh+="$(mbps "$BYTES" "$tsh") "
-        peaks+="$pr $ps "
+        all[shell]+="$(mbps "$BYTES" "$tsh") "
+        line+=$(printf '\n  shell CGI cat %7.1f MB/s' "$(mbps "$BYTES" "$tsh")")
+        echo "$line"
     done
-    local mc mr ms msh mp
-    mc=$(echo "$all_c" | median)
-    mr=$(echo "$all_r" | median)
-    ms=$(echo "$all_s" | median)
-    msh=$(echo "$all_sh" | median)
-    mp=$(echo "$peaks" | largest)
-    printf 'median:  cat %.1f MB/s   receive %.1f MB/s = %s (goal >= 85%%: %s)   sample %.1f MB/s = %s (%s)\n' \
-        "$mc" "$mr" "$(percent "$mr" "$mc")" "$(at_least "$(ratio "$mr" "$mc")" 0.85)" \
-        "$ms" "$(percent "$ms" "$mc")" "$(at_least "$(ratio "$ms" "$mc")" 0.85)"
-    printf '         shell CGI cat through the same lighttpd %.1f MB/s (receive is %s of it)\n' "$msh" "$(percent "$mr" "$msh")"
-    printf 'velascgi peak RSS: %s KiB = %.1f MiB (goal < 16 MiB: %s)\n' "$mp" "$(awk -v k="$mp" 'BEGIN { print k / 1024 }')" \
-        "$(awk -v k="$mp" 'BEGIN { print (k < 16384) ? "met" : "MISSED" }')"
+    local mc msh m mp rt
+    mc=$(echo "${all[cat]}" | median)
+    msh=$(echo "${all[shell]}" | median)
+    echo "median of $XROUNDS rounds:"
+    printf '  %-22s %7.1f MB/s\n' "cat into a file" "$mc"
+    printf '  %-22s %7.1f MB/s (the same bytes through the same lighttpd into a shell CGI)\n' "shell CGI cat" "$msh"
+    if [ "$(ratio "$msh" "$mc")" != n/a ] && [ "$(verdict "$(ratio "$msh" "$mc")" 0.85)" != "goal met" ]; then
+        echo "  lighttpd bounds the uploads here: a shell CGI that only runs cat reaches $(percent "$msh" "$mc") of cat,"
+        echo "  so the front ends are better judged against it than against cat"
+    fi
+    for front in $FRONT_ENDS; do
+        for q in receive sample; do
+            m=$(echo "${all[$front-$q]}" | median)
+            rt=$(ratio "$m" "$mc")
+            line=$(printf '  %-22s %7.1f MB/s = %s of cat (goal >= 85%%: %s), %s of the shell CGI cat' \
+                "$(front_name "$front") $q" "$m" "$(percent "$m" "$mc")" "$(verdict "$rt" 0.85)" "$(percent "$m" "$msh")")
+            if [ "$front" = fcgi ] && uses cgi; then
+                rt=$(ratio "$m" "$(echo "${all[cgi-$q]}" | median)")
+                line+=$(printf '; %sx velascgi (goal >= 1x: %s)' "$rt" "$(verdict "$rt" 1)")
+            fi
+            echo "$line"
+        done
+    done
+    for front in $FRONT_ENDS; do
+        mp=$(echo "${peaks[$front]}" | largest)
+        printf '  %s peak RSS, largest process of any upload: %s KiB = %.1f MiB (goal < 16 MiB in every process: %s)\n' \
+            "$(front_name "$front")" "$mp" "$(awk -v k="$mp" 'BEGIN { print k / 1024 }')" "$(mem_goal "$mp" "${nochild[$front]:-0}")"
+    done
+    echo "  (the machine is shared: load average $(loadavg))"
 }
 
 # ---- download ----------------------------------------------------------------------
@@ -536,55 +998,71 @@ bench_download() {
         label="X-Sendfile on: lighttpd sends the file"
         fast_output yes
     else
-        label="X-Sendfile off: velascgi streams the file"
+        label="X-Sendfile off: the front end streams the file"
         fast_output no
     fi
-    serve "$VELASCGI_MEM" "$xsendfile"
+    serve_fronts "$xsendfile"
     prepare_login || true
     ln -sf "$DATA" "$DOCROOT/bench/static.bin"
-    echo "== download of $SIZE_MB MiB: velascgi ($label) vs cat of the file =="
+    echo "== download of $SIZE_MB MiB: $(for f in $FRONT_ENDS; do printf '%s ' "$(front_name "$f")"; done)($label) vs cat of the file =="
     echo "lighttpd server.stream-response-body = $(server_setting server.stream-response-body)"
-    local r meta tc tv ts tt peak all_c="" all_v="" all_s="" all_t="" peaks=""
+    local r meta tc ts tt front line
+    local -A all=() peaks=() nochild=()
     for r in $(seq 1 "$XROUNDS"); do
         timed cat "$DATA" >/dev/null || die "cat failed"
         tc=$T
-
-        : >"$MEMLOG"
-        timed curl -sS -o /dev/null -w '%{http_code} %{size_download}' "${COOKIE_ARGS[@]}" \
-            "$BASE/webapi/entry.cgi?$DOWNLOAD_QUERY" >"$work/meta" || die "curl download failed"
-        tv=$T
-        meta=$(cat "$work/meta")
-        if [ "$meta" != "200 $BYTES" ]; then
-            echo "download: HTTP status and size $meta, expected 200 $BYTES; the answer begins:" >&2
-            curl -s -i "${COOKIE_ARGS[@]}" -r 0-299 "$BASE/webapi/entry.cgi?$DOWNLOAD_QUERY" | head -c 900 >&2
-            die "the download through velascgi failed"
-        fi
-        peak=$(peak_kib "$MEMLOG")
-
+        all[cat]+="$(mbps "$BYTES" "$tc") "
+        line=$(printf 'round %d: cat %.1f MB/s' "$r" "$(mbps "$BYTES" "$tc")")
+        for front in $FRONT_ENDS; do
+            mem_begin "$front"
+            timed curl -sS -o /dev/null -w '%{http_code} %{size_download}' "${COOKIE_ARGS[@]}" \
+                "${LT_BASE[$front]}/webapi/entry.cgi?$DOWNLOAD_QUERY" >"$work/meta" || die "curl download failed"
+            mem_end "$front"
+            meta=$(cat "$work/meta")
+            if [ "$meta" != "200 $BYTES" ]; then
+                echo "download: HTTP status and size $meta, expected 200 $BYTES; the answer begins:" >&2
+                curl -s -i "${COOKIE_ARGS[@]}" -r 0-299 "${LT_BASE[$front]}/webapi/entry.cgi?$DOWNLOAD_QUERY" | head -c 900 >&2
+                die "the download through $(front_name "$front") failed"
+            fi
+            all[$front]+="$(mbps "$BYTES" "$T") "
+            peaks[$front]+="$PEAK_MAX "
+            [ "$NOCHILD" = 1 ] && nochild[$front]=1
+            line+=$(printf '\n  %s %7.1f MB/s (peak RSS %s)' "$(front_name "$front")" "$(mbps "$BYTES" "$T")" "$PEAK")
+        done
         timed curl -sS -o /dev/null "$BASE/bench/cat_download.sh" || die "curl download from the shell CGI failed"
         ts=$T
         timed curl -sS -o /dev/null "$BASE/bench/static.bin" || die "curl static download failed"
         tt=$T
-
-        printf 'round %d: velascgi %7.1f MB/s (peak RSS %s KiB)   cat %7.1f MB/s   shell CGI cat %7.1f MB/s   lighttpd static file %7.1f MB/s\n' \
-            "$r" "$(mbps "$BYTES" "$tv")" "$peak" "$(mbps "$BYTES" "$tc")" "$(mbps "$BYTES" "$ts")" "$(mbps "$BYTES" "$tt")"
-        all_v+="$(mbps "$BYTES" "$tv") "
-        all_c+="$(mbps "$BYTES" "$tc") "
-        all_s+="$(mbps "$BYTES" "$ts") "
-        all_t+="$(mbps "$BYTES" "$tt") "
-        peaks+="$peak "
+        all[shell]+="$(mbps "$BYTES" "$ts") "
+        all[static]+="$(mbps "$BYTES" "$tt") "
+        line+=$(printf '\n  shell CGI cat %7.1f MB/s   lighttpd static file %7.1f MB/s' "$(mbps "$BYTES" "$ts")" "$(mbps "$BYTES" "$tt")")
+        echo "$line"
     done
-    local mv mc ms mt mp
-    mv=$(echo "$all_v" | median)
-    mc=$(echo "$all_c" | median)
-    ms=$(echo "$all_s" | median)
-    mt=$(echo "$all_t" | median)
-    mp=$(echo "$peaks" | largest)
-    printf 'median:  velascgi %.1f MB/s   cat %.1f MB/s   ratio %s (goal >= 90%%: %s)\n' \
-        "$mv" "$mc" "$(percent "$mv" "$mc")" "$(at_least "$(ratio "$mv" "$mc")" 0.90)"
-    printf '         shell CGI cat %.1f MB/s (velascgi is %s of it), lighttpd static file %.1f MB/s (%s)\n' \
-        "$ms" "$(percent "$mv" "$ms")" "$mt" "$(percent "$mv" "$mt")"
-    printf 'velascgi peak RSS: %s KiB\n' "$mp"
+    local mc ms mt m rt mp
+    mc=$(echo "${all[cat]}" | median)
+    ms=$(echo "${all[shell]}" | median)
+    mt=$(echo "${all[static]}" | median)
+    echo "median of $XROUNDS rounds:"
+    printf '  %-22s %7.1f MB/s\n' "cat of the file" "$mc"
+    printf '  %-22s %7.1f MB/s\n' "shell CGI cat" "$ms"
+    printf '  %-22s %7.1f MB/s\n' "lighttpd static file" "$mt"
+    for front in $FRONT_ENDS; do
+        m=$(echo "${all[$front]}" | median)
+        rt=$(ratio "$m" "$mc")
+        line=$(printf '  %-22s %7.1f MB/s = %s of cat (goal >= 90%%: %s), %s of the shell CGI cat, %s of the static file' \
+            "$(front_name "$front")" "$m" "$(percent "$m" "$mc")" "$(verdict "$rt" 0.90)" "$(percent "$m" "$ms")" "$(percent "$m" "$mt")")
+        if [ "$front" = fcgi ] && uses cgi; then
+            rt=$(ratio "$m" "$(echo "${all[cgi]}" | median)")
+            line+=$(printf '; %sx velascgi (goal >= 1x: %s)' "$rt" "$(verdict "$rt" 1)")
+        fi
+        echo "$line"
+    done
+    for front in $FRONT_ENDS; do
+        mp=$(echo "${peaks[$front]}" | largest)
+        printf '  %s peak RSS, largest process of any download: %s KiB = %.1f MiB (goal < 16 MiB in every process: %s)\n' \
+            "$(front_name "$front")" "$mp" "$(awk -v k="$mp" 'BEGIN { print k / 1024 }')" "$(mem_goal "$mp" "${nochild[$front]:-0}")"
+    done
+    echo "  (the machine is shared: load average $(loadavg))"
 }
 
 # ---- compound requests -----------------------------------------------------------
@@ -729,13 +1207,13 @@ capture() {
 # echo, and the compounds whose form bodies are in $work/body-NAME.
 capture_all() {
     make_capture_wrapper
-    serve "$CAPTURE_CGI" 0
+    serve cgi "$CAPTURE_CGI" 0
     capture separate "$BASE/webapi/entry.cgi?$ECHO_QUERY"
     local m
     for m in sequential parallel empty inprocess; do
         capture "$m" -H 'Content-Type: application/x-www-form-urlencoded' --data-binary "@$work/body-$m" "$BASE/webapi/entry.cgi"
     done
-    serve "$VELASCGI" 0
+    serve cgi "$VELASCGI" 0
 }
 # replay_env CAPTURE: the recorded environment into REPLAY_ENV, as lighttpd
 # gave it to velascgi.
@@ -821,17 +1299,17 @@ compound_label() {
 # own instructions. The run is over when every process has ended (as for
 # cpu_tree).
 callgrind_run() {
-    local dir=$1 cap=$2
+    local dir=$1 cap=$2 program=${3:-$VELASCGI}
     mkdir -p "$dir"
     replay_env "$cap"
     CG_RUNS=$((CG_RUNS + 1))
     env -i "${REPLAY_ENV[@]}" "$VALGRIND" --tool=callgrind --trace-children=yes --dump-before='*fork*' \
-        --log-file="$dir/valgrind.%p" --callgrind-out-file="$dir/callgrind.out.%p" "$VELASCGI" \
+        --log-file="$dir/valgrind.%p" --callgrind-out-file="$dir/callgrind.out.%p" "$program" \
         <"$cap/body" 2>&1 >"$dir/answer.$CG_RUNS" | cat >>"$dir/stderr"
     grep -q '"success":true' "$dir/answer.$CG_RUNS" || {
         head -c 600 "$dir/answer.$CG_RUNS" >&2
         tail -n 20 "$dir/stderr" "$dir"/valgrind.* >&2
-        die "velascgi under callgrind did not succeed"
+        die "${program##*/} under callgrind did not succeed"
     }
 }
 CG_RUNS=0
@@ -934,7 +1412,7 @@ compound_instructions() {
 
 bench_compound() {
     [ -f "$COMPOUND_LIB" ] && [ -x "$FORK_COST" ] || die "the compound benchmark's programs are not built in $build"
-    serve "$VELASCGI" 0
+    serve cgi "$VELASCGI" 0
     prepare_login || die "the echo call does not succeed: set BENCH_ECHO_QUERY"
     local echo_url="$BASE/webapi/entry.cgi?$ECHO_QUERY" call inproc rest
     call=$(query_json "$ECHO_QUERY") || die "BENCH_ECHO_QUERY holds a control character"
@@ -1025,7 +1503,7 @@ bench_compound() {
 }
 
 bench_compound_sleep() {
-    serve "$VELASCGI" 0
+    serve cgi "$VELASCGI" 0
     local url="$BASE/webapi/entry.cgi?api=VELA.Bench.Compound&version=1&method=sleep&ms=$SLEEP_MS"
     local call="{\"api\":\"VELA.Bench.Compound\",\"version\":1,\"method\":\"sleep\",\"ms\":$SLEEP_MS}"
     compound_form "$work/body-sleep-sequential" sequential "$call" "$CALLS"
@@ -1061,7 +1539,7 @@ bench_compound_sleep() {
 
 # Without velascgi: the baselines, to see the script and the machine work.
 bench_baselines_only() {
-    serve "$MINIMAL" 0
+    serve cgi "$MINIMAL" 0
     echo "velascgi or the staged web-API directory is missing in $build: baselines only"
     echo "baseline answer: $(curl -s "$BASE/bench/minimal.cgi?$ECHO_QUERY")"
     echo "baseline: $(wrk_rps "$BASE/bench/minimal.cgi?$ECHO_QUERY") req/s (wrk -t$THREADS -c$CONNS -d${DURATION}s)"
