@@ -151,8 +151,6 @@ bool APIRunner::WarmUp(const std::string& api, std::string* lib)
     }
 }
 
-size_t APIRunner::OpenedLibraries() const { return d_->libs.Size(); }
-
 bool APIRunner::CacheLib(APIRequest* req, void** handle)
 {
     if (!req) {

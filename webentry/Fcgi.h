@@ -83,9 +83,14 @@ bool WriteFully(int fd, const void* data, size_t length);
 // goes to `waiting` without them, for the waits that take them.
 void CatchStopAndChildren(void (*onStop)(int), void (*onChild)(int), sigset_t& blocked, sigset_t& waiting);
 
-// Writes a whole reply (CGI header lines and body) to a FastCGI connection as
-// one stdout stream followed by the end of the request. False when the
-// connection refused it.
+// Writes `length` bytes of the reply to a FastCGI connection as stdout
+// records of up to 65535 bytes each. False when the connection refused them.
+bool WriteStdout(int fd, int requestId, const char* data, size_t length);
+// Ends the request: the empty stdout record, then the end of the request
+// (application status 0, request complete).
+bool WriteEndRequest(int fd, int requestId);
+// A whole reply (CGI header lines and body) and the end of the request, on a
+// connection given a few seconds to take it.
 bool WriteWholeReply(int fd, int requestId, const char* text, size_t length);
 
 }  // namespace Fcgi

@@ -35,7 +35,10 @@ namespace {
 // Bounds on what the web server may hand over as parameters.
 constexpr size_t kMaxParams = 1000;
 constexpr size_t kMaxParamBytes = 1 << 20;
-constexpr size_t kChunk = 64 * 1024;
+constexpr size_t kChunk = 256 * 1024;
+// Room in the pipe of standard output; the default, 64 KiB, makes a
+// download take twice the switches between the call and the thread.
+constexpr int kPipeBytes = 1 << 20;
 
 // The names a request's parameters never set: the server's own environment
 // (VELA_ROOT and the like), the dynamic loader's, and the proxy variable a
@@ -118,7 +121,7 @@ void* PumpOut(void* arg)
         }
         int expected = kNothingSent;
         b.slot->state.compare_exchange_strong(expected, kReplyStarted);
-        if (FCGX_PutStr(buffer, static_cast<int>(n), b.req->out) != n || FCGX_FFlush(b.req->out) != 0) {
+        if (!WriteStdout(b.req->ipcFd, b.req->requestId, buffer, static_cast<size_t>(n))) {
             // The web server went away: the call's next write fails, as a
             // CGI program's does when its pipe is gone.
             b.outFailed = true;
@@ -171,11 +174,8 @@ void FinishReply()
         (void)!write(b.finish, &one, sizeof(one));
         pthread_join(b.outThread, nullptr);
     }
-    if (!b.outFailed) {
-        FCGX_FClose(b.req->err);
-        if (FCGX_FClose(b.req->out) == 0) {
-            b.slot->state.store(kReplyEnded);
-        }
+    if (!b.outFailed && WriteEndRequest(b.req->ipcFd, b.req->requestId)) {
+        b.slot->state.store(kReplyEnded);
     }
     // Standard input goes too, so that an input thread blocked on a full
     // pipe stops; one waiting for the web server is woken by the shutdown.
@@ -212,6 +212,7 @@ bool Plumb(Bridge& b, FCGX_Request& req, Slot& slot)
         VELA_LOG_ERR("cannot make the reply's pipe[%m]");
         return false;
     }
+    fcntl(out[0], F_SETPIPE_SZ, kPipeBytes);  // a smaller pipe only costs speed
     dup2(out[1], STDOUT_FILENO);
     close(out[1]);
     b.outRead = out[0];
@@ -307,9 +308,11 @@ void ServeChild(FCGX_Request& req, WebEntry& entry, const SlotArea& slots, int o
         WriteReply(kSetupFailedReply, kSetupFailedReplyLength);
         exit(0);
     }
-    const size_t before = entry.OpenedLibraries();
     ServeCgiRequest(argc, argv, &entry);
-    if (entry.OpenedLibraries() > before && entry.GetRequest() != nullptr) {
+    // The API of a call that got as far as its description (its library
+    // may have been warm already, opened for another API).
+    if (entry.GetRequest() != nullptr && entry.GetRequest()->GetAPIInfo("lib", "").isString() &&
+        !entry.GetRequest()->GetAPIInfo("lib", "").asString().empty()) {
         const std::string api = entry.GetRequest()->GetAPIClass();
         if (api.size() < sizeof(slot.api)) {
             memcpy(slot.api, api.c_str(), api.size() + 1);

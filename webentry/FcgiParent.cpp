@@ -18,6 +18,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/time.h>
+#include <sys/uio.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <vector>
@@ -304,11 +305,10 @@ void Parent::ServeHere(FCGX_Request& req)
         ssize_t n;
         bool sent = true;
         while (sent && (n = read(reply, buffer, sizeof(buffer))) > 0) {
-            sent = FCGX_PutStr(buffer, static_cast<int>(n), req.out) == n;
+            sent = WriteStdout(req.ipcFd, req.requestId, buffer, static_cast<size_t>(n));
         }
         if (sent) {
-            FCGX_FClose(req.err);
-            FCGX_FClose(req.out);
+            WriteEndRequest(req.ipcFd, req.requestId);
         }
     }
     KeepOwnEnvironment();
@@ -487,27 +487,52 @@ void CatchStopAndChildren(void (*onStop)(int), void (*onChild)(int), sigset_t& b
     sigdelset(&waiting, SIGCHLD);
 }
 
-bool WriteWholeReply(int fd, int requestId, const char* text, size_t length)
+bool WriteStdout(int fd, int requestId, const char* data, size_t length)
 {
-    // The reply is small; a web server that does not read it within a few
-    // seconds does not hold the parent up.
-    const timeval timeout{3, 0};
-    setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &timeout, sizeof(timeout));
     unsigned char h[8];
     while (length > 0) {
         const size_t part = std::min<size_t>(length, 65535);
         Header(h, kStdout, requestId, part);
-        if (!WriteFully(fd, h, sizeof(h)) || !WriteFully(fd, reinterpret_cast<const unsigned char*>(text), part)) {
-            return false;
+        iovec iov[2] = {{h, sizeof(h)}, {const_cast<char*>(data), part}};
+        int at = 0;
+        while (at < 2) {
+            const ssize_t n = writev(fd, iov + at, 2 - at);
+            if (n < 0 && errno == EINTR) {
+                continue;
+            }
+            if (n <= 0) {
+                return false;
+            }
+            size_t done = static_cast<size_t>(n);
+            while (at < 2 && done >= iov[at].iov_len) {
+                done -= iov[at].iov_len;
+                ++at;
+            }
+            if (at < 2) {
+                iov[at].iov_base = static_cast<char*>(iov[at].iov_base) + done;
+                iov[at].iov_len -= done;
+            }
         }
-        text += part;
+        data += part;
         length -= part;
     }
+    return true;
+}
+
+bool WriteEndRequest(int fd, int requestId)
+{
     unsigned char end[24];
     Header(end, kStdout, requestId, 0);
     Header(end + 8, kEndRequest, requestId, 8);
-    memset(end + 16, 0, 8);  // application status 0, request complete
+    memset(end + 16, 0, 8);
     return WriteFully(fd, end, sizeof(end));
+}
+
+bool WriteWholeReply(int fd, int requestId, const char* text, size_t length)
+{
+    const timeval timeout{3, 0};
+    setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &timeout, sizeof(timeout));
+    return WriteStdout(fd, requestId, text, length) && WriteEndRequest(fd, requestId);
 }
 
 int RunParent(int listenFd, const Options& options, int argc, char** argv)

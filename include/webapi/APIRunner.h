@@ -119,8 +119,6 @@ public:
     // both ready. The library's path, as the description names it, goes to
     // `lib`. False when the name, the description or the library fails.
     bool WarmUp(const std::string& api, std::string* lib = nullptr);
-    // How many handler libraries this runner has opened.
-    size_t OpenedLibraries() const;
     // Whether a warm process may serve this method itself, without a child:
     // its API's description is loaded already, lists the method, and the
     // method says "inProcess", runs as the superuser (the warm process's

@@ -92,6 +92,19 @@ srv_wait 40 0.1 in_process "" || fail "not served in process again: $(cat "$TMP/
 expect "in process again, the earlier call's parameters gone" '"params":{"api":"VELA.Pipe.Sub","method":"reportDefault","version":"1"}'
 call "$SUB&method=report"
 expect "a child after calls in process" '"success":true'
+# Another API of the same library, already loaded for the first: it gets
+# warm as well, and is served in process too.
+srv_api VELA.Pipe.Ids <<EOF
+{"VELA.Pipe.Ids": {"lib": "$PIPE_LIB", "minVersion": 1, "maxVersion": 1, "authLevel": 0,
+  "methods": {"1": [{"dropped": {"inProcess": true}}]}}}
+EOF
+ids_in_process() {
+  call "$URL?api=VELA.Pipe.Ids&version=1&method=dropped"
+  local pid
+  pid=$(sed -n 's/.*"pid":\([0-9]*\).*/\1/p' "$TMP/body")
+  [ -n "$pid" ] && parents | grep -qx "$pid"
+}
+srv_wait 40 0.1 ids_in_process || fail "an API sharing a warm library is never served in process: $(cat "$TMP/body")"
 
 # ---- At most two children at once (one per parent): two sleeping requests
 # hold them, a third is refused with 503 and a JSON error.
