@@ -14,6 +14,7 @@
 #include <fcntl.h>
 #include <iostream>
 #include <poll.h>
+#include <sys/ioctl.h>
 #include <pthread.h>
 #include <sys/eventfd.h>
 #include <sys/mman.h>
@@ -77,6 +78,7 @@ struct Bridge {
     pthread_t outThread{};
     bool outStarted = false;
     bool outFailed = false;
+    bool splice = true;    // the connection takes splice(2) (else read and write)
     int inWrite = -1;      // standard input's pipe, written by the input thread
     long long bodyLeft = 0;
     pthread_t inThread{};
@@ -86,42 +88,85 @@ struct Bridge {
 
 Bridge g_bridge;
 
+// One stdout record of the `length` bytes waiting in the pipe: its header
+// written, its content moved from the pipe to the connection by the kernel
+// (splice), or read and written where the connection cannot take a splice.
+bool ForwardRecord(Bridge& b, size_t length)
+{
+    int expected = kNothingSent;
+    b.slot->state.compare_exchange_strong(expected, kReplyStarted);
+    unsigned char header[8] = {1, 6, static_cast<unsigned char>((b.req->requestId >> 8) & 0xff),
+                               static_cast<unsigned char>(b.req->requestId & 0xff),
+                               static_cast<unsigned char>((length >> 8) & 0xff),
+                               static_cast<unsigned char>(length & 0xff), 0, 0};
+    if (!WriteFully(b.req->ipcFd, header, sizeof(header))) {
+        return false;
+    }
+    static char buffer[kChunk];
+    while (length > 0) {
+        if (b.splice) {
+            const ssize_t n = splice(b.outRead, nullptr, b.req->ipcFd, nullptr, length, SPLICE_F_MOVE);
+            if (n > 0) {
+                length -= static_cast<size_t>(n);
+                continue;
+            }
+            if (n < 0 && errno == EINTR) {
+                continue;
+            }
+            if (n < 0 && errno == EINVAL) {
+                b.splice = false;
+                continue;
+            }
+            return false;
+        }
+        const ssize_t n = read(b.outRead, buffer, std::min(length, sizeof(buffer)));
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0 || !WriteFully(b.req->ipcFd, buffer, static_cast<size_t>(n))) {
+            return false;
+        }
+        length -= static_cast<size_t>(n);
+    }
+    return true;
+}
+
 // Standard output to the web server, as stdout records, until the call is
 // over and the pipe holds nothing more.
 void* PumpOut(void* arg)
 {
     Bridge& b = *static_cast<Bridge*>(arg);
-    static char buffer[kChunk];
     bool draining = false;
     for (;;) {
-        if (!draining) {
-            pollfd fds[2] = {{b.outRead, POLLIN, 0}, {b.finish, POLLIN, 0}};
-            if (poll(fds, 2, -1) < 0) {
-                if (errno == EINTR) {
-                    continue;
-                }
-                break;
+        pollfd fds[2] = {{b.outRead, POLLIN, 0}, {b.finish, POLLIN, 0}};
+        if (poll(fds, draining ? 1 : 2, draining ? 0 : -1) < 0) {
+            if (errno == EINTR) {
+                continue;
             }
-            if ((fds[1].revents & POLLIN) != 0 && (fds[0].revents & (POLLIN | POLLHUP)) == 0) {
-                // Over, and nothing waiting: what a process that has not
-                // let go of standard output writes later is not waited for.
-                break;
-            }
-            if ((fds[1].revents & POLLIN) != 0) {
-                draining = true;
-                fcntl(b.outRead, F_SETFL, fcntl(b.outRead, F_GETFL) | O_NONBLOCK);
-            }
+            break;
         }
-        const ssize_t n = read(b.outRead, buffer, sizeof(buffer));
-        if (n < 0 && errno == EINTR) {
+        if ((fds[1].revents & POLLIN) != 0) {
+            draining = true;
+        }
+        if ((fds[0].revents & (POLLIN | POLLHUP)) == 0) {
+            if (draining) {
+                // Over, and nothing waiting: what a process that has not let
+                // go of standard output writes later is not waited for.
+                break;
+            }
             continue;
         }
-        if (n <= 0) {
-            break;  // end of output, or drained
+        int waiting = 0;
+        if (ioctl(b.outRead, FIONREAD, &waiting) != 0) {
+            break;
         }
-        int expected = kNothingSent;
-        b.slot->state.compare_exchange_strong(expected, kReplyStarted);
-        if (!WriteStdout(b.req->ipcFd, b.req->requestId, buffer, static_cast<size_t>(n))) {
+        if (waiting <= 0) {
+            if ((fds[0].revents & POLLHUP) != 0) {
+                break;  // every writer has gone: the end of the output
+            }
+            continue;
+        }
+        if (!ForwardRecord(b, std::min<size_t>(static_cast<size_t>(waiting), 65535))) {
             // The web server went away: the call's next write fails, as a
             // CGI program's does when its pipe is gone.
             b.outFailed = true;
