@@ -10,6 +10,8 @@
 
 #include <exception>
 #include <glob.h>
+#include <mutex>
+#include <sys/stat.h>
 #include <set>
 #include <string>
 
@@ -81,11 +83,45 @@ bool ResolvedCall::Flag(const std::string& attr) const
 
 Registry::Registry() : defaults_(Json::objectValue), table_(Json::objectValue) {}
 
+// The last lib.def read by this process, known by its file's identity, size
+// and modification time: a process that makes many runners (a warm front
+// end) reads and parses the file again only when it changed.
+namespace {
+struct ReadDefaults {
+    std::mutex lock;
+    std::string path;
+    struct stat st {};
+    Json::Value value;
+};
+
+bool SameFile(const struct stat& a, const struct stat& b)
+{
+    return a.st_dev == b.st_dev && a.st_ino == b.st_ino && a.st_size == b.st_size &&
+           a.st_mtim.tv_sec == b.st_mtim.tv_sec && a.st_mtim.tv_nsec == b.st_mtim.tv_nsec;
+}
+}  // namespace
+
 void Registry::LoadDefaults(const std::string& path)
 {
+    static ReadDefaults last;
+    struct stat st {};
+    const bool known = stat(path.c_str(), &st) == 0;
+    {
+        std::lock_guard<std::mutex> hold(last.lock);
+        if (known && last.path == path && SameFile(last.st, st)) {
+            defaults_ = last.value;
+            return;
+        }
+    }
     Json::Value def;
     if (WebAPIUtil::ReadJsonFile(path, def) && def.isObject()) {
         defaults_ = def;
+        if (known) {
+            std::lock_guard<std::mutex> hold(last.lock);
+            last.path = path;
+            last.st = st;
+            last.value = def;
+        }
     }
 }
 

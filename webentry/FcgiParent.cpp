@@ -272,9 +272,12 @@ bool Parent::InProcess(FCGX_Request& req) const
 // its own; the per-client slots and the time limits of a child do not apply.
 void Parent::ServeHere(FCGX_Request& req)
 {
-    struct sigaction saved[NSIG];
-    for (int sig = 1; sig < NSIG; ++sig) {
-        sigaction(sig, nullptr, &saved[sig]);
+    // The signals whose actions the road sets (the upload clean-up, the
+    // request limits) or this process relies on.
+    static const int kKept[] = {SIGTERM, SIGINT, SIGHUP, SIGPIPE, SIGALRM, SIGXCPU, SIGCHLD, SIGUSR1};
+    struct sigaction saved[sizeof(kKept) / sizeof(kKept[0])];
+    for (size_t i = 0; i < sizeof(kKept) / sizeof(kKept[0]); ++i) {
+        sigaction(kKept[i], nullptr, &saved[i]);
     }
     const int reply = memfd_create("velafcgi-reply", MFD_CLOEXEC);
     const int null = open("/dev/null", O_RDONLY | O_CLOEXEC);
@@ -312,10 +315,8 @@ void Parent::ServeHere(FCGX_Request& req)
         }
     }
     KeepOwnEnvironment();
-    for (int sig = 1; sig < NSIG; ++sig) {
-        if (sig != SIGKILL && sig != SIGSTOP) {
-            sigaction(sig, &saved[sig], nullptr);
-        }
+    for (size_t i = 0; i < sizeof(kKept) / sizeof(kKept[0]); ++i) {
+        sigaction(kKept[i], &saved[i], nullptr);
     }
     for (int fd : {reply, null, savedIn, savedOut}) {
         if (fd >= 0) {
