@@ -31,6 +31,8 @@
 # outside the namespace; every file made here is removed on the way out.
 set -u -o pipefail
 
+. "$(dirname "$0")/devlog.sh"
+
 here=$(cd "$(dirname "$0")" && pwd)
 top=$(cd "$here/.." && pwd)
 die() {
@@ -90,28 +92,7 @@ if [ -n "${VELA_BENCH_NS:-}" ]; then
     mount -t tmpfs -o mode=755,size=256m vela-cgicost "$work/state" || die "cannot mount a tmpfs"
     NOTE="state roots on tmpfs, syslog: the machine's log daemon"
     if [ ! -S /dev/log ]; then
-        # A /dev of this namespace only: the machine's nodes bound again, and
-        # a log sink on /dev/log.
-        mkdir "$work/dev" && mount --rbind /dev "$work/dev" &&
-            mount -t tmpfs -o mode=755,size=1m vela-cgicost-dev /dev || die "cannot give the namespace its /dev"
-        for node in "$work"/dev/*; do
-            name=${node##*/}
-            if [ -L "$node" ]; then
-                cp -P "$node" "/dev/$name"
-            elif [ -d "$node" ]; then
-                mkdir "/dev/$name" && mount --rbind "$node" "/dev/$name"
-            else
-                touch "/dev/$name" && mount --bind "$node" "/dev/$name"
-            fi || die "cannot bind /dev/$name"
-        done
-        umount -l "$work/dev"
-        "$LOG_SINK" /dev/log "$work/syslog.txt" &
-        sink_pid=$!
-        for i in $(seq 1 50); do
-            [ -S /dev/log ] && break
-            sleep 0.1
-        done
-        [ -S /dev/log ] || die "the log sink did not start"
+        bench_dev_log "$work" "$LOG_SINK" "$work/syslog.txt"
         NOTE="state roots on tmpfs, syslog: a sink on /dev/log (no log daemon on this machine)"
     fi
 elif [ ! -S /dev/log ]; then

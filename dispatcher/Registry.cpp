@@ -91,6 +91,7 @@ struct ReadDefaults {
     std::mutex lock;
     std::string path;
     struct stat st {};
+    bool kept = false;  // `value` holds the file (from the second read on)
     Json::Value value;
 };
 
@@ -108,7 +109,7 @@ void Registry::LoadDefaults(const std::string& path)
     const bool known = stat(path.c_str(), &st) == 0;
     {
         std::lock_guard<std::mutex> hold(last.lock);
-        if (known && last.path == path && SameFile(last.st, st)) {
+        if (known && last.kept && last.path == path && SameFile(last.st, st)) {
             defaults_ = last.value;
             return;
         }
@@ -117,10 +118,16 @@ void Registry::LoadDefaults(const std::string& path)
     if (WebAPIUtil::ReadJsonFile(path, def) && def.isObject()) {
         defaults_ = def;
         if (known) {
+            // A process that makes one runner (velascgi) never pays for the
+            // copy: the file is kept once it has been read twice.
             std::lock_guard<std::mutex> hold(last.lock);
+            const bool again = last.path == path && SameFile(last.st, st);
             last.path = path;
             last.st = st;
-            last.value = def;
+            last.kept = again;
+            if (again) {
+                last.value = def;
+            }
         }
     }
 }

@@ -73,6 +73,8 @@
 # removed, on every way out.
 set -u -o pipefail
 
+. "$(dirname "$0")/../devlog.sh"
+
 here=$(cd "$(dirname "$0")" && pwd)
 top=$(cd "$here/../.." && pwd)
 build=$(cd "${1:-$top/build}" 2>/dev/null && pwd) || {
@@ -205,28 +207,7 @@ SYSLOG_NOTE="syslog: the machine's log daemon"
 if [ -n "${VELA_BENCH_NS:-}" ]; then
     mount -t tmpfs -o mode=755,size=64m vela-bench-run "$ROOT/run" || die "cannot mount a tmpfs on $ROOT/run"
     if [ ! -S /dev/log ]; then
-        # A /dev of this namespace only: the machine's nodes bound again, and
-        # a log sink on /dev/log.
-        mkdir "$work/dev" && mount --rbind /dev "$work/dev" &&
-            mount -t tmpfs -o mode=755,size=1m vela-bench-dev /dev || die "cannot give the namespace its /dev"
-        for node in "$work"/dev/*; do
-            name=${node##*/}
-            if [ -L "$node" ]; then
-                cp -P "$node" "/dev/$name"
-            elif [ -d "$node" ]; then
-                mkdir "/dev/$name" && mount --rbind "$node" "/dev/$name"
-            else
-                touch "/dev/$name" && mount --bind "$node" "/dev/$name"
-            fi || die "cannot bind /dev/$name"
-        done
-        umount -l "$work/dev"
-        "$LOG_SINK" /dev/log "$SYSLOG" &
-        sink_pid=$!
-        for i in $(seq 1 50); do
-            [ -S /dev/log ] && break
-            sleep 0.1
-        done
-        [ -S /dev/log ] || die "the log sink did not start"
+        bench_dev_log "$work" "$LOG_SINK" "$SYSLOG"
         SYSLOG_NOTE="syslog: no log daemon on this machine, a sink on /dev/log takes the lines"
     fi
 elif [ ! -S /dev/log ]; then
