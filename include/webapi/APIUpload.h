@@ -31,10 +31,8 @@
 namespace VELA {
 
 class APIRequest;
-// Defined inside the library, not exported.
-#pragma GCC visibility push(hidden)
+// Defined inside the library; exported for the library's own tests.
 class APIUploadPrivate;
-#pragma GCC visibility pop
 
 enum {
     UPLOAD_RESULT_SUCCESS = 1,
