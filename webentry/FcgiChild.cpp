@@ -347,12 +347,15 @@ void ServeChild(FCGX_Request& req, WebEntry& entry, const SlotArea& slots, int o
     }
 
     Bridge& b = g_bridge;
-    const bool ready = SetRequestEnvironment(req.envp, options) && Plumb(b, req, slot);
-    atexit(FinishReply);
-    if (!ready) {
-        WriteReply(kSetupFailedReply, kSetupFailedReplyLength);
-        exit(0);
+    if (!SetRequestEnvironment(req.envp, options) || !Plumb(b, req, slot)) {
+        // Answered on the connection itself: standard output may not lead
+        // there yet.
+        if (WriteWholeReply(req.ipcFd, req.requestId, kSetupFailedReply, kSetupFailedReplyLength)) {
+            slot.state.store(kReplyEnded);
+        }
+        _exit(0);
     }
+    atexit(FinishReply);
     ServeCgiRequest(argc, argv, &entry);
     // The API of a call that got as far as its description (its library
     // may have been warm already, opened for another API).

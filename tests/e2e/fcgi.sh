@@ -174,6 +174,11 @@ if command -v cgi-fcgi >/dev/null 2>&1; then
   srv_wait 50 0.1 direct || fail "cgi-fcgi could not ask velafcgi"
   grep -q '"success":true' "$TMP/direct" || fail "direct call: $(cat "$TMP/direct")"
   grep -q '"VELA_WEBAPI_USERNAME":"(unset)"' "$TMP/direct" || fail "a parameter set VELA_WEBAPI_USERNAME: $(cat "$TMP/direct")"
+  # More parameters than a web server ever sends: refused with 117.
+  mapfile -t many < <(seq -f 'P%g=x' 1 1001)
+  direct "${many[@]}"
+  grep -q '"code":117' "$TMP/direct" || fail "1001 parameters: $(head -c 300 "$TMP/direct")"
+  grep -q 'more than 1000 parameters' "$RUN/cgi.log" || fail "no log line for 1001 parameters"
   kill -TERM "$own"
   wait "$own" || fail "velafcgi did not stop cleanly"
   [ ! -e "$sock" ] || fail "the socket was left behind"
