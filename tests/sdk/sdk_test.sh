@@ -28,10 +28,11 @@ if grep -v "^-- Install configuration" "$tmp/install.log" | grep -v "$prefix/" |
   fail "installed outside the prefix"
 fi
 
-# The layout, relative to the prefix (lib/ is the library directory of a
-# prefix other than /usr).
-lib=$prefix/lib/libwebapi-TARN5.so
-[ -f "$lib" ] || fail "no $lib"
+# The layout, relative to the prefix. The library directory is lib/, or
+# lib/<triplet> when the build was configured for the prefix /usr.
+lib=$(find "$prefix/lib" -name libwebapi-TARN5.so | head -n 1)
+[ -n "$lib" ] || fail "no libwebapi-TARN5.so under $prefix/lib"
+libdir=$(dirname "$lib")
 if command -v readelf >/dev/null 2>&1; then
   readelf -d "$lib" | grep -q 'SONAME.*\[libwebapi-TARN5.so\]' || fail "SONAME of $lib"
 fi
@@ -42,7 +43,7 @@ for f in include/webapi/APIRequest.h include/webapi/APITable.h include/vela/expo
          lib/sharing/permission_lib/sample-share.so \
          share/vela/lighttpd.conf.in share/vela/entry-cgi.conf.in share/vela/pam/vela-webapi \
          share/vela/www/login.html share/vela/errors/vela-error-404.html \
-         lib/pkgconfig/vela-webapi.pc lib/cmake/VelaWebAPI/VelaWebAPIConfig.cmake; do
+         "${libdir#$prefix/}/pkgconfig/vela-webapi.pc" "${libdir#$prefix/}/cmake/VelaWebAPI/VelaWebAPIConfig.cmake"; do
   [ -e "$prefix/$f" ] || fail "not installed: $f"
 done
 # Every public header, and nothing else of the sources.
@@ -53,7 +54,7 @@ headers_dst=$(cd "$prefix/include" && find . -type f | sed 's|^\./||' | sort)
 # The template, through the CMake package, found in the prefix only.
 "$cmake" -S "$template" -B "$tmp/b" -DCMAKE_PREFIX_PATH="$prefix" \
   -DCMAKE_FIND_USE_PACKAGE_REGISTRY=OFF >"$tmp/b.log" 2>&1 || { cat "$tmp/b.log"; fail "configure (CMake package)"; }
-grep -qx "VelaWebAPI_DIR:PATH=$prefix/lib/cmake/VelaWebAPI" "$tmp/b/CMakeCache.txt" || fail "package not from the prefix"
+grep -qx "VelaWebAPI_DIR:PATH=$libdir/cmake/VelaWebAPI" "$tmp/b/CMakeCache.txt" || fail "package not from the prefix"
 "$cmake" --build "$tmp/b" >>"$tmp/b.log" 2>&1 || { cat "$tmp/b.log"; fail "build (CMake package)"; }
 "$ctest" --test-dir "$tmp/b" --output-on-failure || fail "template tests (CMake package)"
 
@@ -64,7 +65,7 @@ if [ "$(id -u)" -eq 0 ]; then
   mkdir -p "$root/usr/vela/velaman/webapi"
   cp "$prefix/vela/velaman/webapi/lib.def" "$root/usr/vela/velaman/webapi/"
   got=$(printf '%s' '{"getParam": {"api": "VELA.Greet", "version": 1, "method": "greet", "name": "ann", "port": 8080}}' |
-    LD_LIBRARY_PATH="$prefix/lib" VELA_ROOT="$root" "$prefix/bin/velarun" -C "$tmp/b/webapi") || fail "velarun: $got"
+    LD_LIBRARY_PATH="$libdir" VELA_ROOT="$root" "$prefix/bin/velarun" -C "$tmp/b/webapi") || fail "velarun: $got"
   [ "$got" = '{"data":{"hello":"ann","port":8080,"user":""},"httpd_restart":false,"success":true}' ] ||
     fail "velarun answered $got"
 else
@@ -72,7 +73,7 @@ else
 fi
 
 # The same through pkg-config.
-PKG_CONFIG_PATH="$prefix/lib/pkgconfig${PKG_CONFIG_PATH:+:$PKG_CONFIG_PATH}"
+PKG_CONFIG_PATH="$libdir/pkgconfig${PKG_CONFIG_PATH:+:$PKG_CONFIG_PATH}"
 export PKG_CONFIG_PATH
 [ "$(pkg-config --variable=includedir vela-webapi)" = "$prefix/include" ] || fail "includedir of vela-webapi.pc"
 "$cmake" -S "$template" -B "$tmp/p" -DGREET_USE_PKGCONFIG=ON >"$tmp/p.log" 2>&1 || { cat "$tmp/p.log"; fail "configure (pkg-config)"; }
