@@ -1,0 +1,150 @@
+#!/usr/bin/env bash
+# Calls relayed to a peer appliance: two servers of their own (each its own
+# system root, sessions and tokens), the peer on 127.0.0.2 and this server
+# on 127.0.0.1, which names the peer in its peers file with an access token
+# the peer issued. Then: calls relayed as query and as form, a download with
+# and without a range, an upload; callers without a session or without the
+# relay privilege; peers that are unknown, down, silent, garbled or too
+# talkative; a peers file others may read; the peer's token revoked there.
+set -u
+
+. "$(dirname "$0")/server.sh"
+srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
+srv_require "velascgi switches to the identity each API asks for" python3 cmp cksum
+
+# ---- The peer: its own root, a data volume with a file (this server has
+# no volume: a file that comes back came from the peer).
+SRV_BIND=127.0.0.2
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1
+mkdir -p "$ROOT/vol1/sample"
+echo /vol1 >"$ROOT/etc/vela/volumes.conf"
+head -c 300000 /dev/urandom >"$ROOT/vol1/sample/data.bin"
+srv_serve
+PEER_ROOT=$ROOT PEER_RUN=$RUN PEER_BASE=$BASE
+issued=$(VELA_ROOT=$PEER_ROOT "$VELAADM" token create root --api 'VELA.*' --method '*')
+PEER_TOKEN=$(sed -n 's/^token=//p' <<<"$issued")
+PEER_TOKEN_ID=$(sed -n 's/^id=//p' <<<"$issued")
+[ -n "$PEER_TOKEN" ] || { fail "the peer issued no token"; exit 1; }
+cp "$PEER_ROOT/vol1/sample/data.bin" "$PEER_RUN/../data.bin.copy"
+DATA=$PEER_RUN/../data.bin.copy
+srv_aside
+
+LISTENERS=()
+srv_traps 'kill "${LISTENERS[@]}" 2>/dev/null; if [ "$failures" -ne 0 ]; then
+  echo "---- peer logs"; tail -n 60 "$PEER_RUN/cgi.log" "$PEER_RUN/error.log" 2>/dev/null; fi'
+
+# ---- This server.
+SRV_BIND=127.0.0.1
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1
+srv_serve
+adm() { VELA_ROOT=$ROOT "$VELAADM" "$@"; }
+session() { adm session create "$1" | sed -n 's/^sid=//p'; }
+ADMIN_SID=$(session root)
+USER_SID=$(session nobody)
+[ -n "$ADMIN_SID" ] && [ -n "$USER_SID" ] || { fail "velaadm created no session"; exit 1; }
+
+# Listeners that play broken peers: "silent" accepts and never answers,
+# "garbage" answers HTML, "huge" answers more JSON than is taken. Started
+# here, not in a subshell, so that the exit trap ends them; the port is in
+# $port.
+listener() {
+  python3 - "$1" >"$TMP/$1.port" 2>/dev/null <<'PY' &
+import socket, sys
+mode = sys.argv[1]
+s = socket.socket()
+s.bind(("127.0.0.1", 0))
+s.listen(16)
+print(s.getsockname()[1], flush=True)
+held = []
+while True:
+    c, _ = s.accept()
+    if mode == "silent":
+        held.append(c)
+        continue
+    c.recv(65536)
+    if mode == "garbage":
+        c.sendall(b"HTTP/1.0 200 OK\r\nContent-Type: text/html\r\n\r\n<html>not json</html>")
+    else:
+        body = b'{"success":true,"data":"' + b"x" * (6 << 20) + b'"}'
+        c.sendall(b"HTTP/1.0 200 OK\r\nContent-Type: application/json\r\n\r\n" + body)
+    c.close()
+PY
+  LISTENERS+=($!)
+  srv_wait 50 0.1 test -s "$TMP/$1.port" || fail "listener $1 did not start"
+  port=$(cat "$TMP/$1.port")
+}
+add_peer() { printf '%s\n' "$2" | adm peer add "$1" --url "$3" --token-stdin >/dev/null || fail "peer add $1"; }
+add_peer b "$PEER_TOKEN" "$PEER_BASE"
+add_peer down x.y "http://127.0.0.1:1"
+for mode in silent garbage huge; do
+  listener $mode
+  add_peer $mode x.y "http://127.0.0.1:$port"
+done
+[ "$(stat -c '%a %U' "$ROOT/etc/vela/peers.json")" = "600 root" ] || fail "peers.json is not 0600 root"
+adm peer list | grep -qF "$PEER_TOKEN" && fail "peer list shows the token"
+adm peer list | grep -q "^b .*$PEER_BASE" || fail "peer list lacks b"
+printf 'x.y\n' | adm peer add evil --url "http://10.1.1.1" --token-stdin 2>/dev/null &&
+  fail "plain http to another machine was accepted"
+printf 'x.y\n' | adm peer add ../x --url "$PEER_BASE" --token-stdin 2>/dev/null && fail "peer name ../x accepted"
+adm peer test b --api VELA.Sample --method echo | grep -qF '"success":true' || fail "peer test b"
+adm peer test down >/dev/null 2>&1 && fail "peer test of a peer that is down succeeded"
+
+ONLY="api=VELA.Sample.Echo&version=1&method=echo"
+
+# ---- Relayed calls, as query and as form.
+call --cookie "id=$ADMIN_SID" "$URL?$ONLY&text=hi&relay_ds=b"
+expect_status "relayed GET" 200
+expect "relayed GET" '"success":true' '"text":"hi"' '"api":"VELA.Sample.Echo"'
+grep -qF relay_ds "$TMP/body" && fail "relay_ds reached the peer"
+call --cookie "id=$ADMIN_SID" --data "$ONLY&text=posted&n=7&relay_ds=b&relay_timeout=30" "$URL"
+expect "relayed POST form" '"success":true' '"text":"posted"' '"n":"7"'
+
+# ---- A download, whole and ranged, and an upload stream through.
+DL="$URL?api=VELA.Sample&version=1&method=download&name=data.bin&relay_ds=b"
+call --cookie "id=$ADMIN_SID" "${DL%&relay_ds=b}"
+expect "download here" '"success":false'
+call --cookie "id=$ADMIN_SID" "$DL"
+expect_status "relayed download" 200
+cmp -s "$TMP/body" "$DATA" || fail "relayed download: bytes differ"
+expect_header "relayed download" 'Content-Length: 300000'
+call --cookie "id=$ADMIN_SID" -r 1000-1999 "$DL"
+expect_status "relayed range" 206
+expect_header "relayed range" 'Content-Range: bytes 1000-1999/300000'
+tail -c +1001 "$DATA" | head -c 1000 | cmp -s - "$TMP/body" || fail "relayed range: bytes differ"
+call --cookie "id=$ADMIN_SID" -F "note=up" -F "file=@$DATA;filename=data.bin" \
+  "$URL?api=VELA.Sample&version=1&method=upload&relay_ds=b"
+expect "relayed upload" '"success":true' '"size":300000' "\"cksum\":$(cksum <"$DATA" | cut -d' ' -f1)" \
+  '"note":"up"'
+
+# ---- Callers: no session, no relay privilege, a bad time limit.
+call "$URL?$ONLY&relay_ds=b"
+expect_error "relay without a session" 119 unauth
+call --cookie "id=$USER_SID" "$URL?$ONLY&relay_ds=b"
+expect_error "relay without the privilege" 105 noprivilege
+call --cookie "id=$ADMIN_SID" "$URL?$ONLY&relay_ds=b&relay_timeout=0"
+expect_error "relay_timeout 0" 101
+
+# ---- Peers that are not there or misbehave: 109 and why.
+relay_fails() {
+  call --cookie "id=$ADMIN_SID" "$URL?$ONLY&relay_ds=$1${3:-}"
+  expect_error "relay to $1" 109
+  expect "relay to $1" "\"reason\":\"$2\""
+}
+relay_fails nosuch "unknown peer"
+relay_fails ..%2F..%2Fetc "unknown peer"
+relay_fails down "peer unreachable"
+relay_fails silent "peer timed out" "&relay_timeout=2"
+relay_fails garbage "peer answer not JSON"
+relay_fails huge "peer answer too large"
+chmod 0644 "$ROOT/etc/vela/peers.json"
+relay_fails b "peers not configured"
+chmod 0600 "$ROOT/etc/vela/peers.json"
+grep -q 'relay request fail\[' "$RUN/cgi.log" "$RUN/error.log" 2>/dev/null || fail "no relay failure logged"
+
+# ---- The peer revokes its token: its refusal comes back unchanged.
+VELA_ROOT=$PEER_ROOT "$VELAADM" token revoke "$PEER_TOKEN_ID" >/dev/null || fail "token revoke on the peer"
+call --cookie "id=$ADMIN_SID" "$URL?$ONLY&relay_ds=b"
+expect_error "revoked token" 119
+
+grep -qF "$PEER_TOKEN" "$RUN/cgi.log" "$RUN/error.log" 2>/dev/null && fail "the peer's token was logged"
+srv_finish "all relay checks passed ($URL -> $PEER_BASE)"
