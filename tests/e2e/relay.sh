@@ -5,11 +5,12 @@
 # the peer issued. Then: calls relayed as query and as form, a download with
 # and without a range, an upload; callers without a session or without the
 # relay privilege; peers that are unknown, down, silent, garbled or too
-# talkative; a peers file others may read; the peer's token revoked there.
+# talkative; a peers file others may read; the same from velaapi; the
+# peer's token revoked there.
 set -u
 
 . "$(dirname "$0")/server.sh"
-srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
+srv_args VELASCGI VELAADM VELAAPI WEBAPI SRC -- "$@"
 srv_require "velascgi switches to the identity each API asks for" python3 cmp cksum
 
 # ---- The peer: its own root, a data volume with a file (this server has
@@ -140,6 +141,15 @@ chmod 0644 "$ROOT/etc/vela/peers.json"
 relay_fails b "peers not configured"
 chmod 0600 "$ROOT/etc/vela/peers.json"
 grep -q 'relay request fail\[' "$RUN/cgi.log" "$RUN/error.log" 2>/dev/null || fail "no relay failure logged"
+
+# ---- The same relay from the command line.
+api() { VELA_ROOT=$ROOT "$VELAAPI" call VELA.Sample.Echo echo "$@"; }
+out=$(api text=cli n=3 --peer b) || fail "velaapi --peer b: $out"
+grep -qF '"text":"cli"' <<<"$out" || fail "velaapi --peer b answered $out"
+out=$(api --peer b --user nobody 2>/dev/null) && fail "velaapi relayed for nobody"
+grep -qF '"code":105' <<<"$out" || fail "velaapi --user nobody answered $out"
+out=$(api --peer down 2>/dev/null) && fail "velaapi relayed to a peer that is down"
+grep -qF '"code":109' <<<"$out" || fail "velaapi --peer down answered $out"
 
 # ---- The peer revokes its token: its refusal comes back unchanged.
 VELA_ROOT=$PEER_ROOT "$VELAADM" token revoke "$PEER_TOKEN_ID" >/dev/null || fail "token revoke on the peer"
