@@ -87,6 +87,7 @@ struct CredRequestMgr::Impl {
     bool writeFailed = false;
     bool readFailed = false;
     long long toRead = 0;
+    CURL* curl = nullptr;  // the handle during curl_easy_perform, for the callbacks
 
     void Fail(int code, const std::string& text)
     {
@@ -177,14 +178,16 @@ struct CredRequestMgr::Impl {
     }
 
     // A file answer of the peer (its file outputer), not an answer of the
-    // web API: a partial answer, or a whole one naming a file or offering
-    // ranges, that is not JSON.
+    // web API: a partial answer, a range it cannot give, or a whole answer
+    // naming a file or offering ranges, that is not JSON.
     bool IsFileAnswer() const
     {
         if (StartsWithNoCase(contentType, "application/json")) {
             return false;
         }
-        return status == 206 || (status == 200 && (!disposition.empty() || strcasecmp(acceptRanges.c_str(), "bytes") == 0));
+        const bool offersRanges = strcasecmp(acceptRanges.c_str(), "bytes") == 0;
+        return status == 206 || (status == 416 && !contentRange.empty()) ||
+               (status == 200 && (!disposition.empty() || offersRanges));
     }
 
     bool WriteOut(const char* data, size_t len)
@@ -210,6 +213,8 @@ struct CredRequestMgr::Impl {
         std::string block;
         if (status == 206) {
             block += "Status: 206 Partial Content\r\n";
+        } else if (status == 416) {
+            block += "Status: 416 Range Not Satisfiable\r\n";
         }
         const struct {
             const char* name;
@@ -228,8 +233,6 @@ struct CredRequestMgr::Impl {
         fflush(stdout);
         return WriteOut(block.data(), block.size());
     }
-
-    CURL* curl = nullptr;
 
     size_t Write(const char* data, size_t len)
     {
@@ -316,7 +319,6 @@ bool CredRequestMgr::Impl::Run()
         Fail(kLibrary, "curl_easy_init failed");
         return false;
     }
-    curl = handle.get();
 
     // The peer's token goes with the parameters: in the form when the form
     // is the body, in the query when a client's body streams through.
@@ -349,7 +351,7 @@ bool CredRequestMgr::Impl::Run()
         return false;
     }
 
-    CURL* c = curl;
+    CURL* c = handle.get();
     const long total = timeout;
     const long connect = std::min<long>(kConnectTimeout, total);
     const std::string caFile = peer.caFile.empty() ? std::string() : System::ResolvePath(peer.caFile.c_str());
@@ -398,13 +400,20 @@ bool CredRequestMgr::Impl::Run()
         api->curl_easy_setopt(c, CURLOPT_COPYPOSTFIELDS, form.c_str());
     }
 
+    curl = c;
     const CURLcode rc = api->curl_easy_perform(c);
+    curl = nullptr;
     long code = 0;
     api->curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &code);
     status = code;
-    curl = nullptr;
     if (rc != CURLE_OK) {
         MapCurlError(rc);
+        return false;
+    }
+    // An answer without a body (an empty file, a range it cannot give) is
+    // judged here: no write came to judge it.
+    if (mode == Mode::kUndecided && !StartStream(c)) {
+        Fail(kTransfer, "answer could not be written");
         return false;
     }
     if (mode == Mode::kStream) {

@@ -112,6 +112,9 @@ call --cookie "id=$ADMIN_SID" -r 1000-1999 "$DL"
 expect_status "relayed range" 206
 expect_header "relayed range" 'Content-Range: bytes 1000-1999/300000'
 tail -c +1001 "$DATA" | head -c 1000 | cmp -s - "$TMP/body" || fail "relayed range: bytes differ"
+call --cookie "id=$ADMIN_SID" -r 400000-400001 "$DL"
+expect_status "relayed range past the end" 416
+expect_header "relayed range past the end" 'Content-Range: bytes \*/300000'
 call --cookie "id=$ADMIN_SID" -F "note=up" -F "file=@$DATA;filename=data.bin" \
   "$URL?api=VELA.Sample&version=1&method=upload&relay_ds=b"
 expect "relayed upload" '"success":true' '"size":300000' "\"cksum\":$(cksum <"$DATA" | cut -d' ' -f1)" \
