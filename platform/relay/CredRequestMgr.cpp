@@ -199,10 +199,10 @@ struct CredRequestMgr::Impl {
         return true;
     }
 
-    bool StartStream(CURL* curl)
+    bool StartStream(CURL* handle)
     {
         long code = 0;
-        Relay::LazyCurl()->curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &code);
+        Relay::LazyCurl()->curl_easy_getinfo(handle, CURLINFO_RESPONSE_CODE, &code);
         status = code;
         if (request.outFd < 0 || !IsFileAnswer()) {
             mode = Mode::kBuffer;
