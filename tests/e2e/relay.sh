@@ -5,13 +5,14 @@
 # the peer issued. Then: calls relayed as query and as form, a download with
 # and without a range, an upload; callers without a session or without the
 # relay privilege; peers that are unknown, down, silent, garbled or too
-# talkative; a peers file others may read; the same from velaapi; the
-# peer's token revoked there.
+# talkative, or behind TLS with a certificate trusted or not, pinned or
+# not; a peers file others may read; the same from velaapi; the peer's
+# token revoked there.
 set -u
 
 . "$(dirname "$0")/server.sh"
 srv_args VELASCGI VELAADM VELAAPI WEBAPI SRC -- "$@"
-srv_require "velascgi switches to the identity each API asks for" python3 cmp cksum
+srv_require "velascgi switches to the identity each API asks for" python3 cmp cksum openssl base64
 
 # ---- The peer: its own root, a data volume with a file (this server has
 # no volume: a file that comes back came from the peer).
@@ -81,6 +82,44 @@ for mode in silent garbage huge; do
   listener $mode
   add_peer $mode x.y "http://127.0.0.1:$port"
 done
+
+# A peer behind TLS with a certificate of its own: trusted through the CA
+# file named for it, and with its public key pinned, never by default.
+mkdir -p "$ROOT/etc/vela/certs"
+openssl req -x509 -newkey rsa:2048 -nodes -days 2 -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 \
+  -keyout "$TMP/tls.key" -out "$ROOT/etc/vela/certs/tls.pem" 2>/dev/null || fail "openssl made no certificate"
+pin=sha256//$(openssl x509 -in "$ROOT/etc/vela/certs/tls.pem" -pubkey -noout | openssl pkey -pubin -outform der |
+  openssl dgst -sha256 -binary | base64)
+python3 - "$ROOT/etc/vela/certs/tls.pem" "$TMP/tls.key" >"$TMP/tls.port" 2>/dev/null <<'PY' &
+import http.server, ssl, sys
+class Answer(http.server.BaseHTTPRequestHandler):
+    def do_POST(self):
+        self.rfile.read(int(self.headers.get("Content-Length", 0)))
+        body = b'{"success":true,"data":{"over":"tls"}}'
+        self.send_response(200)
+        self.send_header("Content-Type", "application/json")
+        self.send_header("Content-Length", str(len(body)))
+        self.end_headers()
+        self.wfile.write(body)
+    def log_message(self, *args):
+        pass
+server = http.server.HTTPServer(("127.0.0.1", 0), Answer)
+context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)
+context.load_cert_chain(sys.argv[1], sys.argv[2])
+server.socket = context.wrap_socket(server.socket, server_side=True)
+print(server.server_address[1], flush=True)
+server.serve_forever()
+PY
+LISTENERS+=($!)
+srv_wait 50 0.1 test -s "$TMP/tls.port" || fail "the TLS listener did not start"
+TLS_URL=https://127.0.0.1:$(cat "$TMP/tls.port")
+printf 'x.y\n' | adm peer add tls --url "$TLS_URL" --ca-file /etc/vela/certs/tls.pem --token-stdin >/dev/null ||
+  fail "peer add tls"
+printf 'x.y\n' | adm peer add tlspin --url "$TLS_URL" --ca-file /etc/vela/certs/tls.pem --pin "$pin" \
+  --token-stdin >/dev/null || fail "peer add tlspin"
+printf 'x.y\n' | adm peer add tlsbadpin --url "$TLS_URL" --ca-file /etc/vela/certs/tls.pem \
+  --pin "sha256//$(head -c 32 /dev/urandom | base64)" --token-stdin >/dev/null || fail "peer add tlsbadpin"
+add_peer tlsnoca x.y "$TLS_URL"
 [ "$(stat -c '%a %U' "$ROOT/etc/vela/peers.json")" = "600 root" ] || fail "peers.json is not 0600 root"
 adm peer list | grep -qF "$PEER_TOKEN" && fail "peer list shows the token"
 adm peer list | grep -q "^b .*$PEER_BASE" || fail "peer list lacks b"
@@ -140,6 +179,12 @@ relay_fails down "peer unreachable"
 relay_fails silent "peer timed out" "&relay_timeout=2"
 relay_fails garbage "peer answer not JSON"
 relay_fails huge "peer answer too large"
+relay_fails tlsnoca "peer certificate refused"
+relay_fails tlsbadpin "peer certificate refused"
+for peer in tls tlspin; do
+  call --cookie "id=$ADMIN_SID" "$URL?$ONLY&relay_ds=$peer"
+  expect "relay to $peer" '"success":true' '"over":"tls"'
+done
 chmod 0644 "$ROOT/etc/vela/peers.json"
 relay_fails b "peers not configured"
 chmod 0600 "$ROOT/etc/vela/peers.json"
