@@ -11,6 +11,7 @@
 
 #include "relay/LazyCurl.h"
 #include "system/FileUtil.h"
+#include "system/SigpipeBlock.h"
 #include "system/SysInternal.h"
 #include "vela/log.h"
 #include "vela/relay.h"
@@ -400,9 +401,15 @@ bool CredRequestMgr::Impl::Run()
         api->curl_easy_setopt(c, CURLOPT_COPYPOSTFIELDS, form.c_str());
     }
 
-    curl = c;
-    const CURLcode rc = api->curl_easy_perform(c);
-    curl = nullptr;
+    CURLcode rc = CURLE_OK;
+    {
+        // A client that goes away during a streamed download ends the
+        // exchange (the write fails), not the process.
+        System::SigpipeBlock noSigpipe;
+        curl = c;
+        rc = api->curl_easy_perform(c);
+        curl = nullptr;
+    }
     long code = 0;
     api->curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &code);
     status = code;
