@@ -53,7 +53,9 @@ bool ParseURL(const std::string& url, bool& https, bool& loopback, std::string& 
         }
         host = url.substr(at + 1, end - at - 1);
         in6_addr a6{};
-        if (inet_pton(AF_INET6, host.c_str(), &a6) != 1) {
+        // inet_pton stops at a NUL: every byte is judged first.
+        if (host.size() > INET6_ADDRSTRLEN || host.find_first_not_of("0123456789abcdefABCDEF:.") != std::string::npos ||
+            inet_pton(AF_INET6, host.c_str(), &a6) != 1) {
             why = "url has an invalid IPv6 address";
             return false;
         }

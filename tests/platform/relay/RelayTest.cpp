@@ -86,6 +86,8 @@ TEST(RelayPeer, WhatAPeerMayBe)
         {Peer("p", "https://host:443/x"), "port"},
         {Peer("p", "https://[::1"), "unterminated"},
         {Peer("p", "https://[nonsense]"), "IPv6"},
+        {Peer("p", std::string("http://[::1\0]:80", 16)), "IPv6"},
+        {Peer("p", std::string("http://127.0.0.1\0.evil", 22)), "nothing else"},
         {Peer("p", "https://" + std::string(300, 'a')), "url must be"},
         {Peer("p", "https://a", ""), "token"},
         {Peer("p", "https://a", "a b"), "token"},
