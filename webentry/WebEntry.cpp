@@ -158,6 +158,16 @@ IdentityParams ReadIdentityParams(APIRequest* req)
             param.value = value.Get();
         }
     }
+    // An access token may come in the header X-Vela-Access-Token instead of
+    // "tid" (a peer relaying a call presents it there): then it is not among
+    // the parameters a handler reads, and may answer with.
+    if (!p.hasTid) {
+        const std::string header = RequestFacts::Text(req->GetEnv("HTTP_X_VELA_ACCESS_TOKEN"));
+        if (!header.empty()) {
+            p.tid = header;
+            p.hasTid = true;
+        }
+    }
     return p;
 }
 

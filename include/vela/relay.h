@@ -15,7 +15,8 @@
 // "http" is accepted only for a loopback address (127.0.0.0/8, ::1), for
 // peers on the same machine. "token" is an access token the peer issued
 // (velaadm token create there); the call on the peer runs as its user. The
-// token is never logged nor shown.
+// token is never logged nor shown: it travels in the header
+// X-Vela-Access-Token, and a JSON answer that holds it is refused.
 //
 // A client names a peer, never a URL: nothing a client sends makes the
 // server contact an address the administrator did not write down.

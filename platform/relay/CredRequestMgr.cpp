@@ -321,10 +321,11 @@ bool CredRequestMgr::Impl::Run()
         return false;
     }
 
-    // The peer's token goes with the parameters: in the form when the form
-    // is the body, in the query when a client's body streams through.
+    // The peer's token goes in a header, never among the parameters, where
+    // a handler of the peer could answer with it. A "tid" of the caller's
+    // would take its place: it is dropped.
     Json::Value params = request.params;
-    params["tid"] = peer.token;
+    params.removeMember("tid");
     const bool streamBody = request.bodyFd >= 0;
     const std::string form = FormEncode(params);
     std::string url = peer.url + kEntryPath;
@@ -340,7 +341,8 @@ bool CredRequestMgr::Impl::Run()
         }
         return next != nullptr;
     };
-    bool ok = add("Expect:") && add("Accept: application/json, */*");
+    bool ok = add("Expect:") && add("Accept: application/json, */*") &&
+              add("X-Vela-Access-Token: " + peer.token);
     if (streamBody && !request.contentType.empty()) {
         ok = ok && add("Content-Type: " + request.contentType);
     }
@@ -429,6 +431,12 @@ bool CredRequestMgr::Impl::Run()
     Json::Value answer;
     if (!WebAPIUtil::ParseJson(body, answer) || !answer.isObject() || !answer["success"].isBool()) {
         Fail(kBadAnswer, "answer is not JSON of the web API (HTTP status " + std::to_string(status) + ")");
+        return false;
+    }
+    // The token is this appliance's secret: an answer that shows it (a
+    // handler of the peer echoing its environment) goes no further.
+    if (body.find(peer.token) != std::string::npos) {
+        Fail(kBadAnswer, "answer holds the peer's token");
         return false;
     }
     response = answer;

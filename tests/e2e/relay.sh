@@ -136,6 +136,10 @@ call --cookie "id=$ADMIN_SID" "$URL?$ONLY&text=hi&relay_ds=b"
 expect_status "relayed GET" 200
 expect "relayed GET" '"success":true' '"text":"hi"' '"api":"VELA.Sample.Echo"'
 grep -qF relay_ds "$TMP/body" && fail "relay_ds reached the peer"
+# The caller's session id stays here; the peer's echo shows what it got.
+call "$URL?$ONLY&text=sid&_sid=$ADMIN_SID&relay_ds=b"
+expect "relayed with _sid" '"success":true' '"text":"sid"'
+grep -qF -e "$ADMIN_SID" -e "$PEER_TOKEN" "$TMP/body" && fail "a session id or token came back from the peer: $(cat "$TMP/body")"
 call --cookie "id=$ADMIN_SID" --data "$ONLY&text=posted&n=7&relay_ds=b&relay_timeout=30" "$URL"
 expect "relayed POST form" '"success":true' '"text":"posted"' '"n":"7"'
 
@@ -158,6 +162,9 @@ call --cookie "id=$ADMIN_SID" -F "note=up" -F "file=@$DATA;filename=data.bin" \
   "$URL?api=VELA.Sample&version=1&method=upload&relay_ds=b"
 expect "relayed upload" '"success":true' '"size":300000' "\"cksum\":$(cksum <"$DATA" | cut -d' ' -f1)" \
   '"note":"up"'
+# An upload that names its call only inside its body is not relayed.
+call --cookie "id=$ADMIN_SID" -F api=VELA.Sample -F version=1 -F method=upload -F "file=@$DATA" "$URL?relay_ds=b"
+expect_error "upload named in its body" 101
 
 # ---- Callers: no session, no relay privilege, a bad time limit.
 call "$URL?$ONLY&relay_ds=b"
