@@ -46,7 +46,8 @@ USER_SID=$(session nobody)
 [ -n "$ADMIN_SID" ] && [ -n "$USER_SID" ] || { fail "velaadm created no session"; exit 1; }
 
 # Listeners that play broken peers: "silent" accepts and never answers,
-# "garbage" answers HTML, "huge" answers more JSON than is taken. Started
+# "garbage" answers HTML, "huge" answers more JSON than is taken,
+# "telltale" answers with the token it was given. Started
 # here, not in a subshell, so that the exit trap ends them; the port is in
 # $port.
 listener() {
@@ -63,8 +64,12 @@ while True:
     if mode == "silent":
         held.append(c)
         continue
-    c.recv(65536)
-    if mode == "garbage":
+    head = c.recv(65536)
+    if mode == "telltale":
+        token = [l.split(b":", 1)[1].strip() for l in head.split(b"\r\n") if l.lower().startswith(b"x-vela-access-token:")]
+        c.sendall(b"HTTP/1.0 200 OK\r\nContent-Type: application/json\r\n\r\n" +
+                  b'{"success":true,"data":{"heard":"' + (token[0] if token else b"") + b'"}}')
+    elif mode == "garbage":
         c.sendall(b"HTTP/1.0 200 OK\r\nContent-Type: text/html\r\n\r\n<html>not json</html>")
     else:
         body = b'{"success":true,"data":"' + b"x" * (6 << 20) + b'"}'
@@ -78,9 +83,9 @@ PY
 add_peer() { printf '%s\n' "$2" | adm peer add "$1" --url "$3" --token-stdin >/dev/null || fail "peer add $1"; }
 add_peer b "$PEER_TOKEN" "$PEER_BASE"
 add_peer down x.y "http://127.0.0.1:1"
-for mode in silent garbage huge; do
+for mode in silent garbage huge telltale; do
   listener $mode
-  add_peer $mode x.y "http://127.0.0.1:$port"
+  add_peer $mode "$mode.token-of-this-appliance" "http://127.0.0.1:$port"
 done
 
 # A peer behind TLS with a certificate of its own: trusted through the CA
@@ -186,6 +191,7 @@ relay_fails down "peer unreachable"
 relay_fails silent "peer timed out" "&relay_timeout=2"
 relay_fails garbage "peer answer not JSON"
 relay_fails huge "peer answer too large"
+relay_fails telltale "peer answer not JSON"
 relay_fails tlsnoca "peer certificate refused"
 relay_fails tlsbadpin "peer certificate refused"
 for peer in tls tlspin; do
