@@ -115,13 +115,17 @@ public:
     static constexpr int kMaxTimeout = 3600;
     static constexpr int kConnectTimeout = 10;
 
-    // A request relayed as it came: its parameters go into the query string
-    // (JSON calls) and its body, when `bodyFd` >= 0, streams from that
-    // descriptor (`contentLength` bytes, with `contentType`). `range` is
-    // forwarded as the Range header. When `outFd` >= 0, an answer that is
-    // not JSON (a download) streams to it as a CGI answer (Status,
-    // Content-Type, Content-Length, Content-Range, Content-Disposition,
-    // Accept-Ranges, then the body); without it such an answer is kBadAnswer.
+    // A request relayed as it came. Its parameters (a "tid" among them is
+    // dropped: the peer's token goes in a header) are the form body of a
+    // POST when `post` is set and no body is given, else the query string;
+    // a body, when `bodyFd` >= 0, streams from that descriptor
+    // (`contentLength` bytes, with `contentType`). `range` is forwarded as
+    // the Range header. When `outFd` >= 0, a file answer of the peer (206,
+    // 416 with Content-Range, or 200 with Content-Disposition or
+    // "Accept-Ranges: bytes", not JSON) streams to it as a CGI answer
+    // (Status, Content-Type, Content-Length, Content-Range,
+    // Content-Disposition, Accept-Ranges, then the body); any other answer
+    // must be JSON of the web API (kBadAnswer otherwise).
     struct RelayRequest {
         Json::Value params = Json::Value(Json::objectValue);  // name -> value
         bool post = false;        // form POST of `params` (no body given)

@@ -35,9 +35,14 @@ LISTENERS=()
 srv_traps 'kill "${LISTENERS[@]}" 2>/dev/null; if [ "$failures" -ne 0 ]; then
   echo "---- peer logs"; tail -n 60 "$PEER_RUN/cgi.log" "$PEER_RUN/error.log" 2>/dev/null; fi'
 
-# ---- This server.
+# ---- This server. Its echo may be served in process by a warm velafcgi
+# parent: a relayed echo never is.
 SRV_BIND=127.0.0.1
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1
+srv_api VELA.Sample.Echo <<'EOF'
+{"VELA.Sample.Echo": {"lib": "sample/libvela-sample.so", "minVersion": 1, "maxVersion": 1,
+                      "methods": {"1": [{"echo": {"inProcess": true}}]}}}
+EOF
 srv_serve
 adm() { VELA_ROOT=$ROOT "$VELAADM" "$@"; }
 session() { adm session create "$1" | sed -n 's/^sid=//p'; }
@@ -147,6 +152,28 @@ expect "relayed with _sid" '"success":true' '"text":"sid"'
 grep -qF -e "$ADMIN_SID" -e "$PEER_TOKEN" "$TMP/body" && fail "a session id or token came back from the peer: $(cat "$TMP/body")"
 call --cookie "id=$ADMIN_SID" --data "$ONLY&text=posted&n=7&relay_ds=b&relay_timeout=30" "$URL"
 expect "relayed POST form" '"success":true' '"text":"posted"' '"n":"7"'
+
+# Once every velafcgi parent is warm (has the sample library mapped), the
+# echo could be served by a parent itself; relayed, it never is: no parent
+# maps libcurl.
+if [ "${VELA_FRONT_END:-fcgi}" = fcgi ]; then
+  master=$(pgrep -P "$LPID" -x velafcgi | head -n 1)
+  all_warm() {
+    call --cookie "id=$ADMIN_SID" "$URL?$ONLY&text=warm"
+    local parent
+    for parent in $(pgrep -P "$master"); do
+      grep -q libvela-sample "/proc/$parent/maps" || return 1
+    done
+  }
+  srv_wait 50 0.1 all_warm || fail "the velafcgi parents never got warm"
+  for _ in 1 2 3 4; do
+    call --cookie "id=$ADMIN_SID" "$URL?$ONLY&text=again&relay_ds=b"
+    expect "relayed GET of a method served in process" '"success":true' '"text":"again"'
+  done
+  for parent in $(pgrep -P "$master"); do
+    grep -q libcurl "/proc/$parent/maps" && fail "velafcgi parent $parent mapped libcurl"
+  done
+fi
 
 # ---- A download, whole and ranged, and an upload stream through.
 DL="$URL?api=VELA.Sample&version=1&method=download&name=data.bin&relay_ds=b"
