@@ -17,6 +17,7 @@
 #include "dispatcher/Refusal.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
+#include "vela/relay.h"
 #include "vela/token.h"
 #include "vela/user.h"
 #include "vela/vlibc.h"
@@ -332,6 +333,30 @@ int PermissionCheck::AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTi
         given.session = StoreSessionFacts(req, cgi, user, verdict);
     }
     return verdict;
+}
+
+bool PermissionCheck::CheckRelay(APIRequest* req, APIResponse* resp, bool allowTimeout, VELACGI_CTX* cgi)
+{
+    if (req == nullptr || resp == nullptr) {
+        return false;
+    }
+    const int code = CheckRequest(req, allowTimeout, cgi);
+    RecordCode(req, resp, code, Slot(allowTimeout));
+    if (code != WEBAPI_ERR_NONE) {
+        const char* word = ServerErrorWord(code);
+        if (word != nullptr) {
+            resp->SetServerError(word);
+        }
+        return false;
+    }
+    const std::string user = req->GetLoginUserName();
+    if (VLIBAppPrivUserHas(user.c_str(), kRelayPrivilege, req->GetRemoteIP().c_str()) != 1) {
+        VELA_REFUSE(resp, WEBAPI_ERR_NO_PERMISSION, "relay refused: %s lacks the privilege %s",
+                    LogSafe(user).c_str(), kRelayPrivilege);
+        resp->SetServerError("noprivilege");
+        return false;
+    }
+    return true;
 }
 
 bool PermissionCheck::CheckPermission(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi)

@@ -57,6 +57,13 @@ public:
     // call may go on; the session facts are rebuilt with "appPriv".
     bool CheckPermission(APIRequest* req, APIResponse* resp, VELACGI_CTX* cgi);
 
+    // The check of a call relayed to a peer: the session check (error code
+    // and server-error word on `resp`, as above), then the relay privilege
+    // (kRelayPrivilege, vela/relay.h: administrators hold it, others when
+    // granted) from the client's address, else 105. The relayed call's own
+    // rules ("allowUser", "appPriv") are the peer's to judge.
+    bool CheckRelay(APIRequest* req, APIResponse* resp, bool allowTimeout, VELACGI_CTX* cgi);
+
     // The rules of the whole check that do not depend on a session, for a
     // caller that already acts as the user of `req`'s session facts
     // ("username", "isAdmin"), the API's description handed to `req`

@@ -9,6 +9,7 @@ packages=(
   libssl-dev openssl passwd
   libpam0g-dev
   libsqlite3-dev
+  libcurl4-openssl-dev
   libfcgi-dev libfcgi-bin
   libgtest-dev libgmock-dev googletest
   libbenchmark-dev

@@ -1,8 +1,9 @@
 // velaadm: administration of login sessions, access tokens, background
-// tasks and sharing links, and the server's public key. Works on the state under VELA_ROOT
-// ("/" by default).
+// tasks, sharing links and relay peers, and the server's public key. Works
+// on the state under VELA_ROOT ("/" by default).
 //
 // Exit status: 0 success, 1 the operation failed, 2 a usage error.
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <csignal>
@@ -23,6 +24,7 @@
 #include "vela/vlibc.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
+#include "vela/relay.h"
 #include "vela/session.h"
 #include "vela/sharing.h"
 #include "vela/task.h"
@@ -73,6 +75,21 @@ const char kUsage[] =
     "        Prints the link's record (JSON), without the password's hash.\n"
     "  link revoke <id>\n"
     "        Ends the link and every visitor session of it.\n"
+    "  peer add <name> --url URL (--token-file FILE | --token-stdin)\n"
+    "           [--ca-file PATH] [--pin sha256//BASE64] [--replace]\n"
+    "        Names a peer appliance that calls may be relayed to (parameter\n"
+    "        relay_ds). URL is https://host[:port], or http:// to a loopback\n"
+    "        address; the token is an access token the peer issued, read from\n"
+    "        FILE or standard input (its first line), never from the command\n"
+    "        line. --ca-file: the authority that signed the peer's certificate\n"
+    "        (default: the system's); --pin: the peer's public key hash.\n"
+    "  peer list\n"
+    "        One line per peer: name, URL, TLS check (never the token).\n"
+    "  peer test <name> [--api API --method METHOD] [--version N] [--timeout SECONDS]\n"
+    "        Calls API/METHOD (default VELA.Entry.Request request) on the peer\n"
+    "        with its token and prints the peer's answer; exit status 0 when the\n"
+    "        peer answered with JSON of the web API, whatever its code.\n"
+    "  peer remove <name>\n"
     "  pubkey\n"
     "        Prints the server's public key for encrypted parameters (PEM).\n"
     "\n"
@@ -839,6 +856,205 @@ int PublicKey(int argc, char** argv)
     return 0;
 }
 
+// The token of a peer: the first line of `fd`, without its line end.
+bool ReadTokenLine(int fd, std::string& out, std::string& problem)
+{
+    char buf[VELA::Relay::kMaxPeerToken + 2];
+    size_t len = 0;
+    while (len < sizeof(buf)) {
+        const ssize_t n = read(fd, buf + len, sizeof(buf) - len);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n < 0) {
+            problem = std::string("cannot read the token: ") + strerror(errno);
+            return false;
+        }
+        if (n == 0 || memchr(buf + len, '\n', static_cast<size_t>(n)) != nullptr) {
+            len += static_cast<size_t>(n);
+            break;
+        }
+        len += static_cast<size_t>(n);
+    }
+    const char* nl = static_cast<const char*>(memchr(buf, '\n', len));
+    size_t end = nl != nullptr ? static_cast<size_t>(nl - buf) : len;
+    if (end > 0 && buf[end - 1] == '\r') {
+        --end;
+    }
+    out.assign(buf, end);
+    if (out.empty() || out.size() > VELA::Relay::kMaxPeerToken) {
+        problem = "the token must be on the first line, 1 to " + std::to_string(VELA::Relay::kMaxPeerToken) +
+                  " bytes";
+        return false;
+    }
+    return true;
+}
+
+int PeerAdd(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {"--url", "--token-file", "--ca-file", "--pin"}, {"--token-stdin", "--replace"},
+                   args, problem)) {
+        return Usage(problem.c_str());
+    }
+    if (args.positional.size() != 1) {
+        return Usage("peer add needs exactly one peer name");
+    }
+    VELA::RelayPeer peer;
+    peer.name = args.positional[0];
+    std::string tokenFile;
+    bool tokenStdin = false;
+    bool replace = false;
+    for (const auto& opt : args.options) {
+        if (opt.first == "--url") {
+            peer.url = opt.second;
+        } else if (opt.first == "--token-file") {
+            tokenFile = opt.second;
+        } else if (opt.first == "--ca-file") {
+            peer.caFile = opt.second;
+        } else if (opt.first == "--pin") {
+            peer.pinnedPubKey = opt.second;
+        } else if (opt.first == "--token-stdin") {
+            tokenStdin = true;
+        } else if (opt.first == "--replace") {
+            replace = true;
+        }
+    }
+    if (peer.url.empty() || tokenFile.empty() == !tokenStdin) {
+        return Usage("peer add needs --url and one of --token-file, --token-stdin");
+    }
+    if (tokenStdin) {
+        if (!ReadTokenLine(STDIN_FILENO, peer.token, problem)) {
+            return Fail(problem);
+        }
+    } else {
+        const int fd = open(tokenFile.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
+        struct stat st;
+        const bool ok = fd >= 0 && fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && ReadTokenLine(fd, peer.token, problem);
+        if (!ok && problem.empty()) {
+            problem = tokenFile + ": " + (fd < 0 ? strerror(errno) : "not a regular file");
+        }
+        if (fd >= 0) {
+            close(fd);
+        }
+        if (!ok) {
+            return Fail(problem);
+        }
+    }
+    if (!VELA::Relay::CheckPeer(peer, problem)) {
+        return Fail(problem);
+    }
+    std::vector<VELA::RelayPeer> peers;
+    if (!VELA::Relay::LoadPeers(peers, problem)) {
+        return Fail(problem);
+    }
+    bool found = false;
+    for (VELA::RelayPeer& p : peers) {
+        if (p.name == peer.name) {
+            if (!replace) {
+                return Fail("a peer named \"" + peer.name + "\" exists (--replace replaces it)");
+            }
+            p = peer;
+            found = true;
+        }
+    }
+    if (!found) {
+        peers.push_back(peer);
+    }
+    if (!VELA::Relay::SavePeers(peers, problem)) {
+        return Fail(problem);
+    }
+    printf("peer %s %s\n", peer.name.c_str(), found ? "replaced" : "added");
+    return 0;
+}
+
+int PeerList(int argc, char**)
+{
+    if (argc != 3) {
+        return Usage("peer list takes no arguments");
+    }
+    std::vector<VELA::RelayPeer> peers;
+    std::string problem;
+    if (!VELA::Relay::LoadPeers(peers, problem)) {
+        return Fail(problem);
+    }
+    printf("%-24s  %-40s  %s\n", "NAME", "URL", "TLS");
+    for (const VELA::RelayPeer& p : peers) {
+        std::string tls = p.url.compare(0, 5, "http:") == 0 ? "none (loopback)" : "system authorities";
+        if (!p.caFile.empty()) {
+            tls = "ca " + p.caFile;
+        }
+        if (!p.pinnedPubKey.empty()) {
+            tls += ", key pinned";
+        }
+        printf("%-24s  %-40s  %s\n", p.name.c_str(), p.url.c_str(), tls.c_str());
+    }
+    return 0;
+}
+
+int PeerRemove(int argc, char** argv)
+{
+    if (argc != 4) {
+        return Usage("peer remove needs exactly one peer name");
+    }
+    std::vector<VELA::RelayPeer> peers;
+    std::string problem;
+    if (!VELA::Relay::LoadPeers(peers, problem)) {
+        return Fail(problem);
+    }
+    const size_t before = peers.size();
+    peers.erase(std::remove_if(peers.begin(), peers.end(),
+                               [&](const VELA::RelayPeer& p) { return p.name == argv[3]; }),
+                peers.end());
+    if (peers.size() == before) {
+        return Fail("no peer with that name");
+    }
+    if (!VELA::Relay::SavePeers(peers, problem)) {
+        return Fail(problem);
+    }
+    printf("peer removed\n");
+    return 0;
+}
+
+int PeerTest(int argc, char** argv)
+{
+    Args args;
+    std::string problem;
+    if (!SplitArgs(argc, argv, 3, {"--api", "--method", "--version", "--timeout"}, {}, args, problem)) {
+        return Usage(problem.c_str());
+    }
+    if (args.positional.size() != 1) {
+        return Usage("peer test needs exactly one peer name");
+    }
+    std::string api = "VELA.Entry.Request";
+    std::string method = "request";
+    long long version = 1;
+    long long timeout = 10;
+    for (const auto& opt : args.options) {
+        if (opt.first == "--api") {
+            api = opt.second;
+        } else if (opt.first == "--method") {
+            method = opt.second;
+        } else if (opt.first == "--version" &&
+                   !VELA::System::ParseDecimal(opt.second.c_str(), opt.second.size(), 1, INT_MAX, version)) {
+            return Usage("--version must be a positive number");
+        } else if (opt.first == "--timeout" && !ParseSeconds(opt.second.c_str(), VELA::CredRequestMgr::kMaxTimeout, timeout)) {
+            return Usage("--timeout must be 1 to 3600 seconds");
+        }
+    }
+    VELA::CredRequestMgr mgr;
+    mgr.SetTimeout(static_cast<int>(timeout));
+    if (!mgr.AddWebAPIRequest(args.positional[0], api, static_cast<int>(version), method, Json::Value()) ||
+        !mgr.Run()) {
+        return Fail("peer test failed[" + std::to_string(mgr.GetError()) + "]: " + mgr.GetErrorText());
+    }
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "";
+    printf("%s\n", Json::writeString(builder, mgr.GetResponse()).c_str());
+    return 0;
+}
+
 int Run(int argc, char** argv)
 {
     if (argc < 2) {
@@ -867,6 +1083,23 @@ int Run(int argc, char** argv)
             return TaskStop(argc, argv);
         }
         return Usage(("unknown action \"" + action + "\" for task").c_str());
+    }
+    if (command == "peer") {
+        const std::string action = argc < 3 ? "" : argv[2];
+        if (action == "add") {
+            return PeerAdd(argc, argv);
+        }
+        if (action == "list") {
+            return PeerList(argc, argv);
+        }
+        if (action == "test") {
+            return PeerTest(argc, argv);
+        }
+        if (action == "remove") {
+            return PeerRemove(argc, argv);
+        }
+        return Usage(argc < 3 ? "peer needs an action: add, list, test or remove"
+                              : ("unknown action \"" + action + "\" for peer").c_str());
     }
     if (command == "link") {
         const std::string action = argc < 3 ? "" : argv[2];

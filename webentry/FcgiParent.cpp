@@ -234,7 +234,8 @@ void Parent::KeepOwnEnvironment()
 }
 
 // Whether the request names, in its query string, a method this process may
-// serve itself: a GET without a body, of an API already warm.
+// serve itself: a GET without a body, of an API already warm, not relayed to
+// a peer (a relay waits on the network and loads libcurl: a child's work).
 bool Parent::InProcess(FCGX_Request& req) const
 {
     const char* method = FCGX_GetParam("REQUEST_METHOD", req.envp);
@@ -246,7 +247,7 @@ bool Parent::InProcess(FCGX_Request& req) const
     }
     try {
         Json::Value params(Json::objectValue);
-        if (!WebAPIUtil::strPairToJsonObj(query, params, true, true)) {
+        if (!WebAPIUtil::strPairToJsonObj(query, params, true, true) || params.isMember("relay_ds")) {
             return false;
         }
         const Json::Value& api = params["api"];

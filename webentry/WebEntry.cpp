@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <cstdlib>
+#include <climits>
 #include <cstring>
 #include <fcntl.h>
 #include <poll.h>
@@ -18,6 +19,7 @@
 #include "request/RequestFacts.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
+#include "vela/relay.h"
 #include "vela/sharing.h"
 #include "vela/upload.h"
 #include "vela/vlibc.h"
@@ -37,6 +39,35 @@ namespace {
 // A form-encoded body larger than this is refused before anything is
 // allocated for it; uploads are streamed and not bound by it.
 constexpr long long kMaxPostBody = VELACGI_MAX_PARAM_LINE;
+// The largest upload relayed to a peer (it streams; nothing is stored here).
+constexpr long long kMaxRelayBody = 1LL << 40;
+
+// The word a client reads for a failed relay (the manager's error).
+const char* RelayReason(int error)
+{
+    switch (error) {
+    case CredRequestMgr::kUnknownPeer:
+        return "unknown peer";
+    case CredRequestMgr::kPeersFile:
+        return "peers not configured";
+    case CredRequestMgr::kLibrary:
+        return "relay unavailable";
+    case CredRequestMgr::kConnect:
+        return "peer unreachable";
+    case CredRequestMgr::kTimeout:
+        return "peer timed out";
+    case CredRequestMgr::kTls:
+        return "peer certificate refused";
+    case CredRequestMgr::kBadAnswer:
+        return "peer answer not JSON";
+    case CredRequestMgr::kTooLarge:
+        return "peer answer too large";
+    case CredRequestMgr::kTransfer:
+        return "transfer broken off";
+    default:
+        return "bad relay request";
+    }
+}
 
 // RFC 6265 section 4.1.1 cookie-octet: what may stand in a cookie value
 // without ending it or starting another cookie.
@@ -125,6 +156,16 @@ IdentityParams ReadIdentityParams(APIRequest* req)
         param.present = Present(value);
         if (param.present) {
             param.value = value.Get();
+        }
+    }
+    // An access token may come in the header X-Vela-Access-Token instead of
+    // "tid" (a peer relaying a call presents it there): then it is not among
+    // the parameters a handler reads, and may answer with.
+    if (!p.hasTid) {
+        const std::string header = RequestFacts::Text(req->GetEnv("HTTP_X_VELA_ACCESS_TOKEN"));
+        if (!header.empty()) {
+            p.tid = header;
+            p.hasTid = true;
         }
     }
     return p;
@@ -474,12 +515,92 @@ void WebEntry::RemoveUploadedFiles()
     uploadedFiles_ = Json::Value(Json::arrayValue);
 }
 
+// A relayed call (parameter "relay_ds") goes to the peer of that name in the
+// peers file, under the peer's access token; this server only checks that
+// its caller may relay. Order: the session (with "allowTimeout", or
+// "skipTimeout" of a method that must not depend on the idle timer), the
+// relay privilege, "relay_timeout" (1 to 3600 seconds, default 60), then the
+// exchange. The peer's JSON answer is the answer, its error codes included;
+// a file answer (a download, ranges too) streams through. Failures of the
+// exchange answer 109 with {"reason": ...}.
 bool WebEntry::ProcessRelay(APIRequest* req, APIResponse* resp)
 {
+    const bool allowTimeout = GetMethodAttr(req, "allowTimeout") || GetMethodAttr(req, "skipTimeout");
+    if (!permission_.CheckRelay(req, resp, allowTimeout, cgi_)) {
+        return false;
+    }
     const std::string target = RequestFacts::Text(req->GetParam("relay_ds"));
-    VELA_LOG_ERR("relay request fail[%d]: relaying to another service (relay_ds \"%.64s\") is not served",
-                 ENOSYS, target.c_str());
-    resp->SetError(WEBAPI_ERR_RELAY_FAILED);
+    long long timeout = CredRequestMgr::kDefaultTimeout;
+    if (req->HasParam("relay_timeout")) {
+        timeout = RequestFacts::CheckedInteger(req->GetParam("relay_timeout"), 1, CredRequestMgr::kMaxTimeout, -1);
+        if (timeout < 0) {
+            VELA_LOG_ERR("relay refused: relay_timeout is not 1 to %d seconds", CredRequestMgr::kMaxTimeout);
+            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+            return false;
+        }
+    }
+
+    CredRequestMgr::RelayRequest relay;
+    if (req->IsUploadRequest()) {
+        // The body streams through unread: the call must be named by the
+        // query string, whose parameters are then all there is.
+        Json::Value query(Json::objectValue);
+        const long long length = RequestFacts::ContentLength(req->GetEnv("CONTENT_LENGTH"), kMaxRelayBody);
+        if (!DetectAndDecryptParamLine(RequestFacts::Text(req->GetEnv("QUERY_STRING")), query) ||
+            !query.isMember("api") || !query.isMember("version") || !query.isMember("method") || length < 0) {
+            VELA_LOG_ERR("relay refused: an upload names its call in the query string and has a length");
+            resp->SetError(WEBAPI_ERR_BAD_REQUEST);
+            return false;
+        }
+        relay.params = query;
+        relay.bodyFd = STDIN_FILENO;
+        relay.contentLength = length;
+        relay.contentType = RequestFacts::Text(req->GetEnv("CONTENT_TYPE"));
+    } else {
+        relay.params = req->GetPrivate()->GetData("param", "", Json::Value(Json::objectValue));
+        relay.post = true;
+    }
+    // What names this server's caller or the relay itself stays here.
+    for (const char* name : {"relay_ds", "relay_timeout", "_sid", "tid", "_sharing_id", "_sharing_sid", "VelaToken"}) {
+        relay.params.removeMember(name);
+    }
+    const char* range = getenv("HTTP_RANGE");
+    relay.range = range != nullptr && strlen(range) <= 256 ? range : "";
+    relay.outFd = STDOUT_FILENO;
+
+    CredRequestMgr mgr;
+    mgr.SetTimeout(static_cast<int>(timeout));
+    if (!mgr.AddRelayRequest(target, relay) || !mgr.Run()) {
+        VELA_LOG_ERR("relay request fail[%d]: peer \"%.64s\": %s", mgr.GetError(),
+                     System::IsCheckedName(target, System::kNameDotted, Relay::kMaxPeerName) ? target.c_str() : "?",
+                     mgr.GetErrorText().c_str());
+        if (mgr.Streamed()) {
+            resp->SetEnableOutput(false);  // the answer's headers went out already
+            return false;
+        }
+        Json::Value detail(Json::objectValue);
+        detail["reason"] = RelayReason(mgr.GetError());
+        resp->SetError(WEBAPI_ERR_RELAY_FAILED, detail);
+        return false;
+    }
+    if (mgr.Streamed()) {
+        resp->SetEnableOutput(false);
+        return true;
+    }
+    const Json::Value& answer = mgr.GetResponse();
+    if (answer["success"].asBool()) {
+        resp->SetSuccess(answer["data"]);
+        return true;
+    }
+    const Json::Value& error = answer["error"];
+    const long long code = RequestFacts::Integer(error.isObject() ? error["code"] : Json::Value(), 0);
+    if (code <= 0 || code > INT_MAX) {
+        Json::Value detail(Json::objectValue);
+        detail["reason"] = RelayReason(CredRequestMgr::kBadAnswer);
+        resp->SetError(WEBAPI_ERR_RELAY_FAILED, detail);
+        return false;
+    }
+    resp->SetError(static_cast<int>(code), error.isMember("errors") ? error["errors"] : Json::Value());
     return false;
 }
 

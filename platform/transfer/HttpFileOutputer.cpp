@@ -22,6 +22,7 @@
 #include <unistd.h>
 
 #include "system/FileUtil.h"
+#include "system/SigpipeBlock.h"
 #include "vela/httpoutput.h"
 #include "vela/log.h"
 #include "vela/sysfile.h"
@@ -74,44 +75,6 @@ bool ReadFastOutputConfig()
 }
 
 // ---- Writing to standard output ----
-
-// Blocks SIGPIPE for its scope, so a client that goes away makes writes
-// fail with EPIPE instead of killing the process; a SIGPIPE raised meanwhile
-// is consumed unless one was already pending before.
-class SigpipeBlock {
-public:
-    SigpipeBlock()
-    {
-        sigemptyset(&pipe_);
-        sigaddset(&pipe_, SIGPIPE);
-        sigset_t pending;
-        sigemptyset(&pending);
-        wasPending_ = sigpending(&pending) == 0 && sigismember(&pending, SIGPIPE) == 1;
-        blocked_ = sigprocmask(SIG_BLOCK, &pipe_, &old_) == 0;
-    }
-    ~SigpipeBlock()
-    {
-        if (!blocked_) {
-            return;
-        }
-        const int saved = errno;
-        if (!wasPending_) {
-            const struct timespec zero = {0, 0};
-            while (sigtimedwait(&pipe_, nullptr, &zero) < 0 && errno == EINTR) {
-            }
-        }
-        sigprocmask(SIG_SETMASK, &old_, nullptr);
-        errno = saved;
-    }
-    SigpipeBlock(const SigpipeBlock&) = delete;
-    SigpipeBlock& operator=(const SigpipeBlock&) = delete;
-
-private:
-    sigset_t pipe_;
-    sigset_t old_;
-    bool wasPending_ = false;
-    bool blocked_ = false;
-};
 
 // Waits until a non-blocking `fd` is ready for `events` (POLLIN: has bytes
 // to read, POLLOUT: takes more bytes).
@@ -599,7 +562,7 @@ bool SendOpenFile(int fd, const struct stat& st, const std::string& name, const 
     }
 
     FlushStreams();
-    SigpipeBlock noSigpipe;
+    VELA::System::SigpipeBlock noSigpipe;
     if (!WriteOut(kOut, block.data(), block.size())) {
         LogWriteFailure(errno);
         return false;
@@ -667,7 +630,7 @@ bool SendStream(FILE* file, const struct stat& st, const std::string& name, cons
     block += "\r\n";
 
     FlushStreams();
-    SigpipeBlock noSigpipe;
+    VELA::System::SigpipeBlock noSigpipe;
     if (!WriteOut(kOut, block.data(), block.size())) {
         LogWriteFailure(errno);
         return false;
@@ -788,7 +751,7 @@ bool SendByServer(const std::string& canonical, const std::string& name, const s
     AddLine(block, "X-Sendfile", EncodeSendfilePath(canonical));
     block += "\r\n";
     FlushStreams();
-    SigpipeBlock noSigpipe;
+    VELA::System::SigpipeBlock noSigpipe;
     if (!WriteOut(kOut, block.data(), block.size())) {
         LogWriteFailure(errno);
         return false;

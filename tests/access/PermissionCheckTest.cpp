@@ -290,6 +290,42 @@ TEST_F(PermissionCheckTest, UserClassesAndApplicationPrivilege)
     EXPECT_TRUE(PreparedCall("get", normal).Check());
 }
 
+// A relayed call: the session first, then the relay privilege from the
+// client's address; the API's own rules are not judged here.
+TEST_F(PermissionCheckTest, RelayNeedsASessionAndTheRelayPrivilege)
+{
+    const std::string admin = Login("root");
+    const std::string normal = Login("daemon");
+    struct Relay : PreparedCall {
+        using PreparedCall::PreparedCall;
+        bool Check() { return check.CheckRelay(Req(), Resp(), false, nullptr); }
+    };
+    Declare(Desc(R"({"allowUser": ["normal.local"], "appPriv": "VELA.Photo"})"));
+    {
+        Relay none("get", "");
+        EXPECT_FALSE(none.Check());
+        EXPECT_EQ(119, none.Resp()->GetError());
+        EXPECT_EQ("unauth", none.Resp()->GetServerError());
+    }
+    EXPECT_TRUE(Relay("get", admin).Check()) << "the API's allowUser and appPriv are the peer's to judge";
+    {
+        Relay refused("get", normal);
+        LogCapture log;
+        EXPECT_FALSE(refused.Check());
+        EXPECT_EQ(105, refused.Resp()->GetError());
+        EXPECT_EQ("noprivilege", refused.Resp()->GetServerError());
+        EXPECT_TRUE(log.Contains("relay refused: daemon lacks the privilege VELA.Relay"));
+    }
+    Conf("app_privileges.json", R"({"applications": {"VELA.Relay": {"users": ["daemon"],
+        "allow_from": ["198.51.100.0/24"]}}})");
+    EXPECT_FALSE(Relay("get", normal).Check()) << "granted only from other addresses";
+    Conf("app_privileges.json", R"({"applications": {"VELA.Relay": {"users": ["daemon"],
+        "allow_from": ["192.0.2.0/24"]}}})");
+    EXPECT_TRUE(Relay("get", normal).Check());
+    EXPECT_EQ(0, VELA::Session::Remove(normal.c_str()));
+    EXPECT_FALSE(Relay("get", normal).Check()) << "a privilege without a session";
+}
+
 // The judgement of a caller that already acts as the user (velaapi): the
 // description's rules without a session, with no refusal logged or set.
 TEST_F(PermissionCheckTest, UserMayCallJudgesTheDescriptionWithoutASession)

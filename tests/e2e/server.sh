@@ -17,8 +17,13 @@
 #                                  (X-Sendfile paths must not be)
 #   srv_api NAME <DESCRIPTION      links to the staged web-API directory, and
 #                                  NAME.lib from standard input
-#   srv_start DOCROOT [ARG...]     lighttpd (ARGs to scripts/lighttpd-conf.sh):
-#                                  BASE and URL (the entry), or 1; srv_stop
+#   srv_start DOCROOT [ARG...]     lighttpd (ARGs to scripts/lighttpd-conf.sh)
+#                                  on SRV_BIND (default 127.0.0.1): BASE and
+#                                  URL (the entry), or 1; srv_stop
+#   srv_aside                      keeps the current server running and sets
+#                                  it aside (TMP, ROOT, RUN, BASE, URL, LPID
+#                                  emptied): srv_init may start another one;
+#                                  srv_cleanup stops both
 #   srv_serve [ARG...]             srv_start RUN/www, or exit 1
 #   srv_session                    sid: a session of root from 127.0.0.1
 #   srv_request_count              processes serving a request of this server
@@ -47,7 +52,8 @@
 
 TMP="" ROOT="" RUN="" BASE="" URL="" LPID=""
 SRV_SRC="" SRV_VELASCGI=""
-SRV_USERS=() SRV_GROUPS=()
+SRV_USERS=() SRV_GROUPS=() SRV_ASIDE=()
+SRV_BIND=${SRV_BIND:-127.0.0.1}
 failures=0 status=""
 
 srv_args() {
@@ -151,7 +157,7 @@ srv_start() {
   local docroot=$1 port _
   shift
   local args=(--out "$RUN/lighttpd.conf" --run "$RUN" --pidfile "$RUN/lighttpd.pid" --docroot "$docroot"
-              --velascgi "$SRV_VELASCGI" --env "VELA_ROOT=$ROOT" --env "VELA_LOG_STDERR=1"
+              --velascgi "$SRV_VELASCGI" --bind "$SRV_BIND" --env "VELA_ROOT=$ROOT" --env "VELA_LOG_STDERR=1"
               --env "PATH=/usr/sbin:/usr/bin:/sbin:/bin" "$@")
   # Sanitizer builds: the options reach velascgi too.
   local var
@@ -161,7 +167,7 @@ srv_start() {
   BASE="" URL=""
   for _ in $(seq 1 20); do
     port=$((20000 + RANDOM % 40000))
-    (exec 3<>"/dev/tcp/127.0.0.1/$port") 2>/dev/null && continue
+    (exec 3<>"/dev/tcp/$SRV_BIND/$port") 2>/dev/null && continue
     "$SRV_SRC/scripts/lighttpd-conf.sh" "${args[@]}" --port "$port" || return 1
     lighttpd -D -f "$RUN/lighttpd.conf" 2>>"$RUN/start.log" &
     LPID=$!
@@ -172,8 +178,8 @@ srv_start() {
         LPID=""
         break
       fi
-      if curl -s -o /dev/null --max-time 5 "http://127.0.0.1:$port/webapi/entry.cgi"; then
-        BASE="http://127.0.0.1:$port"
+      if curl -s -o /dev/null --max-time 5 "http://$SRV_BIND:$port/webapi/entry.cgi"; then
+        BASE="http://$SRV_BIND:$port"
         URL="$BASE/webapi/entry.cgi"
         return 0
       fi
@@ -216,6 +222,11 @@ srv_request_count() {
 srv_session() {
   sid=$(VELA_ROOT=$ROOT "$VELAADM" session create root --ip 127.0.0.1 | sed -n 's/^sid=//p')
   [ -n "$sid" ] || fail "velaadm created no session"
+}
+
+srv_aside() {
+  SRV_ASIDE+=("$LPID" "$TMP")
+  TMP="" ROOT="" RUN="" BASE="" URL="" LPID=""
 }
 
 srv_stop() {
@@ -275,8 +286,14 @@ srv_finish() {
 }
 
 srv_cleanup() {
-  local name
+  local name i
   srv_stop
+  for ((i = 0; i < ${#SRV_ASIDE[@]}; i += 2)); do
+    LPID=${SRV_ASIDE[i]}
+    srv_stop
+    [ -n "${SRV_ASIDE[i + 1]}" ] && rm -rf "${SRV_ASIDE[i + 1]}"
+  done
+  SRV_ASIDE=()
   for name in "${SRV_USERS[@]+"${SRV_USERS[@]}"}"; do
     userdel "$name" 2>/dev/null
   done

@@ -198,6 +198,43 @@ expect 0 link revoke "$lid"
 expect 2 link frobnicate
 expect 2 link
 
+# ---- relay peers. The token is read from a file or standard input, never
+# an argument, and never printed; the file is root's alone.
+refused 2 "needs --url and one of" peer add p --url https://a
+refused 2 "unknown option --token" peer add p --url https://a --token x.y
+refused 2 "exactly one peer name" peer add --url https://a --token-stdin
+printf 'x.y\n' >"$TMP/token"
+refused 1 "loopback" peer add p --url http://192.0.2.1 --token-file "$TMP/token"
+refused 1 "peer name" peer add ../p --url https://a --token-file "$TMP/token"
+refused 1 "scheme://host" peer add p --url https://a/path --token-file "$TMP/token"
+refused 1 "not a regular file" peer add p --url https://a --token-file "$TMP"
+printf 'a b\n' >"$TMP/badtoken"
+IN=$TMP/badtoken
+refused 1 "must be an access token" peer add p --url https://a --token-stdin
+IN=/dev/null
+[ ! -e "$VELA_ROOT/etc/vela/peers.json" ] || fail "a refused peer wrote the peers file"
+printf 'tok-1.SECRET_one\n' | "$ADM" peer add nas2 --url https://192.0.2.2:5001 --token-stdin \
+    --ca-file /etc/vela/nas2.pem --pin 'sha256//AAAA=' >"$OUT" 2>"$ERR" || fail "peer add nas2"
+printf 'tok-2.SECRET_two\n' >"$TMP/token"
+expect 0 peer add local --url http://127.0.0.1:8080 --token-file "$TMP/token"
+[ "$(stat -c '%a %u' "$VELA_ROOT/etc/vela/peers.json")" = "600 0" ] || fail "peers.json is not 0600 root"
+refused 1 "exists" peer add local --url http://127.0.0.2 --token-file "$TMP/token"
+expect 0 peer add local --url http://127.0.0.2 --token-file "$TMP/token" --replace
+expect 0 peer list
+stdout_has "^nas2 *https://192.0.2.2:5001 *ca /etc/vela/nas2.pem, key pinned$" "^local *http://127.0.0.2 *none"
+stdout_lacks SECRET
+refused 2 "takes no arguments" peer list x
+chmod 0644 "$VELA_ROOT/etc/vela/peers.json"
+refused 1 "owned by root with mode 0600" peer list
+chmod 0600 "$VELA_ROOT/etc/vela/peers.json"
+refused 1 "no such peer" peer test nosuch
+refused 2 "\-\-timeout must be" peer test local --timeout 0
+refused 1 "no peer with that name" peer remove nosuch
+expect 0 peer remove local
+expect 0 peer list
+stdout_lacks "^local"
+refused 2 "peer needs an action" peer
+
 # ---- public key: printed as PEM, or a clear refusal while none is available
 "$ADM" pubkey >"$OUT" 2>"$ERR"
 case $? in

@@ -50,11 +50,17 @@ cli)
     # More parameters and versions refused, each a list of shell words.
     for args in novalue =x "'[1, 2]'" "'{\"a\": 1}' b=2" api=VELA.Other "'{\"method\": \"fail\"}'" --version \
         "--version 1 --version 1" "--version 0" "--version -1" "--version abc" "--version 1.5" \
-        "--version 99999999999" "--version ''"; do
+        "--version 99999999999" "--version ''" --peer "--peer a --peer b"; do
         eval "run 2 call VELA.Sample echo $args"
     done
     run 2 list extra
     run 2 list --version 1
+    run 2 list --peer nas2
+    stderr_has "options of call"
+    # A peer that is not in the peers file (there is none here): 109, or
+    # 105 for an account without the relay privilege.
+    run 1 call VELA.Sample echo --peer nas2
+    stdout_has '"code":10[59]'
     # Standard input is bounded.
     head -c $((17 * 1024 * 1024)) /dev/zero | tr '\0' ' ' >"$TMP/huge"
     IN=$TMP/huge run 2 call VELA.Sample echo -

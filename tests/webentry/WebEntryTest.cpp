@@ -34,7 +34,8 @@ protected:
     void SetUp() override
     {
         for (const char* name : {"REQUEST_METHOD", "QUERY_STRING", "CONTENT_LENGTH", "CONTENT_TYPE", "HTTP_COOKIE",
-                                 "HTTP_X_VELA_SHARING", "velaAccessToken", "HTTP_X_TYPE_NAME",
+                                 "HTTP_X_VELA_SHARING", "velaAccessToken", "HTTP_X_VELA_ACCESS_TOKEN",
+                                 "HTTP_X_TYPE_NAME",
                                  "HTTP_ACCEPT_LANGUAGE"}) {
             Set(name, nullptr);
         }
@@ -118,6 +119,35 @@ TEST_F(WebEntryInit, GetQueryParametersAndBrokenPercentEncoding)
 // and "_sharing_sid" a cookie only with a sharing id. Once an identity
 // parameter is given, both headers join the request's environment even when
 // empty; "; " joins what is appended only to a cookie header the client sent.
+// The header X-Vela-Access-Token stands for "tid" when the parameter is
+// absent: the access token without a session id, nothing beside one; and it
+// never becomes a parameter.
+TEST_F(WebEntryInit, AccessTokenHeaderStandsForTid)
+{
+    Set("REQUEST_METHOD", "GET");
+    const struct {
+        const char* query;
+        const char* header;  // null: none
+        const char* token;   // velaAccessToken ("-": unset)
+    } cases[] = {
+        {"api=A", "tok2", "tok2"},
+        {"tid=tok1", "tok2", "tok1"},
+        {"_sid=abc", "tok2", "-"},
+        {"api=A", "", "-"},
+        {"api=A", nullptr, "-"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(std::string(c.query) + " / " + (c.header ? c.header : "(no header)"));
+        Set("QUERY_STRING", c.query);
+        Set("HTTP_X_VELA_ACCESS_TOKEN", c.header);
+        Set("velaAccessToken", nullptr);
+        VELA::WebEntry entry;
+        ASSERT_TRUE(entry.Initialize(Json::Value()));
+        EXPECT_EQ(c.token, EnvOr("velaAccessToken", "-"));
+        EXPECT_FALSE(entry.GetRequest()->HasParam("tid") && std::string(c.query).find("tid=") == std::string::npos);
+    }
+}
+
 TEST_F(WebEntryInit, IdentityParametersMoveIntoTheHeaders)
 {
     Set("REQUEST_METHOD", "GET");
