@@ -111,15 +111,15 @@ int ListenUnix(const std::string& path, mode_t mode, const std::string& group)
 }
 
 // TCP on the loopback address only: 127.0.0.1:PORT or [::1]:PORT.
-int ListenLoopback(const std::string& spec)
+int ListenLoopback(const std::string& address)
 {
-    const size_t colon = spec.rfind(':');
+    const size_t colon = address.rfind(':');
     int port = 0;
-    if (colon == std::string::npos || !Number(spec.c_str() + colon + 1, 1, 65535, port)) {
+    if (colon == std::string::npos || !Number(address.c_str() + colon + 1, 1, 65535, port)) {
         fprintf(stderr, "velafcgi: --tcp takes 127.0.0.1:PORT or [::1]:PORT\n");
         return -1;
     }
-    const std::string host = spec.substr(0, colon);
+    const std::string host = address.substr(0, colon);
     int fd = -1;
     if (host == "127.0.0.1") {
         sockaddr_in a{};
@@ -150,7 +150,7 @@ int ListenLoopback(const std::string& spec)
         return -1;
     }
     if (fd < 0 || listen(fd, 128) != 0) {
-        fprintf(stderr, "velafcgi: cannot listen on %s: %s\n", spec.c_str(), strerror(errno));
+        fprintf(stderr, "velafcgi: cannot listen on %s: %s\n", address.c_str(), strerror(errno));
         if (fd >= 0) {
             close(fd);
         }
