@@ -335,11 +335,8 @@ int PermissionCheck::AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTi
     return verdict;
 }
 
-bool PermissionCheck::CheckRelay(APIRequest* req, APIResponse* resp, bool allowTimeout, VELACGI_CTX* cgi)
+bool PermissionCheck::SessionAllowed(APIRequest* req, APIResponse* resp, bool allowTimeout, VELACGI_CTX* cgi)
 {
-    if (req == nullptr || resp == nullptr) {
-        return false;
-    }
     const int code = CheckRequest(req, allowTimeout, cgi);
     RecordCode(req, resp, code, Slot(allowTimeout));
     if (code != WEBAPI_ERR_NONE) {
@@ -347,6 +344,17 @@ bool PermissionCheck::CheckRelay(APIRequest* req, APIResponse* resp, bool allowT
         if (word != nullptr) {
             resp->SetServerError(word);
         }
+        return false;
+    }
+    return true;
+}
+
+bool PermissionCheck::CheckRelay(APIRequest* req, APIResponse* resp, bool allowTimeout, VELACGI_CTX* cgi)
+{
+    if (req == nullptr || resp == nullptr) {
+        return false;
+    }
+    if (!SessionAllowed(req, resp, allowTimeout, cgi)) {
         return false;
     }
     const std::string user = req->GetLoginUserName();
@@ -365,13 +373,7 @@ bool PermissionCheck::CheckPermission(APIRequest* req, APIResponse* resp, VELACG
         return false;
     }
     const bool allowTimeout = runner_.GetMethodAttr(req, "allowTimeout");
-    const int code = CheckRequest(req, allowTimeout, cgi);
-    RecordCode(req, resp, code, Slot(allowTimeout));
-    if (code != WEBAPI_ERR_NONE) {
-        const char* word = ServerErrorWord(code);
-        if (word != nullptr) {
-            resp->SetServerError(word);
-        }
+    if (!SessionAllowed(req, resp, allowTimeout, cgi)) {
         return false;
     }
     const std::string user = req->GetLoginUserName();

@@ -88,6 +88,9 @@ private:
 
     Json::Value& Slot(bool allowTimeout);
     VELACGI_CTX* Handle(VELACGI_CTX* cgi);
+    // The session or token check of the request, its code recorded and, on
+    // a refusal, the server-error word set. True when allowed.
+    bool SessionAllowed(APIRequest* req, APIResponse* resp, bool allowTimeout, VELACGI_CTX* cgi);
     int AskPlatform(APIRequest* req, VELACGI_CTX* cgi, bool allowTimeout, Given& given);
     // Whether the method's (or else the API's) "allowUser" admits `cls`.
     bool ClassAdmitted(APIRequest* req, const std::string& cls);

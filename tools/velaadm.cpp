@@ -1068,85 +1068,43 @@ int Run(int argc, char** argv)
     if (command == "pubkey") {
         return PublicKey(argc, argv);
     }
-    if (command == "task") {
+    // Every command with actions: its actions in the order the usage
+    // message names them.
+    struct Action {
+        const char* name;
+        int (*run)(int, char**);
+    };
+    static const struct {
+        const char* command;
+        std::vector<Action> actions;
+    } kCommands[] = {
+        {"session", {{"create", SessionCreate}, {"list", SessionList}, {"revoke", SessionRevoke}}},
+        {"token", {{"create", TokenCreate}, {"list", TokenList}, {"revoke", TokenRevoke}}},
+        {"task", {{"list", TaskList}, {"show", TaskShow}, {"stop", TaskStop}}},
+        {"peer", {{"add", PeerAdd}, {"list", PeerList}, {"test", PeerTest}, {"remove", PeerRemove}}},
+        {"link", {{"create", LinkCreate}, {"list", LinkList}, {"show", LinkShow}, {"revoke", LinkRevoke}}},
+    };
+    for (const auto& entry : kCommands) {
+        if (command != entry.command) {
+            continue;
+        }
         if (argc < 3) {
-            return Usage("task needs an action: list, show or stop");
+            std::string names;
+            for (size_t k = 0; k < entry.actions.size(); ++k) {
+                names += (k == 0 ? "" : (k + 1 == entry.actions.size() ? " or " : ", "));
+                names += entry.actions[k].name;
+            }
+            return Usage((command + " needs an action: " + names).c_str());
         }
         const std::string action = argv[2];
-        if (action == "list") {
-            return TaskList(argc, argv);
+        for (const Action& a : entry.actions) {
+            if (action == a.name) {
+                return a.run(argc, argv);
+            }
         }
-        if (action == "show") {
-            return TaskShow(argc, argv);
-        }
-        if (action == "stop") {
-            return TaskStop(argc, argv);
-        }
-        return Usage(("unknown action \"" + action + "\" for task").c_str());
+        return Usage(("unknown action \"" + action + "\" for " + command).c_str());
     }
-    if (command == "peer") {
-        const std::string action = argc < 3 ? "" : argv[2];
-        if (action == "add") {
-            return PeerAdd(argc, argv);
-        }
-        if (action == "list") {
-            return PeerList(argc, argv);
-        }
-        if (action == "test") {
-            return PeerTest(argc, argv);
-        }
-        if (action == "remove") {
-            return PeerRemove(argc, argv);
-        }
-        return Usage(argc < 3 ? "peer needs an action: add, list, test or remove"
-                              : ("unknown action \"" + action + "\" for peer").c_str());
-    }
-    if (command == "link") {
-        const std::string action = argc < 3 ? "" : argv[2];
-        if (action == "create") {
-            return LinkCreate(argc, argv);
-        }
-        if (action == "list") {
-            return LinkList(argc, argv);
-        }
-        if (action == "show") {
-            return LinkShow(argc, argv);
-        }
-        if (action == "revoke") {
-            return LinkRevoke(argc, argv);
-        }
-        return Usage(argc < 3 ? "link needs an action: create, list, show or revoke"
-                              : ("unknown action \"" + action + "\" for link").c_str());
-    }
-    if (command != "session" && command != "token") {
-        return Usage(("unknown command \"" + command + "\"").c_str());
-    }
-    if (argc < 3) {
-        return Usage((command + " needs an action: create, list or revoke").c_str());
-    }
-    const std::string action = argv[2];
-    if (command == "session") {
-        if (action == "create") {
-            return SessionCreate(argc, argv);
-        }
-        if (action == "list") {
-            return SessionList(argc, argv);
-        }
-        if (action == "revoke") {
-            return SessionRevoke(argc, argv);
-        }
-    } else {
-        if (action == "create") {
-            return TokenCreate(argc, argv);
-        }
-        if (action == "list") {
-            return TokenList(argc, argv);
-        }
-        if (action == "revoke") {
-            return TokenRevoke(argc, argv);
-        }
-    }
-    return Usage(("unknown action \"" + action + "\" for " + command).c_str());
+    return Usage(("unknown command \"" + command + "\"").c_str());
 }
 
 }  // namespace
