@@ -6,7 +6,9 @@
 // through WebCrypto, and posts it as the one parameter "__cIpHeRtExT"
 // (base64, percent-encoded). The server answers with the session cookie "id"
 // (HttpOnly, so this script never sees it) and the anti-forgery token, which
-// every later call sends in the header "X-Vela-Token".
+// every later call sends in the header "X-Vela-Token". The token is kept in
+// this tab's sessionStorage ("vela.token") for the other pages of the site;
+// login.html?next=<page>.html goes back to that page after the sign-in.
 "use strict";
 
 (function () {
@@ -25,7 +27,14 @@
   };
 
   const el = (id) => document.getElementById(id);
+  const TOKEN_KEY = "vela.token";
   let token = "";
+
+  // The page to go back to: a plain page name of this folder, nothing else.
+  function nextPage() {
+    const next = new URLSearchParams(location.search).get("next") || "";
+    return /^[a-z]{1,32}\.html$/.test(next) ? next : "";
+  }
 
   function showError(text) {
     el("error").textContent = text;
@@ -127,11 +136,17 @@
         throw new Error("Enter the account and the password.");
       }
       token = "";
+      sessionStorage.removeItem(TOKEN_KEY);
       const plain = `account=${encodeURIComponent(account)}&passwd=${encodeURIComponent(passwd)}`;
       const cipher = await encryptForServer(plain);
       const login = await callApi("VELA.Auth", "login", `__cIpHeRtExT=${encodeURIComponent(cipher)}`);
       token = login.token;
+      sessionStorage.setItem(TOKEN_KEY, token);
       el("passwd").value = "";
+      if (nextPage() !== "") {
+        location.replace(nextPage());
+        return;
+      }
       await showWhoAmI();
     } catch (e) {
       showError(e.message);
@@ -148,6 +163,7 @@
       showError(e.message);
     }
     token = "";
+    sessionStorage.removeItem(TOKEN_KEY);
     el("whoami").hidden = true;
   }
 
