@@ -21,6 +21,8 @@
     105: "You are not allowed to do this.",
     106: "Your session has timed out; sign in again.",
     119: "You are not signed in.",
+    480: "That session has already ended.",
+    481: "The server could not complete the call.",
   };
   // Codes that mean the session is gone or unusable from here.
   const SIGNED_OUT = new Set([106, 107, 119, 150]);
