@@ -14,6 +14,9 @@
   const TOKEN_KEY = "vela.token";
   const SIGN_IN = "login.html?next=admin.html";
   const TASK_REFRESH_MS = 3000;
+  // The refresh pauses when nobody used the page for this long, so that an
+  // open tab alone does not keep the session from timing out.
+  const IDLE_PAUSE_MS = 10 * 60 * 1000;
   const MAX_BARS = 20;
   const SVG_NS = "http://www.w3.org/2000/svg";
 
@@ -31,6 +34,7 @@
   const token = sessionStorage.getItem(TOKEN_KEY) || "";
   let taskTimer = 0;
   let taskBusy = false;
+  let lastActive = Date.now();
 
   class ApiError extends Error {
     constructor(code) {
@@ -230,6 +234,10 @@
     if (taskBusy || document.hidden) {
       return;
     }
+    if (Date.now() - lastActive > IDLE_PAUSE_MS) {
+      status("tasks", "Refreshing paused while the page is not used: press Refresh.");
+      return;
+    }
     taskBusy = true;
     try {
       await section("tasks", loadTasks);
@@ -379,6 +387,9 @@
     }
     el("logout").addEventListener("click", signOut);
     el("refresh").addEventListener("click", loadAll);
+    for (const kind of ["pointerdown", "keydown", "wheel"]) {
+      document.addEventListener(kind, () => { lastActive = Date.now(); }, { passive: true });
+    }
     start();
   });
 })();
