@@ -4,9 +4,10 @@
 //
 // The user is the account running velaapi; root may name any other. Exec
 // itself checks no permission, so the tool judges the user first, with the
-// rules the session check applies once a session is valid (PermissionCheck::
-// UserMayCall): "authLevel", the user classes of "allowUser" and the API's
-// application privilege. Every argument is treated as hostile: the user is
+// rules the session check applies once a session is valid (APICatalog,
+// access/): "authLevel", the user classes of "allowUser" and the API's
+// application privilege. The list is the answer of VELA.Admin's "apis",
+// called the same way. Every argument is treated as hostile: the user is
 // checked and looked up before anything runs, the parameters are bounded.
 #include <algorithm>
 #include <cerrno>
@@ -22,8 +23,7 @@
 
 extern char** environ;
 
-#include "access/PermissionCheck.h"
-#include "dispatcher/Registry.h"
+#include "access/APICatalog.h"
 #include "vela/relay.h"
 #include "vela/user.h"
 #include "vela/vlibc.h"
@@ -40,6 +40,10 @@ constexpr int kExitUser = 3;     // the user may not be acted for, or does not e
 constexpr size_t kMaxParams = 16 * 1024 * 1024;
 
 const char kWebAPIDir[] = "/usr/vela/velaman/webapi";
+// The method that lists what a user may call.
+const char kListAPI[] = "VELA.Admin";
+constexpr int kListVersion = 1;
+const char kListMethod[] = "apis";
 
 const char kUsage[] =
     "usage: velaapi call API METHOD [key=value ... | JSON | -] [--version N] [--user NAME]\n"
@@ -74,7 +78,8 @@ const char kManual[] =
     "           refused with error 105 without running.\n"
     "\n"
     "    list   prints, one per line, \"API VERSION METHOD\" for every method the\n"
-    "           user may call, judged as call judges it.\n"
+    "           user may call, judged as call judges it: the answer of the\n"
+    "           method \"apis\" of VELA.Admin, called as call calls it.\n"
     "\n"
     "    The call runs with a plain environment: only PATH, HOME, LANG,\n"
     "    LANGUAGE, LC_*, TZ, TERM, TMPDIR and VELA_* are kept, so no CGI\n"
@@ -369,105 +374,6 @@ bool ParseParams(const std::vector<std::string>& args, size_t from, Json::Value&
     return true;
 }
 
-// A runner that also enumerates the description files, and judges users.
-class Catalog : public VELA::APIRunner {
-public:
-    Catalog() : check_(*this) {}
-
-    // The names of the APIs the *.lib files of the working directory describe.
-    std::vector<std::string> Names()
-    {
-        Json::Value table(Json::objectValue);
-        InitLibDesc(table);
-        return table.getMemberNames();
-    }
-
-    // The description of `api` as a call finds it (its own file, the
-    // defaults of lib.def applied); false when there is none.
-    bool Describe(const std::string& api, Json::Value& desc)
-    {
-        if (!VELA::System::IsAPIName(api)) {
-            return false;
-        }
-        GetMethod(api, 0, "");  // loads the description when there is one
-        VELA::APIRequest req;
-        req.InitParam(Request(api, 0, ""), true);
-        if (!AddAPIInfo(&req)) {
-            return false;
-        }
-        desc = Json::Value(Json::objectValue);
-        for (const char* key : {"minVersion", "maxVersion", "methods"}) {
-            desc[key] = req.GetAPIInfo(key);
-        }
-        return true;
-    }
-
-    // Whether `user` may call the method, as the session check would judge
-    // once the session is valid.
-    bool MayCall(const std::string& api, int version, const std::string& method, const std::string& user)
-    {
-        Json::Value request = Request(api, version, method);
-        request["session"]["username"] = user;
-        request["session"]["isAdmin"] = VLIBGroupIsAdminGroupMem(user.c_str(), 0) == 1;
-        VELA::APIRequest req(request);
-        return AddAPIInfo(&req) && check_.UserMayCall(&req);
-    }
-
-private:
-    static Json::Value Request(const std::string& api, int version, const std::string& method)
-    {
-        Json::Value request(Json::objectValue);
-        request["postParam"]["api"] = api;
-        request["postParam"]["version"] = version;
-        request["postParam"]["method"] = method;
-        return request;
-    }
-
-    VELA::PermissionCheck check_;
-};
-
-// The versions of `desc` in its range, ascending, each with the methods it
-// lists.
-std::vector<std::pair<int, std::vector<std::string>>> Versions(const Json::Value& desc)
-{
-    std::vector<std::pair<int, std::vector<std::string>>> out;
-    const Json::Value& methods = desc["methods"];
-    if (!methods.isObject() || !desc["minVersion"].isInt() || !desc["maxVersion"].isInt()) {
-        return out;
-    }
-    for (const std::string& key : methods.getMemberNames()) {
-        long long version = 0;
-        if (!VELA::System::ParseDecimal(key, desc["minVersion"].asInt(), desc["maxVersion"].asInt(), version)) {
-            continue;
-        }
-        const Json::Value& list = methods[key];
-        if (!list.isArray()) {
-            continue;
-        }
-        std::vector<std::string> names;
-        for (const Json::Value& entry : list) {
-            if (entry.isString()) {
-                names.push_back(entry.asString());
-            } else if (entry.isObject()) {
-                for (const std::string& name : entry.getMemberNames()) {
-                    names.push_back(name);
-                }
-            }
-        }
-        std::vector<std::string> listed;
-        for (const std::string& name : names) {
-            if (VELA::Registry::Lists(desc, static_cast<int>(version), name) &&
-                std::find(listed.begin(), listed.end(), name) == listed.end()) {
-                listed.push_back(name);
-            }
-        }
-        std::sort(listed.begin(), listed.end());
-        out.emplace_back(static_cast<int>(version), listed);
-    }
-    std::sort(out.begin(), out.end());
-    return out;
-}
-
 void PrintAnswer(const Json::Value& answer)
 {
     // JsonToString's text is valid UTF-8 whatever the handler answered; the
@@ -530,13 +436,13 @@ int Call(const Options& o, const std::string& user)
     if (o.peerGiven) {
         return CallPeer(o, user, params);
     }
-    Catalog catalog;
+    VELA::APICatalog catalog;
     int version = o.version;
     Json::Value desc;
     const bool described = catalog.Describe(api, desc);
     if (!o.versionGiven) {
         version = desc["maxVersion"].isInt() ? desc["maxVersion"].asInt() : 1;
-        for (const auto& entry : Versions(desc)) {
+        for (const auto& entry : VELA::APICatalog::Versions(desc)) {
             if (std::find(entry.second.begin(), entry.second.end(), method) != entry.second.end()) {
                 version = entry.first;
             }
@@ -566,17 +472,39 @@ int List(const Options& o, const std::string& user)
     if (o.versionGiven || o.peerGiven) {
         return Usage("--version and --peer are options of call");
     }
-    Catalog catalog;
+    // The administrators' API answers the list, judged and run as a call.
+    VELA::APICatalog catalog;
+    if (!catalog.MayCall(kListAPI, kListVersion, kListMethod, user)) {
+        fprintf(stderr, "velaapi: %s may not call %s %d %s\n", Shown(user).c_str(), kListAPI, kListVersion,
+                kListMethod);
+        return kExitFailure;
+    }
+    Json::Value answer;
+    catalog.Exec(answer, kListAPI, kListVersion, kListMethod, Json::Value(Json::objectValue), user.c_str());
+    const Json::Value& apis = answer["data"]["apis"];
+    if (!answer.isObject() || answer["success"] != Json::Value(true) || !apis.isArray()) {
+        fprintf(stderr, "velaapi: %s %d %s gave no list\n", kListAPI, kListVersion, kListMethod);
+        PrintAnswer(answer);
+        return kExitFailure;
+    }
     std::string out;
-    for (const std::string& api : catalog.Names()) {
-        Json::Value desc;
-        if (!catalog.Describe(api, desc)) {
+    for (const Json::Value& api : apis) {
+        const Json::Value& methods = api["methods"];
+        if (!api["api"].isString() || !methods.isObject()) {
             continue;
         }
-        for (const auto& entry : Versions(desc)) {
-            for (const std::string& method : entry.second) {
-                if (catalog.MayCall(api, entry.first, method, user)) {
-                    out += Shown(api) + " " + std::to_string(entry.first) + " " + Shown(method) + "\n";
+        std::vector<std::pair<long long, std::string>> versions;
+        for (const std::string& key : methods.getMemberNames()) {
+            long long version = 0;
+            if (VELA::System::ParseDecimal(key, 1, INT_MAX, version)) {
+                versions.emplace_back(version, key);
+            }
+        }
+        std::sort(versions.begin(), versions.end());
+        for (const auto& version : versions) {
+            for (const Json::Value& method : methods[version.second]) {
+                if (method.isString()) {
+                    out += Shown(api["api"].asString()) + " " + version.second + " " + Shown(method.asString()) + "\n";
                 }
             }
         }

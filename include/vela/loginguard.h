@@ -45,6 +45,9 @@
 // the session store's clock (VELA::Session::SetClockForTest in vela/session.h).
 #pragma once
 
+#include <string>
+#include <vector>
+
 #include "vela/export.h"
 
 // Exported from libwebapi-TARN5.so, whose other symbols are hidden.
@@ -116,6 +119,28 @@ void LoginGuardFailed(const LoginSettings* settings, const char* account, const 
 // (account, address) pair, and no others, from both records. 0, or -1 when
 // the records could not be updated (logged).
 int LoginGuardSucceeded(const LoginSettings* settings, const char* account, const char* clientIP);
+
+// One address or account that refuses login attempts now.
+struct VELA_EXPORT LoginGuardEntry {
+    // The address as it is counted ("192.0.2.7", "2001:db8:1:2::/64", "?"
+    // for clients of no known address), or the account in lower case.
+    std::string subject;
+    long long until = 0;  // when an attempt is let through again (epoch seconds)
+    int failures = 0;     // the failures that led to the block, or counted now
+};
+
+// The guard's records that refuse attempts now: addresses that are blocked
+// or whose counted attempts have reached the limit, and accounts whose
+// count from every address has reached it (which refuses the attempts of
+// addresses the full store does not track). Each list is sorted by
+// subject. The directory is walked without following links, at most
+// VELA_LOGIN_GUARD_LIST_MAX files are read, and a record that is not one,
+// or that was written before records named their subject, is skipped. 0,
+// or -1 when the directory cannot be read (logged; the lists are then
+// empty); a missing directory gives two empty lists.
+#define VELA_LOGIN_GUARD_LIST_MAX (VELA_LOGIN_GUARD_RECORDS_MAX + 100000)
+int LoginGuardList(const LoginSettings* settings, std::vector<LoginGuardEntry>& addresses,
+                   std::vector<LoginGuardEntry>& accounts);
 
 }  // namespace Session
 }  // namespace VELA

@@ -97,6 +97,19 @@ int List(std::vector<Record>& out);
 // Returns how many were removed, or -1.
 int Purge(long long graceSeconds);
 
+// Characters of a session's handle: the first 16 hex digits of the SHA-256
+// of its id. A handle names a session to administrators without giving
+// away the id, which is a credential.
+#define VELA_SESSION_HANDLE_LEN 16
+
+// The handle of session `sid` (lower-case hex). 0, or -1 when `sid` is not
+// an id or SHA-256 is not available (logged); `handle` is then empty.
+int HandleOf(const char* sid, std::string& handle);
+
+// Whether `text` has the shape of a handle: exactly VELA_SESSION_HANDLE_LEN
+// lower-case hex digits.
+bool IsHandle(const char* text);
+
 // Tests only: replaces time(2) for sessions and access tokens with `now`;
 // null restores time(2).
 void SetClockForTest(long long (*now)(void));

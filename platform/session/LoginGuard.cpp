@@ -1,10 +1,13 @@
 // The brute-force guard of the login API and the login settings (the
 // contract and the policy are in vela/loginguard.h).
 //
-// A record is the JSON object {"version":2, "attempts":[[t, "tag"], ...],
-// "blockedUntil":T}: the attempts counted within the window (in progress or
+// A record is the JSON object {"version":2, "subject":"192.0.2.7",
+// "attempts":[[t, "tag"], ...], "blockedUntil":T, "blockFailures":N}: what
+// it counts (the address key or the account key without its "addr:" or
+// "acct:"), the attempts counted within the window (in progress or
 // failed), each with the tag of the other side of its (account, address)
-// pair, and the end of the block, 0 for none. A tag is the first 16 hex
+// pair, the end of the block, 0 for none, and the failures that started
+// the block. A tag is the first 16 hex
 // digits of the other record's name. A record that holds nothing is removed
 // rather than written. The file's modification time is set to the moment
 // the record will hold nothing any more (its expiry), so the purge finds
@@ -15,6 +18,7 @@
 #include <cstring>
 #include <dirent.h>
 #include <fcntl.h>
+#include <algorithm>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -45,6 +49,8 @@ constexpr size_t kMaxAttempts = VELA_LOGIN_MAX_FAILURES_MAX;
 constexpr size_t kMaxRecordFile = 128 * 1024;
 constexpr int kLockSeconds = 5;
 constexpr size_t kMaxLoggedAccount = 64;
+constexpr size_t kMaxSubject = VELA_LOGIN_ACCOUNT_MAX;
+constexpr size_t kDigestHexLen = 64;
 const int kFailureLog = LOG_AUTHPRIV | LOG_WARNING;
 const int kBlockLog = LOG_AUTHPRIV | LOG_NOTICE;
 
@@ -179,10 +185,12 @@ struct Attempt {
 
 struct Record {
     std::string path;
+    std::string subject;  // the key without its "addr:" or "acct:"
     std::string tag;      // this record's tag, as the other record knows it
     bool exists = false;  // a file was found
     std::vector<Attempt> attempts;  // oldest first
     long long blockedUntil = 0;
+    long long blockFailures = 0;  // the failures that started the block
 };
 
 struct Limits {
@@ -204,6 +212,33 @@ Limits LimitsOf(const LoginSettings* settings)
                   clamp(s.maxRecords, VELA_LOGIN_GUARD_RECORDS_MAX)};
 }
 
+// The counts of the record document `doc` into `rec`. False, `rec`
+// untouched, when it is not a record.
+bool ParseRecord(const Json::Value& doc, Record& rec)
+{
+    const Json::Value& attempts = doc["attempts"];
+    long long until = 0;
+    long long version = 0;
+    if (!attempts.isArray() || !VELA::Session::GetInt(doc, "version", 2, 2, version) ||
+        !VELA::Session::GetInt(doc, "blockedUntil", 0, 1LL << 40, until)) {
+        return false;
+    }
+    rec.blockedUntil = until;
+    long long failures = 0;
+    if (VELA::Session::GetInt(doc, "blockFailures", 0, kMaxAttempts, failures)) {
+        rec.blockFailures = failures;
+    }
+    for (const Json::Value& a : attempts) {
+        if (rec.attempts.size() >= kMaxAttempts) {
+            break;
+        }
+        if (a.isArray() && a.size() == 2 && a[0].isInt64() && a[1].isString() && a[1].asString().size() == kTagLen) {
+            rec.attempts.push_back(Attempt{a[0].asInt64(), a[1].asString()});
+        }
+    }
+    return true;
+}
+
 // Reads the record at `rec.path`. A missing file is an empty record, and
 // so is a corrupt one (logged): it is overwritten. False when the file
 // cannot be read.
@@ -216,25 +251,8 @@ bool LoadRecord(Record& rec)
         return false;
     }
     rec.exists = r != ReadResult::Missing;
-    if (r != ReadResult::Ok) {
-        return true;
-    }
-    const Json::Value& attempts = doc["attempts"];
-    long long until = 0;
-    long long version = 0;
-    if (!attempts.isArray() || !VELA::Session::GetInt(doc, "version", 2, 2, version) ||
-        !VELA::Session::GetInt(doc, "blockedUntil", 0, 1LL << 40, until)) {
+    if (r == ReadResult::Ok && !ParseRecord(doc, rec)) {
         VELA_LOG_ERR("%s is not a login-guard record, starting afresh", rec.path.c_str());
-        return true;
-    }
-    rec.blockedUntil = until;
-    for (const Json::Value& a : attempts) {
-        if (rec.attempts.size() >= kMaxAttempts) {
-            break;
-        }
-        if (a.isArray() && a.size() == 2 && a[0].isInt64() && a[1].isString() && a[1].asString().size() == kTagLen) {
-            rec.attempts.push_back(Attempt{a[0].asInt64(), a[1].asString()});
-        }
     }
     return true;
 }
@@ -256,6 +274,7 @@ void Prune(Record& rec, long long now, const Limits& limits)
     rec.attempts.swap(kept);
     if (rec.blockedUntil <= now) {
         rec.blockedUntil = 0;
+        rec.blockFailures = 0;
     } else if (rec.blockedUntil > now + limits.block) {
         rec.blockedUntil = now + limits.block;
     }
@@ -300,6 +319,7 @@ bool SaveRecord(const Record& rec, const Limits& limits)
     }
     Json::Value doc(Json::objectValue);
     doc["version"] = 2;
+    doc["subject"] = rec.subject;
     doc["attempts"] = Json::Value(Json::arrayValue);
     for (const Attempt& a : rec.attempts) {
         Json::Value pair(Json::arrayValue);
@@ -308,6 +328,9 @@ bool SaveRecord(const Record& rec, const Limits& limits)
         doc["attempts"].append(pair);
     }
     doc["blockedUntil"] = static_cast<Json::Int64>(rec.blockedUntil);
+    if (rec.blockedUntil != 0) {
+        doc["blockFailures"] = static_cast<Json::Int64>(rec.blockFailures);
+    }
     if (!VELA::Session::WriteStateFile(rec.path, doc, false)) {
         return false;
     }
@@ -458,6 +481,8 @@ bool NameRecords(const char* account, const char* clientIP, Pair& pair)
         return false;
     }
     const std::string dir = GuardDir() + "/";
+    pair.account.subject = accountKey.substr(5);
+    pair.address.subject = addressKey.substr(5);
     pair.account.path = dir + kAccountPrefix + accountHex;
     pair.account.tag = accountHex.substr(0, kTagLen);
     pair.address.path = dir + kAddressPrefix + addressHex;
@@ -591,6 +616,7 @@ void Failed(const LoginSettings* settings, const char* account, const char* clie
         const size_t failures = address.attempts.size();
         address.attempts.clear();
         address.blockedUntil = now + limits.block;
+        address.blockFailures = static_cast<long long>(failures);
         if (SaveRecord(address, limits)) {
             VELA_LOG(kBlockLog,
                      "login blocked for %lld minutes: %zu failures from %s within %lld minutes "
@@ -633,7 +659,137 @@ int Succeeded(const LoginSettings* settings, const char* account, const char* cl
     return rc;
 }
 
+// ---- Listing ---------------------------------------------------------------------------
+
+// Whether `name` is a record's file name with `prefix`: the prefix and 64
+// lower-case hex digits.
+bool IsRecordName(const char* name, const char* prefix, size_t prefixLen)
+{
+    if (strncmp(name, prefix, prefixLen) != 0 || strnlen(name, prefixLen + kDigestHexLen + 1) != prefixLen + kDigestHexLen) {
+        return false;
+    }
+    for (size_t i = prefixLen; i < prefixLen + kDigestHexLen; ++i) {
+        const char c = name[i];
+        if (!((c >= '0' && c <= '9') || (c >= 'a' && c <= 'f'))) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// Reads the record file `name` of the store and, when it refuses attempts
+// now, gives its entry. A record must name its subject, and the subject
+// must hash to the file's name, so nothing but the guard's own writing
+// shows up in the list.
+bool ListedEntry(const std::string& dir, const char* name, bool isAddress, long long now, const Limits& limits,
+                 VELA::Session::LoginGuardEntry& entry)
+{
+    Record rec;
+    rec.path = dir + "/" + name;
+    Json::Value doc;
+    if (VELA::Session::ReadStateFile(rec.path, kMaxRecordFile, doc) != VELA::Session::ReadResult::Ok) {
+        return false;
+    }
+    std::string subject;
+    if (!VELA::Session::GetString(doc, "subject", kMaxSubject, subject) || subject.empty() ||
+        !ParseRecord(doc, rec)) {
+        return false;
+    }
+    std::string hex;
+    if (!Digest((isAddress ? "addr:" : "acct:") + subject, hex) ||
+        hex != std::string(name + (isAddress ? sizeof(kAddressPrefix) : sizeof(kAccountPrefix)) - 1)) {
+        return false;
+    }
+    Prune(rec, now, limits);
+    if (!isAddress && rec.attempts.size() < static_cast<size_t>(limits.maxFailures)) {
+        return false;  // an account refuses only on its count
+    }
+    const long long wait = WaitOf(rec, now, limits);
+    if (wait <= 0) {
+        return false;
+    }
+    entry.subject = subject;
+    entry.until = now + wait;
+    entry.failures = static_cast<int>(rec.blockedUntil > now ? rec.blockFailures
+                                                              : static_cast<long long>(rec.attempts.size()));
+    return true;
+}
+
+int ListBlocked(const LoginSettings* settings, std::vector<VELA::Session::LoginGuardEntry>& addresses,
+         std::vector<VELA::Session::LoginGuardEntry>& accounts)
+{
+    const Limits limits = LimitsOf(settings);
+    const std::string dir = GuardDir();
+    const int fd = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (fd < 0) {
+        if (errno == ENOENT) {
+            return 0;
+        }
+        VELA_LOG_ERR("login guard: cannot open %s: %m", dir.c_str());
+        return -1;
+    }
+    struct stat st;
+    if (fstat(fd, &st) != 0 || !S_ISDIR(st.st_mode) || st.st_uid != geteuid()) {
+        VELA_LOG_ERR("login guard: %s is not a directory of uid %u, not listed", dir.c_str(),
+                     static_cast<unsigned>(geteuid()));
+        close(fd);
+        return -1;
+    }
+    DIR* d = fdopendir(fd);
+    if (d == nullptr) {
+        VELA_LOG_ERR("login guard: fdopendir(%s): %m", dir.c_str());
+        close(fd);
+        return -1;
+    }
+    const long long now = Now();
+    size_t read = 0;
+    for (struct dirent* e = readdir(d); e != nullptr; e = readdir(d)) {
+        const char* name = e->d_name;
+        const bool isAddress = IsRecordName(name, kAddressPrefix, sizeof(kAddressPrefix) - 1);
+        if (!isAddress && !IsRecordName(name, kAccountPrefix, sizeof(kAccountPrefix) - 1)) {
+            continue;
+        }
+        // The modification time is the record's expiry: an expired one is
+        // not read.
+        if (fstatat(dirfd(d), name, &st, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISREG(st.st_mode) || st.st_mtime <= now) {
+            continue;
+        }
+        if (++read > VELA_LOGIN_GUARD_LIST_MAX) {
+            VELA_LOG_ERR("login guard: more than %d records, the rest not listed", VELA_LOGIN_GUARD_LIST_MAX);
+            break;
+        }
+        VELA::Session::LoginGuardEntry entry;
+        if (ListedEntry(dir, name, isAddress, now, limits, entry)) {
+            (isAddress ? addresses : accounts).push_back(entry);
+        }
+    }
+    closedir(d);
+    auto bySubject = [](const VELA::Session::LoginGuardEntry& a, const VELA::Session::LoginGuardEntry& b) {
+        return a.subject < b.subject;
+    };
+    std::sort(addresses.begin(), addresses.end(), bySubject);
+    std::sort(accounts.begin(), accounts.end(), bySubject);
+    return 0;
+}
+
 }  // namespace
+
+int VELA::Session::LoginGuardList(const LoginSettings* settings, std::vector<LoginGuardEntry>& addresses,
+                                  std::vector<LoginGuardEntry>& accounts)
+{
+    addresses.clear();
+    accounts.clear();
+    try {
+        if (ListBlocked(settings, addresses, accounts) == 0) {
+            return 0;
+        }
+    } catch (const std::exception&) {
+        VELA_LOG_ERR("login guard: out of memory");
+    }
+    addresses.clear();
+    accounts.clear();
+    return -1;
+}
 
 void VELA::Session::LoginSettingsLoad(LoginSettings* settings)
 {
