@@ -128,14 +128,29 @@
     el("adminonly").hidden = false;
   }
 
-  // Runs `load` for section `id`: its failure is shown in the section, a
-  // refusal turns the page into the administrators-only notice.
+  // A refusal (105) of an administrators' method: the server refuses an
+  // unknown session the same way, so "apis", open to every signed-in user,
+  // tells a gone session (back to the sign-in page) from a user who is no
+  // administrator.
+  async function refused() {
+    try {
+      await callApi("VELA.Admin", "apis");
+    } catch (e) {
+      if (e.code === 105) {
+        signInAgain();
+      }
+      return;
+    }
+    showAdminOnly();
+  }
+
+  // Runs `load` for section `id`: its failure is shown in the section.
   async function section(id, load) {
     try {
       await load();
     } catch (e) {
       if (e.code === 105) {
-        showAdminOnly();
+        await refused();
       } else if (!SIGNED_OUT.has(e.code)) {
         status(id, e.message, true);
       }
@@ -264,7 +279,9 @@
       status("sessions", `The session of ${session.user} from ${session.address || "any address"} is revoked.`);
     } catch (e) {
       button.disabled = false;
-      if (!SIGNED_OUT.has(e.code)) {
+      if (e.code === 105) {
+        await refused();
+      } else if (!SIGNED_OUT.has(e.code)) {
         status("sessions", e.message, true);
       }
     }
@@ -354,7 +371,9 @@
     try {
       admin = await loadApis();
     } catch (e) {
-      if (!SIGNED_OUT.has(e.code)) {
+      if (e.code === 105) {
+        signInAgain();  // "apis" is open to every signed-in user
+      } else if (!SIGNED_OUT.has(e.code)) {
         showError(e.message);
       }
       return;

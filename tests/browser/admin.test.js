@@ -3,8 +3,8 @@
 // administrator then sees the usage chart with the calls run.sh made, the
 // running checksum task with its progress bar (refreshed), the sessions
 // with their own marked, the address run.sh blocked and the APIs they may
-// call; revoking their own session asks first, revoking the second one
-// (made with velaadm) ends it on the server. An ordinary user gets the
+// call; revoking the second session (made with velaadm) ends it on the
+// server, revoking their own asks first and then signs them out. An ordinary user gets the
 // administrators-only notice and nothing broken.
 //
 // With usage collection turned off in INFO_FILE (the root's velainfo.conf)
@@ -74,6 +74,16 @@ async function signInThroughPage(page, account, passwd) {
   await page.waitForURL(/\/admin\.html$/);
 }
 
+// What the page settled on: "panels", "adminonly" or the error it shows.
+async function settled(page) {
+  const shown = await page.waitForFunction(() => {
+    const visible = (id) => !document.getElementById(id).hidden;
+    return visible("panels") ? "panels" : visible("adminonly") ? "adminonly"
+      : visible("error") ? `error: ${document.getElementById("error").textContent}` : null;
+  });
+  return shown.jsonValue();
+}
+
 async function checkUsage(page) {
   await page.waitForSelector("#usage-chart .bar");
   const bars = await page.$$eval("#usage-chart .bar", (gs) => gs.map((g) => ({
@@ -125,9 +135,10 @@ async function checkSessions(page) {
 
   // Their own session: the page asks, and a "no" keeps it.
   const dialogs = [];
+  let yes = false;
   page.on("dialog", (d) => {
     dialogs.push(d.message());
-    d.dismiss();
+    return yes ? d.accept() : d.dismiss();
   });
   await page.click("#sessions tr.current button.revoke");
   check(dialogs.length === 1 && /own session/.test(dialogs[0]), `revoking the own session asked ${JSON.stringify(dialogs)}`);
@@ -138,9 +149,21 @@ async function checkSessions(page) {
   await page.click(`${second} button.revoke`);
   await page.waitForSelector(second, { state: "detached" });
   check(dialogs.length === 1, "revoking another session asked");
+  // A removed session is refused like any unknown id.
   const code = await whoamiCode(secondSid);
-  check(code === 119, `whoami with the revoked session: ${code}`);
+  check(code === 105, `whoami with the revoked session: ${code}`);
   check(/revoked/.test(await page.textContent("#sessions .status")), "no word that the session is revoked");
+
+  // A "yes" for their own: signed out, back on the sign-in page.
+  yes = true;
+  await page.click("#sessions tr.current button.revoke");
+  await page.waitForURL(/\/login\.html\?next=admin\.html$/);
+  check(dialogs.length === 2, `${dialogs.length} questions, expected 2`);
+  const own = await page.evaluate(async () => {
+    const r = await fetch("/webapi/entry.cgi?api=VELA.Sample&version=1&method=whoami");
+    return (await r.json()).success;
+  });
+  check(own === false, "the page's own session still works after it was revoked");
 }
 
 async function checkBlocked(page) {
@@ -161,12 +184,15 @@ async function run() {
     const errors = [];
     const page = await newPage(browser, errors);
     await signInThroughPage(page, admin, adminPass);
-    await page.waitForSelector("#panels", { state: "visible" });
+    const adminSees = await settled(page);
+    if (adminSees !== "panels") {
+      check(false, `the administrator's page shows ${adminSees}`);
+      return;
+    }
     check(await page.isHidden("#adminonly"), "an administrator is told the page is for administrators only");
     await checkUsage(page);
     await checkTask(page);
     await checkBlocked(page);
-    await checkSessions(page);
     // Nothing the server named became markup (run.sh failed a sign-in with
     // an account name that is an <img> tag).
     check(await page.$$eval("main img", (n) => n.length) === 0 && (await page.title()) !== "1",
@@ -177,13 +203,15 @@ async function run() {
     await page.reload();
     await page.waitForFunction(() => /collection is off/.test(document.querySelector("#usage .status").textContent));
     check(await page.isHidden("#usage-box"), "a chart while usage collection is off");
+    await checkSessions(page);
     check(errors.length === 0, `script errors: ${errors.join("; ")}`);
 
     const userErrors = [];
     const userPage = await newPage(browser, userErrors);
     await signInThroughPage(userPage, user, userPass);
-    await userPage.waitForSelector("#adminonly", { state: "visible" });
-    check(/administrators only/i.test(await userPage.textContent("#adminonly")), "no administrators-only notice");
+    const userSees = await settled(userPage);
+    check(userSees === "adminonly" && /administrators only/i.test(await userPage.textContent("#adminonly")),
+          `the user's page shows ${userSees}`);
     check(await userPage.isHidden("#panels") && await userPage.isHidden("#error"),
           "the user's page shows the panels or an error");
     check(userErrors.length === 0, `the user's page had script errors: ${userErrors.join("; ")}`);
