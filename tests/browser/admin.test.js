@@ -194,7 +194,7 @@ async function run() {
     await checkTask(page);
     await checkBlocked(page);
     // Nothing the server named became markup (run.sh failed a sign-in with
-    // an account name that is an <img> tag).
+    // an account name that is an <img> tag, should a list name it).
     check(await page.$$eval("main img", (n) => n.length) === 0 && (await page.title()) !== "1",
           "text from the server became markup");
 
