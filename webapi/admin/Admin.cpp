@@ -152,9 +152,12 @@ void ReadCounterFile(int dir, const char* name, std::vector<Count>& counts)
         return;
     }
     for (auto it = doc.begin(); it != doc.end() && counts.size() < kMaxCounts; ++it) {
+        if (!it->isObject()) {
+            continue;
+        }
         const Json::Value& count = (*it)["count"];
         Count c;
-        if (!it->isObject() || !count.isInt64() || count.asInt64() < 0 || !SplitMember(it.name(), c)) {
+        if (!count.isInt64() || count.asInt64() < 0 || !SplitMember(it.name(), c)) {
             continue;
         }
         c.count = count.asInt64();

@@ -175,6 +175,63 @@ TEST_F(LoginGuard, RecordsAreHashedPrivateFiles)
     }
 }
 
+// The list of blocks: blocked addresses (an IPv6 client as its /64) and
+// accounts whose count from every address reached the limit, until when
+// and after how many failures; nothing below the limit, nothing expired,
+// no file that is not the guard's own record.
+TEST_F(LoginGuard, ListShowsWhatRefusesAttemptsNow)
+{
+    using Entries = std::vector<VELA::Session::LoginGuardEntry>;
+    Entries addresses, accounts;
+    const auto list = [&] {
+        EXPECT_EQ(0, VELA::Session::LoginGuardList(&settings_, addresses, accounts));
+        std::string text;
+        for (const Entries* l : {&addresses, &accounts}) {
+            for (const auto& e : *l) {
+                text += e.subject + " " + std::to_string(e.until - kStart) + " " + std::to_string(e.failures) + "; ";
+            }
+            text += "| ";
+        }
+        return text;
+    };
+    EXPECT_EQ("| | ", list()) << "no store yet";
+
+    Run({{'F', "nosuch", "192.0.2.1", kAllow}, {'F', "nosuch", "192.0.2.1", kAllow},
+         {'F', "nosuch", "192.0.2.1", kAllow},                                          // blocked
+         {'F', "bin", "2001:db8::1", kAllow}, {'F', "bin", "2001:db8::1", kAllow},      // its /64 at 2
+         {'F', "daemon", "192.0.2.3", kAllow, 60}, {'F', "daemon", "192.0.2.4", kAllow},
+         {'F', "daemon", "192.0.2.5", kAllow}});                                       // the account at 3
+    EXPECT_EQ("192.0.2.1 900 3; | daemon 660 3; | ", list());
+    Run({{'F', "nosuch", "2001:db8::2", kAllow}});
+    EXPECT_EQ("192.0.2.1 900 3; 2001:db8::/64 960 3; | daemon 660 3; | ", list());
+
+    // A copy of a record under another name, a link to one and a stray
+    // file are not listed.
+    std::string blocked;
+    for (const std::string& name : DirEntries(GuardDir())) {
+        if (name.compare(0, 5, "addr-") == 0) {
+            blocked = GuardDir() + "/" + name;
+        }
+    }
+    const std::string forged = GuardDir() + "/addr-" + std::string(64, 'a');
+    ASSERT_EQ(0, system(("cp -p '" + blocked + "' '" + forged + "'").c_str()));
+    ASSERT_EQ(0, symlink(blocked.c_str(), (GuardDir() + "/addr-" + std::string(64, 'b')).c_str()));
+    ASSERT_EQ(0, system(("cp -p '" + blocked + "' '" + GuardDir() + "/addr-x'").c_str()));
+    const std::string before = list();
+    EXPECT_EQ(2u, addresses.size()) << before;
+
+    // The account's count leaves the window; the blocks end.
+    Now() += 11 * 60;
+    EXPECT_EQ("192.0.2.1 900 3; 2001:db8::/64 960 3; | | ", list());
+    Now() += 5 * 60;
+    EXPECT_EQ("| | ", list());
+
+    // A store that is a link is not read.
+    ASSERT_EQ(0, system(("mv '" + GuardDir() + "' '" + GuardDir() + ".real' && ln -s '" + GuardDir() +
+                         ".real' '" + GuardDir() + "'").c_str()));
+    EXPECT_EQ(-1, VELA::Session::LoginGuardList(&settings_, addresses, accounts));
+}
+
 // Expired records go at the next failure; the bound holds address records
 // to login_guard_max_records, and a full store never lifts a limit.
 TEST_F(LoginGuard, ExpiredRecordsArePurgedAndTheStoreIsBounded)
