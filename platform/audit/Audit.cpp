@@ -148,8 +148,12 @@ std::string Line(const Event& e, long long epoch)
     };
     const std::string name(e.name);
     Field fields[] = {
-        {"event", &name, kMaxEvent},       {"user", &e.user, kMaxName},     {"actor", &e.actor, kMaxName},
-        {"address", &e.address, kMaxAddress}, {"api", &e.api, kMaxApi},     {"method", &e.method, kMaxApi},
+        {"event", &name, kMaxEvent},
+        {"user", &e.user, kMaxName},
+        {"actor", &e.actor, kMaxName},
+        {"address", &e.address, kMaxAddress},
+        {"api", &e.api, kMaxApi},
+        {"method", &e.method, kMaxApi},
         {"tokenId", &e.tokenId, kMaxTokenId},
     };
     for (;;) {
