@@ -8,7 +8,10 @@
 #include "dispatcher/APIRunnerPrivate.h"
 #include "dispatcher/Refusal.h"
 #include "dispatcher/ResolvedCall.h"
+#include "vela/audit.h"
 #include "vela/log.h"
+#include "webapi/APIRequest.h"
+#include "webapi/APIResponse.h"
 
 namespace VELA {
 
@@ -39,6 +42,31 @@ const RoadStage kRoad[] = {
 };
 // clang-format on
 
+// What an audit event recorded during the call learns of it (asked only
+// when one is recorded).
+void CallFactsOf(const void* arg, Audit::CallFacts& out)
+{
+    const ResolvedCall& call = *static_cast<const ResolvedCall*>(arg);
+    out.actor = call.req->GetLoginUserName();
+    out.address = call.req->GetRemoteIP();
+    out.api = call.api;
+    out.method = call.method;
+}
+
+// A method described with "audit": true leaves one line in the audit trail
+// once the road is over, served or refused, with the answer's error code.
+void AuditCall(const ResolvedCall& call)
+{
+    if (call.flags == nullptr || !call.Flag("audit")) {
+        return;
+    }
+    Audit::Event event;
+    event.name = Audit::kCall;
+    event.user = call.req->GetLoginUserName();
+    event.result = call.resp->GetError();
+    Audit::Record(event);
+}
+
 }  // namespace
 
 Stage RoadStart() { return kRoad[0].run; }
@@ -47,6 +75,7 @@ bool WalkRoad(ResolvedCall& call, Stage from)
 {
     const ResolvedCall* outer = call.d.Current();
     call.d.SetCurrent(&call);
+    const Audit::CallSource outerSource = Audit::SetCallSource({&CallFactsOf, &call});
     bool served = false;
     const char* at = "road";
     try {
@@ -70,6 +99,12 @@ bool WalkRoad(ResolvedCall& call, Stage from)
     }
     call.identity.Restore();
     call.scope.Restore();
+    try {
+        AuditCall(call);
+    } catch (const std::exception& e) {
+        VELA_LOG_ERR("%s: audit failed: %s", LogSafe(call.api).c_str(), e.what());
+    }
+    Audit::SetCallSource(outerSource);
     call.d.SetCurrent(outer);
     return served;
 }

@@ -56,6 +56,7 @@ struct VELA_EXPORT Options {
     std::string app;            // application the session was opened for (at most 255 bytes)
     std::string webapi;         // web-API privilege (at most 255 bytes)
     std::string lang;           // three lower-case letters ("enu"), or "" for none
+    const char* auditEvent = nullptr;  // name of its audit event; null: "session-create"
 };
 
 // A session as List reports it (the anti-forgery token is left out).
@@ -80,13 +81,17 @@ struct VELA_EXPORT Record {
 // A null or empty `clientIP` binds no address and forces skipIP on. `options`
 // may be null for the defaults. Returns 0 and fills `sid` and `token` (the
 // anti-forgery token); -1 on any failure (logged), the outputs then empty.
-// Expired sessions of the store are removed on the way.
+// Expired sessions of the store are removed on the way. A new session is
+// recorded in the audit trail (vela/audit.h) as "session-create", or as
+// `options->auditEvent` (the login API's "login").
 int Create(const char* user, const char* clientIP, const Options* options,
            std::string& sid, std::string& token);
 
 // Removes session `sid`. 0 removed, -2 no such session (or a malformed id),
-// -1 on failure.
-int Remove(const char* sid);
+// -1 on failure. A removal is recorded in the audit trail with the
+// session's user as `auditEvent`, null meaning "session-revoke" (the login
+// API's logout passes "logout").
+int Remove(const char* sid, const char* auditEvent = nullptr);
 
 // Every session of the store, oldest first, expired ones included; files that
 // are not valid sessions are skipped. 0 / -1 (`out` then empty).

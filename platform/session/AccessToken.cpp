@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "session/SessionStore.h"
+#include "vela/audit.h"
 #include "vela/log.h"
 #include "vela/token.h"
 #include "vela/vlibc.h"
@@ -237,6 +238,16 @@ bool CheckPatterns(const std::vector<std::string>& patterns, const char* what)
     return true;
 }
 
+// One line of the audit trail about token `id` of `user` (never its secret).
+void AuditToken(const char* name, const std::string& user, const std::string& id)
+{
+    VELA::Audit::Event event;
+    event.name = name;
+    event.user = user;
+    event.tokenId = id;
+    VELA::Audit::Record(event);
+}
+
 int Create(const char* user, const std::vector<std::string>& apis, const std::vector<std::string>& methods,
            long long lifetime, std::string& token, std::string& id)
 {
@@ -295,6 +306,7 @@ int Create(const char* user, const std::vector<std::string>& apis, const std::ve
     id = t.id;
     VELA_LOG(LOG_AUTHPRIV | LOG_INFO, "access token %s created for \"%s\", expires %lld", t.id.c_str(), user,
              t.expires);
+    AuditToken(VELA::Audit::kTokenCreate, t.user, t.id);
     return 0;
 }
 
@@ -385,6 +397,10 @@ int VelaAccessTokenRevoke(const char* id)
             return -2;
         }
         const std::string path = TokenPath(name);
+        Token t;  // whose token it was, for the audit trail
+        if (LoadToken(name, t) != Load::Ok) {
+            t.user.clear();
+        }
         if (unlink(path.c_str()) != 0) {
             if (errno == ENOENT) {
                 return -2;
@@ -393,6 +409,7 @@ int VelaAccessTokenRevoke(const char* id)
             return -1;
         }
         VELA_LOG(LOG_AUTHPRIV | LOG_INFO, "access token %s revoked", name.c_str());
+        AuditToken(VELA::Audit::kTokenRevoke, t.user, name);
         return 0;
     } catch (const std::exception&) {
         return -1;

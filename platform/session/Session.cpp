@@ -13,6 +13,7 @@
 
 #include "cgi/CgiContext.h"
 #include "session/SessionStore.h"
+#include "vela/audit.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/session.h"
@@ -703,6 +704,15 @@ bool DrawFreeId(StoredSession& s)
     return false;
 }
 
+// One line of the audit trail about a session of `user` (never its id).
+void AuditSession(const char* name, const std::string& user)
+{
+    VELA::Audit::Event event;
+    event.name = name;
+    event.user = user;
+    VELA::Audit::Record(event);
+}
+
 int CreateSession(const char* user, const char* clientIP, const VELA::Session::Options* options, std::string& sid,
                   std::string& token)
 {
@@ -744,6 +754,9 @@ int CreateSession(const char* user, const char* clientIP, const VELA::Session::O
     token = s.token;
     VELA_LOG(LOG_AUTHPRIV | LOG_INFO, "session %s created for \"%s\" from %s", LogId(s.id).c_str(), user,
              s.clientIP.empty() ? "any address" : s.clientIP.c_str());
+    AuditSession(options != nullptr && options->auditEvent != nullptr ? options->auditEvent
+                                                                        : VELA::Audit::kSessionCreate,
+                 s.user);
     return 0;
 }
 
@@ -764,7 +777,7 @@ int VELA::Session::Create(const char* user, const char* clientIP, const VELA::Se
     }
 }
 
-int VELA::Session::Remove(const char* sid)
+int VELA::Session::Remove(const char* sid, const char* auditEvent)
 {
     if (!VELA::Session::IsId(sid, VELA_SESSION_ID_LEN)) {
         return -2;
@@ -780,6 +793,11 @@ int VELA::Session::Remove(const char* sid)
         if (!lock.Held()) {
             return -1;
         }
+        // Whose session it was, for the audit trail (read before it goes).
+        StoredSession s;
+        if (LoadSession(sid, s) != Load::Ok) {
+            s.user.clear();
+        }
         if (unlink(path.c_str()) != 0) {
             if (errno == ENOENT) {
                 return -2;
@@ -788,6 +806,7 @@ int VELA::Session::Remove(const char* sid)
             return -1;
         }
         VELA_LOG(LOG_AUTHPRIV | LOG_INFO, "session %s removed", LogId(sid).c_str());
+        AuditSession(auditEvent != nullptr ? auditEvent : VELA::Audit::kSessionRevoke, s.user);
         return 0;
     } catch (const std::exception&) {
         return -1;

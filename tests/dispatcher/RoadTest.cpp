@@ -1,7 +1,8 @@
 // The road of a call as a whole: every refusal the dispatcher makes is one
 // log line stamped with the file that decided it; when several faults apply
 // the earlier stage's refusal wins (the permission hook before the library:
-// APIRunnerTest.cpp); a call that skips the description check
+// APIRunnerTest.cpp); a method marked "audit" leaves one line in the audit
+// trail at the end of the road, others none; a call that skips the description check
 // (ProcessLib by itself) runs as its request's description says; the hooks
 // read the attributes of the call on the road.
 #include <gtest/gtest.h>
@@ -11,6 +12,7 @@
 
 #include "dispatcher/PipeFixture.h"
 #include "support/TestSupport.h"
+#include "vela/audit.h"
 #include "webapi/APIError.h"
 #include "webapi/APIRequest.h"
 #include "webapi/APIResponse.h"
@@ -184,6 +186,51 @@ TEST_F(Road, HooksReadTheCallsAttributes)
     Asking own;
     EXPECT_TRUE(own.Run(Call("VELA.Pipe.Test", 1, "upload")));
     EXPECT_EQ(J(R"({"upload": true, "download": false, "own": {"allowUpload": true}, "other": true})"), own.seen);
+}
+
+// A method described with "audit": true leaves one line in the audit trail
+// once the road is over, with the answer's code and the call's facts; a
+// method without it leaves no file behind.
+TEST_F(Road, AuditedMethodsLeaveOneLineEach)
+{
+    Json::Value d = Descriptions();
+    d["VELA.Pipe.Test"]["methods"]["1"][1] = J(R"({"echo": {"audit": true}})");
+    d["VELA.Pipe.Nice"]["methods"]["1"][0] = J(R"({"fail": {"audit": true}})");
+    WriteJson("VELA.Pipe.lib", d);
+    struct Open : APIRunner {
+        bool NeedPermission(APIRequest*) override { return false; }
+    };
+    const std::string log = root_.Path() + "/var/log/vela/audit.log";
+
+    const Json::Value print = Call("VELA.Pipe.Test", 1, "print");
+    EXPECT_TRUE(Open().Run(print));
+    struct stat st;
+    EXPECT_NE(0, stat(log.c_str(), &st)) << "an unaudited call touched the audit trail";
+
+    {
+        VELA::Test::ScopedEnv client("REMOTE_ADDR", "192.0.2.5");
+        EXPECT_TRUE(Open().Run(Call("VELA.Pipe.Test", 1, "echo")));
+    }
+    {
+        VELA::Test::ScopedEnv client("REMOTE_ADDR", "192.0.2.6");
+        EXPECT_TRUE(Open().Run(Call("VELA.Pipe.Nice", 1, "fail")));
+    }
+
+    const std::string text = VELA::Test::ReadText(log);
+    const size_t nl = text.find('\n');
+    ASSERT_NE(std::string::npos, nl) << text;
+    ASSERT_EQ(text.size() - 1, text.find('\n', nl + 1)) << "two lines expected: " << text;
+    const Json::Value first = J(text.substr(0, nl));
+    const Json::Value second = J(text.substr(nl + 1));
+    EXPECT_EQ("call", first["event"].asString());
+    EXPECT_EQ("VELA.Pipe.Test", first["api"].asString());
+    EXPECT_EQ("echo", first["method"].asString());
+    EXPECT_EQ("192.0.2.5", first["address"].asString());
+    EXPECT_EQ(0, first["result"].asInt());
+    EXPECT_EQ("VELA.Pipe.Nice", second["api"].asString());
+    EXPECT_EQ("fail", second["method"].asString());
+    EXPECT_EQ("192.0.2.6", second["address"].asString());
+    EXPECT_EQ(555, second["result"].asInt());
 }
 
 }  // namespace

@@ -10,7 +10,9 @@
 # run-as name) taken for root, forwarding headers of a client that is no
 # configured proxy, a password in the URL, and the login guard played
 # (blocking an address of the attacker's choice, spraying from forged
-# addresses). (The login API's own rules, the block, the replacement of a
+# addresses). The audit trail holds the logins, failures, blocks and
+# logouts, the sessions and tokens velaadm made, the calls of the audited
+# method adminonly, and no secret. (The login API's own rules, the block, the replacement of a
 # session and the session settings among them: webapi/AuthTest.cpp; idle
 # and expired sessions: access/PermissionCheckTest.cpp.)
 set -u
@@ -226,5 +228,40 @@ call --interface 127.0.0.12 --data "account=$USER1" "$AUTH&method=login&passwd=$
 expect_error "password in the query string of a POST" 403
 logged 'login refused: a password in the query string'
 grep -qF -- "$PASS1" "$RUN/cgi.log" && fail "a password is in cgi.log"
+
+# ---- The audit trail: one JSON line per event in var/log/vela/audit.log
+# (its format and bounds: platform/audit/AuditTest.cpp), each also in the
+# log as "audit: ", and nothing secret in it.
+AUDIT=$ROOT/var/log/vela/audit.log
+# audited NAME TEXT...: some line of audit.log holds every TEXT.
+audited() {
+  local name=$1 lines
+  shift
+  lines=$(cat "$AUDIT" 2>/dev/null)
+  for text in "$@"; do
+    lines=$(printf '%s\n' "$lines" | grep -F -- "$text")
+  done
+  [ -n "$lines" ] || fail "$name: no line of audit.log holds: $*"
+}
+audited "audit: login" '"event":"login"' "\"user\":\"$USER1\"" '"address":"127.0.0.1"' '"api":"VELA.Auth"' \
+  '"method":"login"' '"result":0' '"time":"20'
+audited "audit: wrong password" '"event":"login-failed"' "\"user\":\"$USER1\"" '"address":"127.0.0.4"' '"result":400'
+audited "audit: unknown account" '"event":"login-failed"' "\"user\":\"nosuch$tag\"" '"result":400'
+audited "audit: blocked" '"event":"login-blocked"' "\"user\":\"spray4$tag\"" '"address":"127.0.0.6"' '"result":407'
+audited "audit: logout" '"event":"logout"' "\"user\":\"$USER1\"" '"method":"logout"' '"result":0'
+grep -F "\"user\":\"$USER1\"" "$AUDIT" | grep -qF '"event":"session-revoke"' &&
+  fail "audit: the logout is also recorded as a revocation"
+audited "audit: velaadm session" '"event":"session-create"' '"user":"system"' '"actor":"root"'
+audited "audit: velaadm token" '"event":"token-create"' '"user":"system"' "\"tokenId\":\"${tok%%.*}\""
+audited "audit: adminonly as an administrator" '"event":"call"' "\"user\":\"$ADMIN\"" '"api":"VELA.Sample"' \
+  '"method":"adminonly"' '"result":0'
+audited "audit: adminonly refused" '"event":"call"' '"method":"adminonly"' '"result":105'
+grep -qF '"method":"whoami"' "$AUDIT" && fail "audit: whoami is not audited, yet it is in audit.log"
+for secret in "$PASS1" "$PASSA" "$SID1" "$TOKEN1" "${tok#*.}"; do
+  grep -qF -- "$secret" "$AUDIT" && fail "audit: a secret is in audit.log"
+done
+grep -qF "audit: {" "$RUN/cgi.log" || fail "audit: the events are not in the log"
+[ "$(stat -c '%a %u' "$AUDIT")" = "640 0" ] || fail "audit: audit.log is $(stat -c '%a %u' "$AUDIT")"
+[ "$(stat -c '%a %u' "$ROOT/var/log/vela")" = "750 0" ] || fail "audit: its directory is $(stat -c '%a %u' "$ROOT/var/log/vela")"
 
 srv_finish "all login checks passed ($URL)"

@@ -26,6 +26,7 @@
 #include <string>
 
 #include "Pam.h"
+#include "vela/audit.h"
 #include "vela/cgi.h"
 #include "vela/log.h"
 #include "vela/loginguard.h"
@@ -200,6 +201,18 @@ VelaAuth::PamResult CheckPassword(const Credentials& creds, const std::string& c
     return checked;
 }
 
+// A refused login in the audit trail: the account as given (never the
+// password), the client address and the error answered.
+void AuditRefusal(const char* name, const std::string& account, const std::string& clientIP, int code)
+{
+    VELA::Audit::Event event;
+    event.name = name;
+    event.user = account;
+    event.address = clientIP;
+    event.result = code;
+    VELA::Audit::Record(event);
+}
+
 // The password check behind the brute-force guard. True when the login may
 // go on as `user`; otherwise the error is set.
 bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VELA::Session::LoginSettings& settings,
@@ -211,6 +224,7 @@ bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VELA::S
         Json::Value details(Json::objectValue);
         details["waitSeconds"] = wait;
         resp->SetError(kErrBlocked, details);
+        AuditRefusal(VELA::Audit::kLoginBlocked, creds.account, clientIP, kErrBlocked);
         return false;
     }
     if (verdict != VELA_LOGIN_GUARD_ALLOW) {
@@ -222,6 +236,7 @@ bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VELA::S
     if (checked == VelaAuth::PamResult::Denied) {
         VELA::Session::LoginGuardFailed(&settings, creds.account.c_str(), clientIP.c_str(), reason.c_str());
         resp->SetError(kErrWrongPassword);
+        AuditRefusal(VELA::Audit::kLoginFailed, creds.account, clientIP, kErrWrongPassword);
         return false;
     }
     if (checked == VelaAuth::PamResult::Error) {
@@ -232,6 +247,7 @@ bool GuardedCheck(const Credentials& creds, const std::string& clientIP, VELA::S
     if (checked == VelaAuth::PamResult::Expired) {
         VELA_LOG(LOG_AUTHPRIV | LOG_NOTICE, "login of \"%s\" refused: the password has expired", user.c_str());
         resp->SetError(kErrPasswordExpired);
+        AuditRefusal(VELA::Audit::kLoginFailed, user, clientIP, kErrPasswordExpired);
         return false;
     }
     return true;
@@ -250,6 +266,7 @@ void OpenSession(APIRequest* req, APIResponse* resp, const std::string& user, co
     options.idleTimeout = settings.idleTimeout;
     options.lifetime = settings.lifetime;
     options.tokenProtect = true;
+    options.auditEvent = VELA::Audit::kLogin;  // the session's creation is the login
     char lang[4] = "";
     if (VelaCgiGetLang(nullptr, lang, sizeof(lang)) == 0) {
         options.lang = lang;
@@ -295,7 +312,7 @@ void Login(APIRequest* req, APIResponse* resp)
 void Logout(APIRequest* req, APIResponse* resp)
 {
     const std::string sid = req->GetSessionID();
-    if (IsSessionId(sid) && VELA::Session::Remove(sid.c_str()) == -1) {
+    if (IsSessionId(sid) && VELA::Session::Remove(sid.c_str(), VELA::Audit::kLogout) == -1) {
         VELA_LOG_ERR("logout: the session could not be removed");
         resp->SetError(kErrServer);
         return;
