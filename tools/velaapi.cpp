@@ -41,12 +41,6 @@ constexpr size_t kMaxParams = 16 * 1024 * 1024;
 
 const char kWebAPIDir[] = "/usr/vela/velaman/webapi";
 
-const char kUsage[] =
-    "usage: velaapi call API METHOD [key=value ... | JSON | -] [--version N] [--user NAME]\n"
-    "                    [--peer NAME]\n"
-    "       velaapi list [--user NAME]\n"
-    "       velaapi --help\n";
-
 const char kManual[] =
     "NAME\n"
     "    velaapi - call a web-API method as a user, or list what a user may call\n"
@@ -166,9 +160,10 @@ void KeepPlainEnvironment()
     }
 }
 
+// A usage error: one line saying what is wrong, and where help is.
 int Usage(const std::string& problem)
 {
-    fprintf(stderr, "velaapi: %s\n%s", problem.c_str(), kUsage);
+    fprintf(stderr, "velaapi: %s\nTry 'velaapi --help' for more information.\n", problem.c_str());
     return kExitUsage;
 }
 
