@@ -100,7 +100,7 @@ int main(int argc, char** argv)
         const std::string arg = argv[i];
         if (arg == "-C" || arg == "--dir") {
             if (++i >= argc) {
-                return Usage("-C needs a directory");
+                return Usage((arg + " needs a directory").c_str());
             }
             dir = argv[i];
         } else if (arg == "-h" || arg == "--help") {
