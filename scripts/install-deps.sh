@@ -15,6 +15,7 @@ packages=(
   libbenchmark-dev
   clang libclang-rt-dev
   wrk curl python3
+  groff-base
   lighttpd media-types
   chromium
 )

@@ -35,6 +35,7 @@ namespace {
 
 const char kUsage[] =
     "usage: velaadm <command> [arguments]\n"
+    "       velaadm --help\n"
     "\n"
     "  session create <user> [--ip ADDRESS] [--timeout SECONDS] [--lifetime SECONDS]\n"
     "                 [--token] [--skip-ip] [--lang CODE]\n"
@@ -93,7 +94,11 @@ const char kUsage[] =
     "  pubkey\n"
     "        Prints the server's public key for encrypted parameters (PEM).\n"
     "\n"
-    "The state lives under VELA_ROOT when it is set.\n";
+    "  -h, --help\n"
+    "        Prints this text (--help also after a command).\n"
+    "\n"
+    "The state lives under VELA_ROOT when it is set. Exit status: 0 success,\n"
+    "1 the operation failed, 2 a usage error.\n";
 
 constexpr int kExitFailure = 1;
 constexpr int kExitUsage = 2;
@@ -116,9 +121,10 @@ void LogSink(int priority, const char* line, void*)
     fprintf(stderr, "velaadm: %s\n", text);
 }
 
+// A usage error: one line saying what is wrong, and where help is.
 int Usage(const char* problem)
 {
-    fprintf(stderr, "velaadm: %s\n\n%s", problem, kUsage);
+    fprintf(stderr, "velaadm: %s\nTry 'velaadm --help' for more information.\n", problem);
     return kExitUsage;
 }
 
@@ -1061,7 +1067,13 @@ int Run(int argc, char** argv)
         return Usage("no command given");
     }
     const std::string command = argv[1];
-    if (command == "--help" || command == "-h" || command == "help") {
+    // --help anywhere asks for the text, even where an option's value is
+    // due: none of the values velaadm takes is sensibly "--help".
+    bool help = command == "-h" || command == "help";
+    for (int i = 1; i < argc && !help; ++i) {
+        help = strcmp(argv[i], "--help") == 0;
+    }
+    if (help) {
         fputs(kUsage, stdout);
         return 0;
     }
@@ -1103,6 +1115,9 @@ int Run(int argc, char** argv)
             }
         }
         return Usage(("unknown action \"" + action + "\" for " + command).c_str());
+    }
+    if (command.size() > 1 && command[0] == '-') {
+        return Usage(("unknown option " + command).c_str());
     }
     return Usage(("unknown command \"" + command + "\"").c_str());
 }

@@ -45,12 +45,6 @@ const char kListAPI[] = "VELA.Admin";
 constexpr int kListVersion = 1;
 const char kListMethod[] = "apis";
 
-const char kUsage[] =
-    "usage: velaapi call API METHOD [key=value ... | JSON | -] [--version N] [--user NAME]\n"
-    "                    [--peer NAME]\n"
-    "       velaapi list [--user NAME]\n"
-    "       velaapi --help\n";
-
 const char kManual[] =
     "NAME\n"
     "    velaapi - call a web-API method as a user, or list what a user may call\n"
@@ -171,9 +165,10 @@ void KeepPlainEnvironment()
     }
 }
 
+// A usage error: one line saying what is wrong, and where help is.
 int Usage(const std::string& problem)
 {
-    fprintf(stderr, "velaapi: %s\n%s", problem.c_str(), kUsage);
+    fprintf(stderr, "velaapi: %s\nTry 'velaapi --help' for more information.\n", problem.c_str());
     return kExitUsage;
 }
 

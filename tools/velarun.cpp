@@ -2,6 +2,7 @@
 // would, and prints the answer on one line.
 //
 //   velarun [-C DIR] [FILE | -]
+//   velarun --help
 //
 // The request JSON (members "getParam", "postParam", "environ", "session",
 // "attr") is read from FILE, or from standard input when FILE is "-" or
@@ -29,13 +30,21 @@ constexpr int kExitUsage = 2;
 
 const char kUsage[] =
     "usage: velarun [-C DIR] [FILE | -]\n"
+    "       velarun --help\n"
     "  Runs the request JSON in FILE (standard input for \"-\" or no FILE)\n"
-    "  in the web-API directory (DIR, default <VELA_ROOT>/usr/vela/velaman/webapi)\n"
-    "  and prints the answer as one line of JSON.\n";
+    "  in the web-API directory and prints the answer as one line of JSON.\n"
+    "\n"
+    "  -C DIR, --dir DIR  the web-API directory (default\n"
+    "                     <VELA_ROOT>/usr/vela/velaman/webapi)\n"
+    "  -h, --help         prints this text\n"
+    "\n"
+    "  Exit status: 0 the answer is a success, 1 it is an error, 2 a usage\n"
+    "  error or unreadable input.\n";
 
+// A usage error: one line saying what is wrong, and where help is.
 int Usage(const char* problem)
 {
-    fprintf(stderr, "velarun: %s\n%s", problem, kUsage);
+    fprintf(stderr, "velarun: %s\nTry 'velarun --help' for more information.\n", problem);
     return kExitUsage;
 }
 
@@ -91,7 +100,7 @@ int main(int argc, char** argv)
         const std::string arg = argv[i];
         if (arg == "-C" || arg == "--dir") {
             if (++i >= argc) {
-                return Usage("-C needs a directory");
+                return Usage((arg + " needs a directory").c_str());
             }
             dir = argv[i];
         } else if (arg == "-h" || arg == "--help") {

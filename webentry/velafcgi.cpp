@@ -6,6 +6,7 @@
 //   velafcgi [--socket PATH [--socket-mode MODE] [--socket-group GROUP]]
 //            [--tcp 127.0.0.1:PORT] [--parents N] [--max-children N]
 //            [--param-seconds N] [--stderr FILE] [--keep-env NAME]...
+//   velafcgi --help
 //
 // The numbers default to fcgi_parents, fcgi_max_children and
 // fcgi_param_seconds of /etc/vela/webapi.conf, else one parent per core, 64
@@ -43,12 +44,38 @@ volatile sig_atomic_t g_stop = 0;
 void OnStop(int) { g_stop = 1; }
 void OnChild(int) {}
 
-void Usage()
+const char kUsage[] =
+    "usage: velafcgi [--socket PATH [--socket-mode MODE] [--socket-group GROUP]] [--tcp ADDRESS:PORT]\n"
+    "                [--parents N] [--max-children N] [--param-seconds N] [--stderr FILE]\n"
+    "                [--keep-env NAME]...\n"
+    "       velafcgi --help\n"
+    "  Serves the web API over FastCGI. Without --socket or --tcp the listening\n"
+    "  socket is standard input, as a web server that starts FastCGI programs\n"
+    "  hands it over.\n"
+    "\n"
+    "  --socket PATH         listen on the Unix socket PATH (absolute)\n"
+    "  --socket-mode MODE    its mode, octal, nothing for others (default 0660)\n"
+    "  --socket-group GROUP  its group (the web server's)\n"
+    "  --tcp ADDRESS:PORT    listen on TCP, 127.0.0.1:PORT or [::1]:PORT only\n"
+    "  --parents N           warm parents, 1 to 64 (default fcgi_parents of\n"
+    "                        /etc/vela/webapi.conf, else one per core, 16 at most)\n"
+    "  --max-children N      requests served at once in all, 1 to 4096\n"
+    "                        (default fcgi_max_children, else 64)\n"
+    "  --param-seconds N     seconds a request's parameters may take to arrive,\n"
+    "                        1 to 3600 (default fcgi_param_seconds, else 10)\n"
+    "  --stderr FILE         append standard error to FILE\n"
+    "  --keep-env NAME       pass the variable NAME on to the requests (PATH,\n"
+    "                        VELA_ROOT, VELA_LOG_STDERR, TZ, LANG, LC_ALL always)\n"
+    "  -h, --help            print this text\n"
+    "\n"
+    "  SIGTERM or SIGINT stops it once the requests under way have finished.\n"
+    "  Exit status: 0 stopped, 1 it could not start, 2 a usage error.\n";
+
+// A usage error: one line saying what is wrong, and where help is.
+int Usage(const std::string& problem)
 {
-    fprintf(stderr,
-            "usage: velafcgi [--socket PATH [--socket-mode MODE] [--socket-group GROUP]] [--tcp 127.0.0.1:PORT]\n"
-            "                [--parents N] [--max-children N] [--param-seconds N] [--stderr FILE]\n"
-            "                [--keep-env NAME]...\n");
+    fprintf(stderr, "velafcgi: %s\nTry 'velafcgi --help' for more information.\n", problem.c_str());
+    return 2;
 }
 
 bool Number(const char* text, int low, int high, int& out)
@@ -180,9 +207,22 @@ int main(int argc, char** argv)
     std::vector<std::string> keep = {"PATH", "VELA_ROOT", "VELA_LOG_STDERR", "TZ", "LANG", "LC_ALL"};
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
+        if (arg == "--help" || arg == "-h") {
+            fputs(kUsage, stdout);
+            return 0;
+        }
+        static const char* const kWithValue[] = {"--socket",        "--socket-group",  "--socket-mode",
+                                                 "--tcp",           "--parents",       "--max-children",
+                                                 "--param-seconds", "--stderr",        "--keep-env"};
+        bool known = false;
+        for (const char* name : kWithValue) {
+            known = known || arg == name;
+        }
+        if (!known) {
+            return Usage((arg.compare(0, 1, "-") == 0 ? "unknown option " : "unexpected argument ") + arg);
+        }
         if (i + 1 >= argc) {
-            Usage();
-            return 2;
+            return Usage(arg + " needs a value");
         }
         const char* value = argv[++i];
         bool ok = true;
@@ -207,13 +247,9 @@ int main(int argc, char** argv)
             errFile = value;
         } else if (arg == "--keep-env") {
             keep.push_back(value);
-        } else {
-            ok = false;
         }
         if (!ok) {
-            fprintf(stderr, "velafcgi: bad option %s %s\n", arg.c_str(), value);
-            Usage();
-            return 2;
+            return Usage("bad value for " + arg + ": " + value);
         }
     }
     if (!errFile.empty()) {
@@ -228,8 +264,7 @@ int main(int argc, char** argv)
 
     int listenFd = -1;
     if (!socketPath.empty() && !tcp.empty()) {
-        fprintf(stderr, "velafcgi: --socket and --tcp exclude each other\n");
-        return 2;
+        return Usage("--socket and --tcp exclude each other");
     }
     if (!socketPath.empty()) {
         listenFd = ListenUnix(socketPath, static_cast<mode_t>(socketMode), socketGroup);
@@ -238,9 +273,7 @@ int main(int argc, char** argv)
     } else if (IsListening(STDIN_FILENO)) {
         listenFd = STDIN_FILENO;
     } else {
-        fprintf(stderr, "velafcgi: no listening socket: give --socket or --tcp, or start it from a web server\n");
-        Usage();
-        return 2;
+        return Usage("no listening socket: give --socket or --tcp, or start it from a web server");
     }
     if (listenFd < 0) {
         return 1;

@@ -28,7 +28,8 @@ refused() {
 }
 
 # ---- usage errors
-refused 2 "usage: velaadm"
+refused 2 "no command given"
+stderr_has "velaadm --help"
 refused 2 "unknown command" frobnicate
 for args in session "session frobnicate" "session create" "session list extra"; do
     eval "expect 2 $args"
