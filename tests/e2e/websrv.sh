@@ -1,0 +1,89 @@
+#!/usr/bin/env bash
+# The scenarios every web server is held to (scenarios.sh) through Apache or
+# nginx, each a private server configured by scripts/websrv-conf.sh on a free
+# port of 127.0.0.1, with the front end VELA_FRONT_END names:
+#   apache fcgi   mod_proxy_fcgi to velafcgi on a socket of its own
+#   apache cgi    mod_cgid running velascgi (see below)
+#   nginx fcgi    fastcgi_pass to velafcgi on a socket of its own
+#   nginx cgi     fastcgi_pass to fcgiwrap, which runs velascgi
+# Fast file output: X-Sendfile through mod_xsendfile (Apache), X-Accel-Redirect
+# to an internal location (nginx).
+#
+#   websrv.sh apache|nginx VELASCGI VELAADM WEBAPI SRC
+set -u
+
+. "$(dirname "$0")/server.sh"
+. "$(dirname "$0")/scenarios.sh"
+server=${1:-}
+shift
+front=${VELA_FRONT_END:-fcgi}
+need=()
+case "$server" in
+  apache) SRV_SERVER=apache2 FAST_HEADER=X-Sendfile ;;
+  nginx)
+    SRV_SERVER=nginx FAST_HEADER=X-Accel-Redirect
+    [ "$front" = fcgi ] || need=(fcgiwrap)
+    ;;
+  *) echo "usage: ${0##*/} apache|nginx VELASCGI VELAADM WEBAPI SRC" >&2; exit 2 ;;
+esac
+srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
+srv_require "the front end runs as root beside the server" cmp cksum stat useradd chpasswd "${need[@]}"
+if [ "$server/$front" = apache/cgi ]; then
+  # mod_cgid runs programs as Apache's User, which may not be root: velascgi
+  # could take no identity an API asks for, and every scenario would fail.
+  echo "SKIP: Apache runs CGI programs as its User, never as root; velascgi needs root (use velafcgi)"
+  exit 77
+fi
+[ "$server" = apache ] && [ ! -f /usr/lib/apache2/modules/mod_xsendfile.so ] &&
+  { echo "SKIP: mod_xsendfile is not installed"; exit 77; }
+
+srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1
+mkdir -p "$ROOT/vol1"
+echo /vol1 >"$ROOT/etc/vela/volumes.conf"
+user=www-data
+id -u "$user" >/dev/null 2>&1 || user=nobody
+group=$(id -gn "$user")
+# The sockets: reached by root and the server's account only.
+sockets=$RUN/sock
+mkdir -m 0750 "$sockets" && chgrp "$group" "$sockets" || exit 1
+socket=$sockets/$front.sock
+
+# srv_front_env as arguments of env.
+mapfile -t front_env < <(srv_front_env)
+if [ "$front" = fcgi ]; then
+  srv_daemon velafcgi env -i "${front_env[@]}" "$(dirname "$VELASCGI")/velafcgi" --socket "$socket" \
+    --socket-group "$group" --stderr "$RUN/cgi.log"
+else
+  # fcgiwrap makes its socket with its umask: the directory above guards it.
+  # velascgi's standard error (its log lines) goes to cgi.log.
+  srv_daemon cgi env -i PATH=/usr/sbin:/usr/bin:/sbin:/bin sh -c 'umask 0; exec fcgiwrap -s "unix:$1"' sh "$socket"
+fi
+srv_wait 100 0.1 test -S "$socket" || { fail "no socket $socket"; srv_finish ""; }
+
+conf_args=(--server "$server" --out "$RUN/$server.conf" --run "$RUN" --pidfile "$RUN/$server.pid"
+           --docroot "$RUN/www" --velascgi "$VELASCGI" --socket "$socket" --user "$user" --group "$group"
+           --fast-dir "$ROOT/vol1" --front-end "$front")
+for line in "${front_env[@]}"; do
+  conf_args+=(--env "$line")
+done
+write_conf() { "$SRC/scripts/websrv-conf.sh" "${conf_args[@]}" --port "$1"; }
+run_apache() { exec apache2 -f "$RUN/apache.conf" -DFOREGROUND; }
+run_nginx() { exec nginx -c "$RUN/nginx.conf" -p "$RUN" -e "$RUN/error.log" -g "daemon off;"; }
+srv_launch write_conf "run_$server" || { failures=1; exit 1; }
+
+# ---- The scenarios, fast output on.
+if [ "$server" = nginx ]; then
+  printf 'xsendfile="yes"\nxaccel_prefix="/vela-files"\n' >"$ROOT/etc/vela/webapi.conf"
+else
+  echo 'xsendfile="yes"' >"$ROOT/etc/vela/webapi.conf"
+fi
+srv_pam
+web_scenarios
+
+# ---- The internal location answers nobody from outside.
+if [ "$server" = nginx ]; then
+  call "$BASE/vela-files$ROOT/vol1/"
+  expect_status "the internal location from outside" 404
+fi
+
+srv_finish "all $server checks passed ($front, $URL)"
