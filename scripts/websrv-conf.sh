@@ -77,11 +77,10 @@ case "$front" in
 esac
 [ "$server/$front" = apache/cgi ] || [ -n "$socket" ] || die "--socket is required for $server with $front"
 # Every path goes into a quoted string of the configuration as it is:
-# refuse what would end or escape it, and blanks (Apache's and nginx's
-# unquoted arguments, SetEnv values).
+# refuse what would end or escape it, or name a variable there.
 plain() {
   case "$1" in
-    *[\"\\\'\;\$\{\}]* | *[[:space:]]* | *[[:cntrl:]]*) die "\"$1\" holds a quote, a blank, ; \$ { } or a control character" ;;
+    *[\"\\\'\;\$\{\}]* | *[[:cntrl:]]*) die "\"$1\" holds a quote, \\, ;, \$, {, } or a control character" ;;
   esac
 }
 for p in "$run" "$pidfile" "$docroot" "$velascgi" "$errors" "$modules" ${socket:+"$socket"}; do
@@ -89,6 +88,7 @@ for p in "$run" "$pidfile" "$docroot" "$velascgi" "$errors" "$modules" ${socket:
   plain "$p"
 done
 plain "$bind"
+case "$bind$socket" in *' '*) die "the address and the socket may not hold blanks" ;; esac
 [ -x "$velascgi" ] || die "$velascgi is not an executable"
 
 cgi_env=""

@@ -39,7 +39,9 @@
 // the header is "X-Accel-Redirect: /PREFIX<absolute path, percent-encoded>"
 // instead; a prefix that is not "/" and plain segments (letters, digits,
 // "-", "_", "~", dots inside a segment; at most 128 bytes) turns fast output
-// off (logged). So the path must be one that
+// off (logged). With xsendfile_encoded="no" (a server that takes the path
+// as it is, such as mod_xsendfile before 1.0), only a path that needs no
+// percent-encoding goes to the server; any other file is streamed. So the path must be one that
 // nobody less privileged than the web server can change in between. The
 // path is the one the kernel keeps for the open descriptor
 // (/proc/self/fd/N), and it is handed over only when

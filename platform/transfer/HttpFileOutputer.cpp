@@ -36,6 +36,7 @@ using VELA::System::ScopedFd;
 const char kConfPath[] = "/etc/vela/webapi.conf";
 const char kFastOutputKey[] = "xsendfile";
 const char kAccelPrefixKey[] = "xaccel_prefix";
+const char kEncodedKey[] = "xsendfile_encoded";
 // Longest internal prefix taken from the configuration.
 constexpr size_t kMaxAccelPrefix = 128;
 const char kDefaultType[] = "application/octet-stream";
@@ -51,13 +52,19 @@ constexpr size_t kMaxDispositionName = 255;
 
 // ---- Fast output switch ----
 
+// How the web server takes the fast output header.
+struct FastOutputMode {
+    std::string accelPrefix;  // X-Accel-Redirect's internal prefix; empty: X-Sendfile
+    bool plainOnly = false;   // it does not decode the path: only paths that need no encoding
+};
+
 struct FastOutputState {
     std::mutex lock;
     bool switchedOff = false;
     bool loaded = false;
     std::string confPath;  // the file the cached answer came from
     bool configured = false;
-    std::string accelPrefix;  // X-Accel-Redirect's internal prefix; empty: X-Sendfile
+    FastOutputMode mode;
 };
 
 FastOutputState& FastOutput()
@@ -796,8 +803,9 @@ bool ServerMayOpen(int fd, const struct stat& st, std::string& canonical, const 
 }
 
 // Fast output: the web server sends the file at `canonical` (X-Sendfile,
-// or X-Accel-Redirect to the internal prefix `accelPrefix` when set).
-bool SendByServer(const std::string& canonical, const std::string& name, const std::string& mimeType,
+// or X-Accel-Redirect to the internal prefix `accelPrefix` when set), its
+// path percent-encoded as `encoded`.
+bool SendByServer(const std::string& encoded, const std::string& name, const std::string& mimeType,
                   bool writeDisposition, const std::string& accelPrefix)
 {
     std::string block;
@@ -808,9 +816,9 @@ bool SendByServer(const std::string& canonical, const std::string& name, const s
     }
     AddLine(block, "X-Content-Type-Options", "nosniff");
     if (accelPrefix.empty()) {
-        AddLine(block, "X-Sendfile", EncodeSendfilePath(canonical));
+        AddLine(block, "X-Sendfile", encoded);
     } else {
-        AddLine(block, "X-Accel-Redirect", accelPrefix + EncodeSendfilePath(canonical));
+        AddLine(block, "X-Accel-Redirect", accelPrefix + encoded);
     }
     block += "\r\n";
     FlushStreams();
@@ -842,10 +850,10 @@ bool CheckReadableRegular(int fd, struct stat& st, const char* what)
     return true;
 }
 
-// Whether fast output is on (configured and not switched off), with the
-// internal prefix of X-Accel-Redirect in `accelPrefix` (empty: X-Sendfile).
-// The configuration is read again when the system root changed.
-bool FastOutputOn(std::string& accelPrefix)
+// Whether fast output is on (configured and not switched off), with how
+// the web server takes it in `mode`. The configuration is read again when
+// the system root changed.
+bool FastOutputOn(FastOutputMode& mode)
 {
     try {
         FastOutputState& state = FastOutput();
@@ -856,14 +864,17 @@ bool FastOutputOn(std::string& accelPrefix)
         const std::string path = VELA::System::Path(kConfPath);
         if (!state.loaded || path != state.confPath) {
             state.configured = ReadFastOutputConfig();
-            if (state.configured && !ReadAccelPrefix(state.accelPrefix)) {
+            if (state.configured && !ReadAccelPrefix(state.mode.accelPrefix)) {
                 state.configured = false;
             }
+            // xsendfile_encoded="no": the server takes the header's path as
+            // it is (mod_xsendfile before 1.0).
+            state.mode.plainOnly = VLIBCFileCheckKeyValue(kConfPath, kEncodedKey, "no", VLIBC_KV_NOCASE) == 1;
             state.confPath = path;
             state.loaded = true;
         }
         if (state.configured) {
-            accelPrefix = state.accelPrefix;
+            mode = state.mode;
         }
         return state.configured;
     } catch (const std::exception&) {
@@ -962,12 +973,16 @@ bool HTTPFileOutputer::SendDescriptor(int fd, const std::string& name, const std
         if (!CheckReadableRegular(fd, st, "the file of a download")) {
             return false;
         }
-        std::string accelPrefix;
-        if (serverMayOpen && FastOutputOn(accelPrefix)) {
+        FastOutputMode mode;
+        if (serverMayOpen && FastOutputOn(mode)) {
             std::string canonical;
             const char* why = "";
             if (ServerMayOpen(fd, st, canonical, why)) {
-                return SendByServer(canonical, name, mimeType, writeDisposition_, accelPrefix);
+                const std::string encoded = EncodeSendfilePath(canonical);
+                if (!mode.plainOnly || encoded == canonical) {
+                    return SendByServer(encoded, name, mimeType, writeDisposition_, mode.accelPrefix);
+                }
+                why = "the web server takes no percent-encoded path";
             }
             VELA_LOG(LOG_INFO, "X-Sendfile not used for %s: %s; the file is sent directly",
                      canonical.empty() ? name.c_str() : canonical.c_str(), why);
@@ -991,8 +1006,8 @@ void FileOutputerHelper::SetFastOutputEnabled(bool enabled)
 
 bool FileOutputerHelper::IsFastOutputEnabled()
 {
-    std::string accelPrefix;
-    return FastOutputOn(accelPrefix);
+    FastOutputMode mode;
+    return FastOutputOn(mode);
 }
 
 }  // namespace HTTP

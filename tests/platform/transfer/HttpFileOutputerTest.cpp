@@ -358,8 +358,9 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
 // nginx's form of fast output: X-Accel-Redirect to the configured internal
 // prefix, the path encoded as for X-Sendfile ("?" and "#" included, which
 // nginx would take for a query or a fragment). A prefix nginx could read
-// otherwise turns fast output off: the file is streamed.
-TEST_F(HttpOutput, AccelRedirectToTheConfiguredPrefix)
+// otherwise turns fast output off: the file is streamed. For a server that
+// decodes no path, only paths that need no encoding are handed over.
+TEST_F(HttpOutput, AccelRedirectAndHowTheServerTakesThePath)
 {
     ScopedEnv base("TMPDIR", SafeBase());
     const VELA::Test::TempDir safe;
@@ -374,8 +375,8 @@ TEST_F(HttpOutput, AccelRedirectToTheConfiguredPrefix)
     // The configuration is read once per system root: another root and
     // back makes it read again.
     const VELA::Test::TempDir other;
-    const auto configure = [&](const std::string& prefix) {
-        Conf("webapi.conf", "xsendfile=\"yes\"\nxaccel_prefix=\"" + prefix + "\"\n");
+    const auto configure = [&](const std::string& prefix, const std::string& more = "") {
+        Conf("webapi.conf", "xsendfile=\"yes\"\nxaccel_prefix=\"" + prefix + "\"\n" + more);
         {
             ScopedEnv root("VELA_ROOT", other.Path().c_str());
             VELA::System::RootReset();
@@ -407,6 +408,24 @@ TEST_F(HttpOutput, AccelRedirectToTheConfiguredPrefix)
         EXPECT_EQ("content", r.body) << prefix;
         EXPECT_TRUE(log.Contains("xaccel_prefix")) << prefix;
     }
+
+    configure("", "xsendfile_encoded=\"No\"\n");
+    {
+        VELA::Test::LogCapture log;
+        const Reply r = Send(path, "text/plain");
+        ExpectHeaders(r, {{"X-Sendfile", ""}, {"Content-Length", "7"}}, "encoded path, raw server");
+        EXPECT_EQ("content", r.body);
+        EXPECT_TRUE(log.Contains("takes no percent-encoded path"));
+    }
+    const std::string plain = safe.Path() + "/plain-1.txt";
+    VELA::Test::WriteFile(plain, "content");
+    real = realpath(plain.c_str(), nullptr);
+    ASSERT_NE(nullptr, real);
+    const std::string plainReal = real;
+    free(real);
+    const Reply r = Send(plain, "text/plain");
+    ExpectHeaders(r, {{"X-Sendfile", plainReal}, {"Content-Length", ""}}, "plain path, raw server");
+    EXPECT_EQ("", r.body);
 }
 
 // What is not a regular file is refused before anything is written, and so
