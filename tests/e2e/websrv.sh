@@ -74,6 +74,12 @@ run_apache() { exec apache2 -f "$RUN/apache.conf" -DFOREGROUND; }
 run_nginx() { exec nginx -c "$RUN/nginx.conf" -p "$RUN" -e "$RUN/error.log" -g "daemon off;"; }
 srv_launch write_conf "run_$server" || { failures=1; exit 1; }
 
+# ---- The server's own refusals answer in the web API's JSON shape.
+call "$BASE/no-such-page"
+expect_status "a missing page" 404
+expect "a missing page" '"success":false' '"code":101'
+expect_header "a missing page" 'Content-Type: application/json'
+
 # ---- mod_cgid: velascgi runs as Apache's User. It answers, with the body
 # of the request read, but refuses what needs root: the session store
 # (105), the identity of an API (117).
