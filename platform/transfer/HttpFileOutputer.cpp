@@ -802,9 +802,9 @@ bool ServerMayOpen(int fd, const struct stat& st, std::string& canonical, const 
     }
 }
 
-// Fast output: the web server sends the file at `canonical` (X-Sendfile,
-// or X-Accel-Redirect to the internal prefix `accelPrefix` when set), its
-// path percent-encoded as `encoded`.
+// Fast output: the web server sends the file whose canonical path,
+// percent-encoded, is `encoded` (X-Sendfile, or X-Accel-Redirect to the
+// internal prefix `accelPrefix` when set).
 bool SendByServer(const std::string& encoded, const std::string& name, const std::string& mimeType,
                   bool writeDisposition, const std::string& accelPrefix)
 {
