@@ -34,7 +34,14 @@
 // and Output(int) may write "X-Sendfile: <absolute path, percent-encoded>"
 // with the content type, nosniff and the disposition instead of the
 // content; the web server then opens the path itself, later, as its own
-// user, and sends the file, ranges included. So the path must be one that
+// user, and sends the file, ranges included. With xaccel_prefix="/PREFIX"
+// in the same file (nginx: an internal location mapping /PREFIX to "/"),
+// the header is "X-Accel-Redirect: /PREFIX<absolute path, percent-encoded>"
+// instead; a prefix that is not "/" and plain segments (letters, digits,
+// "-", "_", "~", dots inside a segment; at most 128 bytes) turns fast output
+// off (logged). With xsendfile_encoded="no" (a server that takes the path
+// as it is, such as mod_xsendfile before 1.0), only a path that needs no
+// percent-encoding goes to the server; any other file is streamed. So the path must be one that
 // nobody less privileged than the web server can change in between. The
 // path is the one the kernel keeps for the open descriptor
 // (/proc/self/fd/N), and it is handed over only when
@@ -140,7 +147,7 @@ private:
 namespace VELA {
 namespace HTTP {
 
-// Fast output (X-Sendfile), process-wide.
+// Fast output (X-Sendfile or X-Accel-Redirect), process-wide.
 class VELA_EXPORT FileOutputerHelper {
 public:
     // false switches fast output off for the rest of the process; true

@@ -1,7 +1,8 @@
 // HTTP file output: a file as the CGI answer on standard output, with its
 // content headers, single byte ranges (RFC 9110 section 14), the
 // attachment disposition (RFC 6266, RFC 8187) and the web server's
-// X-Sendfile header as the fast path. Contracts are in vela/httpoutput.h.
+// X-Sendfile (or nginx's X-Accel-Redirect) header as the fast path.
+// Contracts are in vela/httpoutput.h.
 #include <cerrno>
 #include <climits>
 #include <csignal>
@@ -34,6 +35,10 @@ using VELA::System::ScopedFd;
 
 const char kConfPath[] = "/etc/vela/webapi.conf";
 const char kFastOutputKey[] = "xsendfile";
+const char kAccelPrefixKey[] = "xaccel_prefix";
+const char kEncodedKey[] = "xsendfile_encoded";
+// Longest internal prefix taken from the configuration.
+constexpr size_t kMaxAccelPrefix = 128;
 const char kDefaultType[] = "application/octet-stream";
 constexpr int kOut = STDOUT_FILENO;
 // Bytes asked of one sendfile call (the kernel moves at most 0x7ffff000).
@@ -47,12 +52,19 @@ constexpr size_t kMaxDispositionName = 255;
 
 // ---- Fast output switch ----
 
+// How the web server takes the fast output header.
+struct FastOutputMode {
+    std::string accelPrefix;  // X-Accel-Redirect's internal prefix; empty: X-Sendfile
+    bool plainOnly = false;   // it does not decode the path: only paths that need no encoding
+};
+
 struct FastOutputState {
     std::mutex lock;
     bool switchedOff = false;
     bool loaded = false;
     std::string confPath;  // the file the cached answer came from
     bool configured = false;
+    FastOutputMode mode;
 };
 
 FastOutputState& FastOutput()
@@ -72,6 +84,58 @@ bool ReadFastOutputConfig()
     }
     return strcasecmp(value, "yes") == 0 || strcasecmp(value, "true") == 0 || strcasecmp(value, "on") == 0 ||
            strcmp(value, "1") == 0;
+}
+
+// An internal prefix nginx can take as the start of a URI as it is: "/"
+// then segments of letters, digits, "-", "_" and "~" (dots allowed only
+// inside a segment, so no "." or ".." segment), no empty segment, no
+// trailing "/".
+bool IsPlainUriPrefix(const char* prefix)
+{
+    const size_t len = strlen(prefix);
+    if (len < 2 || prefix[0] != '/' || prefix[len - 1] == '/') {
+        return false;
+    }
+    for (size_t i = 1; i < len; ++i) {
+        const char c = prefix[i];
+        const bool segmentStart = prefix[i - 1] == '/';
+        const bool segmentEnd = i + 1 == len || prefix[i + 1] == '/';
+        if (c == '/') {
+            if (segmentStart) {
+                return false;
+            }
+        } else if (c == '.') {
+            if (segmentStart || segmentEnd) {
+                return false;
+            }
+        } else if (!((c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' ||
+                     c == '_' || c == '~')) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// xaccel_prefix of /etc/vela/webapi.conf: when set, fast output answers
+// with "X-Accel-Redirect: <prefix><path>" (nginx, an internal location
+// mapping <prefix> to "/") instead of X-Sendfile. False when the key is
+// set but unusable (logged): fast output is then off altogether, since the
+// web server would not take an X-Sendfile header.
+bool ReadAccelPrefix(std::string& prefix)
+{
+    prefix.clear();
+    char value[kMaxAccelPrefix + 1] = {};
+    const int found = VLIBCFileGetKeyValue(kConfPath, kAccelPrefixKey, value, sizeof(value));
+    if (found == 0 || (found == 1 && value[0] == '\0')) {
+        return true;
+    }
+    if (found != 1 || !IsPlainUriPrefix(value)) {
+        VELA_LOG_ERR("%s of %s is not a plain URI prefix of at most %zu bytes: fast output off", kAccelPrefixKey,
+                     kConfPath, kMaxAccelPrefix);
+        return false;
+    }
+    prefix = value;
+    return true;
 }
 
 // ---- Writing to standard output ----
@@ -366,8 +430,9 @@ std::string DispositionValue(const std::string& name)
     return value;
 }
 
-// The canonical path for X-Sendfile, percent-encoded (the servers that
-// take the header decode it) except for unreserved characters and "/".
+// The canonical path for X-Sendfile or X-Accel-Redirect, percent-encoded
+// (the servers that take the headers decode them; nginx would take a raw
+// "?" for the start of a query) except for unreserved characters and "/".
 std::string EncodeSendfilePath(const std::string& path)
 {
     std::string out;
@@ -737,9 +802,11 @@ bool ServerMayOpen(int fd, const struct stat& st, std::string& canonical, const 
     }
 }
 
-// Fast output: the web server sends the file at `canonical` (X-Sendfile).
-bool SendByServer(const std::string& canonical, const std::string& name, const std::string& mimeType,
-                  bool writeDisposition)
+// Fast output: the web server sends the file whose canonical path,
+// percent-encoded, is `encoded` (X-Sendfile, or X-Accel-Redirect to the
+// internal prefix `accelPrefix` when set).
+bool SendByServer(const std::string& encoded, const std::string& name, const std::string& mimeType,
+                  bool writeDisposition, const std::string& accelPrefix)
 {
     std::string block;
     AddLine(block, "Content-Type", SafeMimeType(mimeType));
@@ -748,7 +815,11 @@ bool SendByServer(const std::string& canonical, const std::string& name, const s
         AddLine(block, "Content-Disposition", disposition);
     }
     AddLine(block, "X-Content-Type-Options", "nosniff");
-    AddLine(block, "X-Sendfile", EncodeSendfilePath(canonical));
+    if (accelPrefix.empty()) {
+        AddLine(block, "X-Sendfile", encoded);
+    } else {
+        AddLine(block, "X-Accel-Redirect", accelPrefix + encoded);
+    }
     block += "\r\n";
     FlushStreams();
     VELA::System::SigpipeBlock noSigpipe;
@@ -777,6 +848,38 @@ bool CheckReadableRegular(int fd, struct stat& st, const char* what)
         return false;
     }
     return true;
+}
+
+// Whether fast output is on (configured and not switched off), with how
+// the web server takes it in `mode`. The configuration is read again when
+// the system root changed.
+bool FastOutputOn(FastOutputMode& mode)
+{
+    try {
+        FastOutputState& state = FastOutput();
+        std::lock_guard<std::mutex> guard(state.lock);
+        if (state.switchedOff) {
+            return false;
+        }
+        const std::string path = VELA::System::Path(kConfPath);
+        if (!state.loaded || path != state.confPath) {
+            state.configured = ReadFastOutputConfig();
+            if (state.configured && !ReadAccelPrefix(state.mode.accelPrefix)) {
+                state.configured = false;
+            }
+            // xsendfile_encoded="no": the server takes the header's path as
+            // it is (mod_xsendfile before 1.0).
+            state.mode.plainOnly = VLIBCFileCheckKeyValue(kConfPath, kEncodedKey, "no", VLIBC_KV_NOCASE) == 1;
+            state.confPath = path;
+            state.loaded = true;
+        }
+        if (state.configured) {
+            mode = state.mode;
+        }
+        return state.configured;
+    } catch (const std::exception&) {
+        return false;
+    }
 }
 
 }  // namespace
@@ -870,11 +973,16 @@ bool HTTPFileOutputer::SendDescriptor(int fd, const std::string& name, const std
         if (!CheckReadableRegular(fd, st, "the file of a download")) {
             return false;
         }
-        if (serverMayOpen && VELA::HTTP::FileOutputerHelper::IsFastOutputEnabled()) {
+        FastOutputMode mode;
+        if (serverMayOpen && FastOutputOn(mode)) {
             std::string canonical;
             const char* why = "";
             if (ServerMayOpen(fd, st, canonical, why)) {
-                return SendByServer(canonical, name, mimeType, writeDisposition_);
+                const std::string encoded = EncodeSendfilePath(canonical);
+                if (!mode.plainOnly || encoded == canonical) {
+                    return SendByServer(encoded, name, mimeType, writeDisposition_, mode.accelPrefix);
+                }
+                why = "the web server takes no percent-encoded path";
             }
             VELA_LOG(LOG_INFO, "X-Sendfile not used for %s: %s; the file is sent directly",
                      canonical.empty() ? name.c_str() : canonical.c_str(), why);
@@ -898,22 +1006,8 @@ void FileOutputerHelper::SetFastOutputEnabled(bool enabled)
 
 bool FileOutputerHelper::IsFastOutputEnabled()
 {
-    try {
-        FastOutputState& state = FastOutput();
-        std::lock_guard<std::mutex> guard(state.lock);
-        if (state.switchedOff) {
-            return false;
-        }
-        const std::string path = System::Path(kConfPath);
-        if (!state.loaded || path != state.confPath) {
-            state.configured = ReadFastOutputConfig();
-            state.confPath = path;
-            state.loaded = true;
-        }
-        return state.configured;
-    } catch (const std::exception&) {
-        return false;
-    }
+    FastOutputMode mode;
+    return FastOutputOn(mode);
 }
 
 }  // namespace HTTP

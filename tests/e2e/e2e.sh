@@ -2,12 +2,14 @@
 # End-to-end through the real web server: a private lighttpd, configured from
 # deploy/lighttpd.conf.in, runs velascgi on a free port of 127.0.0.1 under a
 # temporary system root that serves the staged web-API directory; curl then
-# calls the sample API the way a browser or a client program would.
+# calls the sample API the way a browser or a client program would. Then
+# the scenarios every web server is held to (scenarios.sh), with X-Sendfile.
 set -u
 
 . "$(dirname "$0")/server.sh"
+. "$(dirname "$0")/scenarios.sh"
 srv_args VELASCGI VELAADM WEBAPI SRC -- "$@"
-srv_require "velascgi switches to the identity each API asks for" cksum cmp
+srv_require "velascgi switches to the identity each API asks for" cksum cmp useradd chpasswd
 
 # ---- The system root: the staged web-API directory, one data volume.
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" private || exit 1
@@ -45,14 +47,8 @@ call --cookie "$COOKIE" -F "title=Holiday 2024" -F "note=x&y=z" \
   "$URL?api=VELA.Sample&version=1&method=upload"
 expect_status "upload" 200
 expect "upload" '"success":true' '"fields":{"note":"x&y=z","title":"Holiday 2024"}'
-# expect_file FIELD NAME PATH: the answer describes that stored file.
-expect_file() {
-  local sum size
-  read -r sum size _ < <(cksum <"$3")
-  expect "upload $1" "{\"cksum\":$sum,\"field\":\"$1\",\"name\":\"$2\",\"size\":$size}"
-}
-expect_file file1 one.bin "$TMP/one.bin"
-expect_file file2 notes.txt "$TMP/two.txt"
+expect_file "upload file1" file1 one.bin "$TMP/one.bin"
+expect_file "upload file2" file2 notes.txt "$TMP/two.txt"
 leftover=$(find "$ROOT/vol1" -path "$ROOT/vol1/sample" -prune -o -type f -print)
 [ -z "$leftover" ] || fail "upload left files behind: $leftover"
 
@@ -62,28 +58,19 @@ expect_error "upload to a method without allowUpload" 115
 # ---- Download, whole and one range, first streamed by velascgi, then
 # through lighttpd's X-Sendfile.
 head -c 2097152 /dev/urandom >"$ROOT/vol1/sample/data.bin"
-tail -c +1001 "$ROOT/vol1/sample/data.bin" | head -c 1000 >"$TMP/range.bin"
-download_checks() {
-  local mode=$1
-  call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=download&name=data.bin"
-  expect_status "download ($mode)" 200
-  cmp -s "$TMP/body" "$ROOT/vol1/sample/data.bin" || fail "download ($mode): bytes differ"
-  expect_header "download ($mode)" 'Content-Length: 2097152' 'X-Content-Type-Options: nosniff'
-  call --cookie "$COOKIE" -r 1000-1999 "$URL?api=VELA.Sample&version=1&method=download&name=data.bin"
-  expect_status "range ($mode)" 206
-  cmp -s "$TMP/body" "$TMP/range.bin" || fail "range ($mode): bytes differ"
-  expect_header "range ($mode)" 'Content-Range: bytes 1000-1999/2097152'
-}
-download_checks "streamed"
+scn_download "streamed" "$COOKIE" "$ROOT/vol1/sample/data.bin"
 grep -qi '^ETag:' "$TMP/headers" && fail "streamed download came from X-Sendfile"
 echo 'xsendfile="yes"' >"$ROOT/etc/vela/webapi.conf"
-download_checks "X-Sendfile"
+scn_download "X-Sendfile" "$COOKIE" "$ROOT/vol1/sample/data.bin"
 # lighttpd's own file answer carries an ETag; velascgi never writes one.
 expect_header "download (X-Sendfile)" 'ETag:'
-rm -f "$ROOT/etc/vela/webapi.conf"
 call --cookie "$COOKIE" "$URL?api=VELA.Sample&version=1&method=download&name=../../etc/passwd"
 expect_error "download outside the folder" 101
 # (The refusals of the front end and the registry, the same through the
 # server: webentry/OutputTest.cpp.)
+
+# ---- The scenarios of every web server, fast output on.
+srv_pam
+FAST_HEADER=X-Sendfile web_scenarios
 
 srv_finish "all end-to-end checks passed ($URL)"

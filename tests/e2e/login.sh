@@ -46,9 +46,7 @@ srv_add_user "$ADMIN" "$PASSA" "$ADMINS"
 
 srv_serve
 
-# ---- Helpers (call, expect, expect_error, fail: server.sh).
-# A string member of the answer.
-member() { sed -n "s/.*\"$1\":\"\\([^\"]*\\)\".*/\\1/p" "$TMP/body"; }
+# ---- Helpers (call, expect, expect_error, fail, member, login: server.sh).
 # logged TEXT: a line velascgi logged since log_mark holds TEXT.
 log_mark() { log_from=$(($(wc -l <"$RUN/cgi.log" 2>/dev/null || echo 0) + 1)); }
 logged() { tail -n "+$log_from" "$RUN/cgi.log" 2>/dev/null | grep -qF -- "$1" || fail "not in cgi.log: $1"; }
@@ -58,17 +56,6 @@ WHOAMI="$URL?api=VELA.Sample&version=1&method=whoami"
 ADMINONLY="$URL?api=VELA.Sample&version=1&method=adminonly"
 nobody_uid=$(id -u nobody)
 
-# login NAME ACCOUNT PASSWORD [CURL ARGS...]: a plain form login; on success
-# sets $sid and $token.
-sid="" token=""
-login() {
-  call "${@:4}" --data-urlencode "account=$2" --data-urlencode "passwd=$3" "$AUTH&method=login"
-  sid=$(member sid) token=$(member token)
-  if [ "$status" != 200 ] || ! grep -qF '"success":true' "$TMP/body" || [ -z "$sid" ] || [ -z "$token" ]; then
-    fail "$1: login of $2 failed (HTTP $status): $(head -c 600 "$TMP/body")"
-    return 1
-  fi
-}
 # login_refused NAME CODE ACCOUNT PASSWORD [CURL ARGS...]: a form login
 # refused with error CODE and no cookie; login_fails: with 400, a wrong
 # password (407: blocked, 403: a password in the URL).

@@ -3,12 +3,14 @@
 # private lighttpd from deploy/lighttpd.conf.in on a free port of 127.0.0.1,
 # and Linux accounts made for the run and removed afterwards. A script takes
 # the paths its srv_args names and exits 0 when every check passed, 1
-# otherwise, 77 (skipped) without a tool it needs or without root.
+# otherwise, 77 (skipped) without a tool it needs or without root. The web
+# server is lighttpd unless a script sets SRV_SERVER (apache2, nginx) and
+# starts it with srv_launch.
 #
 #   srv_args NAME... -- ARG...     each NAME the real path of its ARG (exit 2
 #                                  with the usage when the counts differ)
-#   srv_require WHY TOOL...        exit 77 without a TOOL or without root (WHY
-#                                  needs it); then srv_traps
+#   srv_require WHY TOOL...        exit 77 without a TOOL, SRV_SERVER or curl, or
+#                                  without root (WHY needs it); then srv_traps
 #   srv_traps [COMMAND]            at exit: COMMAND, the logs after a failure,
 #                                  srv_cleanup (server, accounts, groups, TMP)
 #   srv_init SRC VELASCGI WEBAPI [private]
@@ -20,6 +22,15 @@
 #   srv_start DOCROOT [ARG...]     lighttpd (ARGs to scripts/lighttpd-conf.sh)
 #                                  on SRV_BIND (default 127.0.0.1): BASE and
 #                                  URL (the entry), or 1; srv_stop
+#   srv_launch CONF RUN            a web server on a free port of SRV_BIND:
+#                                  "CONF PORT" writes its configuration, RUN
+#                                  runs it in the foreground; BASE, URL, LPID
+#                                  once it answers, or 1
+#   srv_daemon NAME CMD...         CMD in the background until srv_cleanup
+#                                  (its output in RUN/NAME.log)
+#   srv_front_env                  the front end's environment as NAME=VALUE
+#                                  lines (VELA_ROOT, logs to standard error,
+#                                  PATH, sanitizer options)
 #   srv_aside                      keeps the current server running and sets
 #                                  it aside (TMP, ROOT, RUN, BASE, URL, LPID
 #                                  emptied): srv_init may start another one;
@@ -34,6 +45,8 @@
 #   srv_as_nobody CMD...           CMD as the account nobody
 #   srv_wait TRIES PAUSE CMD...    CMD until it succeeds, at most TRIES times
 #                                  PAUSE seconds apart (else 1)
+#   srv_volume                     the first data volume of the root's
+#                                  volumes.conf, as a path of this machine
 #   srv_finish TEXT                exit 1 after failed checks or sanitizer
 #                                  reports, else 0 printing TEXT
 #
@@ -47,13 +60,18 @@
 #   expect_status NAME CODE        the HTTP status was CODE
 #   expect_error NAME CODE [WORD]  the answer is error CODE, with the header
 #                                  "x-request-error: WORD" when WORD is given
-#
-# lighttpd and curl are always required.
+#   member NAME                    a string member of the answer
+#   login NAME ACCOUNT PASSWORD [CURL_ARGS...]
+#                                  a form login with VELA.Auth: $sid and $token
+#   expect_file NAME FIELD FILE PATH
+#                                  the upload answer describes PATH stored as
+#                                  FILE of the form field FIELD
 
 TMP="" ROOT="" RUN="" BASE="" URL="" LPID=""
 SRV_SRC="" SRV_VELASCGI=""
-SRV_USERS=() SRV_GROUPS=() SRV_ASIDE=()
+SRV_USERS=() SRV_GROUPS=() SRV_ASIDE=() SRV_DAEMONS=()
 SRV_BIND=${SRV_BIND:-127.0.0.1}
+SRV_SERVER=${SRV_SERVER:-lighttpd}
 failures=0 status=""
 
 srv_args() {
@@ -77,7 +95,7 @@ srv_args() {
 srv_require() {
   local why=$1 tool
   shift
-  for tool in lighttpd curl "$@"; do
+  for tool in "$SRV_SERVER" curl "$@"; do
     command -v "$tool" >/dev/null 2>&1 || { echo "SKIP: $tool is not installed"; exit 77; }
   done
   [ "$(id -u)" -eq 0 ] || { echo "SKIP: needs root ($why)"; exit 77; }
@@ -124,6 +142,25 @@ expect_error() {
   [ -z "${3:-}" ] || expect_header "$1" "x-request-error: $3"
 }
 
+member() { sed -n "s/.*\"$1\":\"\\([^\"]*\\)\".*/\\1/p" "$TMP/body"; }
+
+# (On success sets $sid and $token.)
+sid="" token=""
+login() {
+  call "${@:4}" --data-urlencode "account=$2" --data-urlencode "passwd=$3" "$URL?api=VELA.Auth&version=1&method=login"
+  sid=$(member sid) token=$(member token)
+  if [ "$status" != 200 ] || ! grep -qF '"success":true' "$TMP/body" || [ -z "$sid" ] || [ -z "$token" ]; then
+    fail "$1: login of $2 failed (HTTP $status): $(head -c 600 "$TMP/body")"
+    return 1
+  fi
+}
+
+expect_file() {
+  local sum size
+  read -r sum size _ < <(cksum <"$4")
+  expect "$1" "{\"cksum\":$sum,\"field\":\"$2\",\"name\":\"$3\",\"size\":$size}"
+}
+
 srv_init() {
   SRV_SRC=$1 SRV_VELASCGI=$2
   if [ "${4:-}" = private ] && [ -d /run ] && [ -w /run ]; then export TMPDIR=/run; fi
@@ -150,26 +187,17 @@ srv_api() {
   cat >"$api/$1.lib" || exit 1
 }
 
-# lighttpd runs in the foreground as a child of the script (-D), so that
+# The server runs in the foreground as a child of the script, so that
 # whoever ends the script's process tree ends the server as well. Another
 # program may take the port between the look and the bind: then try another.
-srv_start() {
-  local docroot=$1 port _
-  shift
-  local args=(--out "$RUN/lighttpd.conf" --run "$RUN" --pidfile "$RUN/lighttpd.pid" --docroot "$docroot"
-              --velascgi "$SRV_VELASCGI" --bind "$SRV_BIND" --env "VELA_ROOT=$ROOT" --env "VELA_LOG_STDERR=1"
-              --env "PATH=/usr/sbin:/usr/bin:/sbin:/bin" "$@")
-  # Sanitizer builds: the options reach velascgi too.
-  local var
-  for var in ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS; do
-    [ -z "${!var:-}" ] || args+=(--env "$var=${!var}")
-  done
+srv_launch() {
+  local conf=$1 run=$2 port _
   BASE="" URL=""
   for _ in $(seq 1 20); do
     port=$((20000 + RANDOM % 40000))
     (exec 3<>"/dev/tcp/$SRV_BIND/$port") 2>/dev/null && continue
-    "$SRV_SRC/scripts/lighttpd-conf.sh" "${args[@]}" --port "$port" || return 1
-    lighttpd -D -f "$RUN/lighttpd.conf" 2>>"$RUN/start.log" &
+    "$conf" "$port" || return 1
+    "$run" 2>>"$RUN/start.log" &
     LPID=$!
     # Up when it answers; gone (the port was taken meanwhile) when it exits.
     for _ in $(seq 1 200); do
@@ -188,8 +216,37 @@ srv_start() {
     srv_stop
   done
   cat "$RUN/start.log" "$RUN/error.log" 2>/dev/null
-  echo "lighttpd did not start"
+  echo "$SRV_SERVER did not start"
   return 1
+}
+
+srv_front_env() {
+  local var
+  printf '%s\n' "VELA_ROOT=$ROOT" "VELA_LOG_STDERR=1" "PATH=/usr/sbin:/usr/bin:/sbin:/bin"
+  # Sanitizer builds: the options reach the front end too.
+  for var in ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS; do
+    [ -z "${!var:-}" ] || printf '%s\n' "$var=${!var}"
+  done
+}
+
+srv_start() {
+  local docroot=$1 line
+  shift
+  SRV_CONF_ARGS=(--out "$RUN/lighttpd.conf" --run "$RUN" --pidfile "$RUN/lighttpd.pid" --docroot "$docroot"
+                 --velascgi "$SRV_VELASCGI" --bind "$SRV_BIND" "$@")
+  while IFS= read -r line; do
+    SRV_CONF_ARGS+=(--env "$line")
+  done < <(srv_front_env)
+  srv_launch srv_lighttpd_conf srv_lighttpd_run
+}
+srv_lighttpd_conf() { "$SRV_SRC/scripts/lighttpd-conf.sh" "${SRV_CONF_ARGS[@]}" --port "$1"; }
+srv_lighttpd_run() { exec lighttpd -D -f "$RUN/lighttpd.conf"; }
+
+srv_daemon() {
+  local name=$1
+  shift
+  "$@" >>"$RUN/$name.log" 2>&1 &
+  SRV_DAEMONS+=($!)
 }
 
 srv_serve() {
@@ -238,7 +295,7 @@ srv_stop() {
 
 srv_logs() {
   local log
-  for log in start.log error.log cgi.log; do
+  for log in start.log error.log cgi.log velafcgi.log fcgiwrap.log; do
     [ -s "$RUN/$log" ] && echo "---- $log (last 100 lines)" && tail -n 100 "$RUN/$log"
   done
 }
@@ -269,6 +326,16 @@ srv_wait() {
   return 1
 }
 
+srv_volume() {
+  local line
+  while IFS= read -r line || [ -n "$line" ]; do
+    case "$line" in
+      /*) echo "${ROOT%/}$line"; return 0 ;;
+    esac
+  done <"$ROOT/etc/vela/volumes.conf"
+  return 1
+}
+
 # (No character that needs quoting in a form or a shell.)
 srv_password() {
   printf 'Pw%s' "$(head -c 64 /dev/urandom | base64 -w0 | tr -dc 'A-Za-z0-9' | head -c 20)"
@@ -294,6 +361,11 @@ srv_cleanup() {
     [ -n "${SRV_ASIDE[i + 1]}" ] && rm -rf "${SRV_ASIDE[i + 1]}"
   done
   SRV_ASIDE=()
+  for i in "${SRV_DAEMONS[@]+"${SRV_DAEMONS[@]}"}"; do
+    kill -TERM "$i" 2>/dev/null
+    wait "$i" 2>/dev/null
+  done
+  SRV_DAEMONS=()
   for name in "${SRV_USERS[@]+"${SRV_USERS[@]}"}"; do
     userdel "$name" 2>/dev/null
   done

@@ -1,7 +1,7 @@
 // HTTP file output: whole files through a pipe and a file,
-// byte ranges, X-Sendfile only for paths nobody else can change, links on
-// the path refused, refusals, the disposition header, a client that goes
-// away.
+// byte ranges, X-Sendfile only for paths nobody else can change, nginx's
+// X-Accel-Redirect, links on the path refused, refusals, the disposition
+// header, a client that goes away.
 
 #include <csignal>
 #include <cstdio>
@@ -111,6 +111,18 @@ protected:
     Reply Send(const std::string& path, const char* type = "")
     {
         return ToFile([&] { return out_.Output(path, type); });
+    }
+
+    // A directory below which only root may change anything, for fast
+    // output: /run when it is root's alone (the checkout may sit below
+    // /tmp, which anyone may write to), else the build directory.
+    static const char* SafeBase()
+    {
+        const char* build = getenv("VELA_TEST_BINARY_DIR");
+        EXPECT_NE(nullptr, build) << "run through CTest";
+        struct stat st;
+        const bool run = geteuid() == 0 && stat("/run", &st) == 0 && st.st_uid == 0 && (st.st_mode & 022) == 0;
+        return run ? "/run" : build;
     }
 
     ScopedEnv range_{"HTTP_RANGE", nullptr};
@@ -241,10 +253,7 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     // X-Sendfile may be used at all only below a directory only root may
     // change: /run when it is root's alone (the checkout may sit below /tmp,
     // which anyone may write to), else the build directory.
-    ASSERT_NE(nullptr, getenv("VELA_TEST_BINARY_DIR")) << "run through CTest";
-    struct stat st;
-    const bool run = geteuid() == 0 && stat("/run", &st) == 0 && st.st_uid == 0 && (st.st_mode & 022) == 0;
-    ScopedEnv base("TMPDIR", run ? "/run" : getenv("VELA_TEST_BINARY_DIR"));
+    ScopedEnv base("TMPDIR", SafeBase());
     const VELA::Test::TempDir safe;
     const std::string dir = safe.Path();
     chmod(dir.c_str(), 0755);
@@ -344,6 +353,79 @@ TEST_F(HttpOutput, FastOutputOnlyForPathsNobodyElseCanChange)
     }
     close(mine);
     fclose(file);
+}
+
+// nginx's form of fast output: X-Accel-Redirect to the configured internal
+// prefix, the path encoded as for X-Sendfile ("?" and "#" included, which
+// nginx would take for a query or a fragment). A prefix nginx could read
+// otherwise turns fast output off: the file is streamed. For a server that
+// decodes no path, only paths that need no encoding are handed over.
+TEST_F(HttpOutput, AccelRedirectAndHowTheServerTakesThePath)
+{
+    ScopedEnv base("TMPDIR", SafeBase());
+    const VELA::Test::TempDir safe;
+    chmod(safe.Path().c_str(), 0755);
+    const std::string path = safe.Path() + "/r?x #.bin";
+    VELA::Test::WriteFile(path, "content");
+    char* real = realpath(safe.Path().c_str(), nullptr);
+    ASSERT_NE(nullptr, real);
+    const std::string encoded = std::string(real) + "/r%3Fx%20%23.bin";
+    free(real);
+
+    // The configuration is read once per system root: another root and
+    // back makes it read again.
+    const VELA::Test::TempDir other;
+    const auto configure = [&](const std::string& prefix, const std::string& more = "") {
+        Conf("webapi.conf", "xsendfile=\"yes\"\nxaccel_prefix=\"" + prefix + "\"\n" + more);
+        {
+            ScopedEnv root("VELA_ROOT", other.Path().c_str());
+            VELA::System::RootReset();
+            EXPECT_FALSE(FileOutputerHelper::IsFastOutputEnabled());
+        }
+        VELA::System::RootReset();
+    };
+    const std::pair<std::string, const char*> taken[] = {  // the prefix and the header it makes
+        {"", "X-Sendfile"}, {"/vela-internal", "X-Accel-Redirect"}, {"/a/b.c_d~", "X-Accel-Redirect"}};
+    for (const auto& [prefix, header] : taken) {
+        configure(prefix);
+        const Reply r = Send(path, "text/plain");
+        EXPECT_TRUE(r.ok && r.complete) << prefix;
+        const char* absent = std::string(header) == "X-Sendfile" ? "X-Accel-Redirect" : "X-Sendfile";
+        ExpectHeaders(r, {{header, prefix + encoded}, {absent, ""}, {"Content-Length", ""},
+                          {"Content-Type", "text/plain"}, {"X-Content-Type-Options", "nosniff"}},
+                      prefix);
+        EXPECT_EQ("", r.body) << prefix;
+    }
+    for (const std::string& prefix : {std::string("vela"), std::string("/"), std::string("/vela/"),
+                                      std::string("//vela"), std::string("/a/../b"), std::string("/a/./b"),
+                                      std::string("/.hidden"), std::string("/a b"), std::string("/a?b"),
+                                      std::string("/a%2fb"), std::string("/a\\b"), "/" + std::string(128, 'p')}) {
+        configure(prefix);
+        VELA::Test::LogCapture log;
+        const Reply r = Send(path, "text/plain");
+        EXPECT_TRUE(r.ok) << prefix;
+        ExpectHeaders(r, {{"X-Accel-Redirect", ""}, {"X-Sendfile", ""}, {"Content-Length", "7"}}, prefix);
+        EXPECT_EQ("content", r.body) << prefix;
+        EXPECT_TRUE(log.Contains("xaccel_prefix")) << prefix;
+    }
+
+    configure("", "xsendfile_encoded=\"No\"\n");
+    {
+        VELA::Test::LogCapture log;
+        const Reply r = Send(path, "text/plain");
+        ExpectHeaders(r, {{"X-Sendfile", ""}, {"Content-Length", "7"}}, "encoded path, raw server");
+        EXPECT_EQ("content", r.body);
+        EXPECT_TRUE(log.Contains("takes no percent-encoded path"));
+    }
+    const std::string plain = safe.Path() + "/plain-1.txt";
+    VELA::Test::WriteFile(plain, "content");
+    real = realpath(plain.c_str(), nullptr);
+    ASSERT_NE(nullptr, real);
+    const std::string plainReal = real;
+    free(real);
+    const Reply r = Send(plain, "text/plain");
+    ExpectHeaders(r, {{"X-Sendfile", plainReal}, {"Content-Length", ""}}, "plain path, raw server");
+    EXPECT_EQ("", r.body);
 }
 
 // What is not a regular file is refused before anything is written, and so
