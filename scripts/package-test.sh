@@ -164,7 +164,7 @@ check_installed() {
     dpkg -S "$f" >/dev/null 2>&1 || fail "$what: $f belongs to no package"
     [ -e "$f" ] || fail "$what: $f is missing"
   done
-  dpkg -L vela-webapi vela-webapi-dev | while read -r f; do
+  dpkg -L vela-webapi vela-webapi-dev | grep -v '^$' | while read -r f; do
     [ -e "$f" ] || echo "FAIL: $what: $f listed by dpkg -L is missing"
   done | tee "$TMP/missing"
   [ -s "$TMP/missing" ] && fail "$what: files of dpkg -L missing"
@@ -181,8 +181,8 @@ check_installed() {
     fail "$what: conffiles are: $conffiles"
   # Nothing the packages installed or made is writable by everyone (a
   # directory only with the sticky bit).
-  mapfile -t installed < <(dpkg -L vela-webapi vela-webapi-dev | grep -v '^/$')
-  find "${installed[@]}" /var/lib/vela /var/spool/webapi /var/log/vela /run/vela -maxdepth 0 -perm -0002 ! \( -type d -perm -1000 \) ! -type l 2>/dev/null | sort -u >"$TMP/writable"
+  mapfile -t installed < <(dpkg -L vela-webapi vela-webapi-dev | grep -v '^/\{0,1\}$')
+  { find "${installed[@]}" /var/lib/vela /var/spool/webapi /var/log/vela /run/vela -maxdepth 0 -perm -0002 ! \( -type d -perm -1000 \) ! -type l 2>/dev/null || true; } | sort -u >"$TMP/writable"
   [ -s "$TMP/writable" ] && fail "$what: writable by everyone: $(tr '\n' ' ' <"$TMP/writable")"
   return 0
 }
@@ -256,13 +256,13 @@ done
 # the enabled snippet and its fastcgi module, and nothing else of the
 # system's configuration (no port 80).
 port=$(python3 -c 'import socket; s = socket.socket(); s.bind(("127.0.0.1", 0)); print(s.getsockname()[1])')
-mkdir -p "$TMP/www" "$TMP/upload"
-chown www-data:www-data "$TMP/upload"
+mkdir -p "$TMP/www" "$TMP/upload" "$TMP/log"
+chown www-data:www-data "$TMP/upload" "$TMP/log"
 cat >"$TMP/lighttpd.conf" <<EOF
 server.modules = ( "mod_indexfile", "mod_access", "mod_alias", "mod_redirect" )
 server.document-root = "$TMP/www"
 server.upload-dirs   = ( "$TMP/upload" )
-server.errorlog      = "$TMP/error.log"
+server.errorlog      = "$TMP/log/error.log"
 server.pid-file      = "$TMP/lighttpd.pid"
 server.username      = "www-data"
 server.groupname     = "www-data"
@@ -280,6 +280,7 @@ BASE="http://127.0.0.1:$port"
 URL="$BASE/webapi/entry.cgi"
 for _ in $(seq 50); do
   curl -s -o /dev/null "$BASE/webapi/login.html" && break
+  kill -0 "$LPID" 2>/dev/null || die "lighttpd did not start: $(cat "$TMP/log/error.log" 2>/dev/null)"
   sleep 0.2
 done
 
@@ -316,7 +317,7 @@ if [ -f "$repo/tests/e2e/scenarios.sh" ]; then
   }
   # server.sh defines the checks anew and empties its variables (TMP,
   # LPID, failures...): ours are kept aside.
-  own_failures=$failures own_tmp=$TMP own_lpid=$LPID
+  own_failures=$failures own_tmp=$TMP own_lpid=$LPID own_base=$BASE
   set +eu
   # shellcheck source=/dev/null
   source "$repo/tests/e2e/server.sh"
@@ -324,12 +325,12 @@ if [ -f "$repo/tests/e2e/scenarios.sh" ]; then
   source "$repo/tests/e2e/scenarios.sh"
   trap cleanup EXIT
   trap 'exit 1' HUP INT TERM
-  TMP=$own_tmp LPID=$own_lpid ROOT=/ RUN=$own_tmp URL="$BASE/webapi/entry.cgi"
+  TMP=$own_tmp LPID=$own_lpid BASE=$own_base URL="$own_base/webapi/entry.cgi" ROOT=/ RUN=$own_tmp
   VELAADM=/usr/sbin/velaadm FAST_HEADER=X-Sendfile SRV_SRC=$repo
   web_scenarios
   set -eu
   srv_cleanup_accounts
-  [ "$failures" -eq 0 ] || { cat "$TMP/velafcgi.log" "$TMP/error.log" 2>/dev/null | tail -n 50; }
+  [ "$failures" -eq 0 ] || { cat "$TMP/velafcgi.log" "$TMP/log/error.log" 2>/dev/null | tail -n 50; }
   failures=$((failures + own_failures))
 fi
 
