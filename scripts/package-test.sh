@@ -188,6 +188,20 @@ check_installed() {
 }
 check_installed "install"
 
+say "building the handler template against vela-webapi-dev"
+[ "$(pkg-config --modversion vela-webapi 2>&1)" = "$(dpkg-query -W -f='${Version}' vela-webapi-dev)" ] ||
+  fail "pkg-config does not find vela-webapi of the package"
+if cmake -S "$repo/sdk/handler-template" -B "$TMP/template" >"$TMP/template.log" 2>&1 &&
+   cmake --build "$TMP/template" -j"$(nproc)" >>"$TMP/template.log" 2>&1; then
+  grep -q "^VelaWebAPI_DIR:PATH=/usr/lib/.*/cmake/VelaWebAPI$" "$TMP/template/CMakeCache.txt" ||
+    fail "the handler template found VelaWebAPI elsewhere: $(grep VelaWebAPI_DIR "$TMP/template/CMakeCache.txt")"
+  (cd "$TMP/template" && ctest --output-on-failure >>"$TMP/template.log" 2>&1) ||
+    { tail -n 30 "$TMP/template.log"; fail "the handler template's tests"; }
+else
+  tail -n 30 "$TMP/template.log"
+  fail "the handler template does not build against vela-webapi-dev"
+fi
+
 say "checking the units"
 if command -v systemd-analyze >/dev/null 2>&1; then
   systemd-analyze verify --man=no /lib/systemd/system/velafcgi.socket /lib/systemd/system/velafcgi.service \
