@@ -197,6 +197,13 @@ if cmake -S "$repo/sdk/handler-template" -B "$TMP/template" >"$TMP/template.log"
     fail "the handler template found VelaWebAPI elsewhere: $(grep VelaWebAPI_DIR "$TMP/template/CMakeCache.txt")"
   (cd "$TMP/template" && ctest --output-on-failure >>"$TMP/template.log" 2>&1) ||
     { tail -n 30 "$TMP/template.log"; fail "the handler template's tests"; }
+  # A handler library's package gets its dependency on vela-webapi from
+  # the shlibs file.
+  handler=$(find "$TMP/template" -name '*.so' -newer "$TMP/template/CMakeCache.txt" | head -n 1)
+  mkdir -p "$TMP/shlibdeps/debian"
+  printf 'Source: greet\n\nPackage: greet\nArchitecture: any\n' >"$TMP/shlibdeps/debian/control"
+  deps=$(cd "$TMP/shlibdeps" && dpkg-shlibdeps -O "$handler" 2>&1) || true
+  grep -q "^shlibs:Depends=.*vela-webapi" <<<"$deps" || fail "dpkg-shlibdeps of a handler library: $deps"
 else
   tail -n 30 "$TMP/template.log"
   fail "the handler template does not build against vela-webapi-dev"
