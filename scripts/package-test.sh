@@ -7,7 +7,9 @@
 # units start it, lighttpd with the package's snippet enabled on a free
 # port, then calls through it (an echo with a session of the installed
 # velaadm, the sign-in page, the end-to-end scenarios of
-# tests/e2e/scenarios.sh when present) and `velaapi list`. Then it removes
+# tests/e2e/scenarios.sh when present) and `velaapi list`; the scenarios
+# again through Apache's mod_cgid running the installed velascgi set-user-id
+# root, when apache2 and mod_xsendfile are installed. Then it removes
 # the packages (only conffiles may stay), purges them (the state goes) and
 # leaves the machine as it found it: the processes it started, the packages
 # it installed (those apt-get pulled in as well), the administrators' group
@@ -68,7 +70,7 @@ check() {
 
 TMP=$(mktemp -d /tmp/vela-pkgtest.XXXXXX)
 chmod 0755 "$TMP"
-VOLUME="" FCGI_PID="" LPID=""
+VOLUME="" FCGI_PID="" LPID="" APID="" override_made=no
 packages_before="$TMP/packages.before"
 dpkg-query -W -f='${Package}:${Architecture} ${db:Status-Status}\n' | awk '$2 == "installed" {print $1}' |
   sort >"$packages_before"
@@ -78,6 +80,11 @@ links_made=()
 policy=/usr/sbin/policy-rc.d policy_saved=""
 
 stop_servers() {
+  if [ -n "$APID" ]; then
+    kill -TERM "$APID" 2>/dev/null || true
+    wait "$APID" 2>/dev/null || true
+    APID=""
+  fi
   if [ -n "$LPID" ]; then
     kill -TERM "$LPID" 2>/dev/null || true
     wait "$LPID" 2>/dev/null || true
@@ -98,6 +105,7 @@ cleanup() {
   for link in "${links_made[@]+"${links_made[@]}"}"; do
     [ -L "$link" ] && rm -f "$link"
   done
+  [ "$override_made" = yes ] && dpkg-statoverride --remove /usr/libexec/vela/velascgi >/dev/null 2>&1
   for p in vela-webapi-dev vela-webapi; do
     if dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -qv "not-installed"; then
       DEBIAN_FRONTEND=noninteractive apt-get purge -y -qq "$p" >/dev/null 2>&1
@@ -349,9 +357,44 @@ if [ -f "$repo/tests/e2e/scenarios.sh" ]; then
   TMP=$own_tmp LPID=$own_lpid BASE=$own_base URL="$own_base/webapi/entry.cgi" ROOT=/ RUN=$own_tmp
   VELAADM=/usr/sbin/velaadm FAST_HEADER=X-Sendfile SRV_SRC=$repo
   web_scenarios
-  set -eu
   srv_cleanup_accounts
   [ "$failures" -eq 0 ] || { cat "$TMP/velafcgi.log" "$TMP/log/error.log" 2>/dev/null | tail -n 50; }
+
+  # Apache's mod_cgid runs CGI programs only as its User: the installed
+  # velascgi is made set-user-id root for the server's group, as an
+  # administrator does it (dpkg-statoverride), and held to the same
+  # scenarios, Debian's mod_xsendfile taking the path as it is.
+  if command -v apache2 >/dev/null 2>&1 && [ -f /usr/lib/apache2/modules/mod_xsendfile.so ]; then
+    say "end-to-end scenarios through Apache (mod_cgid, velascgi set-user-id root)"
+    velascgi=/usr/libexec/vela/velascgi
+    dpkg-statoverride --update --add root www-data 4750 "$velascgi" && override_made=yes
+    [ "$(stat -c '%a %U %G' "$velascgi")" = "4750 root www-data" ] ||
+      fail "statoverride: velascgi is $(stat -c '%a %U %G' "$velascgi")"
+    printf 'xsendfile="yes"\nxsendfile_encoded="no"\n' >/etc/vela/webapi.conf
+    aport=$(python3 -c 'import socket; s = socket.socket(); s.bind(("127.0.0.1", 0)); print(s.getsockname()[1])')
+    if "$repo/scripts/websrv-conf.sh" --server apache --front-end cgi --out "$TMP/apache/apache.conf" \
+         --port "$aport" --run "$TMP/apache" --pidfile "$TMP/apache/apache.pid" --docroot "$TMP/www" \
+         --velascgi "$velascgi" --fast-dir "$VOLUME"; then
+      apache2 -f "$TMP/apache/apache.conf" -DFOREGROUND &
+      APID=$!
+      BASE="http://127.0.0.1:$aport" URL="http://127.0.0.1:$aport/webapi/entry.cgi"
+      for _ in $(seq 50); do
+        curl -s -o /dev/null "$BASE/" && break
+        sleep 0.2
+      done
+      web_scenarios
+      srv_cleanup_accounts
+      [ "$failures" -eq 0 ] || tail -n 50 "$TMP/apache/error.log"
+      kill -TERM "$APID" 2>/dev/null
+      wait "$APID" 2>/dev/null
+      APID=""
+    else
+      fail "websrv-conf.sh wrote no Apache configuration"
+    fi
+    dpkg-statoverride --remove "$velascgi" && override_made=no
+    echo 'xsendfile="yes"' >/etc/vela/webapi.conf
+  fi
+  set -eu
   failures=$((failures + own_failures))
 fi
 

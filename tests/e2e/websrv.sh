@@ -6,7 +6,8 @@
 #   apache cgi    mod_cgid running velascgi, as Apache's User (never root):
 #                 velascgi can take no identity, so instead of the
 #                 scenarios the answers a front end without root gives
-#                 (README, "Other web servers")
+#                 (set-user-id root it serves only the root "/": the
+#                 package test runs the scenarios so)
 #   nginx fcgi    fastcgi_pass to velafcgi on a socket of its own
 #   nginx cgi     fastcgi_pass to fcgiwrap, which runs velascgi
 # Fast file output: X-Sendfile through mod_xsendfile (Apache), X-Accel-Redirect
