@@ -443,12 +443,7 @@ int TaskList(int argc, char** argv)
             if (!task.reload()) {
                 continue;  // removed meanwhile, or not a record (logged)
             }
-            const char* state = "running";
-            if (task.isFinished()) {
-                state = "finished";
-            } else if (task.getCreatePid() > 0 && !task.isWorkerAlive()) {
-                state = "lost";
-            }
+            const char* state = task.stateName();
             const Json::Value info = task.getProperty("info");
             const Json::Value progress = task.getProperty("progress");
             std::string percent = "-";

@@ -86,6 +86,9 @@ public:
     // when `remove` is true.
     bool finish(bool remove);
     bool isFinished() const;
+    // "finished", "lost" (not finished, its recorded worker gone) or
+    // "running", as listings show the task.
+    const char* stateName() const;
     long long getCreated() const;
     long long getFinishedAt() const;
     // The whole record as last read (for listings).

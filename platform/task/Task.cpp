@@ -400,6 +400,14 @@ bool Task::isWorkerAlive() const
     return start >= 0 && IntField(record_, "create_start", -1) == start;
 }
 
+const char* Task::stateName() const
+{
+    if (isFinished()) {
+        return "finished";
+    }
+    return getCreatePid() > 0 && !isWorkerAlive() ? "lost" : "running";
+}
+
 bool Task::finish(bool remove)
 {
     if (!valid_) {

@@ -246,12 +246,7 @@ void Tasks(APIRequest*, APIResponse* resp)
             if (!task.reload()) {
                 continue;  // removed meanwhile, or not a record (logged)
             }
-            const char* state = "running";
-            if (task.isFinished()) {
-                state = "finished";
-            } else if (task.getCreatePid() > 0 && !task.isWorkerAlive()) {
-                state = "lost";
-            }
+            const char* state = task.stateName();
             const Json::Value info = task.getProperty("info");
             const Json::Value progress = task.getProperty("progress");
             Json::Value entry(Json::objectValue);
