@@ -14,8 +14,9 @@
   const TOKEN_KEY = "vela.token";
   const SIGN_IN = "login.html?next=admin.html";
   const TASK_REFRESH_MS = 3000;
-  // The refresh pauses when nobody used the page for this long, so that an
-  // open tab alone does not keep the session from timing out.
+  // The refresh pauses when nobody used the page for this long. The task
+  // list is also read without keeping the session alive ("allowTimeout"),
+  // so an open tab alone never keeps it from timing out.
   const IDLE_PAUSE_MS = 10 * 60 * 1000;
   const MAX_BARS = 20;
   const SVG_NS = "http://www.w3.org/2000/svg";
