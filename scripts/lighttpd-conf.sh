@@ -23,6 +23,7 @@ front="${VELA_FRONT_END:-fcgi}"
 envs=() sendfile_dirs=()
 
 die() { echo "lighttpd-conf.sh: $*" >&2; exit 1; }
+. "$repo/scripts/conf-common.sh"
 
 while [ $# -gt 0 ]; do
   [ $# -ge 2 ] || die "$1 needs a value"
@@ -45,20 +46,15 @@ while [ $# -gt 0 ]; do
 done
 [ -n "$out" ] && [ -n "$port" ] && [ -n "$run" ] && [ -n "$pidfile" ] && [ -n "$docroot" ] && [ -n "$velascgi" ] ||
   die "--out, --port, --run, --pidfile, --docroot and --velascgi are required"
-case "$port" in
-  '' | *[!0-9]*) die "port \"$port\" is not a number" ;;
-esac
-[ "$port" -ge 1 ] && [ "$port" -le 65535 ] || die "port $port out of range"
-for p in "$run" "$pidfile" "$docroot" "$velascgi" "$errors"; do
-  case "$p" in /*) ;; *) die "\"$p\" is not an absolute path" ;; esac
-done
+conf_port "$port"
+conf_absolute "$run" "$pidfile" "$docroot" "$velascgi" "$errors"
 [ -x "$velascgi" ] || die "$velascgi is not an executable"
 case "$front" in
   cgi) module=mod_cgi ;;
   fcgi)
     module=mod_fastcgi
     [ -n "$velafcgi" ] || velafcgi="$(dirname "$velascgi")/velafcgi"
-    case "$velafcgi" in /*) ;; *) die "\"$velafcgi\" is not an absolute path" ;; esac
+    conf_absolute "$velafcgi"
     [ -x "$velafcgi" ] || die "$velafcgi is not an executable"
     # lighttpd splits the program's command line at spaces.
     case "$velafcgi$run" in *[[:space:]]*) die "the paths of velafcgi and the run directory may not hold spaces" ;; esac
@@ -81,13 +77,12 @@ done
 
 cgi_env=""
 for e in "${envs[@]+"${envs[@]}"}"; do
-  name="${e%%=*}"
-  [ "$name" != "$e" ] && [[ "$name" =~ ^[A-Za-z_][A-Za-z0-9_]*$ ]] || die "bad --env \"$e\""
-  cgi_env+="$(quote "$name") => $(quote "${e#*=}"), "
+  conf_env_name "$e"
+  cgi_env+="$(quote "${e%%=*}") => $(quote "${e#*=}"), "
 done
 xsendfile="disable" xsendfile_docroot=""
 for d in "${sendfile_dirs[@]+"${sendfile_dirs[@]}"}"; do
-  case "$d" in /*) ;; *) die "X-Sendfile directory \"$d\" is not an absolute path" ;; esac
+  conf_absolute "$d"
   xsendfile="enable"
   xsendfile_docroot+="$(quote "$d"), "
 done
@@ -97,16 +92,7 @@ chmod 0700 "$run/upload"
 tmp="$(mktemp "$out.XXXXXX")"
 trap 'rm -f "$tmp"' EXIT
 # The template with the front end's block in place of @ENTRY@.
-expanded() {
-  local line
-  while IFS= read -r line || [ -n "$line" ]; do
-    if [ "$line" = "@ENTRY@" ]; then
-      cat "$repo/deploy/entry-$front.conf.in"
-    else
-      printf '%s\n' "$line"
-    fi
-  done <"$template"
-}
+expanded() { conf_expand "$template" cat "$repo/deploy/entry-$front.conf.in"; }
 while IFS= read -r line || [ -n "$line" ]; do
   # Text inside quotes of the template takes the raw value; the lists take
   # entries already quoted.

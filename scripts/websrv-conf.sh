@@ -33,6 +33,7 @@ front="${VELA_FRONT_END:-fcgi}"
 envs=() fast_dirs=()
 
 die() { echo "websrv-conf.sh: $*" >&2; exit 1; }
+. "$repo/scripts/conf-common.sh"
 
 while [ $# -gt 0 ]; do
   [ $# -ge 2 ] || die "$1 needs a value"
@@ -64,10 +65,7 @@ case "$server" in
 esac
 [ -n "$out" ] && [ -n "$port" ] && [ -n "$run" ] && [ -n "$pidfile" ] && [ -n "$docroot" ] && [ -n "$velascgi" ] ||
   die "--out, --port, --run, --pidfile, --docroot and --velascgi are required"
-case "$port" in
-  '' | *[!0-9]*) die "port \"$port\" is not a number" ;;
-esac
-[ "$port" -ge 1 ] && [ "$port" -le 65535 ] || die "port $port out of range"
+conf_port "$port"
 [ -n "$group" ] || group="$user"
 [[ "$user" =~ ^[a-z_][a-z0-9_-]*$ ]] && [[ "$group" =~ ^[a-z_][a-z0-9_-]*$ ]] || die "bad --user or --group"
 [[ "$prefix" =~ ^(/[A-Za-z0-9_~-]+)+$ ]] || die "--xaccel-prefix takes /SEGMENT... of letters, digits, _ ~ -"
@@ -83,8 +81,8 @@ plain() {
     *[\"\\\'\;\$\{\}]* | *[[:cntrl:]]*) die "\"$1\" holds a quote, \\, ;, \$, {, } or a control character" ;;
   esac
 }
+conf_absolute "$run" "$pidfile" "$docroot" "$velascgi" "$errors" "$modules" ${socket:+"$socket"}
 for p in "$run" "$pidfile" "$docroot" "$velascgi" "$errors" "$modules" ${socket:+"$socket"}; do
-  case "$p" in /*) ;; *) die "\"$p\" is not an absolute path" ;; esac
   plain "$p"
 done
 plain "$bind"
@@ -93,8 +91,8 @@ case "$bind$socket" in *' '*) die "the address and the socket may not hold blank
 
 cgi_env=""
 for e in "${envs[@]+"${envs[@]}"}"; do
+  conf_env_name "$e"
   name="${e%%=*}" value="${e#*=}"
-  [ "$name" != "$e" ] && [[ "$name" =~ ^[A-Za-z_][A-Za-z0-9_]*$ ]] || die "bad --env \"$e\""
   plain "$value"
   if [ "$server" = apache ]; then
     cgi_env+="    SetEnv $name \"$value\""$'\n'
@@ -106,7 +104,7 @@ done
 fast_lines=""
 xsendfile=Off
 for d in "${fast_dirs[@]+"${fast_dirs[@]}"}"; do
-  case "$d" in /*) ;; *) die "fast output directory \"$d\" is not an absolute path" ;; esac
+  conf_absolute "$d"
   plain "$d"
   d="${d%/}"
   xsendfile=On
@@ -145,16 +143,7 @@ tmp="$(mktemp "$out.XXXXXX")"
 trap 'rm -f "$tmp" "$tmp.err"' EXIT
 # The template with the front end's block in place of @ENTRY@; the lines of
 # mod_xsendfile left out when Apache has not got it.
-expanded() {
-  local line
-  while IFS= read -r line || [ -n "$line" ]; do
-    if [ "$line" = "@ENTRY@" ]; then
-      expanded_file "$repo/deploy/$server/entry-$front.conf.in"
-    else
-      printf '%s\n' "$line"
-    fi
-  done <"$repo/deploy/$server/$server.conf.in"
-}
+expanded() { conf_expand "$repo/deploy/$server/$server.conf.in" expanded_file "$repo/deploy/$server/entry-$front.conf.in"; }
 expanded_file() {
   local line
   while IFS= read -r line || [ -n "$line" ]; do
