@@ -18,26 +18,11 @@
 
 const crypto = require("crypto");
 const fs = require("fs");
-const { chromium } = require("playwright-core");
+const { STEP_MS, pageLog, check, args, watch, main } = require("./harness");
 
-const [base, admin, adminPass, user, userPass, secondSid, taskId, blocked, infoFile] = process.argv.slice(2);
-if (!infoFile) {
-  console.error("usage: node admin.test.js BASE_URL ADMIN ADMIN_PASSWORD USER USER_PASSWORD SECOND_SID TASK_ID " +
-                "BLOCKED_ADDRESS INFO_FILE");
-  process.exit(2);
-}
-// Bounded waits: a slow machine gets time, a broken page an answer.
-const STEP_MS = 60000;
-
-let failures = 0;
-const pageLog = [];
-
-function check(ok, message) {
-  if (!ok) {
-    console.log(`FAIL: ${message}`);
-    failures++;
-  }
-}
+const [base, admin, adminPass, user, userPass, secondSid, taskId, blocked, infoFile] =
+  args("BASE_URL", "ADMIN", "ADMIN_PASSWORD", "USER", "USER_PASSWORD", "SECOND_SID", "TASK_ID", "BLOCKED_ADDRESS",
+       "INFO_FILE");
 
 // whoami with the session `sid`, outside the browser: the answer's error
 // code, 0 on success.
@@ -52,15 +37,7 @@ async function whoamiCode(sid) {
 // its script errors.
 async function newPage(browser, errors) {
   const context = await browser.newContext();
-  const page = await context.newPage();
-  page.setDefaultTimeout(STEP_MS);
-  page.on("console", (m) => pageLog.push(`console.${m.type()}: ${m.text()}`));
-  page.on("pageerror", (e) => {
-    pageLog.push(`page error: ${e.message}`);
-    errors.push(e.message);
-  });
-  page.on("response", (r) => pageLog.push(`${r.status()} ${r.request().method()} ${r.url()}`));
-  return page;
+  return watch(await context.newPage(), errors);
 }
 
 // Opens the status page without a session, is sent to the sign-in page and
@@ -174,57 +151,39 @@ async function checkBlocked(page) {
   check(apis.includes("VELA.Admin v1") && apis.includes("VELA.Sample v1"), `callable APIs: ${JSON.stringify(apis)}`);
 }
 
-async function run() {
-  const browser = await chromium.launch({
-    executablePath: process.env.CHROMIUM || "/usr/bin/chromium",
-    args: ["--no-sandbox"],
-    timeout: STEP_MS,
-  });
-  try {
-    const errors = [];
-    const page = await newPage(browser, errors);
-    await signInThroughPage(page, admin, adminPass);
-    const adminSees = await settled(page);
-    if (adminSees !== "panels") {
-      check(false, `the administrator's page shows ${adminSees}`);
-      return;
-    }
-    check(await page.isHidden("#adminonly"), "an administrator is told the page is for administrators only");
-    await checkUsage(page);
-    await checkTask(page);
-    await checkBlocked(page);
-    // Nothing the server named became markup (run.sh failed a sign-in with
-    // an account name that is an <img> tag, should a list name it).
-    check(await page.$$eval("main img", (n) => n.length) === 0 && (await page.title()) !== "1",
-          "text from the server became markup");
-
-    // Usage collection off: said in words, no chart.
-    fs.writeFileSync(infoFile, 'enable_data_collect="no"\n');
-    await page.reload();
-    await page.waitForFunction(() => /collection is off/.test(document.querySelector("#usage .status").textContent));
-    check(await page.isHidden("#usage-box"), "a chart while usage collection is off");
-    await checkSessions(page);
-    check(errors.length === 0, `script errors: ${errors.join("; ")}`);
-
-    const userErrors = [];
-    const userPage = await newPage(browser, userErrors);
-    await signInThroughPage(userPage, user, userPass);
-    const userSees = await settled(userPage);
-    check(userSees === "adminonly" && /administrators only/i.test(await userPage.textContent("#adminonly")),
-          `the user's page shows ${userSees}`);
-    check(await userPage.isHidden("#panels") && await userPage.isHidden("#error"),
-          "the user's page shows the panels or an error");
-    check(userErrors.length === 0, `the user's page had script errors: ${userErrors.join("; ")}`);
-  } finally {
-    await browser.close();
+main("admin", async (browser) => {
+  const errors = [];
+  const page = await newPage(browser, errors);
+  await signInThroughPage(page, admin, adminPass);
+  const adminSees = await settled(page);
+  if (adminSees !== "panels") {
+    check(false, `the administrator's page shows ${adminSees}`);
+    return;
   }
-}
+  check(await page.isHidden("#adminonly"), "an administrator is told the page is for administrators only");
+  await checkUsage(page);
+  await checkTask(page);
+  await checkBlocked(page);
+  // Nothing the server named became markup (run.sh failed a sign-in with
+  // an account name that is an <img> tag, should a list name it).
+  check(await page.$$eval("main img", (n) => n.length) === 0 && (await page.title()) !== "1",
+        "text from the server became markup");
 
-run().catch((e) => check(false, e.stack || e)).then(() => {
-  if (failures !== 0) {
-    console.log(`---- what the pages did\n${pageLog.join("\n")}\n${failures} check(s) failed`);
-  } else {
-    console.log("browser admin checks passed");
-  }
-  process.exit(failures === 0 ? 0 : 1);
+  // Usage collection off: said in words, no chart.
+  fs.writeFileSync(infoFile, 'enable_data_collect="no"\n');
+  await page.reload();
+  await page.waitForFunction(() => /collection is off/.test(document.querySelector("#usage .status").textContent));
+  check(await page.isHidden("#usage-box"), "a chart while usage collection is off");
+  await checkSessions(page);
+  check(errors.length === 0, `script errors: ${errors.join("; ")}`);
+
+  const userErrors = [];
+  const userPage = await newPage(browser, userErrors);
+  await signInThroughPage(userPage, user, userPass);
+  const userSees = await settled(userPage);
+  check(userSees === "adminonly" && /administrators only/i.test(await userPage.textContent("#adminonly")),
+        `the user's page shows ${userSees}`);
+  check(await userPage.isHidden("#panels") && await userPage.isHidden("#error"),
+        "the user's page shows the panels or an error");
+  check(userErrors.length === 0, `the user's page had script errors: ${userErrors.join("; ")}`);
 });

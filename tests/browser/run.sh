@@ -9,6 +9,8 @@
 #          a running task, sessions, a blocked address), revokes a session
 #          made with velaadm; an ordinary user is told the page is not for
 #          them (admin.test.js).
+# The three share harness.js, which they require from beside themselves, so
+# they run from SRC/tests/browser and only node_modules lives in WORK_DIR.
 #
 # usage: run.sh VELASCGI STAGED_WEBAPI_DIR SOURCE_DIR WORK_DIR [share VELAADM CHECK_LIBRARY | admin VELAADM]
 # WORK_DIR receives node_modules (npm ci from package-lock.json, again only
