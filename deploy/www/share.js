@@ -10,8 +10,7 @@
 "use strict";
 
 (function () {
-  const ENTRY = "/webapi/entry.cgi";
-  const SHARE = `${ENTRY}?api=VELA.Sample.Share&version=1`;
+  const { el, make, showError } = vela;
 
   const MESSAGES = {
     470: "There is no such link, or it has been withdrawn.",
@@ -28,32 +27,8 @@
     1003: "There is no folder to show behind this link.",
   };
 
-  const el = (id) => document.getElementById(id);
   let link = "";
   let path = "";  // the folder shown, relative to the shared one
-
-  function showError(text) {
-    el("error").textContent = text;
-    el("error").hidden = text === "";
-  }
-
-  // Resolves to the answer's "data"; rejects with an Error carrying `code`.
-  async function callApi(url, init) {
-    const reply = await fetch(url, Object.assign({ credentials: "same-origin" }, init));
-    let answer;
-    try {
-      answer = await reply.json();
-    } catch (e) {
-      throw new Error(`The server sent no answer (HTTP ${reply.status}).`);
-    }
-    if (!answer || answer.success !== true) {
-      const code = answer && answer.error ? answer.error.code : undefined;
-      const error = new Error(MESSAGES[code] || `The server refused the request (error ${code}).`);
-      error.code = code;
-      throw error;
-    }
-    return answer.data;
-  }
 
   function linkFromUrl() {
     const fromQuery = new URLSearchParams(location.search).get("link");
@@ -71,45 +46,39 @@
   }
 
   function downloadUrl(file) {
-    return `${SHARE}&method=download&path=${encodeURIComponent(file)}&_sharing_id=${encodeURIComponent(link)}`;
+    return vela.url("VELA.Sample.Share", "download", { path: file, _sharing_id: link });
   }
 
   async function list(folder) {
-    let url = `${SHARE}&method=list`;
-    if (folder !== "") {
-      url += `&path=${encodeURIComponent(folder)}`;
-    }
-    const data = await callApi(url, { headers: { "X-Vela-Sharing": link } });
+    const data = await vela.call("VELA.Sample.Share", "list", {
+      params: folder !== "" ? { path: folder } : {},
+      headers: { "X-Vela-Sharing": link },
+      messages: MESSAGES,
+    });
     path = folder;
     el("where").textContent = `/${folder}`;
     el("up").hidden = folder === "";
     const items = [];
     for (const file of data.files) {
-      const item = document.createElement("li");
+      const item = make("li");
       const full = folder === "" ? file.name : `${folder}/${file.name}`;
       let name;
       if (file.type === "dir") {
-        name = document.createElement("button");
+        name = make("button", `${file.name}/`);
         name.type = "button";
-        name.textContent = `${file.name}/`;
         name.addEventListener("click", () => enter(full));
       } else if (file.type === "file") {
-        name = document.createElement("a");
+        name = make("a", file.name);
         name.href = downloadUrl(full);
         name.download = file.name;
-        name.textContent = file.name;
       } else {
         continue;
       }
-      const size = document.createElement("span");
-      size.textContent = file.type === "file" ? formatSize(file.size) : "";
-      item.append(name, size);
+      item.append(name, make("span", file.type === "file" ? formatSize(file.size) : ""));
       items.push(item);
     }
     if (data.truncated) {
-      const more = document.createElement("li");
-      more.textContent = "(more entries than can be shown)";
-      items.push(more);
+      items.push(make("li", "(more entries than can be shown)"));
     }
     el("files").replaceChildren(...items);
     el("browser").hidden = false;
@@ -133,11 +102,7 @@
     }
     el("open").disabled = true;
     try {
-      const data = await callApi(`${ENTRY}?api=VELA.Sharing.Visitor&version=1&method=open`, {
-        method: "POST",
-        headers: { "Content-Type": "application/x-www-form-urlencoded" },
-        body,
-      });
+      const data = await vela.call("VELA.Sharing.Visitor", "open", { body, messages: MESSAGES });
       el("password").value = "";
       el("unlock").hidden = true;
       el("title").textContent = data.name;
