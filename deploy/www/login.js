@@ -12,22 +12,17 @@
 "use strict";
 
 (function () {
-  const ENTRY = "/webapi/entry.cgi";
+  const { el, showError, TOKEN_KEY } = vela;
 
   // Messages for the error codes of VELA.Auth and of the session check; any
   // other code is shown with its number.
-  const MESSAGES = {
+  const MESSAGES = Object.assign({
     400: "Wrong account or password.",
     401: "The password has expired; change it before signing in.",
     402: "The server could not complete the sign-in.",
     407: "Too many failed attempts: sign-in is blocked for a while.",
-    105: "You are not allowed to do this.",
-    106: "Your session has timed out; sign in again.",
-    119: "You are not signed in.",
-  };
+  }, vela.ACCESS_MESSAGES);
 
-  const el = (id) => document.getElementById(id);
-  const TOKEN_KEY = "vela.token";
   let token = "";
 
   // The page to go back to: a plain page name of this folder, nothing else.
@@ -36,53 +31,18 @@
     return /^[a-z]{1,32}\.html$/.test(next) ? next : "";
   }
 
-  function showError(text) {
-    el("error").textContent = text;
-    el("error").hidden = false;
-  }
-
-  function clearError() {
-    el("error").textContent = "";
-    el("error").hidden = true;
-  }
-
-  // An API error as an exception carrying the code the server answered.
-  class ApiError extends Error {
-    constructor(code, detail) {
-      let message = MESSAGES[code] || `The server refused the request (error ${code}).`;
-      if (code === 407 && detail && Number.isInteger(detail.waitSeconds)) {
-        message += ` Try again in ${Math.ceil(detail.waitSeconds / 60)} minute(s).`;
-      }
-      super(message);
-      this.code = code;
-      this.detail = detail;
-    }
-  }
-
   // Calls one method; `body` (a string) makes it a form POST. Resolves to
-  // the answer's "data", rejects with ApiError for {"success": false}.
+  // the answer's "data"; a refused sign-in says how long it stays blocked
+  // when the server tells.
   async function callApi(api, method, body) {
-    const url = `${ENTRY}?api=${encodeURIComponent(api)}&version=1&method=${encodeURIComponent(method)}`;
-    const init = { method: body === undefined ? "GET" : "POST", headers: {}, credentials: "same-origin" };
-    if (body !== undefined) {
-      init.headers["Content-Type"] = "application/x-www-form-urlencoded";
-      init.body = body;
-    }
-    if (token) {
-      init.headers["X-Vela-Token"] = token;
-    }
-    const reply = await fetch(url, init);
-    let answer;
     try {
-      answer = await reply.json();
+      return await vela.call(api, method, { body, headers: token ? { "X-Vela-Token": token } : {}, messages: MESSAGES });
     } catch (e) {
-      throw new Error(`The server sent no answer (HTTP ${reply.status}).`);
+      if (e.code === 407 && e.detail && Number.isInteger(e.detail.waitSeconds)) {
+        e.message += ` Try again in ${Math.ceil(e.detail.waitSeconds / 60)} minute(s).`;
+      }
+      throw e;
     }
-    if (!answer || answer.success !== true) {
-      const error = (answer && answer.error) || {};
-      throw new ApiError(error.code, error.errors);
-    }
-    return answer.data;
   }
 
   // The DER bytes of the first PEM block of `pem`.
@@ -126,7 +86,7 @@
 
   async function signIn(event) {
     event.preventDefault();
-    clearError();
+    showError("");
     el("whoami").hidden = true;
     el("submit").disabled = true;
     try {
@@ -156,7 +116,7 @@
   }
 
   async function signOut() {
-    clearError();
+    showError("");
     try {
       await callApi("VELA.Auth", "logout");
     } catch (e) {
