@@ -10,8 +10,7 @@
 "use strict";
 
 (function () {
-  const ENTRY = "/webapi/entry.cgi";
-  const TOKEN_KEY = "vela.token";
+  const { el, make, showError, TOKEN_KEY } = vela;
   const SIGN_IN = "login.html?next=admin.html";
   const TASK_REFRESH_MS = 3000;
   // The refresh pauses when nobody used the page for this long. The task
@@ -21,28 +20,17 @@
   const MAX_BARS = 20;
   const SVG_NS = "http://www.w3.org/2000/svg";
 
-  const MESSAGES = {
-    105: "You are not allowed to do this.",
-    106: "Your session has timed out; sign in again.",
-    119: "You are not signed in.",
+  const MESSAGES = Object.assign({
     480: "That session has already ended.",
     481: "The server could not complete the call.",
-  };
+  }, vela.ACCESS_MESSAGES);
   // Codes that mean the session is gone or unusable from here.
   const SIGNED_OUT = new Set([106, 107, 119, 150]);
 
-  const el = (id) => document.getElementById(id);
   const token = sessionStorage.getItem(TOKEN_KEY) || "";
   let taskTimer = 0;
   let taskBusy = false;
   let lastActive = Date.now();
-
-  class ApiError extends Error {
-    constructor(code) {
-      super(MESSAGES[code] || `The server refused the request (error ${code}).`);
-      this.code = code;
-    }
-  }
 
   function signInAgain() {
     sessionStorage.removeItem(TOKEN_KEY);
@@ -53,28 +41,16 @@
   // form POST. Resolves to the answer's "data"; a gone session leaves the
   // page for the sign-in page.
   async function callApi(api, method, body) {
-    const url = `${ENTRY}?api=${encodeURIComponent(api)}&version=1&method=${encodeURIComponent(method)}`;
-    const init = { method: body === undefined ? "GET" : "POST", headers: { "X-Vela-Token": token },
-                   credentials: "same-origin", cache: "no-store" };
-    if (body !== undefined) {
-      init.headers["Content-Type"] = "application/x-www-form-urlencoded";
-      init.body = body;
-    }
-    const reply = await fetch(url, init);
-    let answer;
     try {
-      answer = await reply.json();
+      const data = await vela.call(api, method, { body, headers: { "X-Vela-Token": token }, cache: "no-store",
+                                                  messages: MESSAGES });
+      return data || {};
     } catch (e) {
-      throw new Error(`The server sent no answer (HTTP ${reply.status}).`);
-    }
-    if (!answer || answer.success !== true) {
-      const code = answer && answer.error ? answer.error.code : undefined;
-      if (SIGNED_OUT.has(code)) {
+      if (SIGNED_OUT.has(e.code)) {
         signInAgain();
       }
-      throw new ApiError(code);
+      throw e;
     }
-    return answer.data || {};
   }
 
   // ---- Small helpers. Values from the server are checked before use.
@@ -85,17 +61,6 @@
 
   function when(epoch) {
     return isCount(epoch) ? new Date(epoch * 1000).toLocaleString() : "\u2014";
-  }
-
-  function make(tag, text, className) {
-    const node = document.createElement(tag);
-    if (text !== undefined) {
-      node.textContent = text;
-    }
-    if (className) {
-      node.className = className;
-    }
-    return node;
   }
 
   function svg(tag, attributes, text) {
@@ -115,11 +80,6 @@
     line.textContent = text;
     line.classList.toggle("error", Boolean(isError));
     line.hidden = text === "";
-  }
-
-  function showError(text) {
-    el("error").textContent = text;
-    el("error").hidden = text === "";
   }
 
   function showAdminOnly() {
