@@ -325,8 +325,10 @@ call --cookie "id=$sid" "$URL?api=VELA.Sample&version=1&method=echo&text=install
   fail "echo with a session: HTTP $status: $(head -c 400 "$TMP/body")"
 call "$URL?api=VELA.Sample&version=1&method=echo&text=x"
 grep -qF '"success":false' "$TMP/body" || fail "echo without a session was answered: $(head -c 400 "$TMP/body")"
-call "$BASE/webapi/login.html"
-[ "$status" = 200 ] && cmp -s "$TMP/body" /usr/share/vela/www/login.html || fail "sign-in page: HTTP $status"
+for page in login.html vela.js; do
+  call "$BASE/webapi/$page"
+  [ "$status" = 200 ] && cmp -s "$TMP/body" "/usr/share/vela/www/$page" || fail "/webapi/$page: HTTP $status"
+done
 call "$BASE/webapi/lib.def"
 [ "$status" = 404 ] || fail "/webapi/lib.def: HTTP $status, expected 404 (only the pages and the entry)"
 [ -S "$socket" ] && [ "$(stat -c '%a %U %G' "$socket")" = "660 root $socket_group" ] ||

@@ -42,7 +42,7 @@ for f in include/webapi/APIRequest.h include/webapi/APITable.h include/vela/expo
          vela/velaman/webapi/sample/libvela-sample.so vela/velaman/webapi/auth/libvela-auth.so \
          lib/sharing/permission_lib/sample-share.so \
          share/vela/lighttpd.conf.in share/vela/entry-cgi.conf.in share/vela/pam/vela-webapi \
-         share/vela/www/login.html share/vela/errors/vela-error-404.html \
+         share/vela/www/login.html share/vela/www/vela.js share/vela/errors/vela-error-404.html \
          "${libdir#$prefix/}/pkgconfig/vela-webapi.pc" "${libdir#$prefix/}/cmake/VelaWebAPI/VelaWebAPIConfig.cmake"; do
   [ -e "$prefix/$f" ] || fail "not installed: $f"
 done
