@@ -11,7 +11,7 @@ srv_require "velascgi runs as root under the server" timeout
 
 srv_init "$SRC" "$VELASCGI" "$WEBAPI" || exit 1
 cat >"$ROOT/etc/vela/webapi.conf" <<'CONF'
-request_body_idle_seconds="3"
+request_body_idle_seconds="8"
 request_max_per_client="3"
 CONF
 srv_serve
@@ -55,7 +55,9 @@ expect "chunked body" '"code":119'
 
 # ---- Slow bodies: a client that announces 1000 bytes, sends 2 and waits
 # holds a root process only for the idle time, and only a few at once. Each
-# holder's answer goes to its own file (30 s at most).
+# holder's answer goes to its own file (30 s at most). The idle time leaves
+# a loaded machine (sanitizers, a parallel suite) room to start the three
+# and ask the fourth before it runs out.
 slow_body() {
   (
     exec 3<>"/dev/tcp/127.0.0.1/$port" || exit 1
@@ -69,7 +71,7 @@ slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
 # Started, then a moment to load and take their slots.
 srv_wait 400 0.05 cgi_at_least 3
-sleep 1
+sleep 2
 # A fourth request of the same client, while three are under way.
 call "$URL?api=VELA.Sample&version=1&method=echo"
 expect_status "fourth request at once" 503
@@ -79,7 +81,7 @@ wait "$p1" "$p2" "$p3"
 for f in "$TMP/slow1" "$TMP/slow2" "$TMP/slow3"; do
   grep -q '"code":101' "$f" || fail "slow body: no 101 answer after the idle time: $(head -c 300 "$f")"
 done
-grep -q 'nothing arrived for 3 s' "$RUN/cgi.log" || fail "slow body: no log line"
+grep -q 'nothing arrived for 8 s' "$RUN/cgi.log" || fail "slow body: no log line"
 # Gone once their answers are out (a sanitizer build takes a moment to exit).
 srv_wait 100 0.1 cgi_none || fail "request processes left: $(cgi_count)"
 # Slots come back when their requests end.
