@@ -20,6 +20,14 @@ port=${BASE##*:}
 cgi_count() { srv_request_count; }
 cgi_at_least() { [ "$(cgi_count)" -ge "$1" ]; }
 cgi_none() { [ "$(cgi_count)" -eq 0 ]; }
+# Client slots held: the one-byte locks on the slot file (/proc/locks names
+# a file as MAJOR:MINOR:INODE).
+slots_held() {
+  local inode
+  inode=$(stat -c %i "$ROOT/run/vela/clients.lock" 2>/dev/null) || { echo 0; return; }
+  grep -cE " [0-9a-f]+:[0-9a-f]+:$inode " /proc/locks
+}
+slots_at_least() { [ "$(slots_held)" -ge "$1" ]; }
 
 # ---- 16 MiB of "&": answered at once (the parser is linear), not after
 # minutes of CPU.
@@ -69,9 +77,9 @@ slow_body() {
 slow_body "$TMP/slow1"; p1=$!
 slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
-# Started, then a moment to load and take their slots.
+# Started, and holding their slots (a process may be slow to get there).
 srv_wait 400 0.05 cgi_at_least 3
-sleep 2
+srv_wait 400 0.05 slots_at_least 3 || fail "slow body: $(slots_held) slots held, expected 3"
 # A fourth request of the same client, while three are under way.
 call "$URL?api=VELA.Sample&version=1&method=echo"
 expect_status "fourth request at once" 503
