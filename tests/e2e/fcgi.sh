@@ -107,12 +107,13 @@ ids_in_process() {
 srv_wait 40 0.1 ids_in_process || fail "an API sharing a warm library is never served in process: $(cat "$TMP/body")"
 
 # ---- At most two children at once (one per parent): two sleeping requests
-# hold them, a third is refused with 503 and a JSON error.
-curl -s -o "$TMP/sleep1" --max-time 30 "$SUB&method=sleep&ms=3000" &
+# hold them, a third is refused with 503 and a JSON error. They sleep long
+# enough for a loaded machine to start both before the first ends.
+curl -s -o "$TMP/sleep1" --max-time 60 "$SUB&method=sleep&ms=8000" &
 s1=$!
-curl -s -o "$TMP/sleep2" --max-time 30 "$SUB&method=sleep&ms=3000" &
+curl -s -o "$TMP/sleep2" --max-time 60 "$SUB&method=sleep&ms=8000" &
 s2=$!
-srv_wait 100 0.05 at_least 2 || fail "the sleeping requests did not start"
+srv_wait 400 0.05 at_least 2 || fail "the sleeping requests did not start"
 call "$SUB&method=report"
 expect_status "third request at once" 503
 expect_header "third request at once" 'Retry-After:'
