@@ -18,7 +18,6 @@ srv_serve
 port=${BASE##*:}
 
 cgi_count() { srv_request_count; }
-cgi_at_least() { [ "$(cgi_count)" -ge "$1" ]; }
 cgi_none() { [ "$(cgi_count)" -eq 0 ]; }
 # Client slots held: the one-byte locks on the slot file (/proc/locks names
 # a file as MAJOR:MINOR:INODE).
@@ -74,11 +73,13 @@ slow_body() {
     timeout 30 cat <&3 >"$1"
   ) &
 }
+# The requests above are over, their processes gone (a sanitizer build's
+# exit takes a moment, and a process keeps its slot until it is gone).
+srv_wait 200 0.1 cgi_none || fail "request processes left before the slow bodies: $(cgi_count)"
 slow_body "$TMP/slow1"; p1=$!
 slow_body "$TMP/slow2"; p2=$!
 slow_body "$TMP/slow3"; p3=$!
-# Started, and holding their slots (a process may be slow to get there).
-srv_wait 400 0.05 cgi_at_least 3
+# Started and holding their slots (a process may be slow to get there).
 srv_wait 400 0.05 slots_at_least 3 || fail "slow body: $(slots_held) slots held, expected 3"
 # A fourth request of the same client, while three are under way.
 call "$URL?api=VELA.Sample&version=1&method=echo"
